@@ -35,8 +35,8 @@ public:
     /// A component that has an update.
     struct UpdateComponent
     {
-        std::int32_t kind; ///< A ComponentKind; other values are passed over by the installation.
-        std::string name;  ///< Display label.
+        std::int32_t kind = COMPONENT_PACKAGE; ///< A ComponentKind; other values are passed over by the installation.
+        std::string name;                      ///< Display label.
         std::string installedVersion;
         std::string candidateVersion;
     };

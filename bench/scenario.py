@@ -1,0 +1,165 @@
+"""Scenario files: what a unit is like before an update, and what must come out. CONTRIBUTING.md tells how to add one."""
+
+import tomllib
+from dataclasses import dataclass
+from pathlib import Path
+from typing import Any
+
+FOLDER = Path(__file__).parent / "scenarios"
+
+# Section, key: what stands when a file says nothing, and what else it may say. A list is a choice; a type is any value
+# of that type.
+UNIT: dict[str, dict[str, tuple[Any, Any]]] = {
+    "package": {
+        "installed": ("1.2.0", str),  # "(none)": known but not installed
+        "offered": ("1.3.0", str),  # by the repository; equal to installed, newer or older
+        "known": (True, bool),  # False: no repository and no installation knows the package
+        # fails: its maintainer script exits 1. asks: it has a question and nobody answers.
+        # locked: another package tool holds the database for some seconds.
+        "install": ("works", ["works", "fails", "asks", "locked"]),
+    },
+    "mirrors": {
+        "refresh": ("works", ["works", "unreachable"]),  # unreachable: apt exits 100
+    },
+    "board": {
+        "installed": ("2.1.0", str),
+        # text of /root/App/AppExe/version.txt; "{version}" stands for `installed`. "" means that there is no file.
+        "version_file": ("Name\tQuorb\r\nBrimvale\t{version}\r\n", str),
+        # lost: gone after the version was read, before the first upload. dies: gone in the middle of the upload.
+        "link": ("up", ["up", "down", "hangs", "slow", "lost", "dies"]),
+        "login": ("accepted", ["accepted", "key-refused", "host-key-changed"]),
+        "disk": ("free", ["free", "full"]),  # full: the archive does not fit
+        "uploads_lost": (0, int),  # that many upload attempts fail before one succeeds
+        # hangs-up: it ends the connection. never-returns: ended by the scenario some real seconds later.
+        "script": ("works", ["works", "fails", "hangs-up", "never-returns"]),
+    },
+    "stick": {
+        "inserted": (True, bool),
+        "directories": (["quorb2.2.0"], list),  # version directories under debs/QUORB/armhf
+        "teamviewer": ("absent", ["absent", "file", "directory"]),  # debs/installTV
+        "pulled_out": ("never", ["never", "before-upload"]),
+    },
+    "head": {
+        "marker": (True, bool),  # /root/RESOURCES/tavren1stboot
+        "harl": ("known", ["known", "unknown"]),  # to the service manager
+        "teamviewer_script": ("works", ["works", "fails", "absent"]),
+    },
+    "tools": {
+        "missing": ([], list),  # not on the search path
+        "killed": ([], list),  # a signal ends them, with the shell that ran them
+    },
+    "updater": {
+        "program": ("remote", ["remote", "main"]),  # main: the main-head driver
+        "arguments": ([], list),
+        "children": ("waited-for", ["waited-for", "ignored"]),  # ignored: started with SIGCHLD ignored
+        # by the service manager. at-its-end: by its own last command. in-install: while the package is being installed.
+        "stopped": ("at-its-end", ["never", "at-its-end", "in-install"]),
+    },
+}
+
+EXPECT: dict[str, Any] = {
+    "status": list,  # exit codes, or minus signal numbers, that the updater may end with
+    "panel": dict,  # LED: colour at the end; LEDs that are not named are dark
+    "sound": ["", "pass", "fail"],  # the one sound that was played to its end
+    "commands": list,  # all but the panel's and the sound's, in order: names of COMMANDS, " x20" behind one repeats it
+    "waits": list,  # s, in order, those of the flashing thread left out
+    "log": str,  # of the update thread, a line each: the operation's name, a colon, the message
+    "package": str,
+    "board": str,
+    "marker": bool,
+    "stick": bool,
+    "harl": ["active", "inactive", "unknown"],
+}
+
+SSH_OPTIONS = "-o ServerAliveInterval=4 -o ServerAliveCountMax=10 -o ConnectTimeout=2 -o TCPKeepAlive=yes"
+BOARD_FILES = "/root/USB_MOUNT/debs/QUORB/armhf"
+
+# Short names, for the scenario files, of the command lines on the whole.
+COMMANDS = {
+    "stop-harl": "systemctl stop harl",
+    "start-harl": "systemctl start harl",
+    "stop-updater": "systemctl stop harl-updater",
+    "refresh-mirrors": "apt update",
+    "read-package": "apt-cache policy solvik4-rh",
+    "install-package": "apt --assume-yes install solvik4-rh",
+    "read-main-package": "apt-cache policy solvik4-dh",
+    "install-main-package": "apt --assume-yes install solvik4-dh",
+    "read-board": f"ssh  {SSH_OPTIONS} 192.168.9.2 \" cat /root/App/AppExe/version.txt | grep 'Brimvale'\"",
+    "list-stick": f"ls {BOARD_FILES}/",
+    "upload-board": f"scp  {SSH_OPTIONS} {BOARD_FILES}/*/OSUpgrade.zip 192.168.9.2:/root/"
+    f" && scp  {SSH_OPTIONS} {BOARD_FILES}/*/unzipUpgrade.sh 192.168.9.2:/",
+    "install-board": f'ssh  {SSH_OPTIONS} 192.168.9.2 "/unzipUpgrade.sh"',
+    "find-teamviewer": "ls /root/USB_MOUNT/debs/installTV",
+    "install-teamviewer": "/root/RESOURCES/teamviewer_updatescript.sh",
+    "remove-marker": "rm /root/RESOURCES/tavren1stboot",
+    "release-stick": "umount /root/USB_MOUNT/",
+}
+
+
+class ScenarioError(Exception):
+    """A scenario that does not exist or cannot be used; the text is one line with the file and the reason."""
+
+
+@dataclass
+class Scenario:
+    """One scenario: `unit[section][key]` is complete, with the defaults of UNIT; `expect` holds what the file says."""
+
+    name: str
+    summary: str
+    unit: dict[str, dict[str, Any]]
+    expect: dict[str, Any]
+
+
+def names() -> list[str]:
+    """The names of all scenarios, in order."""
+    return sorted(path.stem for path in FOLDER.glob("*.toml"))
+
+
+def load(name: str) -> Scenario:
+    """Reads the scenario `name`. Raises ScenarioError."""
+    path = FOLDER / f"{name}.toml"
+    if name not in names():
+        raise ScenarioError(f"no scenario {name!r}: bench/run --list shows all")
+    return read(path)
+
+
+def read(path: Path) -> Scenario:
+    """Reads the scenario file `path`. Raises ScenarioError."""
+    try:
+        content = tomllib.loads(path.read_text(encoding="utf-8"))
+    except (OSError, UnicodeError) as error:
+        raise ScenarioError(f"{path}: {error}") from error
+    except tomllib.TOMLDecodeError as error:
+        raise ScenarioError(f"{path}: {error}") from error
+
+    def fail(key: str, reason: str) -> ScenarioError:
+        return ScenarioError(f"{path}: {key}: {reason}")
+
+    def check(key: str, value: Any, allowed: Any) -> None:
+        if isinstance(allowed, list):
+            if value not in allowed:
+                raise fail(key, f"must be one of {', '.join(map(repr, allowed))}, not {value!r}")
+        elif type(value) is not allowed:
+            raise fail(key, f"must be a {allowed.__name__}, not {value!r}")
+
+    check("summary", content.pop("summary", None), str)
+    expect = content.pop("expect", None)
+    check("expect", expect, dict)
+    unit = {section: {key: default for key, (default, _) in keys.items()} for section, keys in UNIT.items()}
+    for section, values in content.items():
+        if section not in UNIT:
+            raise fail(section, f"not known; the sections are {', '.join(UNIT)} and expect")
+        check(section, values, dict)
+        for key, value in values.items():
+            if key not in UNIT[section]:
+                raise fail(f"{section}.{key}", f"not known; the keys are {', '.join(UNIT[section])}")
+            check(f"{section}.{key}", value, UNIT[section][key][1])
+            unit[section][key] = value
+    for key in expect:
+        if key not in EXPECT:
+            raise fail(f"expect.{key}", f"not known; the keys are {', '.join(EXPECT)}")
+    for key, allowed in EXPECT.items():
+        if key not in expect:
+            raise fail(f"expect.{key}", "is missing")
+        check(f"expect.{key}", expect[key], allowed)
+    return Scenario(path.stem, tomllib.loads(path.read_text(encoding="utf-8"))["summary"], unit, expect)

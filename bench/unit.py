@@ -1,0 +1,60 @@
+"""What the bench asks of a unit: the stand-in unit and the real one are two makes of the same thing."""
+
+from dataclasses import dataclass, field
+from pathlib import Path
+from typing import Protocol
+
+
+@dataclass
+class State:
+    """The lasting things of a unit, read at any moment of a run."""
+
+    package: str  # version of the head's package, "(none)" when it is not installed
+    board: str  # version in the board's version file, "" when it cannot be read from the bench's side
+    marker: bool  # the first-boot marker exists
+    stick: bool  # the stick is mounted
+    harl: str  # "active", "inactive" or "unknown"
+    sounds: list[str] = field(default_factory=list)  # base names of the sound files that were played to their end
+
+
+@dataclass
+class Files:
+    """Where a unit writes what happens, each file appended to while the updater runs. The bench reads them as they grow.
+
+    `log`: the updater's standard output.
+    `calls`: what bench/tap.c, preloaded into the updater alone, writes: one line for each start and each end of a
+    `system`, a `popen`/`pclose` or a `nanosleep` of the updater. Its path is in BENCH_CALLS.
+    `panel`: one line for each byte that reached the LED controller: seconds of CLOCK_MONOTONIC, a blank, two hex digits.
+    """
+
+    log: Path
+    calls: Path
+    panel: Path
+
+
+class UnitError(Exception):
+    """The unit cannot be made on this machine; the text says what is missing and what to do."""
+
+
+class Unit(Protocol):
+    """A head with its board, stick and panel as a scenario describes them, in which the updater runs once.
+
+    `__init__(scenario, folder, speed)` only keeps its arguments: the scenario, an empty folder for everything the unit
+    needs, and how many times faster the updater's own clock and waits run (1: full length). The rest of the bench calls
+    `start`, then `ended` and `state` again and again, and `close` in any case.
+    """
+
+    name: str  # one line for the output: what is real and what is a stand-in
+    files: Files
+
+    def start(self) -> None:
+        """Makes the unit and starts the updater. Raises UnitError."""
+
+    def ended(self) -> int | None:
+        """None while the updater runs, then its status: the exit code, or minus the number of the signal."""
+
+    def state(self) -> State:
+        """The unit as it is now; called several times a second while the updater runs, and once after it."""
+
+    def close(self) -> None:
+        """Ends every process of the unit and takes everything back. May be called at any time and more than once."""

@@ -24,7 +24,7 @@ class Files:
     `log`: the updater's standard output.
     `calls`: what bench/tap.c, preloaded into the updater alone, writes: one line for each start and each end of a
     `system`, a `popen`/`pclose` or a `nanosleep` of the updater. Its path is in BENCH_CALLS.
-    `panel`: one line for each byte that reached the LED controller: seconds of CLOCK_MONOTONIC, a blank, two hex digits.
+    `panel`: one line for each byte that reached the LED controller: seconds of CLOCK_BOOTTIME, a blank, two hex digits.
     """
 
     log: Path

@@ -1,0 +1,125 @@
+"""What was seen of a run: the log's records, the commands and waits with their times, the panel and its changes."""
+
+import re
+import time
+from dataclasses import dataclass, field
+from pathlib import Path
+
+from panel import Panel
+from unit import Files
+
+# First line of a record: time, thread, source position, function. The message is all up to the next first line.
+RECORD = re.compile(
+    r"^Updater \| (?P<time>\d\d-\d\d-\d{4} \d\d-\d\d-\d\d)\t(?P<thread>\d+)\t(?P<file>\w+\.\w+):(?P<line>\d+)\t"
+    r"(?P<function>.+)\n\t\t\t(?P<message>(?:.*\n)(?:(?!Updater \| ).*\n)*)",
+    re.MULTILINE,
+)
+
+
+def now() -> float:
+    """The clock of all times of a run, s."""
+    return time.clock_gettime(time.CLOCK_BOOTTIME)
+
+
+@dataclass
+class Record:
+    """One record of the updater's log."""
+
+    time: str
+    thread: str
+    file: str
+    function: str
+    message: str
+
+    @property
+    def operation(self) -> str:
+        """The function's bare name."""
+        return re.sub(r"\(.*", "", self.function).split("::")[-1].split()[-1]
+
+
+@dataclass
+class Call:
+    """One command, or one wait, of the updater. `end` and `status` are None when it never returned."""
+
+    call: str  # system, popen or nanosleep
+    thread: str
+    start: float  # s
+    text: str  # command line
+    seconds: int = 0  # asked for by a wait
+    real: float = 0.0  # s, that the wait takes in fact
+    end: float | None = None
+    status: int | None = None
+
+
+@dataclass
+class Change:
+    """What the panel shows from `time` (s) on."""
+
+    time: float
+    leds: dict[int, int]
+
+
+@dataclass
+class Run:
+    """Everything seen so far. `update` reads what has come since."""
+
+    files: Files
+    log: str = ""
+    calls: list[Call] = field(default_factory=list)
+    panel: Panel = field(default_factory=Panel)
+    changes: list[Change] = field(default_factory=list)
+    _offsets: dict[Path, int] = field(default_factory=dict)
+
+    def update(self) -> str:
+        """Reads what the unit's files have grown by; returns what is new of the log."""
+        for line in self._new_lines(self.files.calls).splitlines():
+            self._take_call(line)
+        for line in self._new_lines(self.files.panel).splitlines():
+            moment, byte = line.split()
+            self.panel.send(int(byte, 16), float(moment))
+            leds = self.panel.shown(float(moment))
+            if leds != (self.changes[-1].leds if self.changes else dict.fromkeys(leds, 0)):
+                self.changes.append(Change(float(moment), leds))
+        text = self._new_lines(self.files.log)
+        self.log += text
+        return text
+
+    def records(self) -> list[Record]:
+        """The log's records."""
+        return [
+            Record(match["time"], match["thread"], match["file"], match["function"], match["message"][:-1])
+            for match in RECORD.finditer(self.log)
+        ]
+
+    def commands(self) -> list[Call]:
+        """All commands but those of the panel and the sound, in order."""
+        return [call for call in self.calls if call.call != "nanosleep" and not call.text.startswith(("i2cset ", "aplay "))]
+
+    def waits(self) -> list[Call]:
+        """The waits, in order, those of the flashing thread left out."""
+        flashing = {call.thread for call in self.calls if call.call == "nanosleep" and call.seconds == 1}
+        return [call for call in self.calls if call.call == "nanosleep" and call.thread not in flashing]
+
+    def _new_lines(self, path: Path) -> str:
+        """Whole lines only: the rest comes with the next call."""
+        if not path.exists():
+            return ""
+        with path.open("rb") as file:
+            file.seek(self._offsets.get(path, 0))
+            data = file.read()
+        data = data[: data.rfind(b"\n") + 1]
+        self._offsets[path] = self._offsets.get(path, 0) + len(data)
+        return data.decode("utf-8", "backslashreplace")
+
+    def _take_call(self, line: str) -> None:
+        moment, thread, call, phase, value, text = line.split("\t", 5)
+        if phase == "start":
+            entry = Call(call, thread, float(moment), text)
+            if call == "nanosleep":
+                entry.seconds, entry.real, entry.text = int(value), float(text), ""
+            self.calls.append(entry)
+            return
+        for entry in reversed(self.calls):
+            if entry.thread == thread and entry.end is None:
+                entry.end, entry.status = float(moment), int(value)
+                return

@@ -1,0 +1,138 @@
+/// Preloaded into the updater by the bench (LD_PRELOAD), and into none of its children.
+///
+/// Writes the start and the end of every command and every wait to the file named by BENCH_CALLS, one line each, the
+/// columns separated by tabs:
+///
+///   seconds of CLOCK_BOOTTIME, thread id, "system" | "popen" | "nanosleep", "start" | "end", value, text
+///
+/// For a command the text is its command line and the value at its end the raw status. For a wait the value is what was
+/// asked for (s) and the text how long it takes in fact (s).
+///
+/// Shortens the waits: BENCH_SPEED times (1: full length), but to no less than 0.2 s so that the panel's flashing stays
+/// visible. The wall clock that the updater sees moves on by what waits of 2 s and more were shortened by: the log
+/// reads like a run at full length.
+
+#include <algorithm>
+#include <atomic>
+#include <cerrno>
+#include <cmath>
+#include <cstdio>
+#include <cstdlib>
+#include <ctime>
+#include <dlfcn.h>
+#include <fcntl.h>
+#include <string>
+#include <unistd.h>
+
+namespace
+{
+
+const double shortestWait = 0.2; // s
+const double clockWait = 2;      // s, the shortest wait whose shortening moves the wall clock
+
+std::atomic<double> clockOffset{0};   // s, by which the updater's wall clock is ahead
+thread_local std::string pipeCommand; // the updater reads one command at a time on a thread
+
+__attribute__((constructor)) void leaveChildrenAlone()
+{
+    unsetenv("LD_PRELOAD");
+}
+
+/// The function that would have been called without this library.
+template <typename Function>
+Function next(const char* name, Function)
+{
+    return reinterpret_cast<Function>(dlsym(RTLD_NEXT, name));
+}
+
+double speed()
+{
+    const char* text = getenv("BENCH_SPEED");
+    return text == nullptr ? 1 : std::max(1.0, std::atof(text));
+}
+
+void writeLine(const char* call, const char* phase, long value, const std::string& text)
+{
+    const int savedErrno = errno;
+    const char* path = getenv("BENCH_CALLS");
+    timespec now = {};
+    clock_gettime(CLOCK_BOOTTIME, &now);
+    char head[128];
+    std::snprintf(head, sizeof head, "%lld.%06ld\t%d\t%s\t%s\t%ld\t", static_cast<long long>(now.tv_sec),
+                  now.tv_nsec / 1000, gettid(), call, phase, value);
+    const std::string line = head + text + '\n';
+    const int file = path == nullptr ? -1 : open(path, O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0644);
+    if (file < 0 || write(file, line.data(), line.size()) < 0) {
+        std::perror("bench: BENCH_CALLS");
+    }
+    if (file >= 0) {
+        close(file);
+    }
+    errno = savedErrno;
+}
+
+} // namespace
+
+extern "C" {
+
+int system(const char* command)
+{
+    writeLine("system", "start", 0, command);
+    const int status = next("system", &system)(command);
+    writeLine("system", "end", status, command);
+    return status;
+}
+
+FILE* popen(const char* command, const char* mode)
+{
+    pipeCommand = command;
+    writeLine("popen", "start", 0, command);
+    FILE* pipe = next("popen", &popen)(command, mode);
+    if (pipe == nullptr) {
+        writeLine("popen", "end", -1, command);
+    }
+    return pipe;
+}
+
+int pclose(FILE* pipe)
+{
+    const int status = next("pclose", &pclose)(pipe);
+    writeLine("popen", "end", status, pipeCommand);
+    return status;
+}
+
+int nanosleep(const timespec* asked, timespec* remaining)
+{
+    const double length = static_cast<double>(asked->tv_sec) + static_cast<double>(asked->tv_nsec) / 1e9;
+    const double factor = std::max(std::min(1.0, shortestWait / length), 1 / speed());
+    const double shortened = length * factor;
+    timespec wait = {static_cast<std::time_t>(shortened), 0};
+    wait.tv_nsec = static_cast<long>((shortened - std::floor(shortened)) * 1e9);
+
+    writeLine("nanosleep", "start", asked->tv_sec, std::to_string(shortened));
+    const int result = next("nanosleep", &nanosleep)(&wait, remaining);
+    if (result == -1 && errno == EINTR && remaining != nullptr) {
+        const double left =
+            (static_cast<double>(remaining->tv_sec) + static_cast<double>(remaining->tv_nsec) / 1e9) / factor;
+        remaining->tv_sec = static_cast<std::time_t>(left);
+        remaining->tv_nsec = static_cast<long>((left - std::floor(left)) * 1e9);
+        errno = EINTR;
+    } else if (length >= clockWait) {
+        clockOffset = clockOffset + length - shortened; // one thread at a time waits that long
+    }
+    writeLine("nanosleep", "end", 0, "");
+    return result;
+}
+
+std::time_t time(std::time_t* result)
+{
+    timespec now = {};
+    clock_gettime(CLOCK_REALTIME, &now);
+    const double fraction = static_cast<double>(now.tv_nsec) / 1e9;
+    const std::time_t shown = now.tv_sec + static_cast<std::time_t>(fraction + clockOffset);
+    if (result != nullptr) {
+        *result = shown;
+    }
+    return shown;
+}
+}

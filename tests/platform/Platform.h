@@ -1,0 +1,75 @@
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <string>
+#include <thread>
+#include <vector>
+
+/// A stand-in for the platform: linked into a test program, it takes the place of the C library's `system`, `popen`,
+/// `pclose` and `nanosleep`, and of the buffer behind std::cout.
+///
+/// Every call and every log record becomes an entry of one journal, so that a test compares the whole course of events.
+/// A command that has no scripted answer prints nothing and exits with 0; a pause takes 10 ms. All operations may be
+/// called from any thread.
+namespace platform
+{
+
+using Lines = std::vector<std::string>;
+
+/// What a command does when it is run.
+struct Answer
+{
+    int status = 0;                    ///< raw wait status that `system` or `pclose` returns; -1 for their failure
+    std::string output = {};           ///< what `popen`'s stream yields
+    bool starts = true;                ///< false: `popen` returns a null pointer
+    std::function<void()> before = {}; ///< runs first, on the calling thread; for delays
+};
+
+/// An answer of a command that exits normally with `code`.
+Answer exits(int code, const std::string& output = "");
+
+/// One log record, taken apart.
+struct Record
+{
+    std::string time;
+    std::string thread;
+    std::string file;
+    std::string line;
+    std::string function;
+    std::string message;
+    bool flushed = false;
+    std::string text; ///< the whole record as it was written
+};
+
+/// Forgets the journal, the answers and the pauses, and takes over std::cout.
+void reset();
+
+/// Scripts the answers of an exact command line, in order; the last one repeats.
+void script(const std::string& command, const std::vector<Answer>& answers);
+
+/// Replaces the pauses: `pause` gets and returns what nanosleep(2) does, errno included.
+void scriptSleep(const std::function<int(const timespec* duration, timespec* remaining)>& pause);
+
+/// Adds an entry of the test's own, for example from a callback.
+void note(const std::string& text);
+
+/// The entries so far: `log:` and a message, `system:` or `popen:` and a command line, `sleep:` and seconds, or a note.
+Lines journal();
+
+/// The entries of one thread.
+Lines journal(std::thread::id thread);
+
+/// The entries that begin with `prefix`, without it.
+Lines entries(const std::string& prefix);
+
+/// The log records so far. Fails the test when one is not well-formed.
+std::vector<Record> records();
+
+/// Waits until `condition` holds. Fails the test after ten seconds.
+void waitFor(const std::function<bool()>& condition);
+
+/// Sleeps in real time.
+void delay(int milliseconds);
+
+} // namespace platform

@@ -1,0 +1,117 @@
+#include "UnitTest.h"
+
+#include <csignal>
+
+namespace
+{
+
+class RunProcess : public UnitTest
+{
+protected:
+    std::string output = "from an earlier run";
+};
+
+TEST_F(RunProcess, SilentSuccessGivesZeroAndTwoRecords)
+{
+    EXPECT_EQ(UpdateManager::runProcess("true", output), 0);
+    EXPECT_EQ(output, "");
+    EXPECT_EQ(journal(), (Lines{"log:Running command: true", "popen:true", "log:Exit code:0"}));
+    EXPECT_EQ(platform::records().at(0).function,
+              "static int32_t UpdateManager::runProcess(const string&, std::string&)");
+    EXPECT_EQ(platform::records().at(0).file, "UpdateManager.cpp");
+}
+
+TEST_F(RunProcess, OutputKeepsItsLineEnds)
+{
+    script("apt update", {exits(100, "one\ntwo\n")});
+    EXPECT_EQ(UpdateManager::runProcess("apt update", output), 100);
+    EXPECT_EQ(output, "one\ntwo\n");
+    EXPECT_EQ(journal().back(), "log:Exit code:100");
+}
+
+TEST_F(RunProcess, OutputWithoutALastLineEndIsWhole)
+{
+    script("x", {exits(0, "one\r\ntwo")});
+    UpdateManager::runProcess("x", output);
+    EXPECT_EQ(output, "one\r\ntwo");
+}
+
+TEST_F(RunProcess, ExitCodeKeepsEightBits)
+{
+    script("x", {exits(200)});
+    EXPECT_EQ(UpdateManager::runProcess("x", output), 200);
+}
+
+TEST_F(RunProcess, KilledCommandGivesZero)
+{
+    for (const int signal : {SIGKILL, SIGSEGV, SIGSEGV | 0x80, SIGPIPE}) {
+        script("x", {{signal, "partial", true, {}}});
+        EXPECT_EQ(UpdateManager::runProcess("x", output), 0);
+        EXPECT_EQ(output, "partial");
+        EXPECT_EQ(journal().back(), "log:Exit code:0");
+    }
+}
+
+TEST_F(RunProcess, UnknownStatusGivesZero)
+{
+    script("x", {{-1, "text", true, {}}});
+    EXPECT_EQ(UpdateManager::runProcess("x", output), 0);
+    EXPECT_EQ(output, "text");
+    EXPECT_EQ(journal().back(), "log:Exit code:0");
+}
+
+TEST_F(RunProcess, CommandThatDoesNotStartGivesZeroAndNoFurtherRecord)
+{
+    script("x", {{0, "", false, {}}});
+    EXPECT_EQ(UpdateManager::runProcess("x", output), 0);
+    EXPECT_EQ(output, "");
+    EXPECT_EQ(journal(), (Lines{"log:Running command: x", "popen:x"}));
+}
+
+TEST_F(RunProcess, LongLineArrivesWhole)
+{
+    for (const std::size_t length : {1022U, 1023U, 1024U, 1025U, 3072U, 100000U}) {
+        std::string line;
+        for (std::size_t i = 0; i < length; ++i) {
+            line += static_cast<char>('a' + i % 26);
+        }
+        script("x", {exits(0, line + "\nnext\n")});
+        UpdateManager::runProcess("x", output);
+        EXPECT_EQ(output, line + "\nnext\n");
+    }
+}
+
+class InstallUpdate : public UnitTest
+{
+};
+
+TEST_F(InstallUpdate, SuccessLogsOnlyTheEntryAndTheRunnersRecords)
+{
+    script(installCommand, {exits(0, "Setting up\n")});
+    EXPECT_TRUE(UpdateManager::installUpdate(installCommand));
+    EXPECT_EQ(journal(), packageInstalled(installCommand));
+    EXPECT_EQ(platform::records().at(0).function, "static bool UpdateManager::installUpdate(const string&)");
+}
+
+TEST_F(InstallUpdate, FailureLogsCodeAndOutputBackToBack)
+{
+    script(installCommand, {exits(1, "E: broken\n")});
+    EXPECT_FALSE(UpdateManager::installUpdate(installCommand));
+    EXPECT_EQ(journal(), (Lines{"log:", "log:Running command: apt --assume-yes install solvik4-rh",
+                                "popen:apt --assume-yes install solvik4-rh", "log:Exit code:1", "log:1E: broken\n"}));
+    EXPECT_EQ(platform::records().back().function, "static bool UpdateManager::installUpdate(const string&)");
+}
+
+TEST_F(InstallUpdate, InstallThatDoesNotStartCounts)
+{
+    script(installCommand, {{0, "", false, {}}});
+    EXPECT_TRUE(UpdateManager::installUpdate(installCommand));
+}
+
+TEST_F(InstallUpdate, KilledInstallCounts)
+{
+    script(installCommand, {{SIGKILL, "", true, {}}});
+    EXPECT_TRUE(UpdateManager::installUpdate(installCommand));
+}
+
+} // namespace

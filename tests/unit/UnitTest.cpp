@@ -1,0 +1,137 @@
+#include "UnitTest.h"
+
+void UnitTest::SetUp()
+{
+    platform::reset();
+}
+
+void UnitTest::registerCallbacks()
+{
+    UpdateManager::instance()->setCallbacks(noteResult, noteError, noteUpdateFound);
+    platform::reset();
+}
+
+void UnitTest::noteResult(UpdateManager::Result result)
+{
+    platform::note("result:" + std::to_string(result));
+}
+
+void UnitTest::noteError(UpdateManager::Error error)
+{
+    platform::note("error:" + std::to_string(error));
+}
+
+void UnitTest::noteUpdateFound(std::vector<UpdateManager::UpdateComponent> components)
+{
+    std::string text = "found:";
+    for (const UpdateManager::UpdateComponent& component : components) {
+        text += "{" + std::to_string(component.kind) + "," + component.name + "," + component.installedVersion + "," +
+                component.candidateVersion + "}";
+    }
+    platform::note(text);
+}
+
+std::string policy(const std::string& installed, const std::string& candidate)
+{
+    return "solvik4:\n  Installed: " + installed + "\n  Candidate: " + candidate + "\n  Version table:\n";
+}
+
+Lines joined(const std::vector<Lines>& parts)
+{
+    Lines all;
+    for (const Lines& part : parts) {
+        all.insert(all.end(), part.begin(), part.end());
+    }
+    return all;
+}
+
+Lines mirrorsOk()
+{
+    return {"log:", "log:Running command: apt update", "popen:apt update", "log:Exit code:0", "log:OK"};
+}
+
+Lines packageChecked(const std::string& query, const std::string& installed, const std::string& candidate)
+{
+    return {"log:" + query,
+            "log:Running command: " + query,
+            "popen:" + query,
+            "log:Exit code:0",
+            "log:solvik4:",
+            "log:" + installed,
+            "log:" + candidate,
+            "log:  Version table:",
+            "log:" + installed + "  " + candidate,
+            installed == candidate ? "log:NWM_UM_NO_UPDATES " + installed + " == " + candidate
+                                   : "log:NWM_UM_UPDATE_FOUND: " + installed + " -> " + candidate};
+}
+
+Lines packageInstalled(const std::string& command)
+{
+    return {"log:", "log:Running command: " + command, "popen:" + command, "log:Exit code:0"};
+}
+
+Lines boardChecked(const std::string& installed, const std::string& candidate)
+{
+    return {std::string("log:Running command: ") + boardVersionCommand,
+            std::string("popen:") + boardVersionCommand,
+            "log:Exit code:0",
+            "log:" + installed + "\r",
+            std::string("log:Running command: ") + stickVersionCommand,
+            std::string("popen:") + stickVersionCommand,
+            "log:Exit code:0",
+            "log:" + installed + "  " + candidate,
+            installed == candidate ? "log:QUORB up to date" : "log:Update found: " + installed + " -> " + candidate};
+}
+
+Lines boardNotReadable()
+{
+    return {std::string("log:Running command: ") + boardVersionCommand, std::string("popen:") + boardVersionCommand,
+            "log:Exit code:255", "log:Failed to checkUpdate"};
+}
+
+Lines boardInstalled(const std::string& scriptStatus)
+{
+    return {"log:",
+            std::string("log:") + uploadCommand,
+            std::string("system:") + uploadCommand,
+            std::string("log:") + boardScriptCommand,
+            std::string("system:") + boardScriptCommand,
+            "log:Install script ended with code: " + scriptStatus,
+            "log:Starts sleeping for 13mins",
+            "sleep:780",
+            "log:Sleeping for 13mins ended up"};
+}
+
+Lines boardUploadFailed()
+{
+    Lines lines = {"log:", std::string("log:") + uploadCommand};
+    for (int attempt = 0; attempt < 20; ++attempt) {
+        lines.push_back(std::string("system:") + uploadCommand);
+        lines.push_back("log:Uploading failed. Trying again. ");
+    }
+    lines.push_back("log:Failed to upload QUORB with 20 tries. Closing");
+    lines.push_back("log:Failed inside uploadQuorbFiles");
+    return lines;
+}
+
+Lines harlStopped()
+{
+    return {"log:", "system:systemctl stop harl", "log:0"};
+}
+
+Lines harlStarted()
+{
+    return {"log:", "system:umount /root/USB_MOUNT/",     "log:0", "system:systemctl start harl", "log:0", "sleep:10",
+            "log:", "system:systemctl stop harl-updater", "log:0"};
+}
+
+void scriptPackage(const std::string& query, const std::string& installed, const std::string& candidate)
+{
+    script(query, {exits(0, policy(installed, candidate))});
+}
+
+void scriptBoard(const std::string& installed, const std::string& candidate)
+{
+    script(boardVersionCommand, {exits(0, "Brimvale\t" + installed + "\r\n")});
+    script(stickVersionCommand, {exits(0, "quorb" + candidate + "\n")});
+}

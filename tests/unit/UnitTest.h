@@ -1,0 +1,69 @@
+#pragma once
+
+#include "Platform.h"
+#include "UpdateManager.h"
+
+#include <gtest/gtest.h>
+
+#include <string>
+
+/// A test with a fresh journal, whose engine reports into it as notes.
+class UnitTest : public testing::Test
+{
+protected:
+    void SetUp() override;
+
+    /// Registers the callbacks that note what is reported, and forgets the record of that.
+    static void registerCallbacks();
+
+    static void noteResult(UpdateManager::Result result);
+    static void noteError(UpdateManager::Error error);
+    static void noteUpdateFound(std::vector<UpdateManager::UpdateComponent> components);
+};
+
+using platform::entries;
+using platform::exits;
+using platform::journal;
+using platform::Lines;
+using platform::script;
+
+const char mirrorsCommand[] = "apt update";
+const char policyCommand[] = "apt-cache policy solvik4-rh";
+const char installCommand[] = "apt --assume-yes install solvik4-rh";
+const char boardVersionCommand[] =
+    "ssh  -o ServerAliveInterval=4 -o ServerAliveCountMax=10 -o ConnectTimeout=2 -o TCPKeepAlive=yes 192.168.9.2 "
+    "\" cat /root/App/AppExe/version.txt | grep 'Brimvale'\"";
+const char stickVersionCommand[] = "ls /root/USB_MOUNT/debs/QUORB/armhf/";
+const char uploadCommand[] =
+    "scp  -o ServerAliveInterval=4 -o ServerAliveCountMax=10 -o ConnectTimeout=2 -o TCPKeepAlive=yes "
+    "/root/USB_MOUNT/debs/QUORB/armhf/*/OSUpgrade.zip 192.168.9.2:/root/ && "
+    "scp  -o ServerAliveInterval=4 -o ServerAliveCountMax=10 -o ConnectTimeout=2 -o TCPKeepAlive=yes "
+    "/root/USB_MOUNT/debs/QUORB/armhf/*/unzipUpgrade.sh 192.168.9.2:/";
+const char boardScriptCommand[] =
+    "ssh  -o ServerAliveInterval=4 -o ServerAliveCountMax=10 -o ConnectTimeout=2 -o TCPKeepAlive=yes 192.168.9.2 "
+    "\"/unzipUpgrade.sh\"";
+const char markerCommand[] = "rm /root/RESOURCES/tavren1stboot";
+const char teamViewerCheckCommand[] = "ls /root/USB_MOUNT/debs/installTV";
+const char teamViewerMarker[] = "/root/USB_MOUNT/debs/installTV";
+const char teamViewerScriptCommand[] = "/root/RESOURCES/teamviewer_updatescript.sh";
+
+/// What `apt-cache policy` prints for a package with these two versions.
+std::string policy(const std::string& installed, const std::string& candidate);
+
+/// The one journal of all `parts`, in order.
+Lines joined(const std::vector<Lines>& parts);
+
+/// What the runner and the successful check of the mirrors leave in the journal, and so on for the other steps.
+Lines mirrorsOk();
+Lines packageChecked(const std::string& query, const std::string& installed, const std::string& candidate);
+Lines packageInstalled(const std::string& command);
+Lines boardChecked(const std::string& installed, const std::string& candidate);
+Lines boardNotReadable();
+Lines boardInstalled(const std::string& scriptStatus = "0");
+Lines boardUploadFailed();
+Lines harlStopped();
+Lines harlStarted();
+
+/// Scripts the unit: versions of the package and of the board, installed and offered.
+void scriptPackage(const std::string& query, const std::string& installed, const std::string& candidate);
+void scriptBoard(const std::string& installed, const std::string& candidate);

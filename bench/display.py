@@ -6,7 +6,7 @@ import sys
 from observe import Run
 from panel import color_name, led_name
 from scenario import Scenario
-from unit import State
+from session import Result
 
 ANSI = {"off": "2", "blue": "1;34", "pass": "1;32", "fail": "1;31"}
 
@@ -38,8 +38,9 @@ class PlainDisplay:
         sys.stdout.flush()
 
 
-def print_outcome(scenario: Scenario, run: Run, state: State, status: int, seconds: float) -> None:
-    """The summary at the end of a run that took `seconds` (s)."""
+def print_outcome(scenario: Scenario, result: Result) -> None:
+    """The summary at the end of a run."""
+    run, state = result.run, result.state
     begin = run.calls[0].start if run.calls else 0
     before = scenario.unit
     print("\nCommands")
@@ -52,4 +53,4 @@ def print_outcome(scenario: Scenario, run: Run, state: State, status: int, secon
     print(f"Package: {before['package']['installed']} -> {state.package}")
     print(f"Board: {before['board']['installed']} -> {state.board}")
     print(f"First-boot marker: {'there' if state.marker else 'gone'}, stick: {'mounted' if state.stick else 'released'}, harl: {state.harl}")
-    print(f"Updater: status {status}, {seconds:.1f} s")
+    print(f"Updater: status {result.status}, {result.seconds:.1f} s")

@@ -42,6 +42,8 @@ UNIT: dict[str, dict[str, tuple[Any, Any]]] = {
     "head": {
         "marker": (True, bool),  # /root/RESOURCES/tavren1stboot
         "harl": ("known", ["known", "unknown"]),  # to the service manager
+        "panel": ("present", ["present", "absent"]),  # the LED controller on its bus
+        "sound": ("present", ["present", "absent"]),  # the sound device
         "teamviewer_script": ("works", ["works", "fails", "absent"]),
     },
     "tools": {
@@ -59,11 +61,15 @@ UNIT: dict[str, dict[str, tuple[Any, Any]]] = {
 
 EXPECT: dict[str, Any] = {
     "status": list,  # exit codes, or minus signal numbers, that the updater may end with
-    "panel": dict,  # LED: colour at the end; LEDs that are not named are dark
+    # LED: colour at the end; LEDs that are not named are dark. any: whatever is lit has this colour.
+    "panel": dict,
     "sound": ["", "pass", "fail"],  # the one sound that was played to its end
     "commands": list,  # all but the panel's and the sound's, in order: names of COMMANDS, " x20" behind one repeats it
     "waits": list,  # s, in order, those of the flashing thread left out
-    "log": str,  # of the update thread, a line each: the operation's name, a colon, the message
+    # of the update's thread, a line each: the operation's name, a colon, the message. "(name ...)" stands for a block of
+    # compare.py, "(N more)" repeats the line above, "{name}" stands for a command of COMMANDS, "..." for any records, and
+    # at a line's end for any rest of it.
+    "log": str,
     "package": str,
     "board": str,
     "marker": bool,

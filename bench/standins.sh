@@ -81,15 +81,18 @@ apt() {
         echo "Reading package lists..."
         ;;
     "--assume-yes install "*)
-        [ "$UPDATER_STOPPED" != in-install ] || stop_updater
+        if [ "$UPDATER_STOPPED" = in-install ]; then
+            /bin/sleep 0.3
+            stop_updater
+        fi
         [ "$PACKAGE_KNOWN" = true ] || fail 100 "E: Unable to locate package $3"
+        [ "$PACKAGE_INSTALL" != locked ] || /bin/sleep 0.5
+        echo "Setting up $3 ($PACKAGE_OFFERED) ..."
+        echo "$PACKAGE_OFFERED" >"$UNIT/package" # also when it is then left half-configured
         case $PACKAGE_INSTALL in
         fails) fail 100 "E: Sub-process /usr/bin/dpkg returned an error code (1)" ;;
         asks) fail 100 "dpkg: error processing package $3 (--configure): end of file on stdin at conffile prompt" ;;
-        locked) /bin/sleep 0.5 ;;
         esac
-        echo "Setting up $3 ($PACKAGE_OFFERED) ..."
-        echo "$PACKAGE_OFFERED" >"$UNIT/package"
         ;;
     esac
 }
@@ -115,7 +118,8 @@ ssh() {
     board_answers
     case $1 in
     *version.txt*)
-        /bin/grep Brimvale "$board/root/App/AppExe/version.txt"
+        # shellcheck disable=SC2002 # as the board's shell does it: a missing file gives grep's status
+        /bin/cat "$board/root/App/AppExe/version.txt" | /bin/grep Brimvale
         ;;
     /unzipUpgrade.sh)
         case $BOARD_SCRIPT in
@@ -148,6 +152,7 @@ scp() {
 }
 
 i2cset() {
+    [ "$HEAD_PANEL" = present ] || fail 1 "Error: Write failed"
     case $4 in
     0x?) byte=0${4#0x} ;;
     0x??) byte=${4#0x} ;;
@@ -158,6 +163,7 @@ i2cset() {
 
 aplay() {
     [ -f "$head/${1#/root/}" ] || fail 1 "$1: No such file or directory"
+    [ "$HEAD_SOUND" = present ] || fail 1 "aplay: main:831: audio open error: No such file or directory"
     echo "Playing WAVE '$1'" >&2
     /bin/sleep 0.1
     echo "${1##*/}" >>"$UNIT/sounds"

@@ -43,7 +43,7 @@ class StandInUnit:
         """The unit as it is now."""
         known = self._settings["head"]["harl"] == "known"
         return State(
-            package=self._read("package") if self._settings["package"]["known"] else "",
+            package=self._read("package") if self._settings["package"]["known"] else "(none)",
             board=self._board_version(),
             marker=(self._folder / "head/RESOURCES/tavren1stboot").exists(),
             stick=(self._folder / "head/USB_MOUNT").is_symlink(),

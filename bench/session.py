@@ -1,0 +1,69 @@
+"""Runs a scenario once, on the best unit that this machine can make, and leaves nothing behind."""
+
+import contextlib
+import subprocess
+import tempfile
+import time
+from collections.abc import Callable, Iterator
+from dataclasses import dataclass
+from pathlib import Path
+
+from observe import Run, now
+from scenario import Scenario
+from unit import State, Unit, UnitError
+from unit_standin import BUILD, StandInUnit
+
+POLL = 0.02  # s
+LONGEST_RUN = 120  # s, besides the waits; a run that takes longer hangs
+WAITS = 820  # s, of an update at full length
+
+
+@dataclass
+class Result:
+    """How a run ended."""
+
+    run: Run
+    state: State
+    status: int
+    seconds: float
+
+
+@contextlib.contextmanager
+def temporary_folder() -> Iterator[Path]:
+    """A folder that goes with this process, in whatever way the process ends, and with it the updater."""
+    folder = tempfile.mkdtemp(prefix="bench-")
+    # The guard reads until this process has ended, then clears away what still runs and lies there.
+    guard = subprocess.Popen(
+        ["/bin/sh", "-c", 'read -r _; read -r pid <"$0/updater.pid" && kill -s KILL -- "-$pid"; rm -rf "$0"', folder],
+        stdin=subprocess.PIPE,
+        stderr=subprocess.DEVNULL,
+        start_new_session=True,
+    )
+    try:
+        yield Path(folder)
+    finally:
+        assert guard.stdin
+        guard.stdin.close()
+        guard.wait()
+
+
+def make_unit(scenario: Scenario, folder: Path, speed: float, build: Path = BUILD) -> Unit:
+    """The best unit that this machine can make."""
+    return StandInUnit(scenario, folder, speed, build)
+
+
+def run_on(unit: Unit, show: Callable[[Run, str], None], speed: float) -> Result:
+    """Runs the updater on `unit`; `show` gets what was seen so far and what is new of the log. Raises UnitError."""
+    seen = Run(unit.files)
+    begin = now()
+    try:
+        unit.start()
+        while (status := unit.ended()) is None:
+            show(seen, seen.update())
+            if now() - begin > LONGEST_RUN + WAITS / speed:
+                raise UnitError(f"the updater still runs after {now() - begin:.0f} s: ended")
+            time.sleep(POLL)
+        show(seen, seen.update())
+        return Result(seen, unit.state(), status, now() - begin)
+    finally:
+        unit.close()

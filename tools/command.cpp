@@ -1,0 +1,167 @@
+#include "command.h"
+
+#include "descriptor.h"
+
+#include <algorithm>
+#include <array>
+#include <cerrno>
+#include <csignal>
+#include <sstream>
+
+#include <fcntl.h>
+#include <poll.h>
+#include <spawn.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/wait.h>
+
+namespace
+{
+
+const std::size_t mostOutput = 256 * 1024;
+
+struct Pipe
+{
+    Descriptor readEnd;
+    Descriptor writeEnd;
+};
+
+Pipe makePipe()
+{
+    std::array<int, 2> ends = {-1, -1};
+    if (pipe2(ends.data(), O_CLOEXEC) != 0) {
+        return Pipe();
+    }
+    fcntl(ends[0], F_SETFL, O_NONBLOCK);
+    return {Descriptor(ends[0]), Descriptor(ends[1])};
+}
+
+std::vector<char*> pointers(const std::vector<std::string>& texts)
+{
+    std::vector<char*> result;
+    for (const std::string& text : texts) {
+        result.push_back(const_cast<char*>(text.c_str())); // posix_spawn(3) does not change them
+    }
+    result.push_back(nullptr);
+    return result;
+}
+
+std::string searchPathOf(const std::vector<std::string>& environment)
+{
+    for (const std::string& variable : environment) {
+        if (variable.rfind("PATH=", 0) == 0) {
+            return variable.substr(5);
+        }
+    }
+    return "";
+}
+
+/// Appends what `descriptor` has to give by now. False at its end.
+bool drain(int descriptor, std::string& text)
+{
+    std::array<char, 8192> buffer{};
+    for (;;) {
+        const ssize_t count = read(descriptor, buffer.data(), buffer.size());
+        if (count < 0 && errno == EINTR) {
+            continue;
+        }
+        if (count <= 0) {
+            return count < 0 && errno == EAGAIN;
+        }
+        text.append(buffer.data(), std::min(static_cast<std::size_t>(count), mostOutput - text.size()));
+    }
+}
+
+/// Starts the program in a session of its own. Its process id, or -1.
+pid_t spawn(const std::string& program, const std::vector<std::string>& arguments,
+            const std::vector<std::string>& environment, int output, int errors)
+{
+    posix_spawn_file_actions_t actions;
+    posix_spawnattr_t attributes;
+    posix_spawn_file_actions_init(&actions);
+    posix_spawnattr_init(&attributes);
+    posix_spawn_file_actions_addopen(&actions, STDIN_FILENO, "/dev/null", O_RDONLY, 0);
+    posix_spawn_file_actions_adddup2(&actions, output, STDOUT_FILENO);
+    posix_spawn_file_actions_adddup2(&actions, errors, STDERR_FILENO);
+    posix_spawnattr_setflags(&attributes, POSIX_SPAWN_SETSID);
+    pid_t child = -1;
+    const int error = posix_spawn(&child, program.c_str(), &actions, &attributes, pointers(arguments).data(),
+                                  pointers(environment).data());
+    posix_spawn_file_actions_destroy(&actions);
+    posix_spawnattr_destroy(&attributes);
+    return error == 0 ? child : -1;
+}
+
+} // namespace
+
+CommandResult runCommand(const std::vector<std::string>& arguments, const std::vector<std::string>& environment,
+                         std::chrono::milliseconds limit)
+{
+    CommandResult result;
+    const std::string program = findProgram(arguments.front(), searchPathOf(environment));
+    Pipe output = makePipe();
+    Pipe errors = makePipe();
+    if (program.empty() || !output.readEnd || !errors.readEnd) {
+        return result;
+    }
+    const auto deadline = std::chrono::steady_clock::now() + limit;
+    const pid_t child = spawn(program, arguments, environment, output.writeEnd.number(), errors.writeEnd.number());
+    if (child < 0) {
+        return result;
+    }
+    result.started = true;
+    output.writeEnd = Descriptor();
+    errors.writeEnd = Descriptor();
+
+    // A background child of the program may keep the pipes open: the program's own end is what counts.
+    const Descriptor end(static_cast<int>(syscall(SYS_pidfd_open, child, 0)));
+    std::array<pollfd, 3> watched = {
+        {{end.number(), POLLIN, 0}, {output.readEnd.number(), POLLIN, 0}, {errors.readEnd.number(), POLLIN, 0}}};
+    while ((watched[0].revents & POLLIN) == 0) {
+        const auto left =
+            std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+        if (left.count() <= 0) {
+            result.timedOut = true;
+            break;
+        }
+        poll(watched.data(), watched.size(), static_cast<int>(left.count()) + 1);
+        if (watched[1].revents != 0 && !drain(watched[1].fd, result.output)) {
+            watched[1].fd = -1;
+        }
+        if (watched[2].revents != 0 && !drain(watched[2].fd, result.errors)) {
+            watched[2].fd = -1;
+        }
+    }
+    if (result.timedOut) {
+        kill(-child, SIGKILL);
+    }
+    int status = 0;
+    while (waitpid(child, &status, 0) == -1 && errno == EINTR) {
+    }
+    drain(output.readEnd.number(), result.output);
+    drain(errors.readEnd.number(), result.errors);
+    if (!result.timedOut && WIFEXITED(status)) {
+        result.exitCode = WEXITSTATUS(status);
+    }
+    return result;
+}
+
+std::string findProgram(const std::string& name, const std::string& searchPath)
+{
+    const auto canRun = [](const std::string& path) {
+        struct stat status = {};
+        return stat(path.c_str(), &status) == 0 && S_ISREG(status.st_mode) && access(path.c_str(), X_OK) == 0;
+    };
+    if (name.find('/') != std::string::npos) {
+        return canRun(name) ? name : "";
+    }
+    std::istringstream folders(searchPath);
+    std::string folder;
+    while (std::getline(folders, folder, ':')) {
+        const std::string path = folder + '/' + name;
+        if (canRun(path)) {
+            return path;
+        }
+    }
+    return "";
+}

@@ -1,0 +1,28 @@
+#pragma once
+
+#include <chrono>
+#include <string>
+#include <vector>
+
+/// What became of a command.
+struct CommandResult
+{
+    bool started = false;
+    bool timedOut = false; ///< It was killed at its time limit.
+    int exitCode = -1;     ///< -1 when it was not started, timed out or was ended by a signal
+    std::string output;    ///< standard output, the first 256 KiB of it
+    std::string errors;    ///< standard error, likewise
+
+    bool succeeded() const { return exitCode == 0; }
+};
+
+/// Runs a program without a shell, as a service runs it: no terminal, no input. It and its children are killed at
+/// `limit`.
+///
+/// @param arguments    the program, looked for on the PATH of `environment` when it holds no slash, and its arguments
+/// @param environment  all of its environment, as NAME=value
+CommandResult runCommand(const std::vector<std::string>& arguments, const std::vector<std::string>& environment,
+                         std::chrono::milliseconds limit);
+
+/// The program that `name` stands for on `searchPath` (folders with colons between); empty when there is none.
+std::string findProgram(const std::string& name, const std::string& searchPath);

@@ -1,0 +1,240 @@
+#include "findings.h"
+
+#include <algorithm>
+#include <array>
+#include <cstdio>
+#include <ostream>
+#include <utility>
+
+namespace
+{
+
+const std::size_t longestShown = 300; // bytes; a file name has at most 255
+
+/// Length in bytes of the well-formed UTF-8 sequence at the start of `text`, 0 if there is none, and its `character`.
+std::size_t decodeUtf8(std::string_view text, char32_t& character)
+{
+    const auto byteAt = [&](std::size_t index) { return static_cast<unsigned char>(text[index]); };
+    const unsigned char first = byteAt(0);
+    if (first < 0x80) {
+        character = first;
+        return 1;
+    }
+    const std::size_t length = first >= 0xF0 ? 4 : first >= 0xE0 ? 3 : 2;
+    if (first < 0xC2 || first > 0xF4 || text.size() < length) {
+        return 0;
+    }
+    character = first & (0x7FU >> length);
+    for (std::size_t index = 1; index < length; ++index) {
+        if ((byteAt(index) & 0xC0U) != 0x80) {
+            return 0;
+        }
+        character = character << 6U | (byteAt(index) & 0x3FU);
+    }
+    const bool overlong = (length == 3 && character < 0x800) || (length == 4 && character < 0x10000);
+    const bool surrogate = character >= 0xD800 && character <= 0xDFFF;
+    return overlong || surrogate || character > 0x10FFFF ? 0 : length;
+}
+
+/// True for characters beyond ASCII that do not show, or that change how their neighbours show.
+bool isInvisible(char32_t character)
+{
+    static const std::array<std::pair<char32_t, char32_t>, 12> ranges = {{
+        {0x80, 0xA0},       // C1 controls, no-break space
+        {0xAD, 0xAD},       // soft hyphen
+        {0x34F, 0x34F},     // combining grapheme joiner
+        {0x61C, 0x61C},     // Arabic letter mark
+        {0x115F, 0x1160},   // Hangul fillers
+        {0x180B, 0x180E},   // Mongolian separators
+        {0x2000, 0x200F},   // blanks, zero width, direction marks
+        {0x2028, 0x202F},   // line separators, direction embeddings
+        {0x205F, 0x206F},   // blanks, direction isolates
+        {0x3000, 0x3000},   // ideographic space
+        {0xFE00, 0xFEFF},   // variation selectors, Arabic presentation forms, byte order mark
+        {0xE0000, 0x10FFFF} // tags, private use
+    }};
+    return std::any_of(ranges.begin(), ranges.end(),
+                       [&](const auto& range) { return character >= range.first && character <= range.second; });
+}
+
+std::string formatted(const char* format, unsigned value)
+{
+    std::array<char, 32> buffer{};
+    std::snprintf(buffer.data(), buffer.size(), format, value);
+    return buffer.data();
+}
+
+std::string withSeparators(std::uint64_t number)
+{
+    std::string digits = std::to_string(number);
+    for (std::size_t position = digits.size(); position > 3;) {
+        position -= 3;
+        digits.insert(position, ",");
+    }
+    return digits;
+}
+
+} // namespace
+
+const char* severityWord(Severity severity)
+{
+    switch (severity) {
+    case Severity::NOTE:
+        return "note";
+    case Severity::WARNING:
+        return "warning";
+    case Severity::ERROR:
+        return "error";
+    case Severity::UNCHECKED:
+        return "unchecked";
+    }
+    return "";
+}
+
+Report::Report(std::string command, std::string subject) : mCommand(std::move(command)), mSubject(std::move(subject))
+{
+}
+
+void Report::addFact(std::string name, std::string label, std::string text, nlohmann::ordered_json value)
+{
+    mFacts.push_back({std::move(name), std::move(label), std::move(text), std::move(value)});
+}
+
+void Report::addFact(const std::string& name, const std::string& label, const std::string& text)
+{
+    addFact(name, label, text, text);
+}
+
+void Report::add(Finding finding)
+{
+    mFindings.push_back(std::move(finding));
+}
+
+Report::Status Report::status() const
+{
+    const auto has = [&](Severity severity) {
+        return std::any_of(mFindings.begin(), mFindings.end(),
+                           [&](const Finding& finding) { return finding.severity == severity; });
+    };
+    if (has(Severity::ERROR)) {
+        return STATUS_NOT_FIT;
+    }
+    return has(Severity::UNCHECKED) ? STATUS_UNCHECKED : STATUS_FIT;
+}
+
+void Report::write(bool json, std::ostream& out) const
+{
+    if (json) {
+        out << toJson().dump(2) << '\n';
+        return;
+    }
+    print(out);
+}
+
+void Report::print(std::ostream& out) const
+{
+    std::size_t width = 0;
+    for (const Fact& fact : mFacts) {
+        width = std::max(width, fact.label.size());
+    }
+    for (const Fact& fact : mFacts) {
+        out << fact.label << ':' << std::string(width - fact.label.size() + 2, ' ') << fact.text << '\n';
+    }
+    for (Severity severity : {Severity::ERROR, Severity::UNCHECKED, Severity::WARNING, Severity::NOTE}) {
+        for (const Finding& finding : mFindings) {
+            if (finding.severity != severity) {
+                continue;
+            }
+            out << '\n' << severityWord(severity) << ": " << finding.what << " [" << finding.check << "]\n";
+            out << "  The updater: " << finding.effect << '\n';
+            if (!finding.remedy.empty()) {
+                out << "  To mend it:  " << finding.remedy << '\n';
+            }
+        }
+    }
+    out << '\n' << mSubject;
+    switch (status()) {
+    case STATUS_FIT:
+        out << " is fit for an update.\n";
+        break;
+    case STATUS_NOT_FIT:
+        out << " is NOT fit for an update.\n";
+        break;
+    case STATUS_UNCHECKED:
+        out << ": not everything could be checked, whether it is fit is open.\n";
+        break;
+    }
+}
+
+nlohmann::ordered_json Report::toJson() const
+{
+    nlohmann::ordered_json facts = nlohmann::ordered_json::object();
+    for (const Fact& fact : mFacts) {
+        facts[fact.name] = fact.value;
+    }
+    nlohmann::ordered_json findings = nlohmann::ordered_json::array();
+    for (const Finding& finding : mFindings) {
+        findings.push_back({{"severity", severityWord(finding.severity)},
+                            {"check", finding.check},
+                            {"what", finding.what},
+                            {"effect", finding.effect},
+                            {"remedy", finding.remedy}});
+    }
+    return {{"command", mCommand},           {"subject", mSubject}, {"status", static_cast<int>(status())},
+            {"fit", status() == STATUS_FIT}, {"facts", facts},      {"findings", findings}};
+}
+
+std::string escaped(std::string_view text)
+{
+    std::string result;
+    while (!text.empty()) {
+        char32_t character = 0;
+        const std::size_t length = decodeUtf8(text, character);
+        if (length == 0) {
+            result += formatted("\\x%02x", static_cast<unsigned char>(text.front()));
+        } else if (character == '\n') {
+            result += "\\n";
+        } else if (character == '\r') {
+            result += "\\r";
+        } else if (character == '\t') {
+            result += "\\t";
+        } else if (character < 0x20 || character == 0x7F) {
+            result += formatted("\\x%02x", character);
+        } else if (isInvisible(character)) {
+            result += formatted("\\u{%x}", character);
+        } else {
+            if (character == '"' || character == '\\') {
+                result += '\\';
+            }
+            result += text.substr(0, length);
+        }
+        text.remove_prefix(std::max<std::size_t>(length, 1));
+    }
+    return result;
+}
+
+std::string shown(std::string_view text)
+{
+    return '"' + escaped(text.substr(0, longestShown)) + (text.size() > longestShown ? "\"..." : "\"");
+}
+
+std::string byteCount(std::uint64_t bytes)
+{
+    if (bytes < 1000) {
+        return counted(bytes, "byte");
+    }
+    double value = static_cast<double>(bytes);
+    std::size_t unit = 0;
+    static const std::array<const char*, 6> units = {"kB", "MB", "GB", "TB", "PB", "EB"};
+    for (value /= 1000; value >= 999.95 && unit + 1 < units.size(); ++unit) {
+        value /= 1000;
+    }
+    std::array<char, 32> buffer{};
+    std::snprintf(buffer.data(), buffer.size(), "%.1f %s", value, units.at(unit));
+    return std::string(buffer.data()) + " (" + withSeparators(bytes) + " bytes)";
+}
+
+std::string counted(std::uint64_t count, const std::string& noun, const std::string& plural)
+{
+    return withSeparators(count) + ' ' + (count == 1 ? noun : plural.empty() ? noun + 's' : plural);
+}

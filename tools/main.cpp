@@ -1,0 +1,40 @@
+#include "findings.h"
+#include "stick.h"
+#include "unit.h"
+
+#include <iostream>
+#include <string>
+
+#include <CLI/CLI.hpp>
+
+int main(int argc, char** argv)
+{
+    CLI::App app("Answers what a technician asks before and after an update. It never changes the updater.",
+                 "harl-updater-tool");
+    app.require_subcommand(1);
+
+    std::string stickPath = stickMountPoint;
+    bool json = false;
+    CLI::App* stick = app.add_subcommand("stick", "Tell what the updater would do with a stick. Reads only.");
+    stick->add_option("PATH", stickPath, "the folder that the stick is mounted at")->capture_default_str();
+    stick->add_flag("--json", json, "print one JSON object");
+    stick->footer("Exit status: 0 fit for an update, 1 not fit, 2 wrong usage or not everything could be read.");
+
+    UnitOptions unitOptions;
+    CLI::App* unit = app.add_subcommand("unit", "Tell whether this unit is fit for an update. Changes nothing.");
+    unit->add_flag("--panel", unitOptions.panel, "lamp test instead: all 14 LEDs in every colour");
+    unit->add_flag("--sound", unitOptions.sound, "play both sounds instead");
+    unit->add_flag("--json", unitOptions.json, "print one JSON object");
+    unit->footer("Exit status: 0 fit or test passed, 1 not fit or test failed, 2 wrong usage, test refused or not "
+                 "everything could be checked.");
+
+    try {
+        app.parse(argc, argv);
+    } catch (const CLI::ParseError& error) {
+        return app.exit(error) == 0 ? 0 : Report::STATUS_UNCHECKED;
+    }
+    if (stick->parsed()) {
+        return runStick(stickPath, json, std::cout, std::cerr);
+    }
+    return runUnit(unitOptions, thisUnit(), std::cout, std::cerr);
+}

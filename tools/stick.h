@@ -1,0 +1,36 @@
+#pragma once
+
+#include "findings.h"
+
+#include <cstdint>
+#include <iosfwd>
+#include <string>
+#include <string_view>
+#include <vector>
+
+/// Where the unit mounts the stick.
+inline constexpr char stickMountPoint[] = "/root/USB_MOUNT";
+
+/// Checks the stick at `path` for what the updater will do with it, and prints the report to `out`.
+///
+/// Reads only, runs nothing and opens no file outside the stick: a symbolic link that leads out of it is reported
+/// and not followed.
+///
+/// @param json  print one JSON object instead of text
+/// @return a Report::Status; also STATUS_UNCHECKED, with a message on `errors`, when there is no folder to read
+int runStick(const std::string& path, bool json, std::ostream& out, std::ostream& errors);
+
+/// Checks that the board's kernel can run the install script.
+///
+/// @param start  the first bytes of the script, up to scriptBytesChecked
+/// @param size   of the whole script (bytes)
+/// @param name   the script's name for messages, printable
+void checkScript(std::string_view start, std::uint64_t size, const std::string& name, Report& report);
+
+inline constexpr std::size_t scriptBytesChecked = 1024 * 1024;
+
+/// Checks the name that the updater reads the board's version from: the first line of the listing without its first
+/// five bytes.
+///
+/// @return the version as the updater will compare it, not printable as it is
+std::string checkVersionName(const std::string& name, Report& report);

@@ -11,17 +11,17 @@ void UnitTest::registerCallbacks()
     platform::reset();
 }
 
-void UnitTest::noteResult(UpdateManager::Result result)
+void noteResult(UpdateManager::Result result)
 {
     platform::note("result:" + std::to_string(result));
 }
 
-void UnitTest::noteError(UpdateManager::Error error)
+void noteError(UpdateManager::Error error)
 {
     platform::note("error:" + std::to_string(error));
 }
 
-void UnitTest::noteUpdateFound(std::vector<UpdateManager::UpdateComponent> components)
+void noteUpdateFound(std::vector<UpdateManager::UpdateComponent> components)
 {
     std::string text = "found:";
     for (const UpdateManager::UpdateComponent& component : components) {

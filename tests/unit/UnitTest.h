@@ -15,11 +15,11 @@ protected:
 
     /// Registers the callbacks that note what is reported, and forgets the record of that.
     static void registerCallbacks();
-
-    static void noteResult(UpdateManager::Result result);
-    static void noteError(UpdateManager::Error error);
-    static void noteUpdateFound(std::vector<UpdateManager::UpdateComponent> components);
 };
+
+void noteResult(UpdateManager::Result result);
+void noteError(UpdateManager::Error error);
+void noteUpdateFound(std::vector<UpdateManager::UpdateComponent> components);
 
 using platform::entries;
 using platform::exits;

@@ -1,0 +1,337 @@
+#include "LedManager.h"
+#include "UnitTest.h"
+
+#include <atomic>
+#include <cerrno>
+#include <cstdlib>
+#include <thread>
+
+namespace
+{
+
+class Leds : public UnitTest
+{
+protected:
+    /// The command line that sends the controller the two bytes.
+    static std::string bytes(const std::string& first, const std::string& second)
+    {
+        return "i2cset -y 0 0x07 " + first + " c ; i2cset -y 0 0x07 " + second + " c";
+    }
+
+    /// The commands that send every LED the same second byte.
+    static Lines allLeds(const std::string& second)
+    {
+        Lines lines;
+        for (const char* led : {"0x10", "0x11", "0x12", "0x13", "0x14", "0x15", "0x16", "0x17", "0x18", "0x19", "0x1a",
+                                "0x1b", "0x1c", "0x1d"}) {
+            lines.push_back(bytes(led, second));
+        }
+        return lines;
+    }
+
+    static Lines failing(const Lines& commands)
+    {
+        Lines lines;
+        for (const std::string& command : commands) {
+            lines.push_back("system:" + command);
+            lines.push_back("log:system returned false: " + command);
+        }
+        return lines;
+    }
+};
+
+const char remote[] = "0x12";
+const char mainHead[] = "0x15";
+
+TEST_F(Leds, PanelIsOneObject)
+{
+    EXPECT_NE(LedManager::instance(), nullptr);
+    EXPECT_EQ(LedManager::instance(), LedManager::instance());
+}
+
+TEST_F(Leds, TurnOnSendsTheLedThenTheColour)
+{
+    LedManager::turnOn(LedManager::LED_MAIN, LedManager::COLOR_FAIL);
+    LedManager::turnOn(LedManager::LED_REMOTE, LedManager::COLOR_BLUE);
+    LedManager::turnOn(LedManager::LED_PASS, LedManager::COLOR_PASS);
+    LedManager::turnOn(LedManager::LED_FAIL, LedManager::COLOR_OFF);
+    EXPECT_EQ(journal(), (Lines{"system:i2cset -y 0 0x07 0x15 c ; i2cset -y 0 0x07 0x8 c",
+                                "system:i2cset -y 0 0x07 0x12 c ; i2cset -y 0 0x07 0x1 c",
+                                "system:i2cset -y 0 0x07 0x13 c ; i2cset -y 0 0x07 0x2 c",
+                                "system:i2cset -y 0 0x07 0x14 c ; i2cset -y 0 0x07 0x0 c"}));
+}
+
+TEST_F(Leds, TurnOffIsTheColourOff)
+{
+    LedManager::turnOff(LedManager::LED_REMOTE);
+    LedManager::turnOn(LedManager::LED_REMOTE, LedManager::COLOR_OFF);
+    LedManager::stopFlashingSequence(LedManager::LED_REMOTE);
+    EXPECT_EQ(journal(), Lines(3, "system:i2cset -y 0 0x07 0x12 c ; i2cset -y 0 0x07 0x0 c"));
+}
+
+TEST_F(Leds, TurnOffAllDarkensFourteenLedsInAscendingOrder)
+{
+    LedManager::turnOffAll();
+    EXPECT_EQ(journal().size(), 14U);
+    EXPECT_EQ(entries("system:"), allLeds("0x0"));
+}
+
+TEST_F(Leds, TurnOnAllLightsFourteenLedsInAscendingOrder)
+{
+    LedManager::turnOnAll(LedManager::COLOR_FAIL);
+    EXPECT_EQ(journal().size(), 14U);
+    EXPECT_EQ(entries("system:"), allLeds("0x8"));
+}
+
+TEST_F(Leds, FailedCommandIsLoggedAndTheNextOneRuns)
+{
+    for (const std::string& command : allLeds("0x0")) {
+        script(command, {exits(127)});
+    }
+    LedManager::turnOffAll();
+    EXPECT_EQ(journal(), failing(allLeds("0x0")));
+    EXPECT_EQ(platform::records().at(0).function, "static void LedManager::turnOn(LedManager::Led, LedManager::Color)");
+}
+
+TEST_F(Leds, AnyStatusButZeroIsAFailure)
+{
+    for (const int status : {-1, 1, 9, 256}) {
+        platform::reset();
+        script(bytes(remote, "0x1"), {{status, "", true, {}}});
+        LedManager::turnOn(LedManager::LED_REMOTE, LedManager::COLOR_BLUE);
+        EXPECT_EQ(journal(), failing({bytes(remote, "0x1")}));
+    }
+}
+
+class Flashing : public Leds
+{
+protected:
+    /// Lets the flashing thread make `cycles` cycles: the stop comes within the pause of the last one.
+    static void flash(int cycles)
+    {
+        std::atomic<int> pauses{0};
+        platform::scriptSleep([&pauses, cycles](const timespec*, timespec*) {
+            if (pauses + 1 == cycles) {
+                LedManager::instance()->stopFlashRemoteAndMainInBlue();
+            }
+            ++pauses;
+            return 0;
+        });
+        LedManager::instance()->startFlashRemoteAndMainInBlue();
+        platform::waitFor([&pauses, cycles] { return pauses == cycles; });
+        LedManager::instance()->waitForFlashingEnd();
+    }
+
+    static Lines cycle(const char* lit, const char* dark)
+    {
+        Lines lines;
+        for (const std::string& command : allLeds("0x0")) {
+            lines.push_back("system:" + command);
+        }
+        return joined({lines, {"system:" + bytes(lit, "0x1"), "system:" + bytes(dark, "0x0"), "sleep:1"}});
+    }
+
+    static Lines bothOff() { return {"system:" + bytes(mainHead, "0x0"), "system:" + bytes(remote, "0x0")}; }
+};
+
+TEST_F(Flashing, RemoteIsLitFirstThenMainInTurn)
+{
+    flash(3);
+    EXPECT_EQ(journal(),
+              joined({cycle(remote, mainHead), cycle(mainHead, remote), cycle(remote, mainHead), bothOff()}));
+}
+
+TEST_F(Flashing, StartsWithRemoteAgainAfterAStop)
+{
+    flash(1);
+    platform::reset();
+    flash(2);
+    EXPECT_EQ(journal(), joined({cycle(remote, mainHead), cycle(mainHead, remote), bothOff()}));
+}
+
+TEST_F(Flashing, ThreadThatIsStoppedBeforeItsFirstCheckOnlyTurnsBothOff)
+{
+    LedManager::flashingThreadFunction();
+    EXPECT_EQ(journal(), bothOff());
+}
+
+TEST_F(Flashing, RunsOnAThreadOfItsOwn)
+{
+    flash(1);
+    EXPECT_EQ(journal(std::this_thread::get_id()), Lines{});
+}
+
+TEST_F(Flashing, FailedCommandsDoNotEndIt)
+{
+    script(bytes(remote, "0x1"), {exits(1)});
+    flash(2);
+    const Lines log = entries("log:");
+    EXPECT_EQ(log, Lines{"system returned false: " + bytes(remote, "0x1")});
+    EXPECT_EQ(entries("sleep:"), (Lines{"1", "1"}));
+}
+
+TEST_F(Flashing, SignalDoesNotShortenTheSecond)
+{
+    std::atomic<int> calls{0};
+    platform::scriptSleep([&calls](const timespec*, timespec* remaining) {
+        if (calls == 2) {
+            LedManager::instance()->stopFlashRemoteAndMainInBlue();
+            ++calls;
+            return 0;
+        }
+        ++calls;
+        *remaining = {0, calls * 1000};
+        errno = EINTR;
+        return -1;
+    });
+    LedManager::instance()->startFlashRemoteAndMainInBlue();
+    platform::waitFor([&calls] { return calls == 3; });
+    LedManager::instance()->waitForFlashingEnd();
+    EXPECT_EQ(entries("sleep:"), (Lines{"1", "0.1000", "0.2000"}));
+}
+
+TEST_F(Flashing, StopReturnsBeforeTheLastCycleHasEndedAndTheWaitAfterIt)
+{
+    std::atomic<bool> stopped{false};
+    platform::scriptSleep([&stopped](const timespec*, timespec*) {
+        platform::note("pause");
+        platform::waitFor([&stopped] { return stopped.load(); });
+        return 0;
+    });
+    LedManager::instance()->startFlashRemoteAndMainInBlue();
+    platform::waitFor([] { return !entries("pause").empty(); });
+    LedManager::instance()->stopFlashRemoteAndMainInBlue();
+    platform::note("stopped");
+    stopped = true;
+    LedManager::instance()->waitForFlashingEnd();
+    platform::note("ended");
+    const Lines all = journal();
+    EXPECT_EQ(Lines(all.end() - 4, all.end()), joined({{"stopped"}, bothOff(), {"ended"}}));
+}
+
+TEST_F(Flashing, StopAndWaitWithoutAThreadReturnAtOnce)
+{
+    LedManager::instance()->stopFlashRemoteAndMainInBlue();
+    LedManager::instance()->waitForFlashingEnd();
+    LedManager::instance()->waitForFlashingEnd();
+    EXPECT_EQ(journal(), Lines{});
+}
+
+/// In a child process, which a blocked caller cannot outlive: starts again and checks that this does not return.
+[[noreturn]] void startAgain(bool stopFirst)
+{
+    static std::atomic<bool> returned{false};
+    const auto cycles = [] { return entries("sleep:").size(); };
+    LedManager::instance()->startFlashRemoteAndMainInBlue();
+    platform::waitFor([&cycles] { return cycles() == 1; });
+    if (stopFirst) {
+        LedManager::instance()->stopFlashRemoteAndMainInBlue();
+    }
+    std::thread([] {
+        LedManager::instance()->startFlashRemoteAndMainInBlue();
+        returned = true;
+    }).detach();
+    platform::waitFor([&cycles] { return cycles() >= 5; });
+    std::_Exit(returned ? 1 : 0);
+}
+
+TEST_F(Flashing, StartingAgainWithoutAStopBlocksTheCaller)
+{
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    EXPECT_EXIT(startAgain(false), testing::ExitedWithCode(0), "");
+}
+
+TEST_F(Flashing, StartingAgainWithinTheLastPauseRevivesTheOldThread)
+{
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    EXPECT_EXIT(
+        {
+            platform::scriptSleep([](const timespec*, timespec*) {
+                platform::delay(100);
+                return 0;
+            });
+            startAgain(true);
+        },
+        testing::ExitedWithCode(0), "");
+}
+
+class Sequences : public Leds
+{
+protected:
+    const Lines passFor500ms = {
+        "i2cset -y 0 0x07 0x13 c ; i2cset -y 0 0x07 0xc2 c", "i2cset -y 0 0x07 0x1f c ; i2cset -y 0 0x07 0x19 c",
+        "i2cset -y 0 0x07 0x13 c ; i2cset -y 0 0x07 0xC0 c", "i2cset -y 0 0x07 0x1f c ; i2cset -y 0 0x07 0x19 c"};
+
+    static std::string stepTimeOf(int duration)
+    {
+        platform::reset();
+        LedManager::setFlashingSequence(LedManager::LED_PASS, LedManager::COLOR_PASS, duration);
+        EXPECT_EQ(entries("system:").at(1), entries("system:").at(3));
+        return entries("system:").at(1);
+    }
+};
+
+TEST_F(Sequences, ResetStartAndStopSendTheirModes)
+{
+    LedManager::resetFlashingSequence(LedManager::LED_FIRST);
+    LedManager::startFlashingSequence(LedManager::LED_FAIL);
+    LedManager::stopFlashingSequence(LedManager::LED_LAST);
+    EXPECT_EQ(journal(), (Lines{"system:i2cset -y 0 0x07 0x10 c ; i2cset -y 0 0x07 0x80 c",
+                                "system:i2cset -y 0 0x07 0x14 c ; i2cset -y 0 0x07 0x40 c",
+                                "system:i2cset -y 0 0x07 0x1d c ; i2cset -y 0 0x07 0x0 c"}));
+}
+
+TEST_F(Sequences, FailedModeIsLogged)
+{
+    for (const char* mode : {"0x80", "0x40", "0x0"}) {
+        script(bytes("0x13", mode), {exits(1)});
+    }
+    LedManager::resetFlashingSequence(LedManager::LED_PASS);
+    LedManager::startFlashingSequence(LedManager::LED_PASS);
+    LedManager::stopFlashingSequence(LedManager::LED_PASS);
+    EXPECT_EQ(journal(), failing({bytes("0x13", "0x80"), bytes("0x13", "0x40"), bytes("0x13", "0x0")}));
+    EXPECT_EQ(platform::records().at(0).function, "static void LedManager::resetFlashingSequence(LedManager::Led)");
+    EXPECT_EQ(platform::records().at(1).function, "static void LedManager::startFlashingSequence(LedManager::Led)");
+    EXPECT_EQ(platform::records().at(2).function, "static void LedManager::stopFlashingSequence(LedManager::Led)");
+}
+
+TEST_F(Sequences, SetAppendsTheColourThenDarkness)
+{
+    LedManager::setFlashingSequence(LedManager::LED_PASS, LedManager::COLOR_PASS, 500);
+    EXPECT_EQ(journal().size(), 4U);
+    EXPECT_EQ(entries("system:"), passFor500ms);
+}
+
+TEST_F(Sequences, StepTimeIsInUnitsOf20MillisecondsRoundedTowardsZero)
+{
+    EXPECT_EQ(stepTimeOf(0), bytes("0x1f", "0x00"));
+    EXPECT_EQ(stepTimeOf(19), bytes("0x1f", "0x00"));
+    EXPECT_EQ(stepTimeOf(39), bytes("0x1f", "0x01"));
+    EXPECT_EQ(stepTimeOf(5119), bytes("0x1f", "0xff"));
+}
+
+TEST_F(Sequences, StepTimesOutOfRangeAreLeftToTheToolToRefuse)
+{
+    EXPECT_EQ(stepTimeOf(5120), bytes("0x1f", "0x100"));
+    EXPECT_EQ(stepTimeOf(-19), bytes("0x1f", "0x00"));
+    EXPECT_EQ(stepTimeOf(-20), bytes("0x1f", "0xffffffff"));
+}
+
+TEST_F(Sequences, SetEndsAtItsFirstFailedCommand)
+{
+    for (std::size_t failed = 0; failed < passFor500ms.size(); ++failed) {
+        platform::reset();
+        // The second and the fourth command are the same: fail the one that is meant.
+        const bool fourth = failed == 3;
+        script(passFor500ms[failed],
+               fourth ? std::vector<platform::Answer>{exits(0), exits(1)} : std::vector<platform::Answer>{exits(1)});
+        LedManager::setFlashingSequence(LedManager::LED_PASS, LedManager::COLOR_PASS, 500);
+        EXPECT_EQ(entries("system:"),
+                  Lines(passFor500ms.begin(), passFor500ms.begin() + static_cast<std::ptrdiff_t>(failed) + 1));
+        EXPECT_EQ(entries("log:"), Lines{"system returned false: " + passFor500ms[failed]});
+        EXPECT_EQ(platform::records().at(0).function,
+                  "static void LedManager::setFlashingSequence(LedManager::Led, LedManager::Color, int)");
+    }
+}
+
+} // namespace

@@ -1,0 +1,263 @@
+#include "UnitTest.h"
+
+#include <algorithm>
+#include <csignal>
+#include <cstddef>
+#include <cstdlib>
+
+namespace
+{
+
+/// True once an entry of the journal is `text`.
+bool noted(const std::string& text)
+{
+    const Lines lines = journal();
+    return std::find(lines.begin(), lines.end(), text) != lines.end();
+}
+
+class Manager : public UnitTest
+{
+protected:
+    void SetUp() override { registerCallbacks(); }
+
+    /// The thread whose record is the first of the function `function`.
+    static std::string threadOf(const std::string& function)
+    {
+        for (const platform::Record& record : platform::records()) {
+            if (record.function == function) {
+                return record.thread;
+            }
+        }
+        ADD_FAILURE() << "no record of " << function;
+        return "";
+    }
+
+    UpdateManager* const manager = UpdateManager::instance();
+};
+
+const char stopHarl[] = "systemctl stop harl";
+const char stopUpdater[] = "systemctl stop harl-updater";
+const Lines entry = {"log:"};
+
+TEST_F(Manager, IsOneObject)
+{
+    EXPECT_EQ(UpdateManager::instance(), manager);
+    EXPECT_NE(manager, nullptr);
+}
+
+TEST_F(Manager, CallbacksAreValidWhenNoneIsNull)
+{
+    for (const bool result : {false, true}) {
+        for (const bool error : {false, true}) {
+            for (const bool found : {false, true}) {
+                manager->setCallbacks(result ? noteResult : nullptr, error ? noteError : nullptr,
+                                      found ? noteUpdateFound : nullptr);
+                EXPECT_EQ(manager->validateCallbacks(), result && error && found);
+            }
+        }
+    }
+    EXPECT_EQ(platform::records().at(0).message, "");
+    EXPECT_EQ(platform::records().at(0).function,
+              "void UpdateManager::setCallbacks(UpdateManager::ResultCallback, UpdateManager::ErrorCallback, "
+              "UpdateManager::UpdateFoundCallback)");
+}
+
+TEST_F(Manager, RemoteHeadRunsOnTheCallersThread)
+{
+    scriptPackage(policyCommand, "1.2.0", "1.2.0");
+    scriptBoard("2.1.0", "2.1.0");
+    // Synchronous: the journal of this thread is the whole journal as soon as each call has returned.
+    manager->init(true);
+    EXPECT_EQ(journal(), joined({entry, harlStopped()}));
+
+    platform::reset();
+    scriptPackage(policyCommand, "1.2.0", "1.2.0");
+    scriptBoard("2.1.0", "2.1.0");
+    manager->update({{UpdateManager::COMPONENT_TEAMVIEWER, "TV", "1", "2"}}, true); // the list is ignored
+    EXPECT_EQ(journal(), joined({entry,
+                                 entry,
+                                 mirrorsOk(),
+                                 packageChecked(policyCommand, "1.2.0", "1.2.0"),
+                                 boardChecked("2.1.0", "2.1.0"),
+                                 {"result:0"}}));
+
+    platform::reset();
+    manager->deinit(true);
+    EXPECT_EQ(
+        journal(),
+        joined({entry,
+                {"log:", "log:Giving users 30 Secs to view Pass/Fail LED status before completing update", "sleep:30"},
+                harlStarted()}));
+    EXPECT_EQ(journal(std::this_thread::get_id()), journal());
+}
+
+TEST_F(Manager, EntryOperationsAreNamedInTheLog)
+{
+    manager->init(true);
+    EXPECT_EQ(platform::records().at(0).function, "void UpdateManager::init(bool)");
+    platform::reset();
+    manager->update({}, true);
+    EXPECT_EQ(platform::records().at(0).function,
+              "void UpdateManager::update(std::vector<UpdateManager::UpdateComponent>, bool)");
+    platform::reset();
+    manager->deinit(true);
+    EXPECT_EQ(platform::records().at(0).function, "void UpdateManager::deinit(bool)");
+}
+
+std::vector<UpdateManager::UpdateComponent> offered;
+
+void keepOffer(std::vector<UpdateManager::UpdateComponent> components)
+{
+    noteUpdateFound(components);
+    offered = components;
+}
+
+TEST_F(Manager, MainHeadChecksInstallsWhatItOfferedAndClosesOnWorkerThreads)
+{
+    manager->setCallbacks(noteResult, noteError, keepOffer);
+    platform::reset();
+    scriptPackage("apt-cache policy solvik4-dh", "1.2.0", "1.3.0");
+    scriptBoard("2.1.0", "2.1.0");
+    script(teamViewerCheckCommand, {exits(0, std::string(teamViewerMarker) + "\n")});
+    script(stopHarl, {{0, "", true, [] { platform::delay(50); }}});
+
+    manager->init(false);
+    EXPECT_FALSE(noted("found:{0,Solvik IV,1.2.0,1.3.0}{2,TV,1,2}")) << "init() waited for its worker";
+    platform::waitFor([] { return noted("found:{0,Solvik IV,1.2.0,1.3.0}{2,TV,1,2}"); });
+    manager->update(offered, false);
+    offered.clear(); // the worker has a list of its own
+    platform::waitFor([] { return noted("result:1"); });
+    const std::size_t before = journal().size();
+    manager->deinit(false);
+    platform::waitFor([] { return noted(std::string("system:") + stopUpdater) && journal().back() == "log:0"; });
+
+    const Lines all = journal();
+    EXPECT_EQ(Lines(all.begin(), all.begin() + static_cast<std::ptrdiff_t>(before)),
+              joined({entry,
+                      entry,
+                      harlStopped(),
+                      mirrorsOk(),
+                      packageChecked("apt-cache policy solvik4-dh", "1.2.0", "1.3.0"),
+                      boardChecked("2.1.0", "2.1.0"),
+                      {std::string("log:Running command: ") + teamViewerCheckCommand,
+                       std::string("popen:") + teamViewerCheckCommand, "log:Exit code:0",
+                       std::string("log:Teamviewer path") + teamViewerMarker, "log:Teamviewer install is required",
+                       "log:going to install TV", "system:rm /root/RESOURCES/tavren1stboot",
+                       "log:removedrm /root/RESOURCES/tavren1stboot", "found:{0,Solvik IV,1.2.0,1.3.0}{2,TV,1,2}"},
+                      entry,
+                      entry,
+                      {"log:now call install MAIN udate0", "log:now call install DH udate"},
+                      packageInstalled("apt --assume-yes install solvik4-dh"),
+                      {"log:now call install MAIN udate2", "log:now call install TV udate", "log:",
+                       std::string("log:") + teamViewerScriptCommand, std::string("system:") + teamViewerScriptCommand,
+                       "log:Install script ended with code: 0", "log:update maainhead finished", "result:1"}}));
+    EXPECT_EQ(Lines(all.begin() + static_cast<std::ptrdiff_t>(before), all.end()), joined({entry, harlStarted()}));
+
+    const std::string caller = threadOf("void UpdateManager::init(bool)");
+    const std::string checker = threadOf("static void UpdateManager::initMainHead()");
+    const std::string installer =
+        threadOf("static void UpdateManager::updateMainHead(std::vector<UpdateManager::UpdateComponent>)");
+    const std::string closer = threadOf("static void UpdateManager::startHARL()");
+    EXPECT_NE(checker, caller);
+    EXPECT_NE(installer, caller);
+    EXPECT_NE(closer, caller);
+    EXPECT_NE(closer, installer);
+}
+
+TEST_F(Manager, UpdateOfTheMainHeadWaitsForTheCheckAndReturnsBeforeTheInstallation)
+{
+    script(stopHarl, {{0, "", true, [] { platform::delay(100); }}});
+    script(mirrorsCommand, {exits(100)});
+    script(teamViewerScriptCommand, {{0, "", true, [] { platform::delay(100); }}});
+    manager->init(false);
+    manager->update({{UpdateManager::COMPONENT_TEAMVIEWER, "TV", "1", "2"}}, false);
+    EXPECT_TRUE(noted("error:1")) << "update() did not wait for the check";
+    EXPECT_FALSE(noted("result:1")) << "update() waited for the installation";
+    platform::waitFor([] { return noted("result:1"); });
+}
+
+TEST_F(Manager, ClosingStepOfTheMainHeadDoesNotWaitForTheInstallation)
+{
+    script(mirrorsCommand, {exits(100)});
+    script(teamViewerScriptCommand,
+           {{0, "", true, [] { platform::waitFor([] { return noted(std::string("system:") + stopUpdater); }); }}});
+    manager->init(false);
+    manager->update({{UpdateManager::COMPONENT_TEAMVIEWER, "TV", "1", "2"}}, false);
+    manager->deinit(false);
+    platform::waitFor([] { return noted("result:1"); });
+}
+
+TEST_F(Manager, InitAndDeinitOverwriteTheWorkerWithoutWaiting)
+{
+    script(mirrorsCommand, {{100 * 256, "", true, [] { platform::delay(50); }}});
+    manager->init(false);
+    manager->init(false);
+    manager->deinit(false);
+    EXPECT_EQ(entries("error:"), Lines{});
+    // Two checks with a status each, and a closing step with three.
+    platform::waitFor([] { return entries("error:").size() == 2 && entries("log:0").size() == 5; });
+}
+
+TEST_F(Manager, UpdateOfTheMainHeadWithoutACheckInstallsAtOnce)
+{
+    // In a process of its own, where no worker was ever started.
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    EXPECT_EXIT(
+        {
+            manager->update({{5, "", "", ""}}, false);
+            platform::waitFor([] { return noted("result:1"); });
+            std::_Exit(noted("log:now call install MAIN udate5") ? 0 : 1);
+        },
+        testing::ExitedWithCode(0), "");
+}
+
+/// Calls an entry operation with one of the three callbacks missing.
+class MissingCallback : public testing::TestWithParam<int>
+{
+protected:
+    void SetUp() override
+    {
+        platform::reset();
+        UpdateManager::instance()->setCallbacks(GetParam() == 0 ? nullptr : noteResult,
+                                                GetParam() == 1 ? nullptr : noteError,
+                                                GetParam() == 2 ? nullptr : noteUpdateFound);
+    }
+
+    /// glibc's diagnostic, assert(3), with the function as the compiler spells it, as a regular expression.
+    static std::string diagnostic(const std::string& function)
+    {
+        std::string text = ": " + function + ": Assertion `validateCallbacks()' failed\\.";
+        for (const char special : {'(', ')', '<', '>'}) {
+            std::replace(text.begin(), text.end(), special, '.');
+        }
+        return text;
+    }
+};
+
+TEST_P(MissingCallback, AbortsInit)
+{
+    for (const bool head : {false, true}) {
+        EXPECT_EXIT(UpdateManager::instance()->init(head), testing::KilledBySignal(SIGABRT),
+                    diagnostic("void UpdateManager::init(bool)"));
+    }
+}
+
+TEST_P(MissingCallback, AbortsUpdate)
+{
+    for (const bool head : {false, true}) {
+        EXPECT_EXIT(UpdateManager::instance()->update({}, head), testing::KilledBySignal(SIGABRT),
+                    diagnostic("void UpdateManager::update(std::vector<UpdateManager::UpdateComponent>, bool)"));
+    }
+}
+
+TEST_P(MissingCallback, AbortsDeinit)
+{
+    for (const bool head : {false, true}) {
+        EXPECT_EXIT(UpdateManager::instance()->deinit(head), testing::KilledBySignal(SIGABRT),
+                    diagnostic("void UpdateManager::deinit(bool)"));
+    }
+}
+
+INSTANTIATE_TEST_SUITE_P(Each, MissingCallback, testing::Values(0, 1, 2));
+
+} // namespace

@@ -1,0 +1,386 @@
+/// Every command of every path of both heads, with every fault, and with every pair of faults. Each case is a process
+/// of its own in which the program's main(), or one update of the main head, runs whole on the stand-in platform.
+
+#include "AppLock.h"
+#include "Procedure.h"
+#include "UnitTest.h"
+
+#include <algorithm>
+#include <map>
+#include <set>
+#include <unistd.h>
+
+int updaterMain(int, char**); // main() of the remote head's program, renamed for this test program
+
+namespace
+{
+
+struct Case
+{
+    Unit unit;
+    std::vector<Injection> injections;
+
+    std::string name() const;
+};
+
+// Steps that are a group of commands of the remote head's panel, or its sound.
+const std::string panelStep = "panel";
+const std::string soundStep = "sound";
+
+std::string Case::name() const
+{
+    std::string text = unit.mainHead ? "MainHead" : "RemoteHead";
+    text += unit.packageDiffers ? "_package" : "";
+    text += unit.boardDiffers ? "_board" : "";
+    text += unit.teamViewer ? "_TeamViewer" : "";
+    for (const Injection& injection : injections) {
+        text += "__" + injection.step + "_" + injection.fault->name;
+        text += injection.times == 0 ? "" : "_times" + std::to_string(injection.times);
+    }
+    text.erase(std::remove_if(text.begin(), text.end(), [](char c) { return !isalnum(c) && c != '_'; }), text.end());
+    return text;
+}
+
+// Generation
+
+std::vector<Unit> units()
+{
+    std::vector<Unit> all;
+    for (int bits = 0; bits < 4; ++bits) {
+        all.push_back({false, (bits & 1) != 0, (bits & 2) != 0, false});
+    }
+    for (int bits = 0; bits < 8; ++bits) {
+        all.push_back({true, (bits & 1) != 0, (bits & 2) != 0, (bits & 4) != 0});
+    }
+    return all;
+}
+
+platform::Lines ledCommands()
+{
+    platform::Lines commands = darkPanel();
+    for (const char* report : {"result 0", "result 1", "error 0", "error 2"}) {
+        const platform::Lines lit = outcomePanel(report);
+        commands.insert(commands.end(), lit.begin(), lit.end());
+    }
+    for (const char* led : {"0x12", "0x15"}) {
+        commands.push_back(std::string("i2cset -y 0 0x07 ") + led + " c ; i2cset -y 0 0x07 0x1 c");
+    }
+    return commands;
+}
+
+/// Every step of the procedure with every fault.
+std::vector<Injection> procedureInjections(const Unit& unit)
+{
+    std::vector<Injection> all;
+    for (const Step& step : stepsOf(unit)) {
+        const bool run = step.reads == Reads::Nothing || step.reads == Reads::Status;
+        for (const Fault& fault : run ? runFaults() : readFaults()) {
+            if (step.name != "upload") {
+                all.push_back({step.name, &fault});
+                continue;
+            }
+            for (const int times : {1, 19, 20}) {
+                all.push_back({step.name, &fault, times});
+            }
+        }
+    }
+    if (!unit.mainHead) {
+        for (const Fault& fault : runFaults()) {
+            all.push_back({panelStep, &fault});
+            all.push_back({soundStep, &fault});
+        }
+    }
+    return all;
+}
+
+std::vector<Case> faultsOfTheProcedure()
+{
+    std::vector<Case> cases;
+    for (const Unit& unit : units()) {
+        for (const Injection& injection : procedureInjections(unit)) {
+            cases.push_back({unit, {injection}});
+        }
+    }
+    return cases;
+}
+
+/// No fault, those of the procedure, and those of each single LED command.
+std::vector<Case> everyFault()
+{
+    std::vector<Case> cases = faultsOfTheProcedure();
+    for (const Unit& unit : units()) {
+        cases.push_back({unit, {}});
+        for (const std::string& command : unit.mainHead ? platform::Lines{} : ledCommands()) {
+            for (const Fault& fault : runFaults()) {
+                cases.push_back({unit, {{command, &fault}}});
+            }
+        }
+    }
+    return cases;
+}
+
+// The stand-in platform of one case
+
+std::thread::id updateThread;
+std::set<std::string> failingCommands;
+
+void scriptCommand(const std::string& command, int healthyStatus, const std::string& healthy,
+                   const Injection* injection)
+{
+    const bool opens = command == "systemctl stop harl";
+    const auto before = [opens](int delay) {
+        if (opens) {
+            updateThread = std::this_thread::get_id();
+            platform::waitFor([] { return applicationLockWaited.load(); });
+        }
+        platform::delay(delay);
+    };
+    const platform::Answer well = {healthyStatus, healthy, true, [before] { before(0); }};
+    if (injection == nullptr) {
+        script(command, {well});
+        return;
+    }
+    const Fault& fault = *injection->fault;
+    if (fault.status != 0) {
+        failingCommands.insert(command);
+    }
+    std::vector<platform::Answer> answers(
+        static_cast<std::size_t>(std::max(1, injection->times)),
+        {fault.status, fault.output(healthy), fault.starts, [before, &fault] { before(fault.delay); }});
+    if (injection->times != 0) {
+        answers.push_back(well);
+    }
+    script(command, answers);
+}
+
+void scriptUnit(const Case& what)
+{
+    platform::reset();
+    for (const Step& step : stepsOf(what.unit)) {
+        const auto injection = std::find_if(what.injections.begin(), what.injections.end(),
+                                            [&](const Injection& candidate) { return candidate.step == step.name; });
+        scriptCommand(step.command, healthyCode(what.unit, step.name) * 256, healthyOutput(what.unit, step.name),
+                      injection == what.injections.end() ? nullptr : &*injection);
+    }
+    for (const Injection& injection : what.injections) {
+        for (const std::string& command : ledCommands()) {
+            if (injection.step == panelStep || injection.step == command) {
+                scriptCommand(command, 0, "", &injection);
+            }
+        }
+        for (const char* report : {"result 0", "error 0"}) {
+            if (injection.step == soundStep) {
+                scriptCommand(outcomeSound(report), 0, "", &injection);
+            }
+        }
+    }
+    platform::scriptSleep([](const timespec* duration, timespec*) {
+        if (duration->tv_sec == 1) { // of the flashing thread: not instant, or it would do nothing but flash
+            usleep(300);
+        }
+        return 0;
+    });
+}
+
+/// Commands, pauses and reports without the log.
+platform::Lines callsIn(const platform::Lines& journal)
+{
+    platform::Lines calls;
+    std::copy_if(journal.begin(), journal.end(), std::back_inserter(calls),
+                 [](const std::string& entry) { return entry.compare(0, 4, "log:") != 0; });
+    return calls;
+}
+
+// What must hold in every case
+
+void expectWholeRecords()
+{
+    for (const platform::Record& record : platform::records()) { // fails by itself on any that is not well-formed
+        EXPECT_TRUE(record.flushed);
+    }
+}
+
+/// Every failing LED command and sound is logged, and nothing else is.
+void expectFailuresLogged()
+{
+    int failed = 0;
+    for (const std::string& command : entries("system:")) {
+        failed += failingCommands.count(command) != 0 && command.compare(0, 7, "i2cset ") == 0;
+    }
+    EXPECT_EQ(static_cast<int>(entries("log:system returned false: ").size()), failed);
+}
+
+/// The panel is dark before the sound, and afterwards shows the outcome and nothing else.
+void expectPanelShows(const std::string& report)
+{
+    const platform::Lines calls = entries("system:");
+    const auto sound = std::find(calls.begin(), calls.end(), outcomeSound(report));
+    ASSERT_GE(sound - calls.begin(), 14);
+    EXPECT_EQ(platform::Lines(sound - 14, sound), darkPanel());
+    platform::Lines lit;
+    std::copy_if(sound + 1, calls.end(), std::back_inserter(lit),
+                 [](const std::string& command) { return command.compare(0, 7, "i2cset ") == 0; });
+    EXPECT_EQ(lit, outcomePanel(report));
+    EXPECT_EQ(std::count_if(calls.begin(), calls.end(),
+                            [](const std::string& command) { return command.compare(0, 6, "aplay ") == 0; }),
+              1);
+}
+
+/// The one report of the remote head comes from `callback`, behind a record with the outcome's `message`.
+void expectOneReport(const std::string& report, const std::string& message)
+{
+    const std::string callback = report[0] == 'r' ? "resultCallback" : "errorCallback";
+    const std::vector<platform::Record> records = platform::records();
+    std::string last;
+    int reports = 0;
+    for (const platform::Record& record : records) {
+        if (record.function.find("Callback(UpdateManager::") != std::string::npos && record.message.empty()) {
+            ++reports;
+            EXPECT_NE(record.function.find(callback), std::string::npos) << record.function;
+            EXPECT_TRUE(message.empty() || last == message) << last;
+        }
+        if (record.function.find("UpdateManager::") != std::string::npos) {
+            last = record.message;
+        }
+    }
+    EXPECT_EQ(reports, 1);
+}
+
+// Runs
+
+void runRemoteHead(const Case& what)
+{
+    const Expected expected = follow(what.unit, what.injections);
+    scriptUnit(what);
+    EXPECT_EQ(updaterMain(0, nullptr), 0);
+    EXPECT_EQ(callsIn(journal(updateThread)), expected.calls);
+    const platform::Lines main = callsIn(journal(std::this_thread::get_id()));
+    EXPECT_EQ(main.size(), 14U);
+    expectWholeRecords();
+    expectFailuresLogged();
+    expectPanelShows(expected.report);
+    expectOneReport(expected.report, expected.message);
+}
+
+std::atomic<int> mainHeadReports{0};
+std::vector<UpdateManager::UpdateComponent> offered;
+
+void noteReport(const std::string& text)
+{
+    platform::note(text);
+    ++mainHeadReports;
+}
+
+void runMainHead(const Case& what)
+{
+    const Expected expected = follow(what.unit, what.injections);
+    applicationLockWaited = true; // nobody waits there on the main head
+    scriptUnit(what);
+    UpdateManager* manager = UpdateManager::instance();
+    manager->setCallbacks([](UpdateManager::Result result) { noteReport("result:" + std::to_string(result)); },
+                          [](UpdateManager::Error error) { noteReport("error:" + std::to_string(error)); },
+                          [](std::vector<UpdateManager::UpdateComponent> components) {
+                              offered = std::move(components);
+                              std::string text = "found:";
+                              for (const UpdateManager::UpdateComponent& component : offered) {
+                                  text += "{" + std::to_string(component.kind) + "," + component.name + "}";
+                              }
+                              noteReport(text);
+                          });
+    manager->init(false);
+    platform::waitFor([] { return mainHeadReports == 1; });
+    if (!offered.empty()) {
+        manager->update(offered, false);
+        platform::waitFor([] { return mainHeadReports == 2; });
+    }
+    std::string last;
+    for (const std::string& entry : journal()) {
+        last = entry.compare(0, 4, "log:") == 0 ? entry.substr(4) : last;
+    }
+    EXPECT_TRUE(expected.message.empty() || last == expected.message) << last;
+    manager->deinit(false);
+    platform::waitFor([] { return !entries("system:systemctl stop harl-updater").empty(); });
+    EXPECT_EQ(callsIn(journal()), expected.calls);
+    expectWholeRecords();
+}
+
+/// Runs the case and ends the process: with 0 when all held.
+[[noreturn]] void runAlone(const Case& what)
+{
+    alarm(60);
+    if (what.unit.mainHead) {
+        runMainHead(what);
+    } else {
+        runRemoteHead(what);
+    }
+    std::fflush(nullptr);
+    _exit(testing::Test::HasFailure() ? 1 : 0);
+}
+
+int casesRun = 0;
+
+void expectHolds(const Case& what)
+{
+    ++casesRun;
+    SCOPED_TRACE(what.name());
+    EXPECT_EXIT(runAlone(what), testing::ExitedWithCode(0), "");
+}
+
+/// Prints the number of cases: a test of two faults runs many.
+class Count : public testing::Environment
+{
+    void TearDown() override { std::printf("%d cases\n", casesRun); }
+};
+const testing::Environment* const count = testing::AddGlobalTestEnvironment(new Count);
+
+class OneFault : public testing::TestWithParam<Case>
+{
+};
+
+TEST_P(OneFault, EndsAsTheProcedureSays)
+{
+    expectHolds(GetParam());
+}
+
+/// False when one fault keeps the other's step from being run: that is a run with one fault.
+bool bothHappen(const Unit& unit, const Injection& first, const Injection& second)
+{
+    const platform::Lines calls = follow(unit, {first, second}).calls;
+    const auto runs = [&](const Injection& injection) {
+        const std::vector<Step> steps = stepsOf(unit);
+        const auto step =
+            std::find_if(steps.begin(), steps.end(), [&](const Step& one) { return one.name == injection.step; });
+        return step == steps.end() || // the panel and the sound
+               std::any_of(calls.begin(), calls.end(),
+                           [&](const std::string& call) { return call.substr(call.find(':') + 1) == step->command; });
+    };
+    return runs(first) && runs(second);
+}
+
+/// The parameter's fault, together with each fault of each step behind it.
+class TwoFaults : public testing::TestWithParam<Case>
+{
+};
+
+TEST_P(TwoFaults, EndAsTheProcedureSays)
+{
+    const Unit& unit = GetParam().unit;
+    const Injection& first = GetParam().injections.at(0);
+    bool behind = false;
+    for (const Injection& second : procedureInjections(unit)) {
+        if (behind && second.step != first.step && bothHappen(unit, first, second)) {
+            expectHolds({unit, {first, second}});
+        }
+        behind = behind || (second.step == first.step && second.fault == first.fault && second.times == first.times);
+    }
+}
+
+std::string nameOf(const testing::TestParamInfo<Case>& info)
+{
+    return info.param.name();
+}
+
+INSTANTIATE_TEST_SUITE_P(FaultMatrix, OneFault, testing::ValuesIn(everyFault()), nameOf);
+INSTANTIATE_TEST_SUITE_P(FaultMatrix, TwoFaults, testing::ValuesIn(faultsOfTheProcedure()), nameOf);
+
+} // namespace

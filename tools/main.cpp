@@ -1,4 +1,5 @@
 #include "findings.h"
+#include "log.h"
 #include "stick.h"
 #include "unit.h"
 
@@ -28,6 +29,11 @@ int main(int argc, char** argv)
     unit->footer("Exit status: 0 fit or test passed, 1 not fit or test failed, 2 wrong usage, test refused or not "
                  "everything could be checked.");
 
+    LogOptions logOptions;
+    CLI::App* log = app.add_subcommand("log", "Explain the updater's log: what happened, why, and what to do now.");
+    log->add_option("FILE", logOptions.file, "the log; - for standard input")->capture_default_str();
+    log->footer("Exit status: 0 the last run went well, 1 it failed or did not finish, 2 wrong usage or no log.");
+
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& error) {
@@ -35,6 +41,9 @@ int main(int argc, char** argv)
     }
     if (stick->parsed()) {
         return runStick(stickPath, json, std::cout, std::cerr);
+    }
+    if (log->parsed()) {
+        return runLog(logOptions, std::cout, std::cerr);
     }
     return runUnit(unitOptions, thisUnit(), std::cout, std::cerr);
 }

@@ -11,28 +11,30 @@ import scenario
 from compare import differences
 from display import PlainDisplay, print_outcome
 from session import make_unit, run_on, temporary_folder
+from table import run_all
 from unit import UnitError
 
 ROOT = Path(__file__).parent.parent
+PACKAGES = ["cmake", "ninja-build", "g++-11", "libgtest-dev", "libgmock-dev"]
+PACKAGES += ["util-linux", "iproute2", "openssh-client", "i2c-tools", "alsa-utils", "dpkg-dev", "unzip"]
 
 
 def build() -> None:
-    """Brings the updater and the recorder up to date. Says nothing unless something fails."""
-    packages = ["cmake", "ninja-build", "g++-11", "libgtest-dev", "libgmock-dev"]
+    """Brings the updater and the bench's own programs up to date. Says nothing unless something fails."""
     for command in (
-        ["scripts/install-packages", *packages],
+        ["scripts/install-packages", *PACKAGES],
         ["cmake", "--preset", "default"],
-        ["cmake", "--build", "--preset", "default", "--target", "harl-updater", "tap"],
+        ["cmake", "--build", "--preset", "default", "--target", "harl-updater", "tap", "i2c_bus"],
     ):
         done = subprocess.run(command, cwd=ROOT, stdout=subprocess.PIPE, stderr=subprocess.STDOUT, text=True, check=False)
         if done.returncode != 0:
             sys.exit(f"{done.stdout}bench: {' '.join(command)} failed with status {done.returncode}")
 
 
-def run(what: scenario.Scenario, speed: float) -> int:
+def run(kind: str, what: scenario.Scenario, speed: float) -> int:
     """Runs the scenario `what` and shows it. Returns the status of the command."""
     with temporary_folder() as folder:
-        unit = make_unit(what, folder, speed)
+        unit = make_unit(kind, what, folder, speed)
         print(f"{what.name}: {what.summary}\nUnit: {unit.name}\n", flush=True)
         result = run_on(unit, PlainDisplay().show, speed)
     print_outcome(what, result)
@@ -42,25 +44,49 @@ def run(what: scenario.Scenario, speed: float) -> int:
     return 1 if wrong else 0
 
 
-def main() -> int:
-    """The command."""
-    parser = argparse.ArgumentParser(prog="bench/run", description=__doc__, formatter_class=argparse.RawTextHelpFormatter)
+def arguments() -> argparse.Namespace:
+    """The command line."""
+    parser = argparse.ArgumentParser(prog="bench/run", description=__doc__)
     parser.add_argument("scenario", nargs="?", default="package-and-board", help="default: %(default)s")
     parser.add_argument("--list", action="store_true", help="show all scenarios")
+    parser.add_argument("--all", action="store_true", help="run all scenarios and show a table")
+    parser.add_argument(
+        "--jobs", type=int, default=os.cpu_count(), metavar="N", help="with --all: N at a time (default: %(default)s)"
+    )
+    parser.add_argument(
+        "--unit",
+        choices=["best", "real", "stand-in"],
+        default="best",
+        help="the real tools or stand-ins for all of them (default: the real ones where this machine allows it)",
+    )
+    parser.add_argument(
+        "--speed", type=float, default=300, metavar="N", help="shorten the updater's waits N times (default: %(default)s)"
+    )
     parser.add_argument("--full-length", action="store_true", help="keep every wait: up to 14 minutes")
-    parser.add_argument("--speed", type=float, default=300, help="shorten the waits N times (default: %(default)s)", metavar="N")
-    arguments = parser.parse_args()
-    if arguments.speed < 1:
+    given = parser.parse_args()
+    if given.speed < 1:
         parser.error("--speed: must be 1 or more")
+    if given.jobs < 1:
+        parser.error("--jobs: must be 1 or more")
+    if given.full_length:
+        given.speed = 1
+    return given
+
+
+def main() -> int:
+    """The command."""
+    given = arguments()
     signal.signal(signal.SIGTERM, lambda *_: sys.exit(143))
     try:
-        if arguments.list:
+        if given.list:
             for name in scenario.names():
-                print(f"{name:32}  {scenario.load(name).summary}")
+                print(f"{name:38}  {scenario.load(name).summary}")
             return 0
-        what = scenario.load(arguments.scenario)
+        wanted = [scenario.load(name) for name in (scenario.names() if given.all else [given.scenario])]
         build()
-        return run(what, 1 if arguments.full_length else arguments.speed)
+        if given.all:
+            return 0 if run_all(given.unit, wanted, given.speed, given.jobs) else 1
+        return run(given.unit, wanted[0], given.speed)
     except (scenario.ScenarioError, UnitError) as error:
         print(f"bench: {error}", file=sys.stderr)
         return 1

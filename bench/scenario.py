@@ -116,6 +116,16 @@ class Scenario:
     expect: dict[str, Any]
 
 
+def variables(unit: dict[str, dict[str, Any]]) -> dict[str, str]:
+    """The unit of a scenario as variables for shell scripts, such as BOARD_LINK; lists as words."""
+    found = {}
+    for section, values in unit.items():
+        for key, value in values.items():
+            text = " ".join(value) if isinstance(value, list) else str(value)
+            found[f"{section}_{key}".upper()] = text.lower() if isinstance(value, bool) else text
+    return found
+
+
 def names() -> list[str]:
     """The names of all scenarios, in order."""
     return sorted(path.stem for path in FOLDER.glob("*.toml"))

@@ -11,11 +11,18 @@ from pathlib import Path
 from observe import Run, now
 from scenario import Scenario
 from unit import State, Unit, UnitError
+from unit_real import RealUnit, forbidden
 from unit_standin import BUILD, StandInUnit
 
 POLL = 0.02  # s
 LONGEST_RUN = 120  # s, besides the waits; a run that takes longer hangs
 WAITS = 820  # s, of an update at full length
+# Reads until its owner has ended, then clears away what still runs and lies there.
+GUARD = """
+read -r _
+for file in "$0/"*.pid; do read -r pid <"$file" && kill -s KILL -- "-$pid"; done
+for _ in 1 2 3 4 5; do rm -rf "$0" && exit; sleep 0.2; done
+"""
 
 
 @dataclass
@@ -32,9 +39,8 @@ class Result:
 def temporary_folder() -> Iterator[Path]:
     """A folder that goes with this process, in whatever way the process ends, and with it the updater."""
     folder = tempfile.mkdtemp(prefix="bench-")
-    # The guard reads until this process has ended, then clears away what still runs and lies there.
     guard = subprocess.Popen(
-        ["/bin/sh", "-c", 'read -r _; read -r pid <"$0/updater.pid" && kill -s KILL -- "-$pid"; rm -rf "$0"', folder],
+        ["/bin/sh", "-c", GUARD, folder],
         stdin=subprocess.PIPE,
         stderr=subprocess.DEVNULL,
         start_new_session=True,
@@ -47,9 +53,16 @@ def temporary_folder() -> Iterator[Path]:
         guard.wait()
 
 
-def make_unit(scenario: Scenario, folder: Path, speed: float, build: Path = BUILD) -> Unit:
-    """The best unit that this machine can make."""
-    return StandInUnit(scenario, folder, speed, build)
+def make_unit(kind: str, scenario: Scenario, folder: Path, speed: float, build: Path = BUILD) -> Unit:
+    """A unit of the kind "real", "stand-in", or "best": real where this machine allows it. Raises UnitError."""
+    reason = forbidden() if kind != "stand-in" else ""
+    if reason and kind == "real":
+        raise UnitError(f"no real unit on this machine, it forbids namespaces: {reason}. Use --unit stand-in.")
+    if reason or kind == "stand-in":
+        unit = StandInUnit(scenario, folder, speed, build)
+        unit.name += f" (this machine forbids namespaces: {reason})" if reason else ""
+        return unit
+    return RealUnit(scenario, folder, speed, build)
 
 
 def run_on(unit: Unit, show: Callable[[Run, str], None], speed: float) -> Result:

@@ -44,6 +44,7 @@ class Unit(Protocol):
     `start`, then `ended` and `state` again and again, and `close` in any case.
     """
 
+    kind: str  # "real" or "stand-in"
     name: str  # one line for the output: what is real and what is a stand-in
     files: Files
 

@@ -5,7 +5,7 @@ import signal
 import subprocess
 from pathlib import Path
 
-from scenario import Scenario
+from scenario import Scenario, variables
 from unit import Files, State
 
 HERE = Path(__file__).parent
@@ -16,6 +16,7 @@ TOOLS = ["systemctl", "umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp", "i
 class StandInUnit:
     """A unit (see unit.py) whose state is a few files, changed by the stand-in tools."""
 
+    kind = "stand-in"
     name = "stand-ins for all tools"
 
     def __init__(self, scenario: Scenario, folder: Path, speed: float, build: Path = BUILD) -> None:
@@ -122,21 +123,18 @@ class StandInUnit:
             "LD_PRELOAD": str(self._build / "bench/tap.so"),
             "BENCH_CALLS": str(self.files.calls),
             "BENCH_SPEED": str(self._speed),
-        }
-        for section, values in self._settings.items():
-            for key, value in values.items():
-                text = " ".join(value) if isinstance(value, list) else str(value)
-                environment[f"{section}_{key}".upper()] = text.lower() if isinstance(value, bool) else text
-        ignored = self._settings["updater"]["children"] == "ignored"
+        } | variables(self._settings)
+        ignored = []
+        if self._settings["updater"]["children"] == "ignored":
+            ignored = ["/usr/bin/env", "--ignore-signal=CHLD"]
         with self.files.log.open("wb") as log, (self._folder / "errors").open("wb") as errors:
             self._updater = subprocess.Popen(
-                [self._build / "harl-updater", *self._settings["updater"]["arguments"]],
+                [*ignored, self._build / "harl-updater", *self._settings["updater"]["arguments"]],
                 env=environment,
                 cwd=self._folder,
                 stdin=subprocess.DEVNULL,
                 stdout=log,
                 stderr=errors,
                 start_new_session=True,
-                preexec_fn=(lambda: signal.signal(signal.SIGCHLD, signal.SIG_IGN)) if ignored else None,
             )
         (self._folder / "updater.pid").write_text(f"{self._updater.pid}\n")

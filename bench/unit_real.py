@@ -1,0 +1,171 @@
+"""The real unit: a head and a board with the real tools, in namespaces of their own on this machine.
+
+Nothing of it is on the host but one temporary folder: the roots lie in a tmpfs, the network in namespaces, and all of it
+ends with its first process.
+"""
+
+import contextlib
+import os
+import shlex
+import shutil
+import signal
+import subprocess
+import time
+import wave
+from pathlib import Path
+
+import sshd
+from scenario import Scenario, variables
+from unit import Files, State, UnitError
+from unit_real_files import HERE, SEARCH_PATH, SOUND_LENGTH, SOUNDS, head_package, write_board, write_head, write_stick
+from unit_standin import BUILD
+
+NAMESPACES = ["unshare", "--map-root-user", "--mount", "--net", "--ipc", "--uts"]
+NAMESPACES += ["--pid", "--fork", "--kill-child", "--mount-proc"]
+# Everything that unit.sh does and a machine may forbid.
+PROBE = (
+    "mount -t tmpfs probe /tmp && ip link add name probe0 type veth peer name probe1"
+    " && unshare --user --map-user=1000 --map-group=1000 true"
+)
+LONGEST_SETUP = 60  # s
+
+
+def forbidden() -> str:
+    """Why this machine cannot have a real unit; "" when it can."""
+    probe = subprocess.run([*NAMESPACES, "sh", "-c", PROBE], capture_output=True, text=True, check=False)
+    return "" if probe.returncode == 0 else (probe.stderr.strip().splitlines() or ["no reason given"])[-1]
+
+
+class RealUnit:
+    """A unit (see unit.py) made of real tools."""
+
+    kind = "real"
+    name = "real tools; a stand-in for systemctl"
+
+    def __init__(self, scenario: Scenario, folder: Path, speed: float, build: Path = BUILD) -> None:
+        self._settings = scenario.unit
+        self._folder = folder
+        self._speed = speed
+        self._build = build
+        self._namespaces: subprocess.Popen[bytes] | None = None
+        self._out = folder / "out"
+        self.files = Files(log=self._out / "log", calls=self._out / "calls", panel=self._out / "panel")
+
+    def start(self) -> None:
+        """Makes the unit and starts the updater. Raises UnitError."""
+        server = sshd.find(self._build / "bench")
+        for name in ("out", "unit"):
+            (self._folder / name).mkdir()
+        write_head(self._folder / "head", self._settings, self._build / "bench/packages")
+        write_board(self._folder / "board", self._settings, self._folder / "head")
+        write_stick(self._folder / "stick", self._settings)
+        self._add_programs(server)
+        with (self._out / "setup").open("wb") as messages:
+            self._namespaces = subprocess.Popen(
+                [*NAMESPACES, HERE / "unit.sh", self._folder],
+                stdin=subprocess.DEVNULL,
+                stdout=messages,
+                stderr=messages,
+                start_new_session=True,
+            )
+        (self._folder / "unit.pid").write_text(f"{self._namespaces.pid}\n")
+        begin = time.monotonic()
+        while not (self._out / "started").exists():
+            self._check_alive()
+            if time.monotonic() - begin > LONGEST_SETUP:
+                raise UnitError(f"the unit was not ready after {LONGEST_SETUP} s")
+            time.sleep(0.01)
+
+    def ended(self) -> int | None:
+        """None while the updater runs, then its status."""
+        if (self._out / "status").exists():
+            return int((self._out / "status").read_text())
+        self._check_alive()
+        return None
+
+    def state(self) -> State:
+        """The unit as it is now."""
+        head, board = self._root() / "head", self._root() / "board"
+        stick = f"{self._folder}/unit/head/root/USB_MOUNT "
+        known = self._settings["head"]["harl"] == "known"
+        return State(
+            package=self._package_version(head / "var/lib/dpkg/status"),
+            board=_board_version(board / "root/App/AppExe/version.txt"),
+            marker=(head / "root/RESOURCES/tavren1stboot").exists(),
+            stick=stick in Path(f"/proc/{self._first_process()}/mountinfo").read_text(),
+            harl=(head / "run/harl").read_text().strip() if known else "unknown",
+            sounds=self._sounds_played(),
+        )
+
+    def close(self) -> None:
+        """Ends every process of the unit; its mounts and networks go with them, its folder with its owner."""
+        if not self._namespaces:
+            return
+        # The kernel ends all processes of a process namespace before its first one is gone.
+        with contextlib.suppress(UnitError, ProcessLookupError):
+            os.kill(self._first_process(), signal.SIGKILL)
+        self._namespaces.kill()
+        self._namespaces.wait()
+        self._namespaces = None
+
+    def _add_programs(self, server: sshd.Server) -> None:
+        for program in ("harl-updater", "bench/tap.so", "bench/i2c_bus.so"):
+            shutil.copy(self._build / program, self._folder / "head/opt/bench")
+        if server.files:
+            shutil.copytree(server.files, self._folder / "board/opt/bench", dirs_exist_ok=True)
+        missing = self._settings["tools"]["missing"]
+        values = variables(self._settings) | {
+            "BENCH_PACKAGE": head_package(self._settings),
+            "BENCH_PATH": "/opt/bench/tools" if missing else SEARCH_PATH,
+            "BENCH_PROGRAM": "harl-updater",
+            "BENCH_SPEED": str(self._speed),
+            "BENCH_SOUND_LENGTH": f"{SOUND_LENGTH / self._speed:.3f}",
+            "BENCH_SSHD": server.sshd,
+            "BENCH_SFTP_SERVER": server.sftp_server,
+        }
+        text = "".join(f"{name}={shlex.quote(value)}\n" for name, value in values.items())
+        for folder in (self._folder, self._folder / "head/opt/bench", self._folder / "board/opt/bench"):
+            (folder / "variables").write_text(text)
+
+    def _check_alive(self) -> None:
+        assert self._namespaces
+        if self._namespaces.poll() is not None:
+            raise UnitError(f"the unit cannot be made: {(self._out / 'setup').read_text().strip() or 'it ended'}")
+
+    def _first_process(self) -> int:
+        """The first process in the unit's namespaces, as the host numbers it."""
+        assert self._namespaces
+        pid = self._namespaces.pid
+        try:
+            return int(Path(f"/proc/{pid}/task/{pid}/children").read_text().split()[0])
+        except (OSError, IndexError) as error:
+            raise UnitError("the unit has ended") from error
+
+    def _root(self) -> Path:
+        """The folder of the unit's roots, seen from the host."""
+        return Path(f"/proc/{self._first_process()}/root{self._folder}/unit")
+
+    def _package_version(self, status: Path) -> str:
+        for paragraph in status.read_text().split("\n\n"):
+            fields = dict(line.split(": ", 1) for line in paragraph.splitlines() if ": " in line)
+            if fields.get("Package") == head_package(self._settings) and not fields["Status"].endswith("not-installed"):
+                return fields["Version"]
+        return "(none)"
+
+    def _sounds_played(self) -> list[str]:
+        """The sounds whose samples reached the sound device, all of them and nothing but silence behind them."""
+        found = []
+        for played in sorted(self._out.glob("played-*.raw"), key=lambda path: path.stat().st_mtime):
+            samples = played.read_bytes()
+            for name in SOUNDS:
+                with wave.open(str(self._folder / "head/root/RESOURCES/SOUNDS" / name)) as sound:
+                    frames = sound.readframes(sound.getnframes())
+                if samples.startswith(frames) and not samples[len(frames) :].strip(b"\0"):
+                    found.append(name)
+        return found
+
+
+def _board_version(file: Path) -> str:
+    lines = file.read_text().splitlines() if file.exists() else []
+    versions = [line.split("\t", 1)[1] for line in lines if line.startswith("Brimvale\t")]
+    return versions[-1] if versions else ""

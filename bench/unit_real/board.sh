@@ -1,0 +1,28 @@
+#!/bin/sh
+# The board, first process in its network namespace.
+#
+# Usage: board.sh ROOT LINK SSHD
+set -eu
+
+board=$1
+link=$2
+sshd=$3
+
+until ip link show eth0 >/dev/null 2>&1; do sleep 0.01; done
+ip address add 192.168.9.2/24 dev eth0
+ip link set eth0 up
+case $link in
+slow | dies) tc qdisc add dev eth0 root tbf rate 512kbit burst 8k latency 1s ;; # and so does the head's end
+esac
+# Where there is only one user sshd cannot change to another: it runs as a user of its own instead, named root.
+echo 0 >/proc/sys/net/ipv4/ip_unprivileged_port_start
+LD_LIBRARY_PATH=/opt/bench/lib unshare --user --map-user=1000 --map-group=1000 --root="$board" --wd=/ "$sshd" -D -e &
+
+# What happens to the board at the request of others.
+while read -r request <"$board/run/requests"; do
+    case $request in
+    link-down) ip link set eth0 down ;;
+    hang) kill -s STOP "$(cat "$board/run/sshd.pid")" ;;
+    esac
+    echo >"$board/run/answers"
+done

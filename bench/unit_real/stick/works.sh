@@ -1,0 +1,3 @@
+#!/bin/sh
+set -eu
+unzip -q -o /root/OSUpgrade.zip -d /root/App/AppExe

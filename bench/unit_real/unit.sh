@@ -1,0 +1,161 @@
+#!/bin/sh
+# The real unit, in namespaces of its own: unit_real.py runs this as their first process, and everything ends with it.
+#
+# Usage: unit.sh FOLDER
+# FOLDER holds what unit_real.py has prepared: `head`, `board` and `stick` with the files of each, `variables` with the
+# scenario, and `out` for what the unit writes. The roots lie in a tmpfs that only these namespaces see.
+set -eu
+
+folder=$1
+here=$(dirname "$0")
+head=$folder/unit/head
+board=$folder/unit/board
+# shellcheck disable=SC1091 # made by unit_real.py
+. "$folder/variables"
+
+fail() {
+    echo "$*" >&2
+    exit 1
+}
+
+# A root of its own: the host's /usr read-only, devices and everything else private.
+make_root() { # ROOT USER_ID
+    mkdir -p "$1"
+    mount --bind "$1" "$1"
+    cd "$1"
+    mkdir -p usr proc dev run tmp etc root opt srv var/log
+    chmod 1777 tmp
+    for link in bin sbin lib lib64; do ln -s "usr/$link" "$link"; done
+    mount --rbind /usr usr
+    mount -o remount,bind,ro usr
+    mount --bind /proc proc
+    mount -t tmpfs -o mode=755 dev dev
+    mkdir dev/pts dev/shm
+    for device in null zero full random urandom tty; do
+        : >"dev/$device"
+        mount --bind "/dev/$device" "dev/$device"
+    done
+    ln -s /proc/self/fd dev/fd
+    mount -t devpts -o newinstance,ptmxmode=666 devpts dev/pts
+    ln -s pts/ptmx dev/ptmx
+    cp -rP /etc/ld.so.cache /etc/alternatives etc/
+    if [ -e /etc/localtime ]; then cp -L /etc/localtime etc/localtime; fi
+    printf 'root:x:%s:%s::/root:/bin/sh\n' "$2" "$2" >etc/passwd
+    printf 'root:x:%s:\n' "$2" >etc/group
+    cd /
+}
+
+add_files() { # ROOT FILES
+    cp -r "$2/." "$1"
+    chmod 700 "$1/root" "$1/root/.ssh"
+    chmod 600 "$1"/root/.ssh/*
+}
+
+start_board() {
+    make_root "$board" 1000
+    if [ "$BOARD_DISK" = full ]; then mount -t tmpfs -o size=64k disk "$board/root"; fi
+    add_files "$board" "$folder/board"
+    mkfifo "$board/run/requests" "$board/run/answers"
+    own_network=$(readlink /proc/self/ns/net)
+    unshare --net --uts "$here/board.sh" "$board" "$BOARD_LINK" "$BENCH_SSHD" 2>"$folder/out/board" &
+    pid=$!
+    while [ "$(readlink "/proc/$pid/ns/net")" = "$own_network" ]; do sleep 0.01; done
+    ip link set lo up
+    ip link add eth0 type veth peer name eth0 netns "$pid"
+    ip address add 192.168.9.1/24 dev eth0
+    ip link set eth0 up
+    case $BOARD_LINK in
+    slow | dies) tc qdisc add dev eth0 root tbf rate 512kbit burst 8k latency 1s ;;
+    esac
+}
+
+request_of_board() {
+    echo "$1" >"$board/run/requests"
+    read -r _ <"$board/run/answers"
+}
+
+wait_for_board() {
+    tries=0
+    until [ -s "$board/run/sshd.pid" ]; do # its port answers later: an early connection would cost a second
+        tries=$((tries + 1))
+        [ $tries -lt 1000 ] || fail "the board's sshd did not start: $(cat "$folder/out/board")"
+        sleep 0.01
+    done
+    case $BOARD_LINK in
+    down) request_of_board link-down ;;
+    hangs) request_of_board hang ;;
+    esac
+}
+
+# A package database with the older package in it, made by dpkg itself.
+install_package() {
+    cd "$head"
+    mkdir -p etc/apt/preferences.d var/lib/dpkg/info var/lib/dpkg/updates var/lib/apt/lists/partial \
+        var/cache/apt/archives/partial var/log/apt
+    : >var/lib/dpkg/status
+    for package in srv/installed/*.deb; do
+        [ -e "$package" ] || continue
+        in_head dpkg --install "/$package" >"$folder/out/dpkg" 2>&1 || fail "$(cat "$folder/out/dpkg")"
+    done
+    # A configuration file that was changed on the unit: dpkg asks which one to keep.
+    if [ "$PACKAGE_INSTALL" = asks ]; then echo changed >>"etc/$BENCH_PACKAGE.conf"; fi
+    # A refresh that does not take place leaves what an earlier one has brought.
+    case " $TOOLS_KILLED " in
+    *" apt "*) in_head apt-get update >"$folder/out/apt" 2>&1 || fail "$(cat "$folder/out/apt")" ;;
+    esac
+    cd /
+}
+
+insert_stick() {
+    [ "$STICK_INSERTED" = true ] || return 0
+    mount -t tmpfs stick "$head/root/USB_MOUNT"
+    cp -r "$folder/stick/." "$head/root/USB_MOUNT"
+}
+
+in_head() {
+    chroot "$head" env -i HOME=/root LANG=C.UTF-8 PATH=/opt/bench/bin:/usr/sbin:/usr/bin:/sbin:/bin "$@"
+}
+
+# What else happens on the head while the updater runs.
+start_events() {
+    if [ "$PACKAGE_INSTALL" = locked ]; then
+        in_head apt-get --assume-yes install /srv/other.deb >"$folder/out/other" 2>&1 &
+        until [ -e "$head/run/other-package-installs" ]; do sleep 0.01; done
+    fi
+    if [ "$UPDATER_STOPPED" = in-install ]; then
+        (until [ -e "$head/run/package-installs" ]; do sleep 0.01; done && in_head systemctl stop harl-updater) &
+    fi
+}
+
+# Runs the updater to its end, in a session of its own as a service is.
+run_updater() {
+    echo active >"$head/run/harl"
+    start_events
+    ignored=
+    if [ "$UPDATER_CHILDREN" = ignored ]; then ignored=--ignore-signal=CHLD; fi
+    panel=
+    if [ "$HEAD_PANEL" = present ]; then panel=BENCH_PANEL=/opt/bench/out/panel; fi
+    # shellcheck disable=SC2086 # words by intention
+    setsid chroot "$head" env -i $ignored HOME=/root LANG=C.UTF-8 PATH="$BENCH_PATH" LD_PRELOAD=/opt/bench/tap.so \
+        BENCH_CALLS=/opt/bench/out/calls BENCH_SPEED="$BENCH_SPEED" $panel "/opt/bench/$BENCH_PROGRAM" $UPDATER_ARGUMENTS \
+        </dev/null >"$folder/out/log" 2>"$folder/out/errors" &
+    updater=$!
+    echo $updater >"$head/run/updater.pid"
+    echo >"$folder/out/started"
+    status=0
+    wait $updater || status=$?
+    echo $status >"$folder/out/status.part"
+    mv "$folder/out/status.part" "$folder/out/status"
+}
+
+mount -t tmpfs unit "$folder/unit"
+start_board
+make_root "$head" 0
+add_files "$head" "$folder/head"
+mount --bind "$folder/out" "$head/opt/bench/out"
+mount --bind "$board/run" "$head/opt/bench/board"
+install_package
+insert_stick
+wait_for_board
+run_updater
+exec sleep infinity # unit_real.py still looks at the unit, then ends it

@@ -1,0 +1,142 @@
+"""What lies on the real unit before an update: the files of the head, the board and the stick."""
+
+import math
+import os
+import shutil
+import struct
+import subprocess
+import wave
+import zipfile
+from pathlib import Path
+from typing import Any
+
+from packages import package
+
+HERE = Path(__file__).parent / "unit_real"
+TOOLS = ["systemctl", "umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp", "i2cset", "aplay"]
+SEARCH_PATH = "/opt/bench/bin:/usr/sbin:/usr/bin:/sbin:/bin"
+SOUNDS = {"SND_RESULT_PASS.wav": 880, "SND_RESULT_FAIL.wav": 220}  # Hz
+SOUND_LENGTH = 1.5  # s
+ARCHIVE_PAYLOAD = 200_000  # bytes; more than a full board has left
+
+Settings = dict[str, dict[str, Any]]
+
+
+def head_package(settings: Settings) -> str:
+    """The name of the head's own package."""
+    return "solvik4-dh" if settings["updater"]["program"] == "main" else "solvik4-rh"
+
+
+def write_head(folder: Path, settings: Settings, kept: Path) -> None:
+    """The head's files: package sources, sounds, marker and what the bench adds to the tools."""
+    write(folder / "etc/apt/apt.conf.d/50bench", 'APT::Sandbox::User "root";\n')
+    write(folder / "etc/dpkg/dpkg.cfg.d/bench", "force-unsafe-io\n")
+    _write_packages(folder, settings, kept)
+    (folder / "root/USB_MOUNT").mkdir(parents=True)
+    (folder / "root/RESOURCES/SOUNDS").mkdir(parents=True)
+    for name, pitch in SOUNDS.items():
+        write_sound(folder / "root/RESOURCES/SOUNDS" / name, pitch)
+    if settings["head"]["marker"]:
+        write(folder / "root/RESOURCES/tavren1stboot", "")
+    if settings["head"]["sound"] == "present":
+        # ALSA has no sound card here: the default device is a file, in fact a program that reads the samples.
+        device = 'pcm.!default { type file slave.pcm null file "|/opt/bench/bin/play" format raw }\n'
+        write(folder / "etc/asound.conf", device)
+    _write_tools(folder / "opt/bench", settings)
+
+
+def write_board(folder: Path, settings: Settings, head: Path) -> None:
+    """The board's files: the version file, its sshd's configuration, and the keys on both sides."""
+    board = settings["board"]
+    version_file = folder / "root/App/AppExe/version.txt"
+    version_file.parent.mkdir(parents=True)
+    if board["version_file"]:
+        version_file.write_text(board["version_file"].replace("{version}", board["installed"]), newline="")
+    configuration = (
+        "ListenAddress 192.168.9.2\n"
+        "HostKey /etc/ssh/host_key\n"
+        "UsePAM no\n"
+        "Subsystem sftp /opt/bench/bin/sftp\n"
+    )
+    write(folder / "etc/ssh/sshd_config", configuration)
+    write(folder / "opt/bench/bin/sftp", (HERE / "board/sftp").read_text(), 0o755)
+    for key in (head / "root/.ssh/id_ed25519", folder / "etc/ssh/host_key", folder.parent / "other_key"):
+        key.parent.mkdir(parents=True, exist_ok=True)
+        subprocess.run(["ssh-keygen", "-q", "-t", "ed25519", "-N", "", "-C", "bench", "-f", key], check=True)
+    other = (folder.parent / "other_key.pub").read_text()
+    accepted = (head / "root/.ssh/id_ed25519.pub").read_text() if board["login"] != "key-refused" else other
+    known = (folder / "etc/ssh/host_key.pub").read_text() if board["login"] != "host-key-changed" else other
+    write(folder / "root/.ssh/authorized_keys", accepted)
+    write(head / "root/.ssh/known_hosts", f"192.168.9.2 {known}")
+
+
+def write_stick(folder: Path, settings: Settings) -> None:
+    """The stick's files: a zip archive and the script that unpacks it for each version, and the marker for TeamViewer."""
+    versions = folder / "debs/QUORB/armhf"
+    versions.mkdir(parents=True)
+    script = (HERE / "stick" / f"{settings['board']['script']}.sh").read_text()
+    for directory in settings["stick"]["directories"]:
+        write(versions / directory / "unzipUpgrade.sh", script, 0o755)
+        with zipfile.ZipFile(versions / directory / "OSUpgrade.zip", "w") as archive:
+            archive.writestr("version.txt", f"Name\tQuorb\r\nBrimvale\t{directory[5:]}\r\n")
+            archive.writestr("firmware.bin", os.urandom(ARCHIVE_PAYLOAD))
+    if settings["stick"]["teamviewer"] == "file":
+        write(folder / "debs/installTV", "")
+    elif settings["stick"]["teamviewer"] == "directory":
+        (folder / "debs/installTV").mkdir()
+
+
+def write(path: Path, text: str, mode: int = 0o644) -> None:
+    """Writes a file and the folders above it."""
+    path.parent.mkdir(parents=True, exist_ok=True)
+    path.write_text(text)
+    path.chmod(mode)
+
+
+def write_sound(path: Path, pitch: int) -> None:
+    """A WAV file with a tone of `pitch` (Hz)."""
+    rate = 8000
+    samples = [int(12000 * math.sin(2 * math.pi * pitch * at / rate)) for at in range(int(rate * SOUND_LENGTH))]
+    with wave.open(str(path), "wb") as sound:
+        sound.setnchannels(1)
+        sound.setsampwidth(2)
+        sound.setframerate(rate)
+        sound.writeframes(struct.pack(f"<{len(samples)}h", *samples))
+
+
+def _write_packages(folder: Path, settings: Settings, kept: Path) -> None:
+    """The repository with the package that is offered, and the .deb of the one that is installed at first."""
+    name, wanted = head_package(settings), settings["package"]
+    scripts = "interrupted" if settings["updater"]["stopped"] == "in-install" else wanted["install"]
+    (folder / "srv/installed").mkdir(parents=True)
+    if wanted["known"]:
+        shutil.copytree(package(name, wanted["offered"], scripts, kept), folder / "srv/repository")
+        if wanted["installed"] != "(none)":
+            for file in package(name, wanted["installed"], "works", kept).glob("*.deb"):
+                shutil.copy(file, folder / "srv/installed")
+    else:
+        shutil.copytree(package("other", "1.0", "works", kept), folder / "srv/repository")
+    if wanted["install"] == "locked":
+        [file] = package("other", "1.0", "holds-lock", kept).glob("*.deb")
+        shutil.copy(file, folder / "srv/other.deb")
+    where = "repository" if settings["mirrors"]["refresh"] == "works" else "gone"
+    write(folder / "etc/apt/sources.list", f"deb [trusted=yes] file:/srv/{where} ./\n")
+    # For apt an older package is no update, unless the unit's own preferences say so.
+    write(folder / "etc/apt/preferences", 'Package: *\nPin: origin ""\nPin-Priority: 1001\n')
+    write(folder / "etc/apt/apt.conf.d/60downgrade", 'APT::Get::allow-downgrades "true";\n')
+
+
+def _write_tools(folder: Path, settings: Settings) -> None:
+    """What stands in front of the real tools, and with a tool missing, a search path without it."""
+    wrappers = folder / "bin"
+    shutil.copytree(HERE / "head", wrappers)
+    (wrappers / "killed").unlink()
+    for tool in settings["tools"]["killed"]:
+        shutil.copy(HERE / "head/killed", wrappers / tool)
+    (folder / "out").mkdir()
+    (folder / "board").mkdir()
+    if settings["tools"]["missing"]:
+        (folder / "tools").mkdir()
+        for tool in set(TOOLS) - set(settings["tools"]["missing"]):
+            inside = "/opt/bench/bin" if (wrappers / tool).exists() else os.path.dirname(shutil.which(tool) or "")
+            (folder / "tools" / tool).symlink_to(f"{inside}/{tool}")

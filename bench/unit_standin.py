@@ -120,16 +120,16 @@ class StandInUnit:
         environment = {
             "PATH": str(self._folder / "bin"),
             "UNIT": str(self._folder),
-            "LD_PRELOAD": str(self._build / "bench/tap.so"),
             "BENCH_CALLS": str(self.files.calls),
             "BENCH_SPEED": str(self._speed),
         } | variables(self._settings)
-        ignored = []
+        env = ["/usr/bin/env"]
         if self._settings["updater"]["children"] == "ignored":
-            ignored = ["/usr/bin/env", "--ignore-signal=CHLD"]
+            env.append("--ignore-signal=CHLD")
+        env.append(f"LD_PRELOAD={self._build / 'bench/tap.so'}")
         with self.files.log.open("wb") as log, (self._folder / "errors").open("wb") as errors:
             self._updater = subprocess.Popen(
-                [*ignored, self._build / "harl-updater", *self._settings["updater"]["arguments"]],
+                [*env, self._build / "harl-updater", *self._settings["updater"]["arguments"]],
                 env=environment,
                 cwd=self._folder,
                 stdin=subprocess.DEVNULL,

@@ -2,6 +2,7 @@
 /// of its own in which the program's main(), or one update of the main head, runs whole on the stand-in platform.
 
 #include "AppLock.h"
+#include "Cases.h"
 #include "Procedure.h"
 #include "UnitTest.h"
 
@@ -14,110 +15,6 @@ int updaterMain(int, char**); // main() of the remote head's program, renamed fo
 
 namespace
 {
-
-struct Case
-{
-    Unit unit;
-    std::vector<Injection> injections;
-
-    std::string name() const;
-};
-
-// Steps that are a group of commands of the remote head's panel, or its sound.
-const std::string panelStep = "panel";
-const std::string soundStep = "sound";
-
-std::string Case::name() const
-{
-    std::string text = unit.mainHead ? "MainHead" : "RemoteHead";
-    text += unit.packageDiffers ? "_package" : "";
-    text += unit.boardDiffers ? "_board" : "";
-    text += unit.teamViewer ? "_TeamViewer" : "";
-    for (const Injection& injection : injections) {
-        text += "__" + injection.step + "_" + injection.fault->name;
-        text += injection.times == 0 ? "" : "_times" + std::to_string(injection.times);
-    }
-    text.erase(std::remove_if(text.begin(), text.end(), [](char c) { return !isalnum(c) && c != '_'; }), text.end());
-    return text;
-}
-
-// Generation
-
-std::vector<Unit> units()
-{
-    std::vector<Unit> all;
-    for (int bits = 0; bits < 4; ++bits) {
-        all.push_back({false, (bits & 1) != 0, (bits & 2) != 0, false});
-    }
-    for (int bits = 0; bits < 8; ++bits) {
-        all.push_back({true, (bits & 1) != 0, (bits & 2) != 0, (bits & 4) != 0});
-    }
-    return all;
-}
-
-platform::Lines ledCommands()
-{
-    platform::Lines commands = darkPanel();
-    for (const char* report : {"result 0", "result 1", "error 0", "error 2"}) {
-        const platform::Lines lit = outcomePanel(report);
-        commands.insert(commands.end(), lit.begin(), lit.end());
-    }
-    for (const char* led : {"0x12", "0x15"}) {
-        commands.push_back(std::string("i2cset -y 0 0x07 ") + led + " c ; i2cset -y 0 0x07 0x1 c");
-    }
-    return commands;
-}
-
-/// Every step of the procedure with every fault.
-std::vector<Injection> procedureInjections(const Unit& unit)
-{
-    std::vector<Injection> all;
-    for (const Step& step : stepsOf(unit)) {
-        const bool run = step.reads == Reads::Nothing || step.reads == Reads::Status;
-        for (const Fault& fault : run ? runFaults() : readFaults()) {
-            if (step.name != "upload") {
-                all.push_back({step.name, &fault});
-                continue;
-            }
-            for (const int times : {1, 19, 20}) {
-                all.push_back({step.name, &fault, times});
-            }
-        }
-    }
-    if (!unit.mainHead) {
-        for (const Fault& fault : runFaults()) {
-            all.push_back({panelStep, &fault});
-            all.push_back({soundStep, &fault});
-        }
-    }
-    return all;
-}
-
-std::vector<Case> faultsOfTheProcedure()
-{
-    std::vector<Case> cases;
-    for (const Unit& unit : units()) {
-        for (const Injection& injection : procedureInjections(unit)) {
-            cases.push_back({unit, {injection}});
-        }
-    }
-    return cases;
-}
-
-/// No fault, those of the procedure, and those of each single LED command.
-std::vector<Case> everyFault()
-{
-    std::vector<Case> cases = faultsOfTheProcedure();
-    for (const Unit& unit : units()) {
-        cases.push_back({unit, {}});
-        for (const std::string& command : unit.mainHead ? platform::Lines{} : ledCommands()) {
-            for (const Fault& fault : runFaults()) {
-                cases.push_back({unit, {{command, &fault}}});
-            }
-        }
-    }
-    return cases;
-}
 
 // The stand-in platform of one case
 

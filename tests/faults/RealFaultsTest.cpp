@@ -1,0 +1,301 @@
+/// A sample of the fault matrix with the updater's executable: its commands run in real shells, on a search path that
+/// holds nothing but a tool for each of them, made for the case.
+
+#include "Cases.h"
+#include "Procedure.h"
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <csignal>
+#include <cstdlib>
+#include <fcntl.h>
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <memory>
+#include <regex>
+#include <sstream>
+#include <sys/wait.h>
+#include <unistd.h>
+
+namespace
+{
+
+namespace fs = std::filesystem;
+
+const int atOnce = 8;      // runs; they mostly wait
+const int longestRun = 60; // s
+const int sampleDivisor = 4;
+
+/// The arguments by which a tool knows the step, as a pattern of the shell.
+const std::map<std::string, std::string> patterns = {
+    {"stop harl", "stop\\ harl"},  {"refresh", "update"},           {"query", "*"},
+    {"install", "*install*"},      {"read board", "*version.txt*"}, {"list stick", "*"},
+    {"upload", "*OSUpgrade.zip*"}, {"board script", "*"},           {"remove marker", "*"},
+    {"release stick", "*"},        {"start harl", "start\\ harl"},  {"stop updater", "stop\\ harl-updater"},
+};
+
+std::string toolOf(const std::string& command)
+{
+    return command.substr(0, command.find(' '));
+}
+
+void write(const fs::path& path, const std::string& text)
+{
+    std::ofstream(path, std::ios::binary) << text;
+}
+
+std::string read(const fs::path& path)
+{
+    std::ostringstream text;
+    text << std::ifstream(path, std::ios::binary).rdbuf();
+    return text.str();
+}
+
+/// One run of the updater in a folder of its own.
+class RealRun
+{
+public:
+    explicit RealRun(const Case& what);
+    ~RealRun();
+    RealRun(const RealRun&) = delete;
+    RealRun& operator=(const RealRun&) = delete;
+
+    /// Waits for the updater's end and compares all that was seen.
+    void expectHolds();
+
+private:
+    /// The shell line with which a tool answers, once it has been told its step.
+    std::string answer(const std::string& step, const std::string& healthy, const Injection* injection);
+    const Injection* injectionOf(const std::string& step) const;
+    void makeTools();
+    void start();
+    void expectCalls(const Expected& expected);
+    void expectLog();
+
+    const Case mCase;
+    fs::path mFolder;
+    pid_t mUpdater = -1;
+};
+
+RealRun::RealRun(const Case& what) : mCase(what)
+{
+    char name[] = "/tmp/faults-XXXXXX";
+    mFolder = mkdtemp(name);
+    fs::create_directory(mFolder / "bin");
+    makeTools();
+    start();
+}
+
+RealRun::~RealRun()
+{
+    kill(-mUpdater, SIGKILL);
+    fs::remove_all(mFolder);
+}
+
+const Injection* RealRun::injectionOf(const std::string& step) const
+{
+    for (const Injection& injection : mCase.injections) {
+        if (injection.step == step) {
+            return &injection;
+        }
+    }
+    return nullptr;
+}
+
+std::string RealRun::answer(const std::string& step, const std::string& healthy, const Injection* injection)
+{
+    std::string file = step;
+    std::replace(file.begin(), file.end(), ' ', '-');
+    const fs::path output = mFolder / file;
+    const Fault* fault = injection == nullptr ? nullptr : injection->fault;
+    write(output, fault == nullptr ? healthy : fault->output(healthy));
+
+    std::ostringstream line;
+    if (step == "stop harl") {
+        line << "/bin/sleep 0.3; "; // the application lock relies on it
+    }
+    if (fault != nullptr && injection->times != 0) {
+        line << "echo >>" << output.string() << ".tries; [ \"$(/bin/grep -c '' " << output.string() << ".tries)\" -le "
+             << injection->times << " ] || exit 0; ";
+    }
+    if (fault != nullptr && fault->delay != 0) {
+        line << (step == panelStep ? "/bin/sleep 0.1; " : "/bin/sleep 2; "); // the panel takes dozens of commands
+    }
+    if (fs::file_size(output) != 0) {
+        line << "/bin/cat " << output.string() << "; ";
+    }
+    if (fault != nullptr && fault->status > 0 && fault->status < 256) {
+        // The shell that ran the tool, unless it became the tool, dies with it: that is what the updater gets to see.
+        line << "read -r parent </proc/$PPID/comm; [ \"$parent\" != sh ] || kill -" << fault->status << " $PPID; kill -"
+             << fault->status << " $$; ";
+    }
+    line << "exit " << (fault == nullptr ? 0 : fault->code());
+    return line.str();
+}
+
+void RealRun::makeTools()
+{
+    std::map<std::string, std::string> tools;
+    std::map<std::string, int> served;
+    const std::vector<Step> steps = stepsOf(mCase.unit);
+    for (const Step& step : steps) {
+        ++served[toolOf(step.command)];
+    }
+    // ssh's general pattern comes behind the other one.
+    for (const Step& step : steps) {
+        const Injection* injection = injectionOf(step.name);
+        const std::string tool = toolOf(step.command);
+        if (injection != nullptr && injection->fault->name == "toolMissing" && served[tool] == 1 &&
+            injection->times == 0) {
+            continue;
+        }
+        tools[tool] += patterns.at(step.name) + ") " +
+                       answer(step.name, healthyOutput(mCase.unit, step.name), injection) + " ;;\n";
+    }
+    for (const auto& [step, tool] : {std::pair{panelStep, "i2cset"}, std::pair{soundStep, "aplay"}}) {
+        const Injection* injection = injectionOf(step);
+        if (injection == nullptr) {
+            fs::create_symlink("/bin/true", mFolder / "bin" / tool);
+        } else if (injection->fault->name != "toolMissing") {
+            tools[tool] = "*) " + answer(step, "", injection) + " ;;\n";
+        }
+    }
+    for (const auto& [tool, answers] : tools) {
+        write(mFolder / "bin" / tool, "#!/bin/sh\ncase \"$*\" in\n" + answers + "esac\n");
+        fs::permissions(mFolder / "bin" / tool, fs::perms::owner_all);
+    }
+}
+
+void RealRun::start()
+{
+    mUpdater = fork();
+    ASSERT_NE(mUpdater, -1);
+    if (mUpdater != 0) {
+        return;
+    }
+    setpgid(0, 0);
+    const std::string path = "PATH=" + (mFolder / "bin").string();
+    const std::string calls = "BENCH_CALLS=" + (mFolder / "calls").string();
+    const char* environment[] = {path.c_str(), calls.c_str(), "BENCH_SPEED=2000", "LD_PRELOAD=" TAP, nullptr};
+    const int log = open((mFolder / "log").c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
+    dup2(open("/dev/null", O_RDWR), STDIN_FILENO);
+    dup2(STDIN_FILENO, STDERR_FILENO);
+    dup2(log, STDOUT_FILENO);
+    alarm(longestRun);
+    execle(UPDATER, UPDATER, nullptr, environment);
+    _exit(126);
+}
+
+void RealRun::expectHolds()
+{
+    SCOPED_TRACE(mCase.name());
+    int status = -1;
+    ASSERT_EQ(waitpid(mUpdater, &status, 0), mUpdater);
+    EXPECT_EQ(status, 0);
+    expectCalls(follow(mCase.unit, mCase.injections));
+    expectLog();
+}
+
+void RealRun::expectCalls(const Expected& expected)
+{
+    struct Call
+    {
+        std::string thread;
+        std::string text; // as the stand-in platform's journal spells it
+    };
+    std::vector<Call> calls;
+    std::ifstream file(mFolder / "calls");
+    for (std::string line; std::getline(file, line);) {
+        std::istringstream columns(line);
+        std::string time, thread, call, phase, value, text;
+        for (std::string* column : {&time, &thread, &call, &phase, &value}) {
+            std::getline(columns, *column, '\t');
+        }
+        std::getline(columns, text);
+        if (phase == "start") {
+            calls.push_back({thread, call == "nanosleep" ? "sleep:" + value : call + ":" + text});
+        }
+    }
+    const auto first = std::find_if(calls.begin(), calls.end(),
+                                    [](const Call& call) { return call.text == "system:systemctl stop harl"; });
+    ASSERT_NE(first, calls.end());
+    platform::Lines update;
+    platform::Lines lit;
+    bool sounded = false;
+    for (const Call& call : calls) {
+        if (call.thread == first->thread) {
+            update.push_back(call.text);
+        }
+        if (sounded && call.text.find("i2cset") != std::string::npos) {
+            lit.push_back(call.text.substr(call.text.find(':') + 1));
+        }
+        sounded = sounded || call.text == "system:" + outcomeSound(expected.report);
+    }
+    EXPECT_EQ(update, expected.calls);
+    EXPECT_EQ(lit, outcomePanel(expected.report));
+}
+
+/// Every record begins at a line's start and is whole, and there is one report.
+void RealRun::expectLog()
+{
+    static const std::regex form("Updater \\| [0-9]{2}-[0-9]{2}-[0-9]{4} [0-9]{2}-[0-9]{2}-[0-9]{2}\t[0-9]+\t"
+                                 "[A-Za-z]+\\.cpp:[0-9]+\t[^\t]+");
+    const std::string begin = "Updater | ";
+    const std::string log = read(mFolder / "log");
+    EXPECT_EQ(log.compare(0, begin.size(), begin), 0);
+    EXPECT_EQ(log.back(), '\n');
+    int reports = 0;
+    std::size_t found = 0;
+    std::size_t records = 0;
+    for (; (found = log.find(begin, found)) != std::string::npos; ++found, ++records) {
+        EXPECT_TRUE(found == 0 || log[found - 1] == '\n') << "torn at " << found;
+        const std::size_t end = log.find('\n', found);
+        const std::string head = log.substr(found, end - found);
+        EXPECT_TRUE(std::regex_match(head, form)) << head;
+        EXPECT_EQ(log.compare(end, 4, "\n\t\t\t"), 0) << head;
+        reports += head.find("Callback(UpdateManager::Result)") != std::string::npos;
+        reports += head.find("Callback(UpdateManager::Error)") != std::string::npos;
+    }
+    EXPECT_GT(records, 20U);
+    EXPECT_EQ(reports, 1);
+    EXPECT_EQ(log.find("AFTER UPDATE\n") + 13, log.size());
+}
+
+/// Every n-th case of the remote head that a real shell can show.
+std::vector<Case> sample()
+{
+    std::vector<Case> all;
+    for (const Case& what : faultsOfTheProcedure()) {
+        const std::string& fault = what.injections.at(0).fault->name;
+        if (!what.unit.mainHead && fault != "noShell" && fault != "statusLost") {
+            all.push_back(what);
+        }
+    }
+    std::vector<Case> chosen;
+    for (std::size_t i = 0; i < all.size(); i += sampleDivisor) {
+        chosen.push_back(all[i]);
+    }
+    return chosen;
+}
+
+TEST(RealFaults, EndAsTheProcedureSays)
+{
+    const std::vector<Case> cases = sample();
+    std::vector<std::unique_ptr<RealRun>> runs;
+    for (const Case& what : cases) {
+        if (runs.size() == atOnce) {
+            runs.front()->expectHolds();
+            runs.erase(runs.begin());
+        }
+        runs.push_back(std::make_unique<RealRun>(what));
+    }
+    for (const std::unique_ptr<RealRun>& run : runs) {
+        run->expectHolds();
+    }
+    std::printf("%zu cases\n", cases.size());
+    EXPECT_GE(cases.size(), 200U);
+}
+
+} // namespace

@@ -238,3 +238,13 @@ std::string counted(std::uint64_t count, const std::string& noun, const std::str
 {
     return withSeparators(count) + ' ' + (count == 1 ? noun : plural.empty() ? noun + 's' : plural);
 }
+
+std::string listed(const std::vector<std::string>& texts)
+{
+    const std::size_t count = std::min<std::size_t>(texts.size(), 5);
+    std::string result;
+    for (std::size_t index = 0; index < count; ++index) {
+        result += (index == 0 ? "" : ", ") + shown(texts[index]);
+    }
+    return texts.size() == count ? result : result + " and " + std::to_string(texts.size() - count) + " more";
+}

@@ -95,3 +95,6 @@ std::string byteCount(std::uint64_t bytes);
 
 /// `count` and the noun that fits it: "1 entry", "2 entries". Without `plural` it is the noun and an s.
 std::string counted(std::uint64_t count, const std::string& noun, const std::string& plural = "");
+
+/// shown() texts with commas between; of more than five only the first five and how many more there are.
+std::string listed(const std::vector<std::string>& texts);

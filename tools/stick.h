@@ -1,12 +1,10 @@
 #pragma once
 
 #include "findings.h"
+#include "stick_folder.h"
 
-#include <cstdint>
 #include <iosfwd>
 #include <string>
-#include <string_view>
-#include <vector>
 
 /// Where the unit mounts the stick.
 inline constexpr char stickMountPoint[] = "/root/USB_MOUNT";
@@ -20,14 +18,10 @@ inline constexpr char stickMountPoint[] = "/root/USB_MOUNT";
 /// @return a Report::Status; also STATUS_UNCHECKED, with a message on `errors`, when there is no folder to read
 int runStick(const std::string& path, bool json, std::ostream& out, std::ostream& errors);
 
-/// Checks that the board's kernel can run the install script.
+/// The check itself: adds to `report` what it finds.
 ///
-/// @param start  the first bytes of the script, up to scriptBytesChecked
-/// @param size   of the whole script (bytes)
-/// @param name   the script's name for messages, printable
-void checkScript(std::string_view start, std::uint64_t size, const std::string& name, Report& report);
-
-inline constexpr std::size_t scriptBytesChecked = 1024 * 1024;
+/// @param onUnit  the stick is where the unit mounts it
+void checkStick(const StickFolder& stick, bool onUnit, Report& report);
 
 /// Checks the name that the updater reads the board's version from: the first line of the listing without its first
 /// five bytes.

@@ -19,7 +19,9 @@ struct ArchiveSource
 /// Reads the whole archive and tests every entry's checksum and sizes, unpacking nothing to any disk.
 ///
 /// Work and memory are bounded whatever the archive claims: it is not tested when it is larger than 4 GiB, has more
-/// than 100,000 entries, or unpacks to more than 4 GiB in all. Sizes are facts of `report`, faults its findings.
+/// than 100,000 entries, or unpacks to more than `mostUnpacked`. Sizes are facts of `report`, faults its findings.
 ///
-/// @param name  the archive's name for messages, printable
-void checkArchive(const ArchiveSource& source, const std::string& name, Report& report);
+/// @param name          the archive's name for messages, printable
+/// @param mostUnpacked  of all entries together (bytes)
+void checkArchive(const ArchiveSource& source, const std::string& name, Report& report,
+                  std::uint64_t mostUnpacked = 4ULL << 30U);

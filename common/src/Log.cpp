@@ -1,5 +1,6 @@
 #include "Log.h"
 
+#include <cstdio>
 #include <cstring>
 #include <ctime>
 #include <iomanip>
@@ -8,6 +9,9 @@
 
 namespace
 {
+
+// std::cout writes through stdout: without a buffer there, even a long record leaves in one write(2).
+[[maybe_unused]] const int unbuffered = std::setvbuf(stdout, nullptr, _IONBF, 0);
 
 const char* baseName(const char* path)
 {

@@ -226,6 +226,7 @@ void delay(int milliseconds)
 
 } // namespace platform
 
+// NOLINTBEGIN(readability-inconsistent-declaration-parameter-name): the C library names its parameters with underscores
 extern "C" {
 
 int system(const char* command)
@@ -279,3 +280,4 @@ int nanosleep(const timespec* duration, timespec* remaining)
 }
 
 } // extern "C"
+// NOLINTEND(readability-inconsistent-declaration-parameter-name)

@@ -1,0 +1,269 @@
+#include "LedManager.h"
+#include "Log.h"
+#include "Sleep.h"
+#include "UpdateManager.h"
+
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <csignal>
+#include <cstdlib>
+#include <pthread.h>
+#include <string>
+#include <sys/resource.h>
+#include <sys/socket.h>
+#include <sys/time.h>
+#include <thread>
+#include <unistd.h>
+#include <vector>
+
+// The real platform: shells, pipes, signals and pauses. Nothing here runs a tool of a unit.
+
+namespace
+{
+
+/// Takes over standard output for the time of a test, and keeps what each write(2) hands over as one text.
+class Output
+{
+public:
+    Output()
+    {
+        // This kind of socket keeps the bounds of each write.
+        EXPECT_EQ(socketpair(AF_UNIX, SOCK_SEQPACKET, 0, mSockets), 0);
+        EXPECT_EQ(dup2(mSockets[0], STDOUT_FILENO), STDOUT_FILENO);
+    }
+
+    ~Output()
+    {
+        dup2(mStdout, STDOUT_FILENO);
+        close(mStdout);
+        close(mSockets[0]);
+        close(mSockets[1]);
+    }
+
+    Output(const Output&) = delete;
+    Output& operator=(const Output&) = delete;
+
+    std::vector<std::string> writes() const
+    {
+        std::vector<std::string> texts;
+        std::vector<char> buffer(1 << 20);
+        ssize_t size = 0;
+        while ((size = recv(mSockets[1], buffer.data(), buffer.size(), MSG_DONTWAIT)) >= 0) {
+            texts.emplace_back(buffer.data(), static_cast<std::size_t>(size));
+        }
+        return texts;
+    }
+
+    /// The messages of the records; fails the test when a write was not exactly one record.
+    std::vector<std::string> messages() const
+    {
+        std::vector<std::string> result;
+        for (const std::string& text : writes()) {
+            const std::string::size_type end = text.find("\n\t\t\t");
+            EXPECT_EQ(text.compare(0, 10, "Updater | "), 0) << text;
+            EXPECT_EQ(text.find('\n'), end) << text;
+            EXPECT_EQ(text.back(), '\n') << text;
+            result.push_back(text.substr(end + 4, text.size() - end - 5));
+        }
+        return result;
+    }
+
+private:
+    int mStdout = dup(STDOUT_FILENO);
+    int mSockets[2] = {-1, -1};
+};
+
+class Runner : public testing::Test
+{
+protected:
+    std::int32_t run(const std::string& command) { return UpdateManager::runProcess(command, output); }
+
+    Output log;
+    std::string output = "from an earlier run";
+};
+
+using Messages = std::vector<std::string>;
+
+TEST_F(Runner, SilentCommandGivesZero)
+{
+    EXPECT_EQ(run("true"), 0);
+    EXPECT_EQ(output, "");
+    EXPECT_EQ(log.messages(), (Messages{"Running command: true", "Exit code:0"}));
+}
+
+TEST_F(Runner, OutputAndExitCodeArriveWhole)
+{
+    EXPECT_EQ(run("printf 'one\\r\\n\\ntwo'; exit 100"), 100);
+    EXPECT_EQ(output, "one\r\n\ntwo");
+    EXPECT_EQ(log.messages().back(), "Exit code:100");
+}
+
+TEST_F(Runner, ExitCodesKeepEightBits)
+{
+    for (const int code : {1, 2, 100, 127, 128, 200, 255}) {
+        EXPECT_EQ(run("exit " + std::to_string(code)), code);
+    }
+}
+
+TEST_F(Runner, ToolThatIsMissingIsTheShells127)
+{
+    EXPECT_EQ(run("/nonexistent/tool 2>/dev/null"), 127);
+}
+
+TEST_F(Runner, KilledShellGivesZero)
+{
+    for (const char* signal : {"KILL", "SEGV", "PIPE", "TERM"}) {
+        EXPECT_EQ(run(std::string("echo before; kill -") + signal + " $$"), 0);
+        EXPECT_EQ(output, "before\n");
+        EXPECT_EQ(log.messages().back(), "Exit code:0");
+    }
+}
+
+TEST_F(Runner, ChildThatTheShellSawKilledIsAnExitCode)
+{
+    EXPECT_EQ(run("sh -c 'kill -KILL $$'; exit $?"), 128 + SIGKILL);
+}
+
+TEST_F(Runner, StandardErrorIsLeftAlone)
+{
+    testing::internal::CaptureStderr();
+    EXPECT_EQ(run("echo out; echo error >&2"), 0);
+    EXPECT_EQ(testing::internal::GetCapturedStderr(), "error\n");
+    EXPECT_EQ(output, "out\n");
+}
+
+TEST_F(Runner, LongLinesAndManyLinesArriveWhole)
+{
+    EXPECT_EQ(run("head -c 3000 /dev/zero | tr '\\0' x; echo; seq 1 100000"), 0);
+    std::string expected(3000, 'x');
+    expected += '\n';
+    for (int i = 1; i <= 100000; ++i) {
+        expected += std::to_string(i) + '\n';
+    }
+    EXPECT_TRUE(output == expected);
+}
+
+TEST_F(Runner, CommandThatClosesItsOutputEarlyIsWaitedFor)
+{
+    EXPECT_EQ(run("echo early; exec >&-; sleep 0.2; exit 7"), 7);
+    EXPECT_EQ(output, "early\n");
+}
+
+TEST_F(Runner, StatusThatNobodyCanReadGivesZero)
+{
+    // With SIGCHLD ignored the kernel discards the status and pclose(3) fails with ECHILD.
+    void (*const before)(int) = std::signal(SIGCHLD, SIG_IGN);
+    EXPECT_EQ(run("echo text; exit 5"), 0);
+    std::signal(SIGCHLD, before);
+    EXPECT_EQ(output, "text\n");
+    EXPECT_EQ(log.messages().back(), "Exit code:0");
+}
+
+TEST_F(Runner, PipeThatCannotBeOpenedGivesZeroAndNoFurtherRecord)
+{
+    rlimit before = {};
+    ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &before), 0);
+    const rlimit none = {0, before.rlim_max};
+    ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &none), 0);
+    EXPECT_EQ(run("echo text"), 0);
+    ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &before), 0);
+    EXPECT_EQ(output, "");
+    EXPECT_EQ(log.messages(), Messages{"Running command: echo text"});
+}
+
+TEST_F(Runner, SignalWhileReadingLosesNoOutput)
+{
+    struct sigaction action = {};
+    struct sigaction before = {};
+    action.sa_handler = [](int) {};
+    action.sa_flags = SA_RESTART;
+    sigaction(SIGUSR1, &action, &before);
+    const pthread_t reader = pthread_self();
+    std::thread storm([reader] {
+        for (int i = 0; i < 300; ++i) {
+            pthread_kill(reader, SIGUSR1);
+            std::this_thread::sleep_for(std::chrono::milliseconds(1));
+        }
+    });
+    EXPECT_EQ(run("for i in 1 2 3 4 5 6; do echo $i; sleep 0.05; done; exit 3"), 3);
+    storm.join();
+    sigaction(SIGUSR1, &before, nullptr);
+    EXPECT_EQ(output, "1\n2\n3\n4\n5\n6\n");
+}
+
+TEST_F(Runner, FailedInstallLogsCodeAndOutputInOneRecord)
+{
+    EXPECT_FALSE(UpdateManager::installUpdate("seq 1 3000; exit 100"));
+    const Messages messages = log.messages();
+    ASSERT_EQ(messages.size(), 4U);
+    EXPECT_EQ(messages[3].compare(0, 8, "1001\n2\n3"), 0);
+    EXPECT_EQ(messages[3].substr(messages[3].size() - 5), "3000\n");
+}
+
+TEST_F(Runner, RecordsOfManyThreadsStayWhole)
+{
+    std::vector<std::thread> threads;
+    for (int i = 0; i < 8; ++i) {
+        threads.emplace_back([i] {
+            for (int j = 0; j < 25; ++j) {
+                LOG() << std::string(static_cast<std::size_t>(i * 1000), 'x') << j;
+                std::this_thread::sleep_for(std::chrono::milliseconds(1));
+            }
+        });
+    }
+    // Read while they speak: the socket holds only so many.
+    std::size_t records = 0;
+    while (records < 8 * 25) {
+        records += log.messages().size();
+    }
+    for (std::thread& thread : threads) {
+        thread.join();
+    }
+    EXPECT_EQ(records, 8U * 25U);
+}
+
+double secondsOf(void (*action)())
+{
+    const auto begin = std::chrono::steady_clock::now();
+    action();
+    return std::chrono::duration<double>(std::chrono::steady_clock::now() - begin).count();
+}
+
+TEST(Pause, LastsAsLongAsAskedFor)
+{
+    const double seconds = secondsOf([] { sleepSeconds(1); });
+    EXPECT_GE(seconds, 1.0);
+    EXPECT_LT(seconds, 1.5);
+}
+
+TEST(Pause, IsNotShortenedBySignals)
+{
+    struct sigaction action = {};
+    struct sigaction before = {};
+    action.sa_handler = [](int) {};
+    sigaction(SIGALRM, &action, &before);
+    itimerval often = {{0, 20000}, {0, 20000}};
+    setitimer(ITIMER_REAL, &often, nullptr);
+    const double seconds = secondsOf([] { sleepSeconds(1); });
+    often = {};
+    setitimer(ITIMER_REAL, &often, nullptr);
+    sigaction(SIGALRM, &before, nullptr);
+    EXPECT_GE(seconds, 1.0);
+    EXPECT_LT(seconds, 1.5);
+}
+
+TEST(Panel, MissingToolIsLoggedForEachLed)
+{
+    const std::string path = std::getenv("PATH");
+    const Output log;
+    setenv("PATH", "/nonexistent", 1);
+    LedManager::turnOffAll();
+    setenv("PATH", path.c_str(), 1);
+    const Messages messages = log.messages();
+    ASSERT_EQ(messages.size(), 14U);
+    EXPECT_EQ(messages[0], "system returned false: i2cset -y 0 0x07 0x10 c ; i2cset -y 0 0x07 0x0 c");
+    EXPECT_EQ(messages[13], "system returned false: i2cset -y 0 0x07 0x1d c ; i2cset -y 0 0x07 0x0 c");
+}
+
+} // namespace

@@ -237,13 +237,13 @@ TEST_F(Flashing, StopAndWaitWithoutAThreadReturnAtOnce)
 
 TEST_F(Flashing, StartingAgainWithoutAStopBlocksTheCaller)
 {
-    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    NEEDS_A_FRESH_PROCESS();
     EXPECT_EXIT(startAgain(false), testing::ExitedWithCode(0), "");
 }
 
 TEST_F(Flashing, StartingAgainWithinTheLastPauseRevivesTheOldThread)
 {
-    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    NEEDS_A_FRESH_PROCESS();
     EXPECT_EXIT(
         {
             platform::scriptSleep([](const timespec*, timespec*) {

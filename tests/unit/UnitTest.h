@@ -17,6 +17,13 @@ protected:
     static void registerCallbacks();
 };
 
+/// For a test whose EXPECT_EXIT must run in a process in which nothing was started yet.
+#ifdef EMULATED // QEMU's user emulation cannot start the program once more
+#define NEEDS_A_FRESH_PROCESS() GTEST_SKIP()
+#else
+#define NEEDS_A_FRESH_PROCESS() GTEST_FLAG_SET(death_test_style, "threadsafe")
+#endif
+
 void noteResult(UpdateManager::Result result);
 void noteError(UpdateManager::Error error);
 void noteUpdateFound(std::vector<UpdateManager::UpdateComponent> components);

@@ -201,7 +201,7 @@ TEST_F(Manager, InitAndDeinitOverwriteTheWorkerWithoutWaiting)
 TEST_F(Manager, UpdateOfTheMainHeadWithoutACheckInstallsAtOnce)
 {
     // In a process of its own, where no worker was ever started.
-    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    NEEDS_A_FRESH_PROCESS();
     EXPECT_EXIT(
         {
             manager->update({{5, "", "", ""}}, false);

@@ -10,19 +10,21 @@ from pathlib import Path
 import scenario
 from compare import differences
 from display import PlainDisplay, print_outcome
-from session import make_unit, run_on, temporary_folder
+from session import UnitMaker, run_on, temporary_folder
 from table import run_all
 from unit import UnitError
 
 ROOT = Path(__file__).parent.parent
+BUILD = ROOT / "build/default"
 PACKAGES = ["cmake", "ninja-build", "g++-11", "libgtest-dev", "libgmock-dev"]
 PACKAGES += ["util-linux", "iproute2", "openssh-client", "i2c-tools", "alsa-utils", "dpkg-dev", "unzip"]
 
 
 def build() -> None:
     """Brings the updater and the bench's own programs up to date. Says nothing unless something fails."""
+    if subprocess.run(["scripts/install-packages", *PACKAGES], cwd=ROOT, stdout=sys.stderr, check=False).returncode != 0:
+        sys.exit(1)
     for command in (
-        ["scripts/install-packages", *PACKAGES],
         ["cmake", "--preset", "default"],
         ["cmake", "--build", "--preset", "default", "--target", "harl-updater", "tap", "i2c_bus"],
     ):
@@ -31,12 +33,12 @@ def build() -> None:
             sys.exit(f"{done.stdout}bench: {' '.join(command)} failed with status {done.returncode}")
 
 
-def run(kind: str, what: scenario.Scenario, speed: float) -> int:
+def run(maker: UnitMaker, what: scenario.Scenario) -> int:
     """Runs the scenario `what` and shows it. Returns the status of the command."""
     with temporary_folder() as folder:
-        unit = make_unit(kind, what, folder, speed)
+        unit = maker.make(what, folder)
         print(f"{what.name}: {what.summary}\nUnit: {unit.name}\n", flush=True)
-        result = run_on(unit, PlainDisplay().show, speed)
+        result = run_on(unit, PlainDisplay().show, maker.speed)
     print_outcome(what, result)
     wrong = differences(what, result)
     for line in wrong:
@@ -62,6 +64,9 @@ def arguments() -> argparse.Namespace:
     parser.add_argument(
         "--speed", type=float, default=300, metavar="N", help="shorten the updater's waits N times (default: %(default)s)"
     )
+    parser.add_argument(
+        "--build", type=Path, metavar="FOLDER", help="use the build in FOLDER as it is (default: build/default, built first)"
+    )
     parser.add_argument("--full-length", action="store_true", help="keep every wait: up to 14 minutes")
     given = parser.parse_args()
     if given.speed < 1:
@@ -83,18 +88,20 @@ def main() -> int:
                 print(f"{name:38}  {scenario.load(name).summary}")
             return 0
         wanted = [scenario.load(name) for name in (scenario.names() if given.all else [given.scenario])]
-        build()
+        if not given.build:
+            build()
+        maker = UnitMaker(given.unit, given.speed, (given.build or BUILD).resolve())
         if given.all:
-            return 0 if run_all(given.unit, wanted, given.speed, given.jobs) else 1
-        return run(given.unit, wanted[0], given.speed)
-    except (scenario.ScenarioError, UnitError) as error:
+            return 0 if run_all(maker, wanted, given.jobs) else 1
+        return run(maker, wanted[0])
+    except BrokenPipeError:
+        os.dup2(os.open(os.devnull, os.O_WRONLY), sys.stdout.fileno())
+        return 1
+    except (scenario.ScenarioError, UnitError, OSError) as error:
         print(f"bench: {error}", file=sys.stderr)
         return 1
     except KeyboardInterrupt:
         return 130
-    except BrokenPipeError:
-        os.dup2(os.open(os.devnull, os.O_WRONLY), sys.stdout.fileno())
-        return 1
 
 
 sys.exit(main())

@@ -1,5 +1,6 @@
 """Scenario files: what a unit is like before an update, and what must come out. CONTRIBUTING.md tells how to add one."""
 
+import re
 import tomllib
 from dataclasses import dataclass
 from pathlib import Path
@@ -132,34 +133,44 @@ def names() -> list[str]:
 
 
 def load(name: str) -> Scenario:
-    """Reads the scenario `name`. Raises ScenarioError."""
-    path = FOLDER / f"{name}.toml"
+    """Reads the scenario `name`: one of those in the folder, or a file's path ending in .toml. Raises ScenarioError."""
+    if name.endswith(".toml"):
+        return read(Path(name))
     if name not in names():
         raise ScenarioError(f"no scenario {name!r}: bench/run --list shows all")
-    return read(path)
+    return read(FOLDER / f"{name}.toml")
 
 
 def read(path: Path) -> Scenario:
     """Reads the scenario file `path`. Raises ScenarioError."""
     try:
-        content = tomllib.loads(path.read_text(encoding="utf-8"))
-    except (OSError, UnicodeError) as error:
-        raise ScenarioError(f"{path}: {error}") from error
+        text = path.read_text(encoding="utf-8")
+        content = tomllib.loads(text)
+    except OSError as error:
+        raise ScenarioError(f"{path}: {error.strerror}") from error
+    except UnicodeError as error:
+        raise ScenarioError(f"{path}: is no UTF-8 text: {error}") from error
     except tomllib.TOMLDecodeError as error:
-        raise ScenarioError(f"{path}: {error}") from error
+        # The message ends in "(at line 3, column 7)" or "(at end of document)".
+        place = re.search(r" \(at (?:line (\d+), column \d+|end of document)\)$", str(error))
+        line = int(place[1]) if place and place[1] else len(text.splitlines())
+        raise ScenarioError(f"{path}:{line}: {str(error)[: place.start()] if place else error}") from error
 
     def fail(key: str, reason: str) -> ScenarioError:
-        return ScenarioError(f"{path}: {key}: {reason}")
+        return ScenarioError(f"{path}:{_line_of(text, key)}: {key}: {reason}")
 
     def check(key: str, value: Any, allowed: Any) -> None:
         if isinstance(allowed, list):
             if value not in allowed:
                 raise fail(key, f"must be one of {', '.join(map(repr, allowed))}, not {value!r}")
         elif type(value) is not allowed:
-            raise fail(key, f"must be a {allowed.__name__}, not {value!r}")
+            raise fail(key, f"must be of type {allowed.__name__}, not {value!r}")
 
-    check("summary", content.pop("summary", None), str)
-    expect = content.pop("expect", None)
+    for key in ("summary", "expect"):
+        if key not in content:
+            raise fail(key, "is missing")
+    summary, expect = content.pop("summary"), content.pop("expect")
+    check("summary", summary, str)
     check("expect", expect, dict)
     unit = {section: {key: default for key, (default, _) in keys.items()} for section, keys in UNIT.items()}
     for section, values in content.items():
@@ -178,4 +189,18 @@ def read(path: Path) -> Scenario:
         if key not in expect:
             raise fail(f"expect.{key}", "is missing")
         check(f"expect.{key}", expect[key], allowed)
-    return Scenario(path.stem, tomllib.loads(path.read_text(encoding="utf-8"))["summary"], unit, expect)
+    return Scenario(path.stem, summary, unit, expect)
+
+
+def _line_of(text: str, name: str) -> int:
+    """The number of the line with the key or section `name`, such as "board.link"; of its section when it is missing."""
+    section, _, key = name.rpartition(".")
+    found, inside = 1, ""
+    for number, line in enumerate(text.splitlines(), 1):
+        if header := re.match(r"\s*\[([^\]]*)\]", line):
+            inside = header[1].strip()
+            if inside == (section or key):
+                found = number
+        elif inside == section and re.match(rf"\s*{re.escape(key)}\s*=", line):
+            return number
+    return found

@@ -12,7 +12,7 @@ from observe import Run, now
 from scenario import Scenario
 from unit import State, Unit, UnitError
 from unit_real import RealUnit, forbidden
-from unit_standin import BUILD, StandInUnit
+from unit_standin import StandInUnit
 
 POLL = 0.02  # s
 LONGEST_RUN = 120  # s, besides the waits; a run that takes longer hangs
@@ -20,8 +20,11 @@ WAITS = 820  # s, of an update at full length
 # Reads until its owner has ended, then clears away what still runs and lies there.
 GUARD = """
 read -r _
-for file in "$0/"*.pid; do read -r pid <"$file" && kill -s KILL -- "-$pid"; done
-for _ in 1 2 3 4 5; do rm -rf "$0" && exit; sleep 0.2; done
+for _ in 1 2 3 4 5; do
+    read -r pid <"$0/unit.pid" && kill -s KILL -- "-$pid"
+    rm -rf "$0" && exit
+    sleep 0.2
+done
 """
 
 
@@ -53,16 +56,24 @@ def temporary_folder() -> Iterator[Path]:
         guard.wait()
 
 
-def make_unit(kind: str, scenario: Scenario, folder: Path, speed: float, build: Path = BUILD) -> Unit:
-    """A unit of the kind "real", "stand-in", or "best": real where this machine allows it. Raises UnitError."""
-    reason = forbidden() if kind != "stand-in" else ""
-    if reason and kind == "real":
-        raise UnitError(f"no real unit on this machine, it forbids namespaces: {reason}. Use --unit stand-in.")
-    if reason or kind == "stand-in":
-        unit = StandInUnit(scenario, folder, speed, build)
+@dataclass
+class UnitMaker:
+    """Makes units of one kind: "real", "stand-in", or "best", which is real where this machine allows it."""
+
+    kind: str
+    speed: float
+    build: Path  # folder of the programs
+
+    def make(self, scenario: Scenario, folder: Path) -> Unit:
+        """A unit for `scenario` in the empty `folder`. Raises UnitError."""
+        reason = forbidden() if self.kind != "stand-in" else ""
+        if reason and self.kind == "real":
+            raise UnitError(f"no real unit on this machine, it forbids namespaces: {reason}. Use --unit stand-in.")
+        if not reason and self.kind != "stand-in":
+            return RealUnit(scenario, folder, self.speed, self.build)
+        unit = StandInUnit(scenario, folder, self.speed, self.build)
         unit.name += f" (this machine forbids namespaces: {reason})" if reason else ""
         return unit
-    return RealUnit(scenario, folder, speed, build)
 
 
 def run_on(unit: Unit, show: Callable[[Run, str], None], speed: float) -> Result:

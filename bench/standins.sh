@@ -21,7 +21,7 @@ fail() { # STATUS MESSAGE
 
 # Ends the updater and all its children as the service manager does. Does not return.
 stop_updater() {
-    read -r updater <"$UNIT/updater.pid"
+    read -r updater <"$UNIT/unit.pid"
     kill -s TERM -- "-$updater"
     exit 0
 }

@@ -7,7 +7,7 @@ from dataclasses import dataclass
 
 from compare import differences
 from scenario import Scenario
-from session import Result, make_unit, run_on, temporary_folder
+from session import Result, UnitMaker, run_on, temporary_folder
 from unit import UnitError
 
 
@@ -22,7 +22,7 @@ class Outcome:
     wrong: list[str]
 
 
-def run_one(kind: str, what: Scenario, speed: float, stop: threading.Event) -> Outcome:
+def run_one(maker: UnitMaker, what: Scenario, stop: threading.Event) -> Outcome:
     """Runs the scenario `what` and shows nothing. Ends early, with a UnitError, when `stop` is set."""
     begin = time.monotonic()
 
@@ -32,17 +32,17 @@ def run_one(kind: str, what: Scenario, speed: float, stop: threading.Event) -> O
 
     result = None
     with temporary_folder() as folder:
-        unit = make_unit(kind, what, folder, speed)
+        unit = maker.make(what, folder)
         try:
             check()
-            result = run_on(unit, check, speed)
+            result = run_on(unit, check, maker.speed)
             wrong = differences(what, result)
         except UnitError as error:
             wrong = [str(error)]
     return Outcome(what, unit.kind, result, time.monotonic() - begin, wrong)
 
 
-def run_all(kind: str, scenarios: list[Scenario], speed: float, at_once: int) -> bool:
+def run_all(maker: UnitMaker, scenarios: list[Scenario], at_once: int) -> bool:
     """Runs `scenarios`, `at_once` at a time, and prints a table. True when all came out as they say."""
     stop = threading.Event()
     begin = time.monotonic()
@@ -52,7 +52,7 @@ def run_all(kind: str, scenarios: list[Scenario], speed: float, at_once: int) ->
         try:
             # The longest first: none of them is left to run alone at the end.
             waiting = sorted(scenarios, key=lambda what: what.unit["board"]["link"] not in ("dies", "lost"))
-            for done in as_completed([workers.submit(run_one, kind, what, speed, stop) for what in waiting]):
+            for done in as_completed([workers.submit(run_one, maker, what, stop) for what in waiting]):
                 outcome = done.result()
                 failed += bool(outcome.wrong)
                 text = "DIFFERENT" if outcome.wrong else "as it says"

@@ -39,8 +39,9 @@ class UnitError(Exception):
 class Unit(Protocol):
     """A head with its board, stick and panel as a scenario describes them, in which the updater runs once.
 
-    `__init__(scenario, folder, speed)` only keeps its arguments: the scenario, an empty folder for everything the unit
-    needs, and how many times faster the updater's own clock and waits run (1: full length). The rest of the bench calls
+    `__init__(scenario, folder, speed, build)` only keeps its arguments: the scenario, an empty folder for everything the
+    unit needs, how many times faster the updater's own clock and waits run (1: full length), and the folder of the
+    programs. The rest of the bench calls
     `start`, then `ended` and `state` again and again, and `close` in any case.
     """
 
@@ -59,3 +60,11 @@ class Unit(Protocol):
 
     def close(self) -> None:
         """Ends every process of the unit and takes everything back. May be called at any time and more than once."""
+
+
+def with_pid_file(folder: Path, command: list[str | Path]) -> list[str | Path]:
+    """`command`, to be started in a session of its own, with a line in front that leaves its process id in `folder`.
+
+    Whoever clears the folder away ends the session; a command that finds the folder gone does not start.
+    """
+    return ["/bin/sh", "-c", 'echo $$ >"$0/unit.pid" && exec "$@"', folder, *command]

@@ -16,9 +16,8 @@ from pathlib import Path
 
 import sshd
 from scenario import Scenario, variables
-from unit import Files, State, UnitError
+from unit import Files, State, UnitError, with_pid_file
 from unit_real_files import HERE, SEARCH_PATH, SOUND_LENGTH, SOUNDS, head_package, write_board, write_head, write_stick
-from unit_standin import BUILD
 
 NAMESPACES = ["unshare", "--map-root-user", "--mount", "--net", "--ipc", "--uts"]
 NAMESPACES += ["--pid", "--fork", "--kill-child", "--mount-proc"]
@@ -42,7 +41,7 @@ class RealUnit:
     kind = "real"
     name = "real tools; a stand-in for systemctl"
 
-    def __init__(self, scenario: Scenario, folder: Path, speed: float, build: Path = BUILD) -> None:
+    def __init__(self, scenario: Scenario, folder: Path, speed: float, build: Path) -> None:
         self._settings = scenario.unit
         self._folder = folder
         self._speed = speed
@@ -62,13 +61,12 @@ class RealUnit:
         self._add_programs(server)
         with (self._out / "setup").open("wb") as messages:
             self._namespaces = subprocess.Popen(
-                [*NAMESPACES, HERE / "unit.sh", self._folder],
+                with_pid_file(self._folder, [*NAMESPACES, HERE / "unit.sh", self._folder]),
                 stdin=subprocess.DEVNULL,
                 stdout=messages,
                 stderr=messages,
                 start_new_session=True,
             )
-        (self._folder / "unit.pid").write_text(f"{self._namespaces.pid}\n")
         begin = time.monotonic()
         while not (self._out / "started").exists():
             self._check_alive()

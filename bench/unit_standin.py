@@ -6,10 +6,9 @@ import subprocess
 from pathlib import Path
 
 from scenario import Scenario, variables
-from unit import Files, State
+from unit import Files, State, with_pid_file
 
 HERE = Path(__file__).parent
-BUILD = HERE.parent / "build" / "default"
 TOOLS = ["systemctl", "umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp", "i2cset", "aplay"]
 
 
@@ -19,7 +18,7 @@ class StandInUnit:
     kind = "stand-in"
     name = "stand-ins for all tools"
 
-    def __init__(self, scenario: Scenario, folder: Path, speed: float, build: Path = BUILD) -> None:
+    def __init__(self, scenario: Scenario, folder: Path, speed: float, build: Path) -> None:
         self._settings = scenario.unit
         self._folder = folder
         self._speed = speed
@@ -129,7 +128,7 @@ class StandInUnit:
         env.append(f"LD_PRELOAD={self._build / 'bench/tap.so'}")
         with self.files.log.open("wb") as log, (self._folder / "errors").open("wb") as errors:
             self._updater = subprocess.Popen(
-                [*env, self._build / "harl-updater", *self._settings["updater"]["arguments"]],
+                with_pid_file(self._folder, [*env, self._build / "harl-updater", *self._settings["updater"]["arguments"]]),
                 env=environment,
                 cwd=self._folder,
                 stdin=subprocess.DEVNULL,
@@ -137,4 +136,3 @@ class StandInUnit:
                 stderr=errors,
                 start_new_session=True,
             )
-        (self._folder / "updater.pid").write_text(f"{self._updater.pid}\n")

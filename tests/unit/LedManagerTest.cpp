@@ -149,6 +149,22 @@ TEST_F(Flashing, StartsWithRemoteAgainAfterAStop)
     EXPECT_EQ(journal(), joined({cycle(remote, mainHead), cycle(mainHead, remote), bothOff()}));
 }
 
+TEST_F(Flashing, StartReplacesAThreadThatHasEnded)
+{
+    std::atomic<int> pauses{0};
+    platform::scriptSleep([&pauses](const timespec*, timespec*) {
+        LedManager::instance()->stopFlashRemoteAndMainInBlue();
+        ++pauses;
+        return 0;
+    });
+    for (const int round : {1, 2}) {
+        LedManager::instance()->startFlashRemoteAndMainInBlue(); // the second joins the first's thread
+        platform::waitFor([&pauses, round] { return pauses == round; });
+    }
+    LedManager::instance()->waitForFlashingEnd();
+    EXPECT_EQ(journal(), joined({cycle(remote, mainHead), bothOff(), cycle(remote, mainHead), bothOff()}));
+}
+
 TEST_F(Flashing, ThreadThatIsStoppedBeforeItsFirstCheckOnlyTurnsBothOff)
 {
     LedManager::flashingThreadFunction();

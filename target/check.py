@@ -1,0 +1,82 @@
+"""Compares what a scenario left with what must come out: all that the bench compares, and what only the target shows."""
+
+import re
+
+from compare import differences
+from observe import Call
+from outcome import Outcome
+from panel import Panel, color_name, led_name
+from plan import Plan
+
+IDENTIFIER = "harl-updater"
+
+
+def panel_bytes(calls: list[Call]) -> list[int]:
+    """The bytes that the panel commands among `calls` send."""
+    return [int(byte, 16) for call in calls for byte in re.findall(r"i2cset -y 0 0x07 (0x\w+) c", call.text)]
+
+
+def check_bus(outcome: Outcome) -> list[str]:
+    """The bytes on the bus must be those of the updater's commands, in their order; no pair is split."""
+    run = outcome.result.run
+    ended = panel_bytes([call for call in run.calls if call.end is not None])
+    sent = outcome.sent
+    if sent != outcome.asked:
+        return [f"bus: {len(sent)} bytes that are not the {len(outcome.asked)} bytes the kernel was asked to send"]
+    if outcome.after["Result"] == "success":
+        if sent != ended:
+            return [f"bus: {len(sent)} bytes that are not the {len(ended)} bytes of the commands"]
+    elif sent[: len(ended)] != ended:  # what runs after the updater sends more
+        return ["bus: does not begin with the bytes of the commands"]
+    return []
+
+
+def lit(leds: dict[int, int]) -> dict[str, str]:
+    """The LEDs that are lit, by name, with the names of their colours."""
+    return {led_name(led): color_name(color) for led, color in leds.items() if color}
+
+
+def check_sound(outcome: Outcome) -> list[str]:
+    """The panel must flash blue before the sound, stay dark while it plays, and light the outcome after it."""
+    run = outcome.result.run
+    sound = next((call for call in run.calls if call.text.startswith("aplay ")), None)
+    if sound is None or sound.end is None:
+        return []  # the bench's comparison tells whether one was expected
+    found = []
+    flashed = [lit(change.leds) for change in run.changes if change.time < sound.start and lit(change.leds)]
+    if flashed != [[{"REMOTE": "blue"}, {"MAIN": "blue"}][index % 2] for index in range(len(flashed))] or not flashed:
+        found.append(f"panel: expected REMOTE and MAIN blue in turn before the sound, not {flashed}")
+    moments = [change.time for change in run.changes if lit(change.leds)]
+    if not any(moment > sound.end for moment in moments):
+        found.append("panel: no outcome after the sound")
+    if any(sound.start < moment < sound.end for moment in moments):
+        found.append("panel: lit while the sound played")
+    return found
+
+
+def check(plan: Plan, outcome: Outcome) -> list[str]:
+    """One line for each difference; none when the run came out as `plan` says."""
+    before, after = outcome.before, outcome.after
+    found = differences(plan.like, outcome.result) + check_bus(outcome) + check_sound(outcome)
+
+    def same(what: str, expected: object, seen: object) -> None:
+        if expected != seen:
+            found.append(f"{what}: expected {expected!r}, not {seen!r}")
+
+    same("journal identifiers", {IDENTIFIER}, outcome.identifiers)
+    same("result of the unit", plan.expect["result"], after["Result"])
+    same("package status", plan.expect["package_status"], after["package_status"])
+    same("harl-updater", plan.expect["updater"], "same" if before["updater"] == after["updater"] else "newer")
+    same("harl-updater starts at boot", False, after["enabled"] == "enabled")
+    same("harl was started again", True, int(after["harl_since"]) > int(before["harl_since"]))
+    if plan.settings["script_seconds"]:
+        same("package's maintainer script", ["began", "ended"], outcome.package_script)
+    return found
+
+
+def check_cut(panel: Panel) -> list[str]:
+    """What the panel showed when the machine was stopped: the blue flashing of an update at work."""
+    pattern = panel.pattern(0)
+    if set(pattern.values()) - {"blue"}:
+        return [f"panel at the power cut: expected the blue flashing, not {pattern!r}"]
+    return []

@@ -1,0 +1,88 @@
+"""The emulated machine: boots a disk with what a run carries in, within a bounded time, and brings back its results."""
+
+import shutil
+import subprocess
+import tarfile
+import time
+from pathlib import Path
+
+BOOT_LIMIT = 300  # s, until the guest's own program runs
+POLL = 0.2  # s
+OUTPUT_SIZE = 128 << 20  # bytes, for the results of one boot
+CUT = "target: power-cut"  # what the guest's console says when the machine is to be stopped hard
+
+
+class MachineError(Exception):
+    """The machine did not do what a boot must do; the text is one line with what to look at."""
+
+
+def drive(name: str, file: Path, *options: str) -> list[str]:
+    """The options for a virtio disk that the guest finds by `name`."""
+    settings = ["if=none", f"id={name}", "format=raw", f"file={file}", *options]
+    return ["-drive", ",".join(settings), "-device", f"virtio-blk-device,drive={name},serial={name}"]
+
+
+def boot(image: Path, disk: Path, inputs: Path, folder: Path, limit: float, keep: bool = False, cut: bool = False) -> None:
+    """Boots `disk` and waits for the end; `folder` then holds the guest's results, `console` and `bus`, the I2C trace.
+
+    @param image   folder with the kernel, the device tree and the initrd
+    @param disk    the root file system; written to only when `keep`
+    @param inputs  the disk that carries the scenarios in
+    @param limit   how long the scenarios may take (s)
+    @param cut     stop the machine hard when the guest asks for it; there are no results of the guest then
+    Raises MachineError.
+    """
+    shutil.rmtree(folder, ignore_errors=True)
+    folder.mkdir(parents=True)
+    console, output = folder / "console", folder / "output.tar"
+    console.touch()
+    with output.open("wb") as file:
+        file.truncate(OUTPUT_SIZE)
+    command = ["setpriv", "--pdeathsig", "KILL", "nice", "qemu-system-arm"]  # it never outlives this process
+    command += ["-M", "vexpress-a15", "-m", "1024", "-no-reboot", "-display", "none", "-monitor", "none"]
+    command += ["-kernel", str(image / "vmlinuz"), "-initrd", str(image / "initrd"), "-dtb", str(image / "board.dtb")]
+    # The guest's clock counts instructions (2 ns each): a busy host makes the run longer, not the guest's tools late.
+    command += ["-icount", "shift=1"]
+    command += ["-append", "rw console=ttyAMA0 quiet", "-serial", f"file:{console}", "-audiodev", "none,id=none"]
+    # The panel's controller: a chip that acknowledges at its address. Every byte on the bus goes into the trace.
+    command += ["-device", "tmp105,bus=i2c,address=0x07", "-trace", "i2c_*", "-D", str(folder / "bus")]
+    command += drive("root", disk, "cache=writeback" if keep else "snapshot=on")
+    command += drive("in", inputs, "readonly=on") + drive("out", output, "cache=unsafe")
+    with (folder / "errors").open("wb") as errors:
+        machine = subprocess.Popen(command, stdin=subprocess.DEVNULL, stdout=errors, stderr=errors)
+    try:
+        was_cut = follow(machine, console, limit)
+    finally:
+        machine.kill()
+        machine.wait()
+    if was_cut != cut:
+        raise MachineError(f"the guest {'did not ask' if cut else 'asked'} for a power cut: see {console}")
+    if cut:
+        return
+    if machine.returncode != 0:
+        raise MachineError(f"qemu-system-arm ended with {machine.returncode}: see {folder / 'errors'}")
+    with tarfile.open(output) as archive:
+        archive.extractall(folder, filter="data")
+    output.unlink()
+    if (folder / "status").read_text().strip() != "0":
+        raise MachineError(f"the guest's program failed: see {folder / 'guest.log'}")
+
+
+def follow(machine: subprocess.Popen[bytes], console: Path, limit: float) -> bool:
+    """Shows the guest's progress until it ends. True when it asked for a power cut. Raises MachineError."""
+    begin = time.monotonic()
+    shown = 0
+    while machine.poll() is None:
+        lines = [line for line in console.read_text(errors="replace").splitlines() if line.startswith("target: ")]
+        for line in lines[shown:]:
+            print(f"{time.monotonic() - begin:6.0f} s  {line[8:]}", flush=True)
+        shown = len(lines)
+        if CUT in lines:
+            return True
+        passed = time.monotonic() - begin
+        if not lines and passed > BOOT_LIMIT:
+            raise MachineError(f"the machine did not come up within {BOOT_LIMIT} s: see {console}")
+        if passed > BOOT_LIMIT + limit:
+            raise MachineError(f"the scenarios did not end within {BOOT_LIMIT + limit:.0f} s: see {console}")
+        time.sleep(POLL)
+    return False

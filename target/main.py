@@ -1,0 +1,174 @@
+"""target/run: proves the updater's package on an emulated armhf unit: kernel, systemd, real tools, I2C bus, sound card."""
+
+import argparse
+import shutil
+import signal
+import subprocess
+import sys
+import time
+from pathlib import Path
+
+HERE = Path(__file__).parent
+ROOT = HERE.parent
+sys.path.insert(1, str(ROOT / "bench"))  # its scenarios, its panel and its comparison serve here too
+
+from check import check, check_cut  # noqa: E402
+from inputs import write_input  # noqa: E402
+from machine import MachineError, boot  # noqa: E402
+from outcome import Outcome, read, read_bus  # noqa: E402
+from panel import Panel  # noqa: E402
+from plan import Plan, PlanError, load, names  # noqa: E402
+from scenario import ScenarioError  # noqa: E402
+
+WORK = ROOT / "build/target"
+SPACE = 2000  # MiB, for disks and results
+SPEED = 300  # how many times shorter the updater's waits are
+SCENARIO_LIMIT = 420  # s, for one scenario besides the updater's waits; guest/main gives up before that
+
+
+class TargetError(Exception):
+    """The test cannot be made on this machine; the text is one line that says what to do."""
+
+
+def updater_package(given: Path | None) -> Path:
+    """The package to prove: the one that was given, or the one built from the checked-out commit. Raises TargetError."""
+    if given:
+        if not given.is_file():
+            raise TargetError(f"{given}: no such file; give a package of harl-updater for armhf")
+        return given
+    folder = ROOT / "build/package"
+    commit = subprocess.check_output(["git", "rev-parse", "HEAD"], cwd=ROOT, text=True)
+    built = WORK / "package-commit"
+    if not built.exists() or built.read_text() != commit or not list(folder.glob("harl-updater_*_armhf.deb")):
+        print("target: building the package", flush=True)
+        log = WORK / "package.log"
+        with log.open("w") as output:
+            if subprocess.run([ROOT / "package/build", "armhf"], stdout=output, stderr=output, check=False).returncode != 0:
+                raise TargetError(f"package/build armhf failed: see {log}")
+        built.write_text(commit)
+    packages = sorted(folder.glob("harl-updater_*_armhf.deb"), key=lambda file: file.stat().st_mtime)
+    if not packages:
+        raise TargetError(f"{folder} holds no harl-updater_*_armhf.deb: package/build armhf makes it")
+    return packages[-1]
+
+
+def make_image() -> Path:
+    """The folder of the unit's disk and boot files, made when there is none yet. Raises TargetError."""
+    done = subprocess.run([HERE / "image", WORK / "cache"], stdout=subprocess.PIPE, text=True, check=False)
+    if done.returncode != 0:
+        raise TargetError("no image of the unit, see above")
+    return Path(done.stdout.strip())
+
+
+def time_limit(plans: list[Plan], speed: float) -> float:
+    """How long `plans` may take in one boot, s."""
+    return sum(SCENARIO_LIMIT + sum(plan.like.expect["waits"]) / speed for plan in plans)
+
+
+def run_shared(plans: list[Plan], image: Path, updater: Path, speed: float) -> dict[str, tuple[Outcome, list[str]]]:
+    """Runs `plans` one after the other in one boot. Returns what each left and its differences. Raises MachineError."""
+    folder, inputs = WORK / "shared", WORK / "in.tar"
+    write_input(inputs, WORK / "in", image, updater, plans, speed, again=False)
+    boot(image, image / "root.ext4", inputs, folder, time_limit(plans, speed))
+    return evaluate(plans, folder)
+
+
+def run_cut(plan: Plan, image: Path, updater: Path, speed: float) -> dict[str, tuple[Outcome, list[str]]]:
+    """Runs `plan` until it stops the machine hard, boots the same disk again and runs the next update. As run_shared."""
+    folder, inputs, disk = WORK / plan.name, WORK / "in.tar", WORK / "disk.ext4"
+    subprocess.run(["cp", "--sparse=always", image / "root.ext4", disk], check=True)
+    try:
+        write_input(inputs, WORK / "in", image, updater, [plan], speed, again=False)
+        boot(image, disk, inputs, WORK / f"{plan.name}-cut", time_limit([plan], speed), keep=True, cut=True)
+        panel = Panel()
+        for byte in read_bus(WORK / f"{plan.name}-cut/bus")[-1]:
+            panel.send(byte, 0)
+        write_input(inputs, WORK / "in", image, updater, [plan], speed, again=True)
+        boot(image, disk, inputs, folder, time_limit([plan], speed), keep=True)
+    finally:
+        disk.unlink(missing_ok=True)
+    results = evaluate([plan], folder)
+    outcome, found = results[plan.name]
+    return {plan.name: (outcome, check_cut(panel) + found)}
+
+
+def evaluate(plans: list[Plan], folder: Path) -> dict[str, tuple[Outcome, list[str]]]:
+    """Reads and checks what a boot with `plans` left in `folder`. Raises MachineError."""
+    parts = read_bus(folder / "bus")
+    if len(parts) != 2 * len(plans) + 1:
+        raise MachineError(f"{len(parts) - 1} marks on the I2C bus for {len(plans)} scenarios: see {folder / 'bus'}")
+    results = {}
+    for index, plan in enumerate(plans):
+        outcome = read(folder / plan.name, parts[2 * index + 1])
+        results[plan.name] = (outcome, check(plan, outcome))
+    return results
+
+
+def print_table(results: dict[str, tuple[Outcome, list[str]]]) -> None:
+    """The results as a table for a document."""
+    print("\n| Scenario | Result | Unit | Package | Board | Panel | Sound | Time |\n|---|---|---|---|---|---|---|---|")
+    for name, (outcome, found) in results.items():
+        run, state, before = outcome.result.run, outcome.result.state, outcome.before
+        cells = [
+            name,
+            "different" if found else "as expected",
+            f"{outcome.after['Result']}, status {outcome.result.status}",
+            f"{before['package']} → {state.package}",
+            f"{before['board']} → {state.board}",
+            ", ".join(f"{led} {color}" for led, color in run.panel.pattern(0).items()) or "dark",
+            ", ".join(file.removeprefix("SND_RESULT_").removesuffix(".wav").lower() for file in state.sounds) or "none",
+            f"{outcome.result.seconds:.0f} s",
+        ]
+        print(f"| {' | '.join(cells)} |")
+
+
+def run(plans: list[Plan], package: Path | None, speed: float) -> int:
+    """Runs `plans` and shows what came of them. Returns the status of the command. Raises TargetError, MachineError."""
+    WORK.mkdir(parents=True, exist_ok=True)
+    if shutil.disk_usage(WORK).free < SPACE << 20:
+        raise TargetError(f"{WORK} has less than {SPACE} MiB free: free some space")
+    begin = time.monotonic()
+    updater, image = updater_package(package), make_image()
+    print(f"Package: {updater.name}", flush=True)
+    shared = [plan for plan in plans if plan.settings["event"] != "power-cut"]
+    results = run_shared(shared, image, updater, speed) if shared else {}
+    for plan in plans:
+        if plan not in shared:
+            results |= run_cut(plan, image, updater, speed)
+    print_table(results)
+    for name, (_, found) in results.items():
+        for line in found:
+            print(f"DIFFERENCE: {name}: {line}")
+    failed = sum(1 for _, found in results.values() if found)
+    print(f"\n{len(results) - failed} of {len(results)} scenarios as expected, {time.monotonic() - begin:.0f} s in all")
+    return 1 if failed else 0
+
+
+def main() -> int:
+    """The command."""
+    parser = argparse.ArgumentParser(prog="target/run", description=__doc__)
+    parser.add_argument("scenario", nargs="*", help="default: all")
+    parser.add_argument("--list", action="store_true", help="show all scenarios")
+    parser.add_argument("--full-length", action="store_true", help="keep every wait; 20 minutes for package-and-board, the default then")
+    parser.add_argument("--package", type=Path, help="default: built by package/build armhf", metavar="FILE")
+    arguments = parser.parse_args()
+    signal.signal(signal.SIGTERM, lambda *_: sys.exit(143))
+    try:
+        if arguments.list:
+            for name in names():
+                print(f"{name:32}  {load(name).summary}")
+            return 0
+        chosen = arguments.scenario or (["package-and-board"] if arguments.full_length else names())
+        return run([load(name) for name in chosen], arguments.package, 1 if arguments.full_length else SPEED)
+    except (TargetError, PlanError, ScenarioError, MachineError) as error:
+        print(f"target: {error}", file=sys.stderr)
+    except FileNotFoundError as error:
+        print(f"target: {error.filename}: not found; target/run installs what is missing", file=sys.stderr)
+    except subprocess.CalledProcessError as error:
+        print(f"target: {error.cmd[0]} failed: {(error.stderr or '').strip()}", file=sys.stderr)
+    except KeyboardInterrupt:
+        return 130
+    return 1
+
+
+sys.exit(main())

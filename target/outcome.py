@@ -1,0 +1,113 @@
+"""What a scenario left: the guest's files and its part of the I2C trace, in the form in which the bench sees a run."""
+
+import json
+import re
+from dataclasses import dataclass
+from pathlib import Path
+
+from inputs import SOUNDS, samples
+from observe import Run
+from session import Result
+from unit import Files, State
+
+# A line of QEMU's log: an event of the board's I2C bus (hw/i2c/trace-events).
+EVENT = re.compile(r"i2c_(?P<kind>send|recv) \w+\(addr:0x07\) data:0x(?P<byte>\w\w)")
+# A line of the guest kernel's trace: time since boot (s), and the byte it was asked to send (events/smbus/smbus_write).
+WRITE = re.compile(r" (?P<time>[\d.]+): smbus_write: i2c-0 a=007 f=\w+ c=(?P<byte>\w+) BYTE ")
+PIECE = 400  # bytes of a sound, 25 ms
+LAST_PIECES = 8
+CLD_EXITED = 1  # waitid(2), as the service manager shows it in ExecMainCode; other codes are for signals
+
+
+@dataclass
+class Outcome:
+    """Everything about one scenario's run; `before` and `after` are the guest's state lines by their names."""
+
+    result: Result
+    asked: list[int]  # the bytes for the panel's controller that the guest's kernel was asked to send
+    sent: list[int]  # those that went over the bus
+    before: dict[str, str]
+    after: dict[str, str]
+    identifiers: set[str]  # under which the updater's own records stand in the journal
+    package_script: list[str]  # "began", "ended"
+
+
+def read_bus(trace: Path) -> list[list[int]]:
+    """The bytes sent over the bus, in parts: before the guest's first mark (a read), between its marks, after the last."""
+    parts: list[list[int]] = [[]]
+    for match in EVENT.finditer(trace.read_text()):
+        if match["kind"] == "recv":
+            parts.append([])
+        else:
+            parts[-1].append(int(match["byte"], 16))
+    return parts
+
+
+def read_state(file: Path) -> dict[str, str]:
+    """A file of NAME=VALUE lines."""
+    return dict(line.split("=", 1) for line in file.read_text().splitlines())
+
+
+def read_journal(file: Path, log: Path) -> set[str]:
+    """Writes the updater's own lines of the journal to `log`; what its children and systemd say is left out.
+
+    Returns the identifiers of those lines. The updater's process is the one that printed the banner.
+    """
+    entries = [json.loads(line) for line in file.read_text().splitlines()]
+    texts = [entry["MESSAGE"] for entry in entries]
+    # The journal gives a message that is not all printable, such as one with a carriage return, as a list of bytes.
+    lines = [text if isinstance(text, str) else bytes(text).decode("utf-8", "backslashreplace") for text in texts]
+    process = next((entry["_PID"] for entry, line in zip(entries, lines) if "TavrenUpdater version: " in line), None)
+    own = [(entry, line) for entry, line in zip(entries, lines) if entry.get("_PID") == process]
+    log.write_text("".join(f"{line}\n" for _, line in own), newline="")
+    return {entry.get("SYSLOG_IDENTIFIER", "") for entry, _ in own}
+
+
+def heard(recording: Path) -> list[str]:
+    """The sounds that the sound card played to the end, by file name.
+
+    The loopback card may drop some samples when its timer is late: nine pieces of ten must be there, in order, and one
+    of the last ones.
+    """
+    data = recording.read_bytes()
+    names = []
+    for name in SOUNDS:
+        sound = samples(name)
+        pieces = [sound[start : start + PIECE] for start in range(0, len(sound), PIECE)]
+        position, found = 0, []
+        for index, piece in enumerate(pieces):
+            if (place := data.find(piece, position)) >= 0:
+                position = place + PIECE
+                found.append(index)
+        if len(found) >= 0.9 * len(pieces) and found[-1] >= len(pieces) - LAST_PIECES:
+            names.append(name)
+    return names
+
+
+def read(folder: Path, sent: list[int]) -> Outcome:
+    """Reads what one scenario left in `folder`; the bytes `sent` went over the bus meanwhile."""
+    before, after = read_state(folder / "before"), read_state(folder / "after")
+    files = Files(log=folder / "log", calls=folder / "calls", panel=folder / "panel")
+    identifiers = read_journal(folder / "journal", files.log)
+    writes = list(WRITE.finditer((folder / "i2c").read_text()))
+    files.panel.write_text("".join(f"{write['time']} {byte:02x}\n" for write, byte in zip(writes, sent)))
+    run = Run(files)
+    run.update()
+    code = int(after["ExecMainStatus"])
+    state = State(
+        package=after["package"],
+        board=after["board"],
+        marker=after["marker"] == "yes",
+        stick=after["stick"] == "yes",
+        harl=after["harl"],
+        sounds=heard(folder / "heard.raw"),
+    )
+    result = Result(
+        run=run,
+        state=state,
+        status=code if int(after["ExecMainCode"]) == CLD_EXITED else -code,
+        seconds=float(after["uptime"]) - float(before["uptime"]),
+    )
+    script = folder / "package-script"
+    asked = [int(write["byte"], 16) for write in writes]
+    return Outcome(result, asked, sent, before, after, identifiers, script.read_text().split() if script.exists() else [])

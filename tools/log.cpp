@@ -1,25 +1,38 @@
 #include "log.h"
 
-#include "descriptor.h"
 #include "findings.h"
 #include "log_explain.h"
+#include "log_follow.h"
+#include "log_html.h"
+#include "log_json.h"
 #include "log_parser.h"
 #include "log_report.h"
 #include "log_run.h"
+#include "log_source.h"
 
 #include <cerrno>
+#include <cstdio>
 #include <cstring>
-#include <fcntl.h>
+#include <fstream>
+#include <memory>
+#include <optional>
 #include <ostream>
-#include <unistd.h>
 #include <vector>
+
+#include <poll.h>
+#include <sys/stat.h>
+#include <unistd.h>
 
 namespace
 {
 
-const std::size_t blockSize = 256 * 1024; // bytes
+using Json = nlohmann::ordered_json;
 
-/// What a file that holds no text begins with, and what to do about it.
+const std::size_t blockSize = 256 * 1024; // bytes
+const int pollTime = 250;                 // ms between two looks at a file, and at the clock
+const int settleTime = 2;                 // s, at most, for the earlier runs in a pipe
+
+/// What an input that holds no text begins with, and what to do about it.
 struct Magic
 {
     std::string_view bytes;
@@ -29,9 +42,7 @@ struct Magic
 const Magic magics[] = {
     {"LPKSHHRH", "a journal's own file: journalctl --file FILE -u harl-updater | harl-updater-tool log"},
     {"\x1f\x8b", "compressed: zcat FILE | harl-updater-tool log"},
-    {"\xfd"
-     "7zXZ",
-     "compressed: xzcat FILE | harl-updater-tool log"},
+    {"\xfd\x37zXZ", "compressed: xzcat FILE | harl-updater-tool log"},
     {"\x28\xb5\x2f\xfd", "compressed: zstdcat FILE | harl-updater-tool log"},
     {"PK\x03\x04", "an archive: unpack it first"},
     {"\xff\xfe", "text in UTF-16: save it as UTF-8 first"},
@@ -49,56 +60,282 @@ const char* adviceFor(std::string_view start)
     return nullptr;
 }
 
+/// Reads a source block by block into a parser.
+class Reader
+{
+public:
+    Reader(const LogSource& source, LogParser& parser) : mSource(source), mParser(parser), mBlock(blockSize) {}
+
+    /// Reads one block. False at the source's end for now, and when something is wrong.
+    bool readBlock()
+    {
+        ssize_t length = -1;
+        do {
+            length = read(mSource.descriptor(), mBlock.data(), mBlock.size());
+        } while (length < 0 && errno == EINTR);
+        if (length < 0) {
+            mError = position() + std::strerror(errno);
+        }
+        if (length <= 0) {
+            return false;
+        }
+        const std::string_view text(mBlock.data(), static_cast<std::size_t>(length));
+        if (const char* advice = mParser.bytes() == 0 ? adviceFor(text) : nullptr; advice != nullptr) {
+            mError = position() + "no log but " + advice;
+            return false;
+        }
+        mParser.feed(text);
+        return true;
+    }
+
+    /// "byte 17, line 2: ", of what comes next.
+    std::string position() const
+    {
+        return "byte " + std::to_string(mParser.bytes()) + ", line " + std::to_string(mParser.lines() + 1) + ": ";
+    }
+
+    /// What is wrong, in words; empty for nothing.
+    const std::string& error() const { return mError; }
+
+private:
+    const LogSource& mSource;
+    LogParser& mParser;
+    std::vector<char> mBlock;
+    std::string mError;
+};
+
+/// A file that takes the place of another one of its name once it is whole.
+class NewFile
+{
+public:
+    explicit NewFile(const std::string& path)
+        : mPath(path), mPartPath(path + ".part"), mStream(mPartPath, std::ios::binary)
+    {
+    }
+    ~NewFile()
+    {
+        if (!mKept) {
+            std::remove(mPartPath.c_str());
+        }
+    }
+    NewFile(const NewFile&) = delete;
+    NewFile& operator=(const NewFile&) = delete;
+
+    std::ostream& stream() { return mStream; }
+
+    /// Returns what is wrong, in words; empty when the file is whole and in its place.
+    std::string keep()
+    {
+        mStream.close();
+        if (!mStream || std::rename(mPartPath.c_str(), mPath.c_str()) != 0) {
+            return std::strerror(errno);
+        }
+        mKept = true;
+        return "";
+    }
+
+private:
+    std::string mPath;
+    std::string mPartPath;
+    std::ofstream mStream;
+    bool mKept = false;
+};
+
+/// Prints explained runs one by one: for people, or as one JSON object.
+class Printer
+{
+public:
+    Printer(const std::string& source, bool json, std::ostream& out) : mSource(source), mJson(json), mOut(out)
+    {
+        if (mJson) {
+            mOut << "{\"command\": \"log\", \"source\": " << dumped(mSource) << ", \"runs\": [";
+        }
+    }
+
+    void print(const Run& run)
+    {
+        mOut << (run.number == 1 ? "" : mJson ? "," : "\n");
+        if (mJson) {
+            mOut << '\n' << dumped(runToJson(run));
+        } else {
+            printRun(run, mSource, mOut);
+        }
+    }
+
+    void finish(const LogParser& parser, int status, const std::string& error)
+    {
+        if (mJson) {
+            mOut << "\n], \"lines\": " << parser.lines() << ", \"bytes\": " << parser.bytes()
+                 << ", \"status\": " << status << ", \"error\": " << (error.empty() ? "null" : dumped(error)) << "}\n";
+        }
+        mOut.flush();
+    }
+
+private:
+    static std::string dumped(const Json& value) { return value.dump(1, ' ', false, Json::error_handler_t::replace); }
+
+    std::string mSource;
+    bool mJson;
+    std::ostream& mOut;
+};
+
+std::string noRecordText(const LogParser& parser)
+{
+    return "no record of the updater in " + counted(parser.lines(), "line") + ", " + byteCount(parser.bytes()) +
+           ". A record begins with \"Updater | DD-MM-YYYY HH-MM-SS\".";
+}
+
+int explainAll(LogSource& source, const LogOptions& options, std::ostream& out, std::ostream& err)
+{
+    std::unique_ptr<NewFile> file;
+    std::optional<HtmlPage> page;
+    if (!options.htmlFile.empty()) {
+        file = std::make_unique<NewFile>(options.htmlFile);
+        if (!file->stream()) {
+            err << "harl-updater-tool: " << escaped(options.htmlFile) << ": " << std::strerror(errno) << '\n';
+            return LOG_UNREADABLE;
+        }
+        page.emplace(source.name(), file->stream());
+    }
+
+    Printer printer(source.name(), options.json, out);
+    LogStatus status = LOG_UNREADABLE;
+    RunBuilder builder([&](Run& run) {
+        explain(run);
+        printer.print(run);
+        if (page) {
+            page->writeRun(run);
+        }
+        status = wentWell(run) ? LOG_WENT_WELL : LOG_WENT_WRONG;
+    });
+    LogParser parser(builder);
+    Reader reader(source, parser);
+    while (reader.readBlock()) {
+    }
+    parser.finish();
+    builder.finish();
+
+    std::string error = reader.error();
+    if (const int code = source.close(error.empty()); error.empty() && code != 0) {
+        error = "journalctl ended with status " + std::to_string(code);
+    }
+    if (error.empty() && parser.records() == 0) {
+        error = noRecordText(parser);
+    }
+    if (!error.empty()) {
+        status = LOG_UNREADABLE;
+    }
+    printer.finish(parser, status, error);
+    if (!error.empty()) {
+        err << "harl-updater-tool: " << source.name() << ": " << error << '\n';
+    } else if (page) {
+        page->finish();
+        if (const std::string wrong = file->keep(); !wrong.empty()) {
+            err << "harl-updater-tool: " << escaped(options.htmlFile) << ": " << wrong << '\n';
+            return LOG_UNREADABLE;
+        }
+    }
+    return status;
+}
+
+/// Waits for more from a pipe, `time` ms at most; for all of `time` with a file. True when a pipe has more, or has
+/// ended.
+bool awaitMore(const LogSource& source, int time)
+{
+    pollfd wanted = {source.isRegularFile() ? -1 : source.descriptor(), POLLIN, 0};
+    return poll(&wanted, 1, time) > 0;
+}
+
+/// Reads all that is there by now. A file's end is the end for now; a pipe ends when nobody writes into it any more.
+///
+/// @return false when nothing more can come
+bool readWhatIsThere(Reader& reader, const LogSource& source)
+{
+    if (source.isRegularFile()) {
+        while (reader.readBlock()) {
+        }
+        return true;
+    }
+    while (awaitMore(source, 0)) {
+        if (!reader.readBlock()) {
+            return false;
+        }
+    }
+    return true;
+}
+
+/// Reads the earlier runs, which a journal hands out with little pauses. As readWhatIsThere() otherwise.
+bool readEarlierRuns(Reader& reader, const LogSource& source)
+{
+    const std::int64_t end = localNow() + settleTime;
+    while (readWhatIsThere(reader, source)) {
+        if (source.isRegularFile() || localNow() > end || !awaitMore(source, pollTime)) {
+            return true;
+        }
+    }
+    return false;
+}
+
+/// What is wrong with a file that others write to, in words; empty for nothing.
+std::string changeOf(const LogSource& source, const Reader& reader, const LogParser& parser)
+{
+    struct stat state = {};
+    if (fstat(source.descriptor(), &state) == 0 && S_ISREG(state.st_mode) &&
+        static_cast<std::uint64_t>(state.st_size) < parser.bytes()) {
+        return reader.position() + "the file was made shorter while it was read; start again";
+    }
+    return reader.error();
+}
+
+int followLast(LogSource& source, const LogOptions& options, std::ostream& out, std::ostream& err)
+{
+    Follower follower(options.json, options.terminal, out);
+    LogStatus status = LOG_UNREADABLE;
+    RunBuilder builder([&](Run& run) {
+        explain(run);
+        follower.runComplete(run);
+        status = wentWell(run) ? LOG_WENT_WELL : LOG_WENT_WRONG;
+    });
+    LogParser parser(builder);
+    Reader reader(source, parser);
+    std::string error;
+
+    bool open = readEarlierRuns(reader, source);
+    while (true) {
+        error = changeOf(source, reader, parser);
+        if (!open) {
+            parser.finish();
+        }
+        follower.show(builder.current(), localNow());
+        if (!open || !error.empty() || follower.ended()) {
+            break;
+        }
+        awaitMore(source, pollTime);
+        open = readWhatIsThere(reader, source);
+    }
+    builder.finish();
+    const int code = source.close(!open && error.empty());
+    if (error.empty() && code != 0) {
+        error = "journalctl ended with status " + std::to_string(code);
+    } else if (error.empty() && parser.records() == 0) {
+        error = noRecordText(parser);
+    }
+    if (!error.empty()) {
+        err << "harl-updater-tool: " << source.name() << ": " << error << '\n';
+        return LOG_UNREADABLE;
+    }
+    return status;
+}
+
 } // namespace
 
 int runLog(const LogOptions& options, std::ostream& out, std::ostream& err)
 {
-    const bool standardInput = options.file == "-";
-    const std::string source = standardInput ? "standard input" : escaped(options.file);
-    const auto refuse = [&](const std::string& why) {
-        err << "harl-updater-tool: " << source << ": " << why << '\n';
+    LogSource source;
+    const std::string wrong = options.unit ? source.openJournal(options.follow) : source.openFile(options.file);
+    if (!wrong.empty()) {
+        err << "harl-updater-tool: " << source.name() << ": " << wrong << '\n';
         return LOG_UNREADABLE;
-    };
-
-    const Descriptor file(standardInput ? dup(STDIN_FILENO) : open(options.file.c_str(), O_RDONLY | O_CLOEXEC));
-    if (!file) {
-        return refuse(std::strerror(errno));
     }
-
-    LogStatus status = LOG_UNREADABLE;
-    RunBuilder builder([&](Run& run) {
-        explain(run);
-        out << (run.number > 1 ? "\n" : "");
-        printRun(run, source, out);
-        status = wentWell(run) ? LOG_WENT_WELL : LOG_WENT_WRONG;
-    });
-    LogParser parser(builder);
-    std::vector<char> block(blockSize);
-    int readError = 0;
-    while (true) {
-        const ssize_t length = read(file.number(), block.data(), block.size());
-        if (length < 0 && errno == EINTR) {
-            continue;
-        }
-        if (length <= 0) {
-            readError = length < 0 ? errno : 0;
-            break;
-        }
-        const std::string_view text(block.data(), static_cast<std::size_t>(length));
-        if (const char* advice = parser.bytes() == 0 ? adviceFor(text) : nullptr; advice != nullptr) {
-            return refuse(std::string("byte 0: no text but ") + advice);
-        }
-        parser.feed(text);
-    }
-    parser.finish();
-    builder.finish();
-    if (readError != 0) {
-        return refuse("byte " + std::to_string(parser.bytes()) + ", line " + std::to_string(parser.lines() + 1) + ": " +
-                      std::strerror(readError));
-    }
-    if (parser.records() == 0) {
-        return refuse("no record of the updater in " + counted(parser.lines(), "line") + ", " +
-                      byteCount(parser.bytes()) + ". A record begins with \"Updater | DD-MM-YYYY HH-MM-SS\".");
-    }
-    return status;
+    return options.follow ? followLast(source, options, out, err) : explainAll(source, options, out, err);
 }

@@ -6,6 +6,11 @@
 struct LogOptions
 {
     std::string file = "-"; ///< "-": standard input
+    bool unit = false;      ///< the service's journal instead of a file
+    bool follow = false;    ///< show the run that goes on instead of explaining those that were
+    bool json = false;      ///< for programs: one object; with `follow` one for each change
+    bool terminal = false;  ///< the output is one
+    std::string htmlFile;   ///< also write a page with the timelines there; empty for none
 };
 
 /// Exit status of `harl-updater-tool log`.
@@ -15,7 +20,7 @@ enum LogStatus {
     LOG_UNREADABLE = 2, ///< Wrong usage, unreadable input, or no record in it.
 };
 
-/// Explains the runs in a log of the updater: harl-updater-tool log.
+/// Explains the runs in a log of the updater, or follows the one that goes on: harl-updater-tool log.
 ///
 /// @return a LogStatus; all that could be read is explained even if reading fails in the middle
 int runLog(const LogOptions& options, std::ostream& out, std::ostream& err);

@@ -7,6 +7,7 @@
 #include <string>
 
 #include <CLI/CLI.hpp>
+#include <unistd.h>
 
 int main(int argc, char** argv)
 {
@@ -31,7 +32,14 @@ int main(int argc, char** argv)
 
     LogOptions logOptions;
     CLI::App* log = app.add_subcommand("log", "Explain the updater's log: what happened, why, and what to do now.");
-    log->add_option("FILE", logOptions.file, "the log; - for standard input")->capture_default_str();
+    CLI::Option* file =
+        log->add_option("FILE", logOptions.file, "the log; - for standard input")->capture_default_str();
+    log->add_flag("--unit", logOptions.unit, "read the journal of the service harl-updater")->excludes(file);
+    CLI::Option* follow = log->add_flag("--follow", logOptions.follow, "show the run that goes on, until it ends");
+    log->add_flag("--json", logOptions.json, "print one JSON object; with --follow one for each change");
+    log->add_option("--html", logOptions.htmlFile, "also write a page with each run's timeline")
+        ->type_name("FILE")
+        ->excludes(follow);
     log->footer("Exit status: 0 the last run went well, 1 it failed or did not finish, 2 wrong usage or no log.");
 
     try {
@@ -43,6 +51,7 @@ int main(int argc, char** argv)
         return runStick(stickPath, json, std::cout, std::cerr);
     }
     if (log->parsed()) {
+        logOptions.terminal = isatty(STDOUT_FILENO) == 1;
         return runLog(logOptions, std::cout, std::cerr);
     }
     return runUnit(unitOptions, thisUnit(), std::cout, std::cerr);

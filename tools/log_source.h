@@ -1,0 +1,39 @@
+#pragma once
+
+#include "descriptor.h"
+
+#include <string>
+#include <sys/types.h>
+
+/// Where a log comes from: a file, standard input, or the journal of the updater's service.
+class LogSource
+{
+public:
+    LogSource() = default;
+    LogSource(const LogSource&) = delete;
+    LogSource& operator=(const LogSource&) = delete;
+    ~LogSource() { close(false); }
+
+    /// Opens `path`, or standard input for "-". Returns what is wrong, in words; empty when it is open.
+    std::string openFile(const std::string& path);
+
+    /// Reads the journal of the service harl-updater through journalctl(1), and with `follow` what comes.
+    ///
+    /// @return what is wrong, in words; empty when it is open
+    std::string openJournal(bool follow);
+
+    /// Name for messages, printable.
+    const std::string& name() const { return mName; }
+    int descriptor() const { return mDescriptor.number(); }
+    bool isRegularFile() const;
+
+    /// Waits for journalctl's end, which it brings about unless all of its output was read.
+    ///
+    /// @return journalctl's exit code; 0 for the other sources and when it was ended
+    int close(bool allRead);
+
+private:
+    std::string mName;
+    Descriptor mDescriptor;
+    pid_t mJournal = -1;
+};

@@ -17,6 +17,7 @@ struct UnitSite
 {
     std::string root;       ///< Goes in front of every absolute path that is read; empty for the machine itself.
     std::string searchPath; ///< The services' PATH where the service manager does not tell it.
+    bool isRoot = true;     ///< The check has root's rights.
     std::function<void(int seconds)> pause; ///< Waits while a lamp colour is shown.
 };
 

@@ -1,0 +1,116 @@
+#!/bin/sh
+# The tools that `harl-updater-tool unit` asks, on a stand-in unit: its search path holds a link to this file for each of
+# them, and nothing else. They answer as the real ones do. What the unit is like comes from the file "settings" in the
+# folder above: UNIT is the folder of the stand-in unit, the other names are the bench's for the keys of a scenario.
+# shellcheck disable=SC2154 # the settings
+set -u
+
+tool=${0##*/}
+# shellcheck source=/dev/null
+. "${0%/*}/../settings"
+
+fail() { # STATUS MESSAGE
+    echo "$2" >&2
+    exit "$1"
+}
+
+# Every call is noted: a test can tell what was run.
+printf '%s\n' "$tool $*" >>"$UNIT/calls"
+
+systemctl() {
+    case $1 in
+    show-environment) printf '%s\n' "$UNIT_ENVIRONMENT" ;;
+    show)
+        state=loaded
+        [ "$HEAD_HARL" = known ] || state=not-found
+        printf 'Id=harl.service\nLoadState=%s\nActiveState=active\nEnvironment=\n\n' "$state"
+        printf 'Id=harl-updater.service\nLoadState=%s\nActiveState=%s\nEnvironment=%s\n' \
+            "$UNIT_UPDATER_LOADED" "$UNIT_UPDATER" "$UNIT_SERVICE_ENVIRONMENT"
+        ;;
+    esac
+}
+
+i2cset() {
+    case $4 in
+    0x100) fail 1 "Error: Data address invalid!" ;;
+    esac
+    [ "$HEAD_PANEL" = present ] || fail 1 "Error: Write failed"
+}
+
+i2cdetect() {
+    answer=07
+    [ "$HEAD_PANEL" = present ] || answer=--
+    echo "     0  1  2  3  4  5  6  7  8  9  a  b  c  d  e  f"
+    echo "00:                      $answer                         "
+}
+
+aplay() {
+    [ "$HEAD_SOUND" = present ] || fail 1 "aplay: main:831: audio open error: No such file or directory"
+}
+
+ssh() {
+    case $BOARD_LINK in
+    down | hangs) fail 255 "ssh: connect to host 192.168.9.2 port 22: Connection timed out" ;;
+    esac
+    case $BOARD_LOGIN in
+    key-refused) fail 255 "root@192.168.9.2: Permission denied (publickey)." ;;
+    host-key-changed)
+        echo "@    WARNING: REMOTE HOST IDENTIFICATION HAS CHANGED!     @" >&2
+        fail 255 "Host key verification failed."
+        ;;
+    esac
+    [ -n "$BOARD_VERSION_FILE" ] || fail 1 "cat: /root/App/AppExe/version.txt: No such file or directory"
+    before=${BOARD_VERSION_FILE%%"{version}"*}
+    after=${BOARD_VERSION_FILE#*"{version}"}
+    printf '%s%s%s' "$before" "$BOARD_INSTALLED" "$after" | /bin/grep Brimvale
+}
+
+dpkg_query() {
+    printf 'ii \tapt\nii \tdpkg\n'
+    [ "$PACKAGE_KNOWN" = false ] || [ "$PACKAGE_INSTALLED" = "(none)" ] || printf 'ii \tsolvik4-rh\n'
+}
+
+apt_cache() {
+    case $1 in
+    policy)
+        if [ "$PACKAGE_KNOWN" = true ]; then
+            printf 'solvik4-rh:\n  Installed: %s\n  Candidate: %s\n  Version table:\n' \
+                "$PACKAGE_INSTALLED" "$PACKAGE_OFFERED"
+        fi
+        printf 'apt:\n  Installed: 2.6.1\n  Candidate: 2.6.1\n  Version table:\n'
+        ;;
+    show)
+        [ "$PACKAGE_KNOWN" = true ] || fail 100 "E: No packages found"
+        printf 'Package: solvik4-rh\nVersion: %s\nInstalled-Size: 2048\nSize: 1000000\n' "$PACKAGE_OFFERED"
+        ;;
+    esac
+}
+
+apt_get() {
+    echo "'http://mirror.invalid/dists/stable/InRelease' mirror.invalid_dists_stable_InRelease 0 "
+}
+
+apt_helper() {
+    while [ "$1" != download-file ]; do shift; done
+    while [ $# -gt 3 ]; do
+        if [ "$MIRRORS_REFRESH" = works ]; then
+            : >"$3"
+        else
+            echo "E: Failed to fetch $2  Could not resolve 'mirror.invalid'" >&2
+        fi
+        shift 3
+    done
+    [ "$MIRRORS_REFRESH" = works ] || fail 100 "E: Download Failed"
+}
+
+case " $TOOLS_KILLED " in
+*" $tool "*) kill -KILL $$ ;;
+esac
+case $tool in
+apt-cache) apt_cache "$@" ;;
+apt-get) apt_get "$@" ;;
+apt-helper) apt_helper "$@" ;;
+dpkg-query) dpkg_query "$@" ;;
+umount | rm | ls | apt | scp) ;; # asked for, not run
+*) "$tool" "$@" ;;
+esac

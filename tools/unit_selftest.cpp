@@ -1,0 +1,65 @@
+#include "unit_selftest.h"
+
+#include "LedManager.h"
+
+#include <array>
+#include <ostream>
+#include <sstream>
+#include <utility>
+
+namespace
+{
+
+const auto soundLimit = 60s;
+
+void runIn(SelfTest& test, const Unit& unit, const std::vector<std::string>& command, std::chrono::milliseconds limit)
+{
+    const CommandResult result = unit.run(command, limit);
+    if (!result.succeeded()) {
+        ++test.failedCommands;
+        test.reason = complaint(result);
+    }
+}
+
+} // namespace
+
+SelfTest testPanel(const Unit& unit, const UnitSite& site, std::ostream* out)
+{
+    const std::array<std::pair<LedManager::Color, const char*>, 4> colors = {{
+        {LedManager::COLOR_BLUE, "blue"},
+        {LedManager::COLOR_PASS, "in the pass colour"},
+        {LedManager::COLOR_FAIL, "in the fail colour"},
+        {LedManager::COLOR_OFF, "dark"},
+    }};
+    SelfTest test;
+    test.tested = LedManager::LED_LAST - LedManager::LED_FIRST + 1;
+    for (const auto& [color, name] : colors) {
+        for (int led = LedManager::LED_FIRST; led <= LedManager::LED_LAST; ++led) {
+            for (const int value : {led, static_cast<int>(color)}) {
+                std::ostringstream byte;
+                byte << "0x" << std::hex << value;
+                runIn(test, unit, {"i2cset", "-y", "0", "0x07", byte.str(), "c"}, quick);
+            }
+        }
+        if (out != nullptr) {
+            *out << "All " << test.tested << " LEDs must be " << name << " now." << std::endl;
+        }
+        if (color != LedManager::COLOR_OFF) {
+            site.pause(2);
+        }
+    }
+    return test;
+}
+
+SelfTest testSound(const Unit& unit, std::ostream* out)
+{
+    SelfTest test;
+    for (const auto& [sound, name] : {std::pair(passSound, "pass"), std::pair(failSound, "fail")}) {
+        if (out != nullptr) {
+            *out << "The " << name << " sound must be heard now." << std::endl;
+        }
+        runIn(test, unit, {"aplay", sound}, soundLimit);
+        ++test.tested;
+    }
+    return test;
+}

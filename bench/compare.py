@@ -35,35 +35,43 @@ runProcess: Running command: {refresh-mirrors}
 runProcess: Exit code:0
 updateMirrors: OK
 """,
-    # (package-differs INSTALLED OFFERED)
-    "package-differs": """
-checkUpdate: {read-package}
-runProcess: Running command: {read-package}
+    # (versions-differ COMMAND PACKAGE INSTALLED OFFERED)
+    "versions-differ": """
+checkUpdate: {{1}}
+runProcess: Running command: {{1}}
 runProcess: Exit code:0
-checkUpdate: solvik4-rh:
-checkUpdate: {1}
-checkUpdate: {2}
+checkUpdate: {2}:
+checkUpdate: {3}
+checkUpdate: {4}
 ...
-checkUpdate: {1}  {2}
-checkUpdate: NWM_UM_UPDATE_FOUND: {1} -> {2}
+checkUpdate: {3}  {4}
+checkUpdate: NWM_UM_UPDATE_FOUND: {3} -> {4}
 """,
-    # (package-same VERSION)
-    "package-same": """
-checkUpdate: {read-package}
-runProcess: Running command: {read-package}
+    # (versions-same COMMAND PACKAGE VERSION)
+    "versions-same": """
+checkUpdate: {{1}}
+runProcess: Running command: {{1}}
 runProcess: Exit code:0
-checkUpdate: solvik4-rh:
-checkUpdate: {1}
-checkUpdate: {1}
+checkUpdate: {2}:
+checkUpdate: {3}
+checkUpdate: {3}
 ...
-checkUpdate: {1}  {1}
-checkUpdate: NWM_UM_NO_UPDATES {1} == {1}
+checkUpdate: {3}  {3}
+checkUpdate: NWM_UM_NO_UPDATES {3} == {3}
 """,
-    "package-installed": """
+    # (installed COMMAND)
+    "installed": """
 installUpdate:
-runProcess: Running command: {install-package}
+runProcess: Running command: {{1}}
 runProcess: Exit code:0
 """,
+    # (package-differs INSTALLED OFFERED), (package-same VERSION)
+    "package-differs": "(versions-differ read-package solvik4-rh {1} {2})",
+    "package-same": "(versions-same read-package solvik4-rh {1})",
+    "package-installed": "(installed install-package)",
+    "main-package-differs": "(versions-differ read-main-package solvik4-dh {1} {2})",
+    "main-package-same": "(versions-same read-main-package solvik4-dh {1})",
+    "main-package-installed": "(installed install-main-package)",
     # (board-not-read STATUS)
     "board-not-read": """
 runProcess: Running command: {read-board}
@@ -111,6 +119,49 @@ uploadQuorbFiles: Uploading failed. Trying again.
 uploadQuorbFiles: Failed to upload QUORB with 20 tries. Closing
 installQuorbUpdate: Failed inside uploadQuorbFiles
 """,
+    # The main head's.
+    "main-opening": """
+initMainHead:
+stopHARL:
+stopHARL: 0
+""",
+    # (main-closing STATUS STATUS): what releasing the stick and starting harl gave
+    "main-closing": """
+startHARL:
+startHARL: {1}
+startHARL: {2}
+stopUpdater:
+""",
+    # (teamviewer-looked-for STATUS)
+    "teamviewer-looked-for": """
+runProcess: Running command: {find-teamviewer}
+runProcess: Exit code:{1}
+""",
+    "teamviewer-required": """
+(teamviewer-looked-for 0)
+checkTVUpdate: Teamviewer path/root/USB_MOUNT/debs/installTV
+checkTVUpdate: Teamviewer install is required
+initMainHead: going to install TV
+""",
+    "teamviewer-directory": """
+checkTVUpdate: Teamviewer path/root/USB_MOUNT/debs/installTV
+checkTVUpdate: No need to install Teamviewer
+""",
+    "teamviewer-absent": """
+(teamviewer-looked-for 2)
+checkTVUpdate: install Teamviewer flag doesnot exist
+""",
+    # (main-component KIND NAME)
+    "main-component": """
+updateMainHead: now call install MAIN udate{1}
+updateMainHead: now call install {2} udate
+""",
+    # (teamviewer-installed STATUS)
+    "teamviewer-installed": """
+installTVUpdate:
+installTVUpdate: {install-teamviewer}
+installTVUpdate: Install script ended with code: {1}
+""",
     "updated": """
 updateRemoteHead: removed{remove-marker}
 resultCallback:
@@ -145,9 +196,11 @@ def expected_log(text: str) -> list[str]:
 
 
 def seen_log(run: Run) -> list[str]:
-    """The records of the update thread: operation, colon, message; control characters as escapes."""
+    """The records of the update's threads: operation, colon, message; control characters as escapes."""
     records = run.records()
-    threads = [record.thread for record in records if record.operation == "processUpdate"]
+    threads = {record.thread for record in records if record.operation == "processUpdate"}
+    if not threads:  # a main head: all but the thread that calls the engine
+        threads = {record.thread for record in records} - {record.thread for record in records[:1]}
     lines = []
     for record in records:
         if record.thread in threads:

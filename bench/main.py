@@ -18,6 +18,7 @@ ROOT = Path(__file__).parent.parent
 BUILD = ROOT / "build/default"
 PACKAGES = ["cmake", "ninja-build", "g++-11", "libgtest-dev", "libgmock-dev"]
 PACKAGES += ["util-linux", "iproute2", "openssh-client", "i2c-tools", "alsa-utils", "dpkg-dev", "unzip"]
+TARGETS = ["harl-updater", "main-head-driver", "tap", "i2c_bus"]
 
 
 def build() -> None:
@@ -26,7 +27,7 @@ def build() -> None:
         sys.exit(1)
     for command in (
         ["cmake", "--preset", "default"],
-        ["cmake", "--build", "--preset", "default", "--target", "harl-updater", "tap", "i2c_bus"],
+        ["cmake", "--build", "--preset", "default", "--target", *TARGETS],
     ):
         done = subprocess.run(command, cwd=ROOT, stdout=subprocess.PIPE, stderr=subprocess.STDOUT, text=True, check=False)
         if done.returncode != 0:

@@ -37,7 +37,8 @@ UNIT: dict[str, dict[str, tuple[Any, Any]]] = {
     "stick": {
         "inserted": (True, bool),
         "directories": (["quorb2.2.0"], list),  # version directories under debs/QUORB/armhf
-        "teamviewer": ("absent", ["absent", "file", "directory"]),  # debs/installTV
+        # debs/installTV. unreadable: ls exits with a code that no file system brings about.
+        "teamviewer": ("absent", ["absent", "file", "directory", "unreadable"]),
         "pulled_out": ("never", ["never", "before-upload"]),
     },
     "head": {
@@ -113,6 +114,7 @@ class Scenario:
 
     name: str
     summary: str
+    only: str  # "real" or "stand-in": the one kind of unit that can serve it; "" both
     unit: dict[str, dict[str, Any]]
     expect: dict[str, Any]
 
@@ -172,6 +174,8 @@ def read(path: Path) -> Scenario:
     summary, expect = content.pop("summary"), content.pop("expect")
     check("summary", summary, str)
     check("expect", expect, dict)
+    only = content.pop("only", "")
+    check("only", only, ["", "real", "stand-in"])
     unit = {section: {key: default for key, (default, _) in keys.items()} for section, keys in UNIT.items()}
     for section, values in content.items():
         if section not in UNIT:
@@ -189,7 +193,7 @@ def read(path: Path) -> Scenario:
         if key not in expect:
             raise fail(f"expect.{key}", "is missing")
         check(f"expect.{key}", expect[key], allowed)
-    return Scenario(path.stem, summary, unit, expect)
+    return Scenario(path.stem, summary, only, unit, expect)
 
 
 def _line_of(text: str, name: str) -> int:

@@ -56,6 +56,10 @@ def temporary_folder() -> Iterator[Path]:
         guard.wait()
 
 
+class NotServed(UnitError):
+    """The unit cannot serve a scenario that another kind of unit can."""
+
+
 @dataclass
 class UnitMaker:
     """Makes units of one kind: "real", "stand-in", or "best", which is real where this machine allows it."""
@@ -65,7 +69,13 @@ class UnitMaker:
     build: Path  # folder of the programs
 
     def make(self, scenario: Scenario, folder: Path) -> Unit:
-        """A unit for `scenario` in the empty `folder`. Raises UnitError."""
+        """A unit for `scenario` in the empty `folder`. Raises UnitError, NotServed when another kind of unit can do it."""
+        unit = self._make(scenario, folder)
+        if scenario.only not in ("", unit.kind):
+            raise NotServed(f"{scenario.name} needs the {scenario.only} unit")
+        return unit
+
+    def _make(self, scenario: Scenario, folder: Path) -> Unit:
         reason = forbidden() if self.kind != "stand-in" else ""
         if reason and self.kind == "real":
             raise UnitError(f"no real unit on this machine, it forbids namespaces: {reason}. Use --unit stand-in.")

@@ -62,6 +62,7 @@ rm() {
 }
 
 ls() {
+    [ "$STICK_TEAMVIEWER" != unreadable ] || [ "$1" != /root/USB_MOUNT/debs/installTV ] || fail 1 "ls: $1: failure"
     path=$head/${1#/root/}
     if [ -d "$path" ]; then
         /bin/ls "$path"

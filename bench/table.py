@@ -7,7 +7,7 @@ from dataclasses import dataclass
 
 from compare import differences
 from scenario import Scenario
-from session import Result, UnitMaker, run_on, temporary_folder
+from session import NotServed, UnitMaker, run_on, temporary_folder
 from unit import UnitError
 
 
@@ -16,51 +16,53 @@ class Outcome:
     """How one scenario came out."""
 
     scenario: Scenario
-    unit: str  # what kind of unit it ran on
-    result: Result | None
+    unit: str  # the kind of unit it ran on
     seconds: float  # with set-up
+    text: str
     wrong: list[str]
 
 
 def run_one(maker: UnitMaker, what: Scenario, stop: threading.Event) -> Outcome:
-    """Runs the scenario `what` and shows nothing. Ends early, with a UnitError, when `stop` is set."""
+    """Runs the scenario `what` and shows nothing. Ends early when `stop` is set."""
     begin = time.monotonic()
+
+    def outcome(kind: str, text: str, wrong: list[str]) -> Outcome:
+        return Outcome(what, kind, time.monotonic() - begin, text, wrong)
 
     def check(*_: object) -> None:
         if stop.is_set():
             raise UnitError("stopped")
 
-    result = None
     with temporary_folder() as folder:
-        unit = maker.make(what, folder)
         try:
             check()
-            result = run_on(unit, check, maker.speed)
-            wrong = differences(what, result)
-        except UnitError as error:
-            wrong = [str(error)]
-    return Outcome(what, unit.kind, result, time.monotonic() - begin, wrong)
+            unit = maker.make(what, folder)
+            wrong = differences(what, run_on(unit, check, maker.speed))
+        except NotServed as error:
+            return outcome("none", f"not run: {error}", [])
+        except (UnitError, OSError) as error:
+            return outcome("none", "FAILED", [str(error)])
+    return outcome(unit.kind, "DIFFERENT" if wrong else "as it says", wrong)
 
 
 def run_all(maker: UnitMaker, scenarios: list[Scenario], at_once: int) -> bool:
-    """Runs `scenarios`, `at_once` at a time, and prints a table. True when all came out as they say."""
+    """Runs `scenarios`, `at_once` at a time, and prints a table. True when none came out other than its file says."""
     stop = threading.Event()
     begin = time.monotonic()
-    failed = 0
-    print(f"{'scenario':38} {'unit':9} {'time':>7}  result")
+    wrong = 0
+    # The longest first: none of them is left to run alone at the end.
+    order = sorted(scenarios, key=lambda what: what.unit["board"]["link"] not in ("dies", "lost"))
+    print(f"{'scenario':38} {'unit':8} {'time':>7}  result")
     with ThreadPoolExecutor(at_once) as workers:
         try:
-            # The longest first: none of them is left to run alone at the end.
-            waiting = sorted(scenarios, key=lambda what: what.unit["board"]["link"] not in ("dies", "lost"))
-            for done in as_completed([workers.submit(run_one, maker, what, stop) for what in waiting]):
+            for done in as_completed([workers.submit(run_one, maker, what, stop) for what in order]):
                 outcome = done.result()
-                failed += bool(outcome.wrong)
-                text = "DIFFERENT" if outcome.wrong else "as it says"
-                print(f"{outcome.scenario.name:38} {outcome.unit:9} {outcome.seconds:5.1f} s  {text}")
+                print(f"{outcome.scenario.name:38} {outcome.unit:8} {outcome.seconds:5.1f} s  {outcome.text}")
                 for line in outcome.wrong:
                     print(f"    {line}")
                 print(end="", flush=True)
+                wrong += bool(outcome.wrong)
         finally:
             stop.set()
-    print(f"{len(scenarios)} scenarios, {failed} different, {time.monotonic() - begin:.0f} s")
-    return not failed
+    print(f"{len(scenarios)} scenarios, {wrong} wrong, {time.monotonic() - begin:.0f} s")
+    return not wrong

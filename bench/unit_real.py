@@ -16,7 +16,7 @@ from pathlib import Path
 
 import sshd
 from scenario import Scenario, variables
-from unit import Files, State, UnitError, with_pid_file
+from unit import PROGRAMS, Files, State, UnitError, with_pid_file
 from unit_real_files import HERE, SEARCH_PATH, SOUND_LENGTH, SOUNDS, head_package, write_board, write_head, write_stick
 
 NAMESPACES = ["unshare", "--map-root-user", "--mount", "--net", "--ipc", "--uts"]
@@ -107,15 +107,16 @@ class RealUnit:
         self._namespaces = None
 
     def _add_programs(self, server: sshd.Server) -> None:
-        for program in ("harl-updater", "bench/tap.so", "bench/i2c_bus.so"):
-            shutil.copy(self._build / program, self._folder / "head/opt/bench")
+        program = PROGRAMS[self._settings["updater"]["program"]]
+        for file in (program, "bench/tap.so", "bench/i2c_bus.so"):
+            shutil.copy(self._build / file, self._folder / "head/opt/bench")
         if server.files:
             shutil.copytree(server.files, self._folder / "board/opt/bench", dirs_exist_ok=True)
         missing = self._settings["tools"]["missing"]
         values = variables(self._settings) | {
             "BENCH_PACKAGE": head_package(self._settings),
             "BENCH_PATH": "/opt/bench/tools" if missing else SEARCH_PATH,
-            "BENCH_PROGRAM": "harl-updater",
+            "BENCH_PROGRAM": program.name,
             "BENCH_SPEED": str(self._speed),
             "BENCH_SOUND_LENGTH": f"{SOUND_LENGTH / self._speed:.3f}",
             "BENCH_SSHD": server.sshd,

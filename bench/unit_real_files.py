@@ -38,6 +38,9 @@ def write_head(folder: Path, settings: Settings, kept: Path) -> None:
         write_sound(folder / "root/RESOURCES/SOUNDS" / name, pitch)
     if settings["head"]["marker"]:
         write(folder / "root/RESOURCES/tavren1stboot", "")
+    if settings["head"]["teamviewer_script"] != "absent":
+        script = (HERE / "teamviewer" / f"{settings['head']['teamviewer_script']}.sh").read_text()
+        write(folder / "root/RESOURCES/teamviewer_updatescript.sh", script, 0o755)
     if settings["head"]["sound"] == "present":
         # ALSA has no sound card here: the default device is a file, in fact a program that reads the samples.
         device = 'pcm.!default { type file slave.pcm null file "|/opt/bench/bin/play" format raw }\n'
@@ -80,7 +83,7 @@ def write_stick(folder: Path, settings: Settings) -> None:
         with zipfile.ZipFile(versions / directory / "OSUpgrade.zip", "w") as archive:
             archive.writestr("version.txt", f"Name\tQuorb\r\nBrimvale\t{directory[5:]}\r\n")
             archive.writestr("firmware.bin", os.urandom(ARCHIVE_PAYLOAD))
-    if settings["stick"]["teamviewer"] == "file":
+    if settings["stick"]["teamviewer"] in ("file", "unreadable"):
         write(folder / "debs/installTV", "")
     elif settings["stick"]["teamviewer"] == "directory":
         (folder / "debs/installTV").mkdir()
@@ -131,6 +134,8 @@ def _write_tools(folder: Path, settings: Settings) -> None:
     wrappers = folder / "bin"
     shutil.copytree(HERE / "head", wrappers)
     (wrappers / "killed").unlink()
+    if settings["stick"]["teamviewer"] != "unreadable":
+        (wrappers / "ls").unlink()
     for tool in settings["tools"]["killed"]:
         shutil.copy(HERE / "head/killed", wrappers / tool)
     (folder / "out").mkdir()

@@ -6,7 +6,7 @@ import subprocess
 from pathlib import Path
 
 from scenario import Scenario, variables
-from unit import Files, State, with_pid_file
+from unit import PROGRAMS, Files, State, with_pid_file
 
 HERE = Path(__file__).parent
 TOOLS = ["systemctl", "umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp", "i2cset", "aplay"]
@@ -126,9 +126,10 @@ class StandInUnit:
         if self._settings["updater"]["children"] == "ignored":
             env.append("--ignore-signal=CHLD")
         env.append(f"LD_PRELOAD={self._build / 'bench/tap.so'}")
+        program = self._build / PROGRAMS[self._settings["updater"]["program"]]
         with self.files.log.open("wb") as log, (self._folder / "errors").open("wb") as errors:
             self._updater = subprocess.Popen(
-                with_pid_file(self._folder, [*env, self._build / "harl-updater", *self._settings["updater"]["arguments"]]),
+                with_pid_file(self._folder, [*env, program, *self._settings["updater"]["arguments"]]),
                 env=environment,
                 cwd=self._folder,
                 stdin=subprocess.DEVNULL,

@@ -1,0 +1,98 @@
+"""Stand-in units that something happens to: the updater starts under other circumstances, a tool does more than it
+should, or the unit is used a second time."""
+
+import os
+import shutil
+import time
+from pathlib import Path
+
+from compare import seen_log
+from scenario import Scenario
+from session import Result
+from unit_standin import StandInUnit
+
+SPEED = 2000  # times shorter waits, each 0.2 s at least
+
+
+class DisturbedUnit(StandInUnit):
+    """A stand-in unit whose updater is started by shell lines, and which can be started a second time.
+
+    `circumstances` are shell lines that run before the updater takes the shell's place, such as "ulimit -n 4";
+    `redirection` is the updater's own, such as ">/dev/full"; `runner` stands in front of its name.
+    """
+
+    def __init__(self, what: Scenario, folder: Path, build: Path, circumstances: str = "", redirection: str = "",
+                 runner: str = "") -> None:
+        wrapped = folder / "build"
+        (wrapped / "bench").mkdir(parents=True)
+        shutil.copy(build / "bench/tap.so", wrapped / "bench")
+        shutil.copy(build / "harl-updater", wrapped / "updater")
+        script = f"""#!/bin/sh
+{circumstances}
+exec {runner} /usr/bin/env LD_PRELOAD={wrapped}/bench/tap.so {wrapped}/updater {redirection}
+"""
+        (wrapped / "harl-updater").write_text(script)
+        (wrapped / "harl-updater").chmod(0o755)
+        super().__init__(what, folder, SPEED, wrapped)
+        self._made = False
+        self._changed_tools: dict[str, str] = {}
+
+    def change_tool(self, tool: str, lines: str) -> None:
+        """Runs shell `lines` in place of a tool; in them, real "$@" is the stand-in tool itself."""
+        self._changed_tools[tool] = f'#!/bin/sh\nreal() {{ "$UNIT/real/{tool}" "$@"; }}\n{lines}\n'
+
+    def start(self) -> None:
+        """Makes the unit the first time, and starts the updater."""
+        if self._made:
+            for file in (self.files.log, self.files.calls, self.files.panel, self._folder / "sounds"):
+                file.write_text("")
+            self._start_updater()
+            return
+        self._made = True
+        super().start()
+
+    def ended(self) -> int | None:
+        """None while the updater runs, or a command that it left behind, then its status."""
+        status = super().ended()
+        if status is not None and self._updater:
+            for _ in range(50):
+                try:
+                    os.killpg(self._updater.pid, 0)
+                except ProcessLookupError:
+                    break
+                time.sleep(0.02)
+        return status
+
+    def restore_tools(self) -> None:
+        """Takes every change of a tool back."""
+        for tool in self._changed_tools:
+            (self._folder / "bin" / tool).unlink()
+            (self._folder / "real" / tool).rename(self._folder / "bin" / tool)
+        self._changed_tools = {}
+
+    def signal(self, number: int) -> None:
+        """Sends a signal to the updater alone."""
+        if self._updater and self._updater.poll() is None:
+            os.kill(self._updater.pid, number)
+
+    def _make_head(self) -> None:
+        super()._make_head()
+        (self._folder / "real").mkdir()
+        for tool, text in self._changed_tools.items():
+            (self._folder / "bin" / tool).rename(self._folder / "real" / tool)
+            (self._folder / "bin" / tool).write_text(text)
+            (self._folder / "bin" / tool).chmod(0o755)
+
+
+def outcome(result: Result) -> dict[str, object]:
+    """What a run came to: how it ended, what it did, and the unit behind it."""
+    run, state = result.run, result.state
+    return {
+        "status": result.status,
+        "commands": [call.text for call in run.commands()],
+        "waits": [call.seconds for call in run.waits()],
+        "log": seen_log(run),
+        "panel": run.panel.pattern(run.calls[-1].start if run.calls else 0),
+        "panel faults": run.panel.faults,
+        **vars(state),
+    }

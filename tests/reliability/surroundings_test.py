@@ -1,0 +1,171 @@
+"""Usage: surroundings_test.py BUILD_FOLDER [TEST...]
+
+Runs the updater's executable on the stand-in unit while its surroundings do not keep their side: signals, limits, and a
+standard output that takes nothing. Where the updater does not come through, the test says how it ends.
+"""
+
+import os
+import signal
+import sys
+import threading
+import time
+import unittest
+from pathlib import Path
+
+sys.path.insert(0, str(Path(__file__).parents[2] / "bench"))
+
+import scenario
+from compare import differences
+from disturbed import SPEED, DisturbedUnit
+from observe import Run
+from session import Result, run_on, temporary_folder
+
+BUILD = Path()
+PLAIN_USER = 64999  # has no processes of its own
+
+
+class SurroundingsTest(unittest.TestCase):
+    """One run of the updater each."""
+
+    def setUp(self) -> None:
+        self.what = scenario.load("package-and-board")
+        context = temporary_folder()
+        self.folder = context.__enter__()
+        self.addCleanup(context.__exit__, None, None, None)
+
+    def run_updater(self, unit: DisturbedUnit) -> Result:
+        """One run to its end."""
+        return run_on(unit, lambda run, log: None, SPEED)
+
+    def unit(self, **circumstances: str) -> DisturbedUnit:
+        """A unit with the package and the board to be updated."""
+        return DisturbedUnit(self.what, self.folder, BUILD, **circumstances)
+
+    def assert_complete(self, result: Result, without: tuple[str, ...] = ()) -> None:
+        """The update came out as ever; differences that begin like one of `without` do not count."""
+        self.assertEqual([line for line in differences(self.what, result) if not line.startswith(without)], [])
+
+    # Signals
+
+    def test_storm_of_signals_changes_nothing(self) -> None:
+        unit = self.unit()
+        over = threading.Event()
+
+        def storm() -> None:
+            while not over.wait(0.001):
+                for number in (signal.SIGCHLD, signal.SIGWINCH, signal.SIGURG, signal.SIGCONT):
+                    unit.signal(number)
+
+        thread = threading.Thread(target=storm)
+        thread.start()
+        try:
+            result = self.run_updater(unit)
+        finally:
+            over.set()
+            thread.join()
+        self.assert_complete(result)
+        self.assert_no_wait_was_shortened(result)
+
+    def test_stop_and_continue_in_every_wait_changes_nothing(self) -> None:
+        unit = self.unit()
+        stopped: set[float] = set()
+
+        def stop_in_new_call(run: Run, _log: str) -> None:
+            running = [call for call in run.calls if call.end is None and not call.text.startswith("i2cset")]
+            for call in running:
+                if call.start not in stopped and call.seconds != 1:
+                    stopped.add(call.start)
+                    unit.signal(signal.SIGSTOP)
+                    time.sleep(0.1)
+                    unit.signal(signal.SIGCONT)
+
+        # Every command takes long enough to be met while it runs.
+        for tool in ("systemctl", "apt", "apt-cache", "ssh", "ls", "scp", "rm", "umount"):
+            unit.change_tool(tool, '/bin/sleep 0.1\nreal "$@"')
+        result = run_on(unit, stop_in_new_call, SPEED)
+        self.assert_complete(result)
+        self.assert_no_wait_was_shortened(result)
+        self.assertGreaterEqual(len(stopped), 15)
+
+    def assert_no_wait_was_shortened(self, result: Result) -> None:
+        """Every wait that ended took as long as it had to."""
+        for call in result.run.calls:
+            if call.call == "nanosleep" and call.end is not None:
+                self.assertGreaterEqual(call.end - call.start, call.real)
+
+    # Standard output
+
+    def test_closed_output_changes_nothing(self) -> None:
+        self.assert_complete(self.run_updater(self.unit(redirection=">&-")), without=("log:",))
+
+    def test_full_output_changes_nothing(self) -> None:
+        self.assert_complete(self.run_updater(self.unit(redirection=">/dev/full")), without=("log:",))
+
+    GONE_READER = '/usr/bin/mkfifo "$UNIT/pipe"\n/usr/bin/head -c 4000 <"$UNIT/pipe" >/dev/null &\n'
+
+    def test_broken_pipe_ends_an_updater_started_by_hand(self) -> None:
+        result = self.run_updater(self.unit(circumstances=self.GONE_READER, redirection='>"$UNIT/pipe"'))
+        self.assertEqual(result.status, -signal.SIGPIPE)
+        self.assertEqual(result.state.harl, "inactive")
+
+    def test_broken_pipe_changes_nothing_where_its_signal_is_ignored(self) -> None:
+        lines = self.GONE_READER + "trap '' PIPE"
+        self.assert_complete(
+            self.run_updater(self.unit(circumstances=lines, redirection='>"$UNIT/pipe"')), without=("log:",)
+        )
+
+    # Limits
+
+    def test_without_descriptors_no_output_can_be_read_and_the_check_fails(self) -> None:
+        result = self.run_updater(self.unit(circumstances="ulimit -n 4"))
+        commands = [call.text for call in result.run.commands()]
+        names = ["stop-harl", "refresh-mirrors", "read-package", "release-stick", "start-harl", "stop-updater"]
+        self.assertEqual(commands, [scenario.COMMANDS[name] for name in names])
+        self.assertEqual(result.status, 0)
+        last = [call.text for call in result.run.calls if call.text.startswith("i2cset")][-2:]
+        self.assertEqual(last, [f"i2cset -y 0 0x07 {led} c ; i2cset -y 0 0x07 0x8 c" for led in ("0x12", "0x15")])
+
+    def limit_processes(self, limit: int) -> Result:
+        """A run as a user who may have `limit` processes and threads."""
+        if os.geteuid() != 0:
+            self.skipTest("needs root, to run as a user without other processes")
+        unit = self.unit(
+            runner=f"/usr/bin/prlimit --nproc={limit} /usr/bin/setpriv --reuid={PLAIN_USER} --regid={PLAIN_USER} --clear-groups",
+        )
+        self.folder.chmod(0o777)
+        make = unit._start_updater
+
+        def start_updater() -> None:
+            for path in self.folder.rglob("*"):
+                if not path.is_symlink():
+                    path.chmod(0o777)
+            make()
+
+        unit._start_updater = start_updater  # type: ignore[method-assign]
+        return self.run_updater(unit)
+
+    def test_without_processes_the_run_ends_with_no_command_done(self) -> None:
+        result = self.limit_processes(3)
+        self.assertEqual(result.status, 0)
+        self.assertIn("AFTER UPDATE", result.run.log)
+        self.assertEqual(result.state.package, "1.2.0")
+
+    def test_without_threads_the_updater_aborts_before_anything_is_changed(self) -> None:
+        result = self.limit_processes(1)
+        self.assertEqual(result.status, -signal.SIGABRT)
+        self.assertEqual(result.run.commands(), [])
+
+    def test_little_memory_is_enough(self) -> None:
+        self.assert_complete(self.run_updater(self.unit(circumstances="ulimit -v 65536")))
+
+    def test_output_larger_than_memory_aborts_the_updater(self) -> None:
+        unit = self.unit(circumstances="ulimit -v 65536")
+        unit.change_tool("apt", "/usr/bin/tr '\\0' x </dev/zero | /usr/bin/head -c 100000000\nreal \"$@\"")
+        result = self.run_updater(unit)
+        self.assertEqual(result.status, -signal.SIGABRT)
+        self.assertEqual(result.state.harl, "inactive")
+
+
+if __name__ == "__main__":
+    BUILD = Path(sys.argv.pop(1))
+    unittest.main()

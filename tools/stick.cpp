@@ -301,7 +301,7 @@ private:
         if (!file) {
             return;
         }
-        std::string start(std::min<std::uint64_t>(node.size, scriptBytesChecked), '\0');
+        std::string start(static_cast<std::size_t>(std::min<std::uint64_t>(node.size, scriptBytesChecked)), '\0');
         if (readAt(file.number(), 0, start.data(), start.size()) != start.size()) {
             addUnreadable(path, EIO, uploadFailsEffect);
             return;
@@ -414,8 +414,10 @@ int runStick(const std::string& path, bool json, std::ostream& out, std::ostream
 {
     const StickFolder stick(path);
     if (stick.error() != 0) {
-        errors << "harl-updater-tool: " << shown(path) << " cannot be read: " << std::strerror(stick.error())
-               << ". Name the folder that the stick is mounted at, the one that holds \"debs\".\n";
+        errors << "harl-updater-tool: " << shown(path) << " cannot be read: " << std::strerror(stick.error()) << ". "
+               << (stick.error() == ENOSYS ? "The kernel must be Linux 5.6 or later.\n"
+                                           : "Name the folder that the stick is mounted at, the one that holds "
+                                             "\"debs\".\n");
         return Report::STATUS_UNCHECKED;
     }
     Report report("stick", "The stick at " + shown(path));

@@ -299,7 +299,7 @@ private:
             }
             return info.number_entry > 0;
         }
-        std::string magic(std::min<std::uint64_t>(mSource.size, 4), '\0');
+        std::string magic(static_cast<std::size_t>(std::min<std::uint64_t>(mSource.size, 4)), '\0');
         magic.resize(mSource.read(0, magic.data(), magic.size()));
         if (const auto offset = mWindow.failedAt()) {
             addUnreadable(*offset);

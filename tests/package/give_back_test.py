@@ -1,0 +1,152 @@
+"""What runs after the service has ended, on stand-in tools, in a process namespace of its own: it looks for processes."""
+
+import shutil
+import subprocess
+import sys
+import tempfile
+import unittest
+from pathlib import Path
+
+ROOT = Path(__file__).parents[2]
+sys.path.insert(0, str(ROOT / "bench"))
+
+from panel import Panel, color_name, led_name
+
+SKIPPED = 77
+NAMESPACES = ["unshare", "--map-root-user", "--mount", "--pid", "--fork", "--kill-child", "--mount-proc"]
+GIVE_BACK = ROOT / "package/service/give-back"
+START = "systemctl --no-block start harl"
+TOOLS = {
+    "systemctl": "",
+    "i2cset": 'exit "$I2CSET_STATUS"',
+    "umount": '[ ! -e "$UNIT/busy" ] || { rm "$UNIT/busy"; exit 32; }; [ -e "$UNIT/stuck" ] || rm "$UNIT/mounted"',
+    "mountpoint": '[ -e "$UNIT/mounted" ]',
+    "sleep": "exec /usr/bin/sleep 0.05",
+}
+
+
+class GiveBack(unittest.TestCase):
+    """A unit whose updater has just ended, with the stick still in use."""
+
+    def setUp(self) -> None:
+        folder = tempfile.TemporaryDirectory(prefix="give-back-")
+        self.addCleanup(folder.cleanup)
+        self.unit = Path(folder.name)
+        (self.unit / "bin").mkdir()
+        (self.unit / "run").mkdir()
+        (self.unit / "mounted").touch()
+        self.environment = {
+            "PATH": f"{self.unit}/bin:/usr/bin:/bin",
+            "UNIT": str(self.unit),
+            "I2CSET_STATUS": "0",
+            "RUNTIME_DIRECTORY": str(self.unit / "run"),
+            "SERVICE_RESULT": "success",
+            "EXIT_CODE": "killed",
+            "EXIT_STATUS": "TERM",
+        }
+        for name, text in TOOLS.items():
+            log = '[ "${0##*/}" = sleep ] || [ "${0##*/}" = mountpoint ] || echo "${0##*/} $*" >>"$UNIT/calls"'
+            (self.unit / "bin" / name).write_text(f"#!/bin/sh\n{log}\n{text}\n")
+            (self.unit / "bin" / name).chmod(0o755)
+        # Copies of sleep(1) under the names of what the updater may leave at work.
+        for name in ("apt", "dpkg", "scp", "ssh"):
+            shutil.copy("/usr/bin/sleep", self.unit / name)
+        shutil.copy(GIVE_BACK, self.unit / "give-back")
+
+    def give_back(self, beside: str = ":", after: str = ":") -> str:
+        """Runs it with the shell line `beside` started before it, and `after` run next; what it says."""
+        line = f'cd "$UNIT"; {beside}; ./give-back; {after}'
+        done = subprocess.run(
+            [*NAMESPACES, "sh", "-c", line], env=self.environment, capture_output=True, text=True, check=False, timeout=60
+        )
+        self.assertEqual(done.stderr, "")
+        return done.stdout
+
+    def calls(self, *tools: str) -> list[str]:
+        """The calls of the named tools, or of all."""
+        path = self.unit / "calls"
+        lines = path.read_text().splitlines() if path.exists() else []
+        return [line for line in lines if not tools or line.split()[0] in tools]
+
+    def panel(self) -> dict[str, str]:
+        """The LEDs that are lit after what was sent, had they flashed blue before."""
+        panel = Panel()
+        for byte in ("0x12", "0x1", *[line.split()[4] for line in self.calls("i2cset")]):
+            panel.send(int(byte, 16), 0)
+        self.assertEqual(panel.faults, [])
+        return {led_name(led): color_name(color) for led, color in panel.shown(0).items() if color}
+
+    def test_after_a_normal_end_nothing_is_left_to_do(self) -> None:
+        (self.unit / "run/outcome").touch()
+        (self.unit / "mounted").unlink()
+        self.assertEqual(self.give_back(), "")
+        self.assertEqual(self.calls(), [START])
+
+    def test_end_before_the_outcome_shows_the_failure(self) -> None:
+        said = self.give_back()
+        self.assertIn("ended (success killed TERM) before it showed an outcome", said)
+        self.assertEqual(self.panel(), {"FAIL": "fail"})
+        self.assertEqual(self.calls("umount", "systemctl"), ["umount /root/USB_MOUNT", START])
+        # The operator sees the failure even if what follows should hang.
+        self.assertEqual(self.calls()[-2:], ["umount /root/USB_MOUNT", START])
+
+    def test_end_after_the_outcome_leaves_the_panel_alone(self) -> None:
+        (self.unit / "run/outcome").touch()
+        self.give_back()
+        self.assertEqual(self.calls(), ["umount /root/USB_MOUNT", START])
+
+    def test_package_tools_are_waited_for(self) -> None:
+        for tool in ("apt", "dpkg"):
+            said = self.give_back(f'(./{tool} 0.5; echo "{tool} ended" >>"$UNIT/calls") &')
+            self.assertIn("still at work", said)
+            self.assertEqual(self.calls()[0], f"{tool} ended")
+            self.assertEqual(self.calls()[-1], START)
+            (self.unit / "calls").unlink()
+
+    def test_package_tool_that_hangs_does_not_keep_the_instrument(self) -> None:
+        text = GIVE_BACK.read_text()
+        (self.unit / "give-back").write_text(text.replace("package_tools_wait=1800", "package_tools_wait=3"))
+        self.assertNotEqual((self.unit / "give-back").read_text(), text)
+        said = self.give_back("./dpkg 30 &", 'kill -0 $! && echo "it lives"')
+        self.assertIn("going on beside it", said)
+        self.assertIn("it lives", said)
+        self.assertEqual(self.calls()[-1], START)
+
+    def test_upload_is_ended_and_the_board_script_is_not(self) -> None:
+        said = self.give_back(
+            "./scp 30 & upload=$!; ./ssh 30 & board=$!",
+            "/usr/bin/sleep 0.1; kill -0 $board && echo board lives; wait $upload; echo upload $?",
+        )
+        self.assertIn("board lives", said)
+        self.assertIn("upload 143", said)
+
+    def test_busy_stick_is_tried_again(self) -> None:
+        (self.unit / "busy").touch()
+        self.give_back()
+        self.assertEqual(len(self.calls("umount")), 2)
+        self.assertFalse((self.unit / "mounted").exists())
+
+    def test_stick_that_stays_does_not_keep_the_application(self) -> None:
+        (self.unit / "stuck").touch()
+        self.assertIn("the stick stays mounted", self.give_back())
+        self.assertEqual(self.calls()[-1], START)
+
+    def test_absent_panel_does_not_keep_the_application(self) -> None:
+        self.environment["I2CSET_STATUS"] = "1"
+        self.give_back()
+        self.assertEqual(self.calls("umount", "systemctl"), ["umount /root/USB_MOUNT", START])
+
+    def test_service_manager_that_tells_nothing(self) -> None:
+        for name in ("RUNTIME_DIRECTORY", "SERVICE_RESULT", "EXIT_CODE", "EXIT_STATUS"):
+            del self.environment[name]
+        self.give_back()
+        self.assertEqual(self.panel(), {"FAIL": "fail"})
+        self.assertEqual(self.calls()[-1], START)
+
+
+if __name__ == "__main__":
+    probe = subprocess.run([*NAMESPACES, "true"], capture_output=True, text=True, check=False)
+    if probe.returncode != 0:
+        print(f"left out: this machine allows no process namespace: {probe.stderr.strip()}")
+        sys.exit(SKIPPED)
+    unittest.main()

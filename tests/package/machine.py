@@ -1,0 +1,107 @@
+"""A machine with real systemd, apt and dpkg in namespaces of its own on this one. Needs root; nothing of it outlives it."""
+
+import contextlib
+import os
+import signal
+import subprocess
+import tempfile
+import time
+from collections.abc import Iterator
+from pathlib import Path
+
+NAMESPACES = ["unshare", "--mount", "--net", "--ipc", "--uts", "--pid", "--fork", "--kill-child"]
+LONGEST_START = 60  # s
+
+
+class MachineError(Exception):
+    """The machine cannot be made here; the text says why."""
+
+
+class Machine:
+    """A running machine. `files` is what it has besides the host's /usr."""
+
+    def __init__(self, folder: Path) -> None:
+        self._folder = folder
+        self.files = folder / "files"
+        self.files.mkdir()
+        (folder / "memory").mkdir()
+        self._namespaces: subprocess.Popen[bytes] | None = None
+        self._first = 0
+
+    def start(self) -> None:
+        """Returns when systemd is up. Raises MachineError."""
+        with (self._folder / "console").open("wb") as console:
+            self._namespaces = subprocess.Popen(
+                [*NAMESPACES, Path(__file__).with_name("machine.sh"), self._folder],
+                stdin=subprocess.DEVNULL,
+                stdout=console,
+                stderr=console,
+                start_new_session=True,
+            )
+        end = time.monotonic() + LONGEST_START
+        while self.status("systemctl", "is-active", "--quiet", "basic.target") != 0:
+            if self._namespaces.poll() is not None or time.monotonic() > end:
+                text = (self._folder / "console").read_text(errors="replace").strip().splitlines()
+                raise MachineError(text[-1] if text else "systemd does not come up")
+            time.sleep(0.1)
+
+    def stop(self) -> None:
+        """Ends every process of the machine."""
+        if self._namespaces is None:
+            return
+        with contextlib.suppress(OSError):
+            os.kill(self._first_process(), signal.SIGKILL)
+        self._namespaces.kill()
+        self._namespaces.wait()
+        self._remove_control_groups()
+
+    def run(self, *command: str) -> str:
+        """What the command prints inside; fails with its errors when its status is not 0."""
+        done = self._inside(*command)
+        if done.returncode != 0:
+            raise AssertionError(f"{' '.join(command)}: status {done.returncode}\n{done.stdout}{done.stderr}")
+        return done.stdout
+
+    def status(self, *command: str) -> int:
+        """The status of the command inside."""
+        return self._inside(*command).returncode
+
+    def root(self) -> Path:
+        """The machine's root, seen from outside."""
+        return Path(f"/proc/{self._first_process()}/root")
+
+    def _remove_control_groups(self) -> None:
+        for top in [*Path("/sys/fs/cgroup").glob(self._folder.name), *Path("/sys/fs/cgroup").glob(f"*/{self._folder.name}")]:
+            for attempt in range(100):  # a group stays busy until its last process is gone
+                subprocess.run(["find", top, "-depth", "-type", "d", "-exec", "rmdir", "{}", "+"], capture_output=True, check=False)
+                if not top.exists():
+                    break
+                time.sleep(0.05)
+
+    def _inside(self, *command: str) -> subprocess.CompletedProcess[str]:
+        try:
+            enter = ["nsenter", "--all", f"--target={self._first_process()}", "--root", "--wd"]
+        except OSError:
+            return subprocess.CompletedProcess(command, 1, "", "not started")
+        environment = {"PATH": "/usr/sbin:/usr/bin:/sbin:/bin", "HOME": "/root", "LC_ALL": "C"}
+        return subprocess.run([*enter, *command], env=environment, capture_output=True, text=True, check=False)
+
+    def _first_process(self) -> int:
+        """systemd, as the host numbers it."""
+        assert self._namespaces
+        pid = self._namespaces.pid
+        try:
+            return int(Path(f"/proc/{pid}/task/{pid}/children").read_text().split()[0])
+        except IndexError as error:
+            raise ProcessLookupError(pid) from error
+
+
+@contextlib.contextmanager
+def machine() -> Iterator[Machine]:
+    """A machine that is not started yet, and goes with the block."""
+    with tempfile.TemporaryDirectory(prefix="machine-") as folder:
+        made = Machine(Path(folder))
+        try:
+            yield made
+        finally:
+            made.stop()

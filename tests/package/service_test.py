@@ -1,0 +1,341 @@
+"""Usage: service_test.py BUILD_FOLDER PACKAGE
+
+Runs the service of the built PACKAGE (harl-updater or harl-updater-static, from build/package/) under real systemd, apt
+and dpkg and lets it end in every way. The board, the sound and the panel's bus are stand-ins.
+"""
+
+import os
+import shutil
+import subprocess
+import sys
+import time
+import unittest
+from collections.abc import Callable
+from pathlib import Path
+
+ROOT = Path(__file__).parents[2]
+sys.path.insert(0, str(ROOT / "bench"))
+
+from machine import Machine, MachineError, machine
+from observe import RECORD
+from panel import Panel, color_name, led_name
+
+SKIPPED = 77
+SPEED = 10  # times shorter waits of the updater
+TOOLS = {
+    # As i2c-tools 4.3: the panel's address only with -a. The panel keeps what it is sent.
+    "i2cset": """
+[ "$1" != -h ] || { echo "Usage: i2cset [-f] [-y] [-m MASK] [-r] [-a] I2CBUS CHIP-ADDRESS DATA-ADDRESS" >&2; exit 1; }
+[ "$1" = -a ] || { echo "Error: Chip address out of range (0x08-0x77)!" >&2; exit 1; }
+echo "$5" >>/var/log/panel
+""",
+    "aplay": 'sleep 0.2; echo "${1##*/}" >>/var/log/sounds',
+    "ssh": r"""
+case $* in
+*version.txt*) printf 'Brimvale\t%s\r\n' "$(cat /srv/board)" ;;
+esac
+""",
+    # Reads from the stick for as long as it takes.
+    "scp": "exec 3</root/USB_MOUNT/debs/QUORB/armhf/quorb2.2.0/OSUpgrade.zip; touch /run/uploads; exec /opt/scp 60",
+}
+SLOW_SCRIPT = """
+touch /run/package-installs
+sleep 10
+echo "a script that goes on talking"
+systemctl is-active harl >/run/harl-after || true
+"""
+CONTROL = """Package: {name}
+Version: {version}
+Architecture: all
+Maintainer: Test <test@localhost>
+Description: test
+{fields}
+"""
+# Ordered after the updater: its start must not wait for a service that waits for it.
+HARL = "[Unit]\nAfter=harl-updater.service\n[Service]\nExecStart=/bin/sleep infinity\n"
+
+
+def make_files(files: Path, package: Path, build: Path) -> None:
+    """Writes what the machine has: tools, packages and the application."""
+    for name, text in TOOLS.items():
+        write(files / "usr/local/sbin" / name, f"#!/bin/bash\n{text.strip()}\n", 0o755)
+    write(files / "etc/systemd/system/harl.service", HARL)
+    write(files / "etc/apt/sources.list", "deb [trusted=yes] file:/srv/repository ./\n")
+    write(files / "etc/apt/apt.conf.d/50test", 'APT::Sandbox::User "root";\n')
+    (files / "etc/systemd/system/dbus.socket").symlink_to("/dev/null")  # apt would wait for a login manager behind it
+    write(files / "srv/board", "2.2.0\n")
+    for folder in ("etc/apt/preferences.d", "var/lib/dpkg/info", "var/lib/dpkg/updates", "var/lib/apt/lists/partial", "srv/repository"):
+        (files / folder).mkdir(parents=True)
+    for folder in ("var/cache/apt/archives/partial", "var/log/apt", "root/USB_MOUNT", "root/RESOURCES/SOUNDS", "opt"):
+        (files / folder).mkdir(parents=True)
+    write(files / "var/lib/dpkg/status", "")
+    shutil.copy(package, files / "srv/updater.deb")
+    shutil.copy(build / "bench/tap.so", files / "opt")
+    shutil.copy("/usr/bin/sleep", files / "opt/scp")
+
+
+def write(path: Path, text: str, mode: int = 0o644) -> None:
+    """Writes a file, with the folders above it."""
+    path.parent.mkdir(parents=True, exist_ok=True)
+    path.write_text(text)
+    path.chmod(mode)
+
+
+def make_package(
+    unit: Machine, folder: str, name: str, version: str, script: str = "", fields: str = "", when: str = "postinst"
+) -> str:
+    """Builds a package inside the machine, with a maintainer script of these lines; its path."""
+    tree = unit.root() / "srv/tree"
+    write(tree / "DEBIAN/control", CONTROL.format(name=name, version=version, fields=fields).strip() + "\n")
+    write(tree / "DEBIAN" / when, f"#!/bin/sh\nset -e\n{script}\n", 0o755)
+    path = f"{folder}/{name}_{version}.deb"
+    unit.run("dpkg-deb", "--build", "/srv/tree", path)
+    unit.run("rm", "-r", "/srv/tree")
+    return path
+
+
+def install(unit: Machine) -> None:
+    """Installs the package under test, and a package that stands for all that it depends on."""
+    depends = unit.run("dpkg-deb", "--field", "/srv/updater.deb", "Depends")
+    names = ", ".join(f"{item.split()[0]} (= 9999)" for item in depends.split(","))
+    unit.run("dpkg", "--install", make_package(unit, "/srv", "tools", "1.0", fields=f"Provides: {names}"), "/srv/updater.deb")
+
+
+def wait_for(what: str, condition: Callable[[], bool], seconds: float = 60) -> None:
+    """Returns once the condition holds."""
+    end = time.monotonic() + seconds
+    while not condition():
+        if time.monotonic() > end:
+            raise AssertionError(f"not within {seconds} s: {what}")
+        time.sleep(0.1)
+
+
+class ServiceTest(unittest.TestCase):
+    """Every test is one run of the service, from a unit as a technician finds it."""
+
+    unit: Machine
+    package: str
+
+    def setUp(self) -> None:
+        self.maxDiff = None
+        self.inside = self.unit.run
+        self.inside("sh", "-c", "rm -f /run/package-installs /run/uploads /run/harl-* /var/log/panel /var/log/sounds")
+        self.inside("touch", "/root/RESOURCES/tavren1stboot", "/var/log/panel", "/var/log/sounds")
+        self.inside("sh", "-c", "mount -t tmpfs stick /root/USB_MOUNT")
+        self.inside("mkdir", "-p", "/root/USB_MOUNT/debs/QUORB/armhf/quorb2.2.0")
+        self.inside("touch", "/root/USB_MOUNT/debs/QUORB/armhf/quorb2.2.0/OSUpgrade.zip")
+        self.inside("sh", "-c", "echo 2.2.0 >/srv/board; dpkg --purge solvik4-rh solvik4-data; rm -rf /srv/repository/*")
+        self.inside("dpkg", "--install", make_package(self.unit, "/srv", "solvik4-rh", "1.2.0"))
+        self.set_speed(SPEED)
+        self.inside("systemctl", "start", "harl")
+
+    def tearDown(self) -> None:
+        self.unit.status("umount", "-l", "/root/USB_MOUNT")
+        self.unit.status("systemctl", "reset-failed")
+
+    def set_speed(self, speed: int) -> None:
+        """Shortens the updater's waits, not those of its children."""
+        text = f"[Service]\nEnvironment=LD_PRELOAD=/opt/tap.so BENCH_SPEED={speed} BENCH_CALLS=/var/log/calls\n"
+        folder = self.unit.root() / "etc/systemd/system/harl-updater.service.d"
+        if self.package.endswith("-static"):  # which no library can be loaded into
+            text = ""
+        write(folder / "test.conf", text)
+        self.inside("systemctl", "daemon-reload")
+
+    def offer(self, script: str = "", fields: str = "") -> None:
+        """Offers solvik4-rh 1.3.0."""
+        make_package(self.unit, "/srv/repository", "solvik4-rh", "1.3.0", script, fields)
+        self.inside("sh", "-c", "cd /srv/repository && dpkg-scanpackages --multiversion . >Packages")
+
+    def start(self) -> None:
+        """Starts the service."""
+        self.inside("systemctl", "start", "harl-updater")
+        self.main = int(self.show("MainPID"))
+        self.invocation = self.show("InvocationID")
+
+    def kill(self, signal: str) -> None:
+        """Sends a signal to the updater itself."""
+        self.inside("kill", "-s", signal, str(self.main))
+
+    def show(self, name: str) -> str:
+        """A property of the service."""
+        return self.inside("systemctl", "show", "--value", f"--property={name}", "harl-updater").strip()
+
+    def wait_for_file(self, path: str) -> None:
+        """Waits for a file inside."""
+        wait_for(path, lambda: (self.unit.root() / path.lstrip("/")).exists())
+
+    def wait_for_end(self) -> None:
+        """Waits until the service has ended, with what runs after it."""
+        wait_for("end of the service", lambda: self.show("ActiveState") in ("inactive", "failed"), 90)
+
+    def ended_as(self) -> tuple[str, str, str]:
+        """Result of the service, and how the updater's process ended."""
+        return self.show("Result"), self.show("ExecMainCode"), self.show("ExecMainStatus")
+
+    def panel(self) -> dict[str, str]:
+        """The LEDs that are lit."""
+        panel = Panel()
+        for byte in self.read("/var/log/panel").split():
+            panel.send(int(byte, 16), 0)
+        self.assertEqual(panel.faults, [])
+        return {led_name(led): color_name(color) for led, color in panel.shown(0).items() if color}
+
+    def read(self, path: str) -> str:
+        """Text of a file inside."""
+        return (self.unit.root() / path.lstrip("/")).read_text()
+
+    def journal(self) -> str:
+        """The messages of the service, of this run."""
+        self.inside("journalctl", "--sync")
+        match = [f"_SYSTEMD_INVOCATION_ID={self.invocation}", "SYSLOG_IDENTIFIER=harl-updater"]
+        return self.inside("journalctl", "--quiet", "--output=cat", *match)
+
+    def package_state(self, name: str = "solvik4-rh") -> str:
+        """State and version in the package database."""
+        return self.inside("dpkg-query", "--show", "--showformat=${Status} ${Version}", name)
+
+    def assert_given_back(self) -> None:
+        """The stick is released and the application runs."""
+        self.assertNotEqual(self.unit.status("mountpoint", "-q", "/root/USB_MOUNT"), 0)
+        wait_for("harl", lambda: self.unit.status("systemctl", "is-active", "--quiet", "harl") == 0, 10)
+
+    def assert_installation_ended_well(self) -> None:
+        """The slow script was let finish, and the application kept away meanwhile."""
+        self.assertEqual(self.package_state(), "install ok installed 1.3.0")
+        self.assertEqual(self.read("/run/harl-after"), "inactive\n")
+
+
+class Ends(ServiceTest):
+    """One test for each end."""
+
+    def test_normal_end(self) -> None:
+        self.offer()
+        self.start()
+        self.wait_for_end()
+        self.assertEqual(self.ended_as(), ("success", "2", "15"))
+        self.assert_given_back()
+        self.assertEqual(self.panel(), {"PASS": "pass"})
+        self.assertEqual(self.read("/var/log/sounds"), "SND_RESULT_PASS.wav\n")
+        self.assertEqual(self.package_state(), "install ok installed 1.3.0")
+        log = self.journal()
+        self.assertIn("TavrenUpdater version: ", log)
+        self.assertEqual([record["function"] for record in RECORD.finditer(log)][-1], "static void UpdateManager::stopUpdater()")
+        self.assertNotIn("give-back", log)
+
+    def test_failure_keeps_its_own_outcome(self) -> None:
+        self.offer("exit 1")
+        self.start()
+        self.wait_for_end()
+        self.assertEqual(self.ended_as(), ("success", "2", "15"))
+        self.assert_given_back()
+        self.assertEqual(self.panel(), {"FAIL": "fail"})
+        self.assertNotIn("give-back", self.journal())
+
+    def test_killed_during_the_installation(self) -> None:
+        # With the first of two packages not yet unpacked, most of the work is still to be done.
+        make_package(self.unit, "/srv/repository", "solvik4-data", "1.3.0", SLOW_SCRIPT, when="preinst")
+        self.offer("echo configured", "Depends: solvik4-data")
+        self.start()
+        self.wait_for_file("/run/package-installs")
+        self.kill("KILL")
+        self.wait_for_end()
+        self.assertEqual(self.ended_as(), ("signal", "2", "9"))
+        self.assert_installation_ended_well()
+        self.assert_given_back()
+        self.assertEqual(self.panel(), {"FAIL": "fail"})
+        self.assertIn("give-back: a package tool is still at work", self.journal())
+
+    def test_stopped_by_an_operator_during_the_installation(self) -> None:
+        self.offer(SLOW_SCRIPT)
+        self.start()
+        self.wait_for_file("/run/package-installs")
+        self.inside("systemctl", "stop", "harl-updater")
+        self.assertEqual(self.ended_as(), ("success", "2", "15"))
+        self.assert_installation_ended_well()
+        self.assert_given_back()
+        self.assertEqual(self.panel(), {"FAIL": "fail"})
+
+    def test_crash_during_the_upload(self) -> None:
+        self.inside("sh", "-c", "echo 2.1.0 >/srv/board")
+        self.offer()
+        self.start()
+        self.wait_for_file("/run/uploads")
+        self.kill("SEGV")
+        self.wait_for_end()
+        self.assertIn(self.ended_as()[0], ("signal", "core-dump"))
+        self.assert_given_back()
+        self.assertEqual(self.panel(), {"FAIL": "fail"})
+        self.assertNotEqual(self.unit.status("pgrep", "--exact", "scp"), 0)
+
+    def test_crash_after_the_outcome_was_shown(self) -> None:
+        self.offer()
+        self.start()
+        wait_for("outcome", lambda: self.panel() == {"PASS": "pass"})
+        self.kill("ABRT")
+        self.wait_for_end()
+        self.assert_given_back()
+        self.assertEqual(self.panel(), {"PASS": "pass"})
+
+    def test_stopped_when_the_package_itself_has_started_the_application(self) -> None:
+        self.inside("sh", "-c", "echo 2.1.0 >/srv/board")
+        self.offer("systemctl start harl")
+        self.start()
+        self.wait_for_file("/run/uploads")
+        self.inside("systemctl", "stop", "harl-updater")
+        self.assert_given_back()
+        self.assertEqual(self.panel(), {"FAIL": "fail"})
+
+    def test_upgrade_of_the_updater_in_its_own_run(self) -> None:
+        self.inside("dpkg-deb", "--raw-extract", "/srv/updater.deb", "/srv/newer")
+        self.inside("sed", "-i", "s/^Version: .*/Version: 9.0.0/", "/srv/newer/DEBIAN/control")
+        self.inside("sh", "-c", "echo '# newer' >>/srv/newer/lib/systemd/system/harl-updater.service")
+        self.inside("dpkg-deb", "--build", "/srv/newer", "/srv/repository/updater_9.0.0.deb")
+        self.offer("systemctl daemon-reload\ntouch /run/package-installs\n", f"Depends: {self.package} (>= 9.0.0)")
+        self.start()
+        self.wait_for_file("/run/package-installs")
+        self.assertEqual(int(self.show("MainPID")), self.main)
+        self.wait_for_end()
+        self.assertEqual(self.ended_as(), ("success", "2", "15"))
+        self.assertEqual(self.package_state(self.package), "install ok installed 9.0.0")
+        self.assert_given_back()
+        self.assertEqual(self.panel(), {"PASS": "pass"})
+        self.inside("dpkg", "--purge", "solvik4-rh")
+        self.inside("dpkg", "--install", "--force-downgrade", "/srv/updater.deb")
+
+    def test_removal_leaves_the_run_alone(self) -> None:
+        self.offer()
+        self.start()
+        wait_for("outcome", lambda: self.panel() == {"PASS": "pass"})
+        self.inside("dpkg", "--remove", self.package)
+        self.assertEqual(int(self.show("MainPID")), self.main)
+        self.wait_for_end()
+        self.assertEqual(self.ended_as()[1:], ("2", "15"))
+        self.assert_given_back()
+        self.inside("dpkg", "--install", "/srv/updater.deb")
+        self.assertNotEqual(self.show("ActiveState"), "active")
+
+
+def skip(why: str) -> None:
+    """Ends the test as left out."""
+    print(f"left out: {why}")
+    sys.exit(SKIPPED)
+
+
+if __name__ == "__main__":
+    build, package = Path(sys.argv[1]), sys.argv[2]
+    architecture = subprocess.run(["dpkg", "--print-architecture"], capture_output=True, text=True, check=True).stdout.strip()
+    found = sorted((ROOT / "build/package").glob(f"{package}_*_{architecture}.deb"))
+    if not found:
+        skip("there is no package for this machine: package/build")
+    if os.geteuid() != 0:
+        skip("systemd as the first process of a machine of its own needs root")
+    with machine() as made:
+        make_files(made.files, found[-1], build)
+        try:
+            made.start()
+        except MachineError as error:
+            skip(f"this machine allows no machine of its own: {error}")
+        ServiceTest.unit, ServiceTest.package = made, package
+        install(made)
+        unittest.main(argv=[sys.argv[0], *sys.argv[3:]], verbosity=2)

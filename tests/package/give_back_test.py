@@ -55,7 +55,7 @@ class GiveBack(unittest.TestCase):
 
     def give_back(self, beside: str = ":", after: str = ":") -> str:
         """Runs it with the shell line `beside` started before it, and `after` run next; what it says."""
-        line = f'cd "$UNIT"; {beside}; ./give-back; {after}'
+        line = f'cd "$UNIT"\n{beside}\n./give-back\n{after}'
         done = subprocess.run(
             [*NAMESPACES, "sh", "-c", line], env=self.environment, capture_output=True, text=True, check=False, timeout=60
         )

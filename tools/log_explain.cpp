@@ -69,12 +69,8 @@ const Hint hints[] = {
 /// The hint that fits what the tools of `step` said, or null.
 const Hint* hintFor(const Step& step)
 {
-    const auto holds = [&](const Hint& hint) {
-        const auto says = [&](const std::string& line) { return contains(line, hint.said); };
-        return std::any_of(step.said.first.begin(), step.said.first.end(), says) ||
-               std::any_of(step.said.last.begin(), step.said.last.end(), says);
-    };
-    const auto found = std::find_if(std::begin(hints), std::end(hints), holds);
+    const auto fits = [&](const Hint& hint) { return step.said.contain(hint.said); };
+    const auto found = std::find_if(std::begin(hints), std::end(hints), fits);
     return found == std::end(hints) ? nullptr : found;
 }
 
@@ -246,32 +242,45 @@ const Step* decidingStep(const Run& run)
     return found == run.steps.rend() ? nullptr : &*found;
 }
 
+/// What to do about a run that ended, or may have ended, in `step`.
+std::string remedyFor(const Step& step)
+{
+    switch (step.kind) {
+    case StepKind::INSTALL_PACKAGE:
+        return "run on the unit: dpkg --configure -a, then run the update again.";
+    case StepKind::RUN_BOARD_SCRIPT:
+    case StepKind::WAIT_FOR_BOARD:
+        return "leave the board 13 minutes of power, then run the update again.";
+    case StepKind::SHOW_TO_OPERATOR:
+    case StepKind::GIVE_BACK:
+        return "the update itself was over: see that the application runs (systemctl status harl).";
+    default:
+        return "run the update again.";
+    }
+}
+
 /// A run without its last record.
 Problem explainUnfinished(const Run& run)
 {
     const Step& last = run.steps.back();
+    if (run.ended == RunEnd::EARLY) {
+        std::string why = "The updater ended in this step: it crashed, was stopped, or was killed.";
+        if (run.failureShownByService) {
+            why += " The service then lit FAIL, without a sound, released the stick and started the application.";
+        }
+        return problem(run, last, "ended-early", why, "Read below what the service manager said; " + remedyFor(last));
+    }
     std::string why = "The run's records end in this step. ";
     if (last.kind == StepKind::WAIT_FOR_BOARD) {
         why += "The wait lasts 13 minutes and is silent: it may still be going on. ";
     }
-    why +=
-        run.followedByAnother
-            ? "The updater ended early: the power went, or it was stopped or killed."
-            : "Either it still goes on, or the updater ended early (power, stopped, killed), or the log was cut off.";
-    if (run.serviceManager.count > 0) {
-        why += " The service manager said: " + run.serviceManager.first.back();
+    if (run.followedByAnother) {
+        why += "The updater ended early: the power went, or it was stopped or killed.";
+        return problem(run, last, "unfinished", why, "If the next run did not go well either: " + remedyFor(last));
     }
-    std::string remedy = "See whether the panel still flashes blue in turn. If it does, wait; if not, ";
-    if (last.kind == StepKind::INSTALL_PACKAGE) {
-        remedy += "run on the unit: dpkg --configure -a, then ";
-    } else if (last.kind == StepKind::RUN_BOARD_SCRIPT || last.kind == StepKind::WAIT_FOR_BOARD) {
-        remedy += "leave the board 13 minutes of power, then ";
-    }
-    remedy += "run the update again. Until then the application may be stopped: systemctl start harl.";
-    if (last.kind == StepKind::GIVE_BACK || last.kind == StepKind::SHOW_TO_OPERATOR) {
-        remedy = "The update itself was over. If the application does not run: systemctl start harl.";
-    }
-    return problem(run, last, "unfinished", why, remedy);
+    why += "Either it still goes on, or the updater ended early (power, stopped, killed), or the log was cut off.";
+    return problem(run, last, "unfinished", why,
+                   "See whether the panel still flashes blue in turn. If it does, wait. If not: " + remedyFor(last));
 }
 
 void addFailure(Run& run)
@@ -286,7 +295,8 @@ void addFailure(Run& run)
                                     "An error was shown, but the records that tell which are missing.",
                                     "Get the whole log (harl-updater-tool log --unit), or run the update again.")
                           : explainFailedStep(run, *step);
-    } else if (run.ended == RunEnd::NOT_SEEN && !(run.mainHead && run.outcome != Outcome::NONE)) {
+    } else if ((run.ended == RunEnd::NOT_SEEN || run.ended == RunEnd::EARLY) &&
+               !(run.mainHead && run.outcome != Outcome::NONE)) {
         run.failure = explainUnfinished(run);
     }
 }
@@ -471,11 +481,16 @@ OperatorView operatorView(const Run& run)
         return view;
     }
     if (run.outcome == Outcome::NONE) {
-        if (run.ledFailures == 0) {
+        if (run.failureShownByService) {
+            view.meaning = "FAILED: the updater ended before its outcome was known";
+            view.leds = {{"FAIL", "fail"}};
+            view.seen = "FAIL lit in fail colour; no sound";
+        } else if (run.ledFailures > 0) {
+            view.seen = "a panel that fails; no sound";
+        } else {
             view.leds = {{"any", "blue"}};
+            view.seen = "REMOTE and MAIN flashing blue in turn while it went on; no sound";
         }
-        view.seen = run.ledFailures == 0 ? "REMOTE and MAIN flashing blue in turn, or one of them left blue; no sound"
-                                         : "a panel that fails; no sound";
         return view;
     }
     if (run.outcome == Outcome::UNKNOWN_FAILURE) {

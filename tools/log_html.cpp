@@ -25,7 +25,7 @@ h1 { font-size: 1.3em; } h2 { font-size: 1.15em; margin-top: 2em; border-top: 2p
 table { border-collapse: collapse; } th { text-align: left; padding: .1em 1em .1em 0; font-weight: normal; color: #555; }
 .good { color: #176b2c; font-weight: bold; } .bad { color: #a31515; font-weight: bold; }
 .scale { display: flex; height: 14px; margin: 1em 0 .3em; border: 1px solid #888; }
-.scale div { min-width: 1px; }
+.scale div { min-width: 3px; box-sizing: border-box; border-right: 1px solid #fff; }
 .scroll { overflow-x: auto; }
 .lanes { display: grid; gap: 2px; margin: .4em 0 1em; font-size: 12px; min-width: max-content; }
 .lanes > * { padding: 3px 5px; background: #f1f1f1; overflow-wrap: anywhere; }
@@ -314,10 +314,8 @@ void writeProblem(const Run& run, const Problem& problem, const std::string& hea
         << html(problem.why) << "<br>\n<b>Do now:</b> " << html(problem.remedy) << '\n';
     if (step.said.count > 0) {
         out << "<pre>";
-        for (const std::vector<std::string>* part : {&step.said.first, &step.said.last}) {
-            for (const std::string& line : *part) {
-                out << html(line) << '\n';
-            }
+        for (const std::string& line : step.said.shown()) {
+            out << html(line) << '\n';
         }
         out << "</pre>\n";
     }

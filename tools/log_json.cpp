@@ -15,13 +15,7 @@ Json duration(std::int64_t start, const std::optional<std::int64_t>& end)
 
 Json linesToJson(const OtherLines& lines)
 {
-    Json shown = Json::array();
-    for (const std::vector<std::string>* part : {&lines.first, &lines.last}) {
-        for (const std::string& line : *part) {
-            shown.push_back(line);
-        }
-    }
-    return {{"count", lines.count}, {"shown", shown}};
+    return {{"count", lines.count}, {"shown", lines.shown()}};
 }
 
 const char* resultName(StepResult result)
@@ -90,6 +84,8 @@ const char* endName(RunEnd end)
         return "by-service-manager";
     case RunEnd::BY_ITSELF:
         return "by-itself";
+    case RunEnd::EARLY:
+        return "early";
     }
     return "";
 }

@@ -78,7 +78,7 @@ std::size_t indentationOf(std::string_view text)
 /// True for what a console may put in front of each line: a time, such as "[07:15:33.123] " or "[   12.345678] ".
 bool isConsolePrefix(std::string_view text)
 {
-    if (text.size() > longestPrefix || text.back() != ' ') {
+    if (text.empty() || text.size() > longestPrefix || text.back() != ' ') {
         return false;
     }
     for (std::size_t index = 1; index + 2 < text.size(); ++index) {
@@ -220,6 +220,9 @@ void LogParser::takeText(std::string_view line, std::size_t indentation)
             text = line.substr(tabs);
             indentation = 3;
         }
+    }
+    if (indentation == 0 && program.empty() && mPrefixLength > 0 && isConsolePrefix(line.substr(0, mPrefixLength))) {
+        text = line.substr(std::min(mPrefixLength, line.size()));
     }
     if (mHeadOpen && indentation != 0) {
         takeMessage(text.substr(indentation));

@@ -58,14 +58,7 @@ void printSteps(const Run& run, std::ostream& out)
 
 void printLines(const OtherLines& lines, std::ostream& out)
 {
-    for (const std::string& line : lines.first) {
-        out << "    | " << line << '\n';
-    }
-    const std::uint64_t shown = lines.first.size() + lines.last.size();
-    if (lines.count > shown) {
-        out << "    | ... (" << counted(lines.count - shown, "line") << " left out)\n";
-    }
-    for (const std::string& line : lines.last) {
+    for (const std::string& line : lines.shown()) {
         out << "    | " << line << '\n';
     }
 }
@@ -126,6 +119,9 @@ std::string resultText(const Step& step)
 std::string packageText(const Run& run)
 {
     const Step* check = run.find(StepKind::CHECK_PACKAGE);
+    if (check == nullptr && run.beginningMissing) {
+        return "not in this log";
+    }
     if (check == nullptr || !check->end) {
         return "not checked";
     }
@@ -149,6 +145,9 @@ std::string packageText(const Run& run)
 std::string boardText(const Run& run)
 {
     const Step* check = run.find(StepKind::CHECK_BOARD);
+    if (check == nullptr && run.beginningMissing) {
+        return "not in this log";
+    }
     if (check == nullptr || !check->end) {
         return "not checked";
     }

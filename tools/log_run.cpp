@@ -68,6 +68,17 @@ StepResult resultOf(long status)
     return status == 0 ? StepResult::DONE : StepResult::FAILED;
 }
 
+/// A command line without its -o options, whose values are always the same.
+std::string withoutOptions(std::string_view command)
+{
+    std::string text(command.substr(0, 2 * longestText));
+    for (std::size_t option = text.find(" -o "); option != std::string::npos; option = text.find(" -o ", option)) {
+        const std::size_t end = text.find(' ', option + 4);
+        text.erase(option, end == std::string::npos ? std::string::npos : end - option);
+    }
+    return text;
+}
+
 /// The decimal number at the start of `text`, if there is one.
 std::optional<long> leadingNumber(std::string_view text)
 {
@@ -100,13 +111,41 @@ bool splitVersions(std::string_view text, std::string_view separator, Versions& 
 void OtherLines::add(std::string_view text)
 {
     ++count;
-    if (first.size() < mostLinesAtEnds) {
-        first.push_back(kept(text));
-    } else if (last.size() < mostLinesAtEnds) {
-        last.push_back(kept(text));
-    } else {
-        last[static_cast<std::size_t>((count - 1) % mostLinesAtEnds)] = kept(text);
+    std::string line = kept(text);
+    OtherLine* previous = !last.empty() ? &last.back() : !first.empty() ? &first.back() : nullptr;
+    if (previous != nullptr && previous->text == line) {
+        ++previous->times;
+        return;
     }
+    if (first.size() < mostLinesAtEnds) {
+        first.push_back({std::move(line)});
+        return;
+    }
+    last.push_back({std::move(line)});
+    if (last.size() > mostLinesAtEnds) {
+        leftOut += last.front().times;
+        last.pop_front();
+    }
+}
+
+std::vector<std::string> OtherLines::shown() const
+{
+    std::vector<std::string> lines;
+    const auto show = [&](const OtherLine& line) {
+        lines.push_back(line.text + (line.times > 1 ? " (" + counted(line.times, "time") + ')' : ""));
+    };
+    std::for_each(first.begin(), first.end(), show);
+    if (leftOut > 0) {
+        lines.push_back("... (" + counted(leftOut, "line") + " left out)");
+    }
+    std::for_each(last.begin(), last.end(), show);
+    return lines;
+}
+
+bool OtherLines::contain(const std::string& part) const
+{
+    const auto holds = [&](const OtherLine& line) { return contains(line.text, part); };
+    return std::any_of(first.begin(), first.end(), holds) || std::any_of(last.begin(), last.end(), holds);
 }
 
 const Step* Run::find(StepKind kind) const
@@ -168,14 +207,17 @@ void RunBuilder::otherLine(std::uint64_t line, std::string_view program, std::st
     if (!mRun) {
         return;
     }
-    const std::string_view unit = "harl-updater.service: ";
-    const bool ofUnit = program == "systemd" || startsWith(program, "systemd[");
-    if (ofUnit && startsWith(text, "Start")) {
+    const bool manager = program == "systemd" || startsWith(text, "harl-updater.service: ");
+    if (manager && startsWith(text, "Start")) {
         return; // the next run's
     }
     mRun->lastLine = line;
-    if (ofUnit || startsWith(text, unit)) {
+    if (manager || startsWith(text, "give-back: ")) { // see package/service/give-back
         mRun->serviceManager.add(text);
+        mRun->failureShownByService = mRun->failureShownByService || contains(text, "before it showed an outcome");
+        if (mRun->ended == RunEnd::NOT_SEEN && (mRun->failureShownByService || contains(text, "Main process exited"))) {
+            mRun->ended = RunEnd::EARLY;
+        }
         return;
     }
     ++mRun->otherLines;
@@ -218,13 +260,6 @@ void RunBuilder::endRun(bool followedByAnother)
         return;
     }
     mRun->followedByAnother = followedByAnother;
-    for (Step& step : mRun->steps) {
-        OtherLines& said = step.said;
-        if (said.count > 2 * mostLinesAtEnds) {
-            const auto oldest = static_cast<std::ptrdiff_t>(said.count % mostLinesAtEnds);
-            std::rotate(said.last.begin(), said.last.begin() + oldest, said.last.end());
-        }
-    }
     mRunComplete(*mRun);
     mRun.reset();
 }
@@ -615,7 +650,7 @@ void RunBuilder::beginAction(const ParsedRecord& record, std::string_view text)
         return;
     }
     Action action;
-    action.text = kept(text);
+    action.text = kept(withoutOptions(text));
     action.start = record.time;
     mRun->steps.back().actions.push_back(std::move(action));
 }

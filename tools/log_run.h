@@ -3,6 +3,7 @@
 #include "log_parser.h"
 
 #include <cstdint>
+#include <deque>
 #include <functional>
 #include <optional>
 #include <string>
@@ -45,14 +46,27 @@ struct Action
     std::string status; ///< in plain words; empty when the log holds none
 };
 
-/// Lines of other programs: the first and the last few, each cut to a few hundred bytes.
+/// A line of another program, and how often it came in succession.
+struct OtherLine
+{
+    std::string text; ///< cut to a few hundred bytes, printable
+    std::uint64_t times = 1;
+};
+
+/// Lines of other programs: the first and the last few.
 struct OtherLines
 {
-    std::vector<std::string> first;
-    std::vector<std::string> last; ///< as a ring; in order once a run is handed over
+    std::vector<OtherLine> first;
+    std::deque<OtherLine> last;
     std::uint64_t count = 0;
+    std::uint64_t leftOut = 0; ///< between the first and the last
 
     void add(std::string_view text);
+
+    /// Text for people, a line each: "scp: Connection closed (20 times)".
+    std::vector<std::string> shown() const;
+
+    bool contain(const std::string& part) const;
 };
 
 struct Step
@@ -96,6 +110,7 @@ enum class RunEnd {
     NOT_SEEN,
     BY_SERVICE_MANAGER, ///< at the updater's own last command
     BY_ITSELF,          ///< not run as the service
+    EARLY,              ///< The service manager, or what it runs afterwards, says so.
 };
 
 /// What went wrong in a run and what to do about it.
@@ -134,7 +149,8 @@ struct Run
     std::uint64_t tornRecords = 0;
     std::uint64_t firstTornLine = 0;
     std::uint64_t otherLines = 0;
-    OtherLines serviceManager;
+    OtherLines serviceManager;          ///< its lines, and those of what it runs after the updater
+    bool failureShownByService = false; ///< LED_FAIL, lit after the updater had ended without an outcome
     std::string mainThread;
     std::string updateThread;
 

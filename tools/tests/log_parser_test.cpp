@@ -122,7 +122,8 @@ TEST(LogParser, JournalMayHideAMessage)
 TEST(LogParser, ConsolesPrefixIsTakenOff)
 {
     const std::string prefix = "[2026-11-21 07:35:33.123] ";
-    EXPECT_EQ(parsed(prefix + mirrors + prefix + "\t\t\tOK\n"), List{"record 1" + mirrorsEvent + "OK"});
+    EXPECT_EQ(parsed(prefix + mirrors + prefix + "\t\t\tOK\n" + prefix + "scp: gone\n"),
+              (List{"record 1" + mirrorsEvent + "OK", "other 3 [] scp: gone"}));
 }
 
 TEST(LogParser, OtherProgramsLinesCarryTheirName)

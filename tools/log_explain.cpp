@@ -74,6 +74,12 @@ const Hint* hintFor(const Step& step)
     return found == std::end(hints) ? nullptr : found;
 }
 
+/// Name of the package that `run` is about.
+std::string packageOf(const Run& run)
+{
+    return run.mainHead ? "solvik4-dh" : "solvik4-rh";
+}
+
 Problem problem(const Run& run, const Step& step, const char* name, std::string why, std::string remedy)
 {
     return {name, static_cast<std::size_t>(&step - run.steps.data()), std::move(why), std::move(remedy)};
@@ -100,15 +106,16 @@ Problem explainPackageCheck(const Run& run, const Step& step)
 {
     if (step.code && *step.code != 0) {
         return problem(run, step, "package-query-failed",
-                       "The package tool could not be asked for the versions of solvik4-rh.",
-                       "On the unit run: apt-cache policy solvik4-rh, mend what it names, then run the update again.");
+                       "The package tool could not be asked for the versions of " + packageOf(run) + ".",
+                       "On the unit run: apt-cache policy " + packageOf(run) +
+                           ", mend what it names, then run the update again.");
     }
-    return problem(
-        run, step, "package-unknown",
-        "The package tool named no installed or no candidate version: no package source of this unit holds "
-        "the package, its words are in another language than English, or the tool was killed.",
-        "On the unit run: apt-cache policy solvik4-rh. It must show \"Installed:\" and \"Candidate:\"; if not, "
-        "correct the package sources or the service's language, then run the update again.");
+    return problem(run, step, "package-unknown",
+                   "The package tool named no installed or no candidate version: no package source of this unit holds "
+                   "the package, its words are in another language than English, or the tool was killed.",
+                   "On the unit run: apt-cache policy " + packageOf(run) +
+                       ". It must show \"Installed:\" and \"Candidate:\"; if not, "
+                       "correct the package sources or the service's language, then run the update again.");
 }
 
 Problem explainPackageInstall(const Run& run, const Step& step)
@@ -117,13 +124,13 @@ Problem explainPackageInstall(const Run& run, const Step& step)
         return problem(run, step, "package-tool-missing", "The package tool apt is not on the service's search path.",
                        "Run harl-updater-tool unit and mend what it names.");
     }
-    return problem(
-        run, step, "package-install-failed",
-        "The package tool could not install the package: it could not be fetched, a script of it failed, or "
-        "it had a question that nobody could answer. It may be left half-configured, and the next update "
-        "would then take it for installed.",
-        "On the unit run: dpkg --configure -a, then apt install solvik4-rh, and mend what they name. Only then "
-        "run the update again.");
+    return problem(run, step, "package-install-failed",
+                   "The package tool could not install the package: it could not be fetched, a script of it failed, or "
+                   "it had a question that nobody could answer. It may be left half-configured, and the next update "
+                   "would then take it for installed.",
+                   "On the unit run: dpkg --configure -a, then apt install " + packageOf(run) +
+                       ", and mend what they name. Only then "
+                       "run the update again.");
 }
 
 Problem explainBoardCheck(const Run& run, const Step& step)
@@ -414,7 +421,8 @@ void addUntold(Run& run)
     if (install != nullptr && install->result == StepResult::DONE && !run.statusesLost) {
         untold(
             "Whether the package is really installed: exit code 0 also stands for a command that was killed or could "
-            "not be started. On the unit: dpkg -s solvik4-rh.");
+            "not be started. On the unit: dpkg -s " +
+            packageOf(run) + ".");
     }
     const Step* upload = run.find(StepKind::UPLOAD_BOARD);
     if (upload != nullptr && upload->failedAttempts > 0) {

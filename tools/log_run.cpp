@@ -557,6 +557,9 @@ void RunBuilder::takeTeamViewer(const ParsedRecord& record)
 void RunBuilder::takeFeedback(const ParsedRecord& record)
 {
     if (record.operation == "resultCallback" || record.operation == "errorCallback") {
+        if (mRun->mainHead) {
+            return; // a record of its own program: the procedure's records have told the outcome
+        }
         beginStep(StepKind::SHOW_OUTCOME, record);
         if (record.operation == "errorCallback") {
             mRun->outcome = mVerdict == Outcome::NONE ? Outcome::UNKNOWN_FAILURE : mVerdict;

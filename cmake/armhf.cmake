@@ -4,5 +4,6 @@ set(CMAKE_SYSTEM_PROCESSOR armv7l)
 set(CMAKE_C_COMPILER arm-linux-gnueabihf-gcc-11) # googletest asks for one
 set(CMAKE_CXX_COMPILER arm-linux-gnueabihf-g++-11)
 set(CMAKE_LIBRARY_ARCHITECTURE arm-linux-gnueabihf)
-set(CMAKE_CROSSCOMPILING_EMULATOR qemu-arm-static -L /usr/arm-linux-gnueabihf)
+find_program(QEMU_ARM qemu-arm-static REQUIRED)
+set(CMAKE_CROSSCOMPILING_EMULATOR ${QEMU_ARM} -L /usr/arm-linux-gnueabihf)
 set(CMAKE_FIND_ROOT_PATH_MODE_LIBRARY ONLY)

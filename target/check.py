@@ -1,5 +1,6 @@
-"""Compares what a scenario left with what must come out: all that the bench compares, and what only the target shows."""
+"""Compares what a scenario left with what must come out: all that the bench compares, and what only the unit shows."""
 
+import math
 import re
 
 from compare import differences
@@ -16,14 +17,14 @@ def panel_bytes(calls: list[Call]) -> list[int]:
     return [int(byte, 16) for call in calls for byte in re.findall(r"i2cset -y 0 0x07 (0x\w+) c", call.text)]
 
 
-def check_bus(outcome: Outcome) -> list[str]:
+def check_bus(plan: Plan, outcome: Outcome) -> list[str]:
     """The bytes on the bus must be those of the updater's commands, in their order; no pair is split."""
     run = outcome.result.run
     ended = panel_bytes([call for call in run.calls if call.end is not None])
     sent = outcome.sent
     if sent != outcome.asked:
         return [f"bus: {len(sent)} bytes that are not the {len(outcome.asked)} bytes the kernel was asked to send"]
-    if outcome.after["Result"] == "success":
+    if plan.settings["event"] in ("nothing", "power-cut"):
         if sent != ended:
             return [f"bus: {len(sent)} bytes that are not the {len(ended)} bytes of the commands"]
     elif sent[: len(ended)] != ended:  # what runs after the updater sends more
@@ -57,7 +58,7 @@ def check_sound(outcome: Outcome) -> list[str]:
 def check(plan: Plan, outcome: Outcome) -> list[str]:
     """One line for each difference; none when the run came out as `plan` says."""
     before, after = outcome.before, outcome.after
-    found = differences(plan.like, outcome.result) + check_bus(outcome) + check_sound(outcome)
+    found = differences(plan.like, outcome.result) + check_bus(plan, outcome) + check_sound(outcome)
 
     def same(what: str, expected: object, seen: object) -> None:
         if expected != seen:
@@ -70,7 +71,12 @@ def check(plan: Plan, outcome: Outcome) -> list[str]:
     same("harl-updater starts at boot", False, after["enabled"] == "enabled")
     same("harl was started again", True, int(after["harl_since"]) > int(before["harl_since"]))
     if plan.settings["script_seconds"]:
-        same("package's maintainer script", ["began", "ended"], outcome.package_script)
+        same("package's maintainer script", ["began", "ended"], list(outcome.package_script))
+        ended = outcome.package_script.get("ended", math.inf)
+        same("harl was started after the package's maintainer script", True, int(after["harl_since"]) / 1e6 > ended)
+    if plan.settings["event"] == "power-cut":
+        same("harl after the boot", "active", before["harl"])
+        same("package status after the boot", "half-configured", before["package_status"])
     return found
 
 

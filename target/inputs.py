@@ -13,7 +13,7 @@ from plan import Plan
 ROOT = Path(__file__).parent.parent
 RATE = 8000  # Hz, of both sounds; the loopback card takes it unchanged
 SOUND_SECONDS = 2
-# Each sound is a sweep, so that every piece of it is found nowhere else: its frequency at the beginning and the end, Hz.
+# Each sound is a sweep, so that every piece of it is found nowhere else: its first and its last frequency, Hz.
 SOUNDS = {"SND_RESULT_PASS.wav": (300, 900), "SND_RESULT_FAIL.wav": (1000, 1600)}
 BOARD_VERSION = "2.2.0"  # on the stick
 ARCHIVE_SIZE = 200_000  # bytes
@@ -43,8 +43,8 @@ def samples(name: str) -> bytes:
 def write_sound(file: Path) -> None:
     """Writes the sound file that `file` names."""
     data = samples(file.name)
-    header = struct.pack("<4sI8sIHHIIHH4sI", b"RIFF", 36 + len(data), b"WAVEfmt ", 16, 1, 1, RATE, 2 * RATE, 2, 16, b"data", len(data))
-    file.write_bytes(header + data)
+    header = struct.pack("<4sI8sIHHIIHH", b"RIFF", 36 + len(data), b"WAVEfmt ", 16, 1, 1, RATE, 2 * RATE, 2, 16)
+    file.write_bytes(header + struct.pack("<4sI", b"data", len(data)) + data)
 
 
 def write_package(folder: Path, version: str, seconds: int, depends: str) -> None:
@@ -53,12 +53,16 @@ def write_package(folder: Path, version: str, seconds: int, depends: str) -> Non
     (tree / "DEBIAN").mkdir(parents=True)
     (tree / "opt/solvik4").mkdir(parents=True)
     (tree / "opt/solvik4/version").write_text(version + "\n")
-    control = f"Package: solvik4-rh\nVersion: {version}\nArchitecture: armhf\nMaintainer: Target test <test@target.invalid>\n"
+    control = f"Package: solvik4-rh\nVersion: {version}\nArchitecture: armhf\n"
+    control += "Maintainer: Target test <test@target.invalid>\n"
     control += f"Depends: {depends}\n" if depends else ""
     (tree / "DEBIAN/control").write_text(control + "Description: instrument package of the target test\n")
     script = tree / "DEBIAN/postinst"
     if seconds:
-        script.write_text(f"#!/bin/sh\nset -e\necho began > /run/package-script\nsleep {seconds}\necho ended >> /run/package-script\n")
+        note = 'echo "{}" "$(cut -d " " -f 1 /proc/uptime)" >> /run/package-script'
+        # It goes on talking after its long work, to whoever listens then.
+        lines = ["#!/bin/sh", "set -e", note.format("began"), f"sleep {seconds}", "echo set up", note.format("ended")]
+        script.write_text("".join(f"{line}\n" for line in lines))
         script.chmod(0o755)
     run("dpkg-deb", "--root-owner-group", "-Zgzip", "--build", tree, folder)
     shutil.rmtree(tree)
@@ -93,7 +97,8 @@ def write_scenario(folder: Path, plan: Plan, updater: Path, speed: float, again:
     os.rename(folder / f"solvik4-rh_{unit['package']['installed']}_armhf.deb", folder / "installed.deb")
     write_package(repository, unit["package"]["offered"], plan.settings["script_seconds"], depends)
     with (repository / "Packages").open("w") as index:
-        subprocess.run(["dpkg-scanpackages", "--multiversion", "."], cwd=repository, stdout=index, stderr=subprocess.DEVNULL, check=True)
+        scan = ["dpkg-scanpackages", "--multiversion", "."]
+        subprocess.run(scan, cwd=repository, stdout=index, stderr=subprocess.PIPE, text=True, check=True)
     settings = {
         "mirrors": unit["mirrors"]["refresh"],
         "board_version": unit["board"]["installed"],
@@ -148,10 +153,13 @@ def write_head(folder: Path, image: Path) -> None:
 
 def build_recorder(library: Path) -> None:
     """Builds the bench's recorder of commands and waits for the unit."""
-    run("arm-linux-gnueabihf-g++-11", "-std=c++17", "-O2", "-shared", "-fPIC", "-o", library, ROOT / "bench/tap.cpp", "-ldl")
+    compiler = ["arm-linux-gnueabihf-g++-11", "-std=c++17", "-O2", "-shared", "-fPIC"]
+    run(*compiler, "-o", library, ROOT / "bench/tap.cpp", "-ldl")
 
 
-def write_input(disk: Path, folder: Path, image: Path, updater: Path, plans: list[Plan], speed: float, again: bool) -> None:
+def write_input(
+    disk: Path, folder: Path, image: Path, updater: Path, plans: list[Plan], speed: float, again: bool
+) -> None:
     """Writes the disk that brings `plans` into the unit. `again`: the run after a power cut."""
     shutil.rmtree(folder, ignore_errors=True)
     folder.mkdir()

@@ -22,7 +22,9 @@ def drive(name: str, file: Path, *options: str) -> list[str]:
     return ["-drive", ",".join(settings), "-device", f"virtio-blk-device,drive={name},serial={name}"]
 
 
-def boot(image: Path, disk: Path, inputs: Path, folder: Path, limit: float, keep: bool = False, cut: bool = False) -> None:
+def boot(
+    image: Path, disk: Path, inputs: Path, folder: Path, limit: float, keep: bool = False, cut: bool = False
+) -> None:
     """Boots `disk` and waits for the end; `folder` then holds the guest's results, `console` and `bus`, the I2C trace.
 
     @param image   folder with the kernel, the device tree and the initrd

@@ -1,28 +1,32 @@
-"""target/run: proves the updater's package on an emulated armhf unit: kernel, systemd, real tools, I2C bus, sound card."""
+"""target/run: proves the updater's package on an emulated armhf unit: kernel, systemd, real tools, I2C bus, sound."""
 
 import argparse
+import os
 import shutil
 import signal
 import subprocess
 import sys
 import time
 from pathlib import Path
+from typing import IO
 
 HERE = Path(__file__).parent
 ROOT = HERE.parent
 sys.path.insert(1, str(ROOT / "bench"))  # its scenarios, its panel and its comparison serve here too
 
-from check import check, check_cut  # noqa: E402
-from inputs import write_input  # noqa: E402
-from machine import MachineError, boot  # noqa: E402
-from outcome import Outcome, read, read_bus  # noqa: E402
-from panel import Panel  # noqa: E402
-from plan import Plan, PlanError, load, names  # noqa: E402
-from scenario import ScenarioError  # noqa: E402
+from check import check, check_cut
+from inputs import write_input
+from machine import MachineError, boot
+from outcome import Outcome, read, read_bus
+from panel import Panel
+from plan import Plan, PlanError, load, names
+from scenario import ScenarioError
 
 WORK = ROOT / "build/target"
+PACKAGED = ["CMakeLists.txt", "cmake", "common", "debian", "docs/man", "package", "remote"]  # what is in the package
 SPACE = 2000  # MiB, for disks and results
 SPEED = 300  # how many times shorter the updater's waits are
+TOOL_LIMIT = 3000  # s, to build the package or the image
 SCENARIO_LIMIT = 420  # s, for one scenario besides the updater's waits; guest/main gives up before that
 
 
@@ -30,22 +34,38 @@ class TargetError(Exception):
     """The test cannot be made on this machine; the text is one line that says what to do."""
 
 
+def run_tool(command: list[str | Path], output: int | IO[str], errors: IO[str] | None) -> str | None:
+    """Runs a long command; whatever ends this program ends it with all that it started.
+
+    Returns its output when that is a pipe, "" when not, and None when it failed. Raises TargetError.
+    """
+    with subprocess.Popen(command, stdout=output, stderr=errors, text=True, start_new_session=True) as tool:
+        try:
+            text, _ = tool.communicate(timeout=TOOL_LIMIT)
+        except subprocess.TimeoutExpired as error:
+            raise TargetError(f"{command[0]} took over {TOOL_LIMIT} s: try again on a less busy machine") from error
+        finally:
+            if tool.returncode is None:
+                os.killpg(tool.pid, signal.SIGTERM)
+    return (text or "") if tool.returncode == 0 else None
+
+
 def updater_package(given: Path | None) -> Path:
-    """The package to prove: the one that was given, or the one built from the checked-out commit. Raises TargetError."""
+    """The package to prove: the one that was given, or one built from the checked-out commit. Raises TargetError."""
     if given:
         if not given.is_file():
             raise TargetError(f"{given}: no such file; give a package of harl-updater for armhf")
         return given
     folder = ROOT / "build/package"
-    commit = subprocess.check_output(["git", "rev-parse", "HEAD"], cwd=ROOT, text=True)
-    built = WORK / "package-commit"
-    if not built.exists() or built.read_text() != commit or not list(folder.glob("harl-updater_*_armhf.deb")):
+    sources = subprocess.check_output(["git", "ls-tree", "HEAD", *PACKAGED], cwd=ROOT, text=True)
+    built = WORK / "package-sources"
+    if not built.exists() or built.read_text() != sources or not list(folder.glob("harl-updater_*_armhf.deb")):
         print("target: building the package", flush=True)
         log = WORK / "package.log"
         with log.open("w") as output:
-            if subprocess.run([ROOT / "package/build", "armhf"], stdout=output, stderr=output, check=False).returncode != 0:
+            if run_tool([ROOT / "package/build", "armhf"], output, output) is None:
                 raise TargetError(f"package/build armhf failed: see {log}")
-        built.write_text(commit)
+        built.write_text(sources)
     packages = sorted(folder.glob("harl-updater_*_armhf.deb"), key=lambda file: file.stat().st_mtime)
     if not packages:
         raise TargetError(f"{folder} holds no harl-updater_*_armhf.deb: package/build armhf makes it")
@@ -54,10 +74,10 @@ def updater_package(given: Path | None) -> Path:
 
 def make_image() -> Path:
     """The folder of the unit's disk and boot files, made when there is none yet. Raises TargetError."""
-    done = subprocess.run([HERE / "image", WORK / "cache"], stdout=subprocess.PIPE, text=True, check=False)
-    if done.returncode != 0:
+    folder = run_tool([HERE / "image", WORK / "cache"], subprocess.PIPE, None)
+    if folder is None:
         raise TargetError("no image of the unit, see above")
-    return Path(done.stdout.strip())
+    return Path(folder.strip())
 
 
 def time_limit(plans: list[Plan], speed: float) -> float:
@@ -74,7 +94,7 @@ def run_shared(plans: list[Plan], image: Path, updater: Path, speed: float) -> d
 
 
 def run_cut(plan: Plan, image: Path, updater: Path, speed: float) -> dict[str, tuple[Outcome, list[str]]]:
-    """Runs `plan` until it stops the machine hard, boots the same disk again and runs the next update. As run_shared."""
+    """Runs `plan` until it stops the machine hard, boots the same disk again and runs the update. As run_shared."""
     folder, inputs, disk = WORK / plan.name, WORK / "in.tar", WORK / "disk.ext4"
     subprocess.run(["cp", "--sparse=always", image / "root.ext4", disk], check=True)
     try:
@@ -149,7 +169,9 @@ def main() -> int:
     parser = argparse.ArgumentParser(prog="target/run", description=__doc__)
     parser.add_argument("scenario", nargs="*", help="default: all")
     parser.add_argument("--list", action="store_true", help="show all scenarios")
-    parser.add_argument("--full-length", action="store_true", help="keep every wait; 20 minutes for package-and-board, the default then")
+    parser.add_argument(
+        "--full-length", action="store_true", help="keep every wait; 20 minutes for package-and-board, the default then"
+    )
     parser.add_argument("--package", type=Path, help="default: built by package/build armhf", metavar="FILE")
     arguments = parser.parse_args()
     signal.signal(signal.SIGTERM, lambda *_: sys.exit(143))

@@ -29,11 +29,11 @@ class Outcome:
     before: dict[str, str]
     after: dict[str, str]
     identifiers: set[str]  # under which the updater's own records stand in the journal
-    package_script: list[str]  # "began", "ended"
+    package_script: dict[str, float]  # "began", "ended": when the package's maintainer script did, s since the boot
 
 
 def read_bus(trace: Path) -> list[list[int]]:
-    """The bytes sent over the bus, in parts: before the guest's first mark (a read), between its marks, after the last."""
+    """The bytes sent over the bus, in parts: before the guest's first mark (a read), between marks, after the last."""
     parts: list[list[int]] = [[]]
     for match in EVENT.finditer(trace.read_text()):
         if match["kind"] == "recv":
@@ -109,5 +109,7 @@ def read(folder: Path, sent: list[int]) -> Outcome:
         seconds=float(after["uptime"]) - float(before["uptime"]),
     )
     script = folder / "package-script"
+    lines = script.read_text().splitlines() if script.exists() else []
+    package_script = {line.split()[0]: float(line.split()[1]) for line in lines}
     asked = [int(write["byte"], 16) for write in writes]
-    return Outcome(result, asked, sent, before, after, identifiers, script.read_text().split() if script.exists() else [])
+    return Outcome(result, asked, sent, before, after, identifiers, package_script)

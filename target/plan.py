@@ -15,7 +15,7 @@ FOLDER = Path(__file__).parent / "scenarios"
 # What a file may say beside `summary`, `like` and `expect`: the default and what else is allowed.
 SETTINGS: dict[str, tuple[Any, Any]] = {
     # what befalls the updater while the package's maintainer script is at work
-    "event": ("nothing", ["nothing", "crash", "kill", "stop", "power-cut"]),
+    "event": ("nothing", ["nothing", "crash", "stop", "power-cut"]),
     "script_seconds": (0, int),  # that the package's maintainer script takes
     "needs_newer_updater": (False, bool),  # the offered package depends on a newer harl-updater, which is offered too
 }
@@ -79,7 +79,10 @@ def read(path: Path) -> Plan:
     # The journal drops blanks and carriage returns at the ends of lines.
     like.expect["log"] = "\n".join(re.sub(r"(\\r| )+$", "", line) for line in expected_log(like.expect["log"]))
     check_unit(path, like)
-    return Plan(path.stem, summary, like, merged(path, "", SETTINGS, content), merged(path, "expect.", EXPECT, expect))
+    settings = merged(path, "", SETTINGS, content)
+    if settings["event"] != "nothing" and settings["script_seconds"] < 1:
+        raise PlanError(f"{path}: script_seconds: must be 1 or more with event = {settings['event']!r}")
+    return Plan(path.stem, summary, like, settings, merged(path, "expect.", EXPECT, expect))
 
 
 def merged(path: Path, prefix: str, known: dict[str, tuple[Any, Any]], values: dict[str, Any]) -> dict[str, Any]:
@@ -100,6 +103,6 @@ def check_unit(path: Path, like: bench.Scenario) -> None:
     for section, values in like.unit.items():
         for key, value in values.items():
             if key not in SUPPORTED.get(section, []) and value != bench.UNIT[section][key][0]:
-                raise PlanError(f"{path}: like: the target test cannot make {section}.{key} = {value!r} of {like.name}")
+                raise PlanError(f"{path}: like: {like.name} has {section}.{key} = {value!r}, which cannot be made here")
     if like.unit["board"]["link"] not in ("up", "down"):
         raise PlanError(f"{path}: like: the target test knows a board link that is up or down, no other")

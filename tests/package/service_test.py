@@ -286,6 +286,23 @@ class Ends(ServiceTest):
         self.assert_given_back()
         self.assertEqual(self.panel(), {"FAIL": "fail"})
 
+    def test_installation_that_a_power_cut_left_behind_is_finished(self) -> None:
+        self.offer("touch /run/package-installs")
+        self.inside("dpkg", "--unpack", "/srv/repository/solvik4-rh_1.3.0.deb")
+        self.start()
+        self.wait_for_end()
+        self.assertTrue((self.unit.root() / "run/package-installs").exists())
+        self.assertEqual(self.package_state(), "install ok installed 1.3.0")
+        self.assertEqual(self.panel(), {"REMOTE": "pass", "MAIN": "pass"})  # up to date
+
+    def test_package_that_cannot_be_set_up_does_not_keep_the_updater(self) -> None:
+        self.offer("exit 1")
+        self.inside("dpkg", "--unpack", "/srv/repository/solvik4-rh_1.3.0.deb")
+        self.start()
+        self.wait_for_end()
+        self.assertEqual(self.ended_as(), ("success", "2", "15"))
+        self.assert_given_back()
+
     def test_upgrade_of_the_updater_in_its_own_run(self) -> None:
         self.inside("dpkg-deb", "--raw-extract", "/srv/updater.deb", "/srv/newer")
         self.inside("sed", "-i", "s/^Version: .*/Version: 9.0.0/", "/srv/newer/DEBIAN/control")

@@ -1,7 +1,7 @@
 """Usage: log_documents_test.py TOOL
 
-Compares the tables of docs/operator.md and docs/technician.md with the updater's code, and with what
-`harl-updater-tool log` says of the golden logs.
+Compares the tables of docs/operator.md and docs/technician.md, and those of the outcomes in the README and the manual
+page, with the updater's code, and with what `harl-updater-tool log` says of the golden logs.
 """
 
 import json
@@ -69,6 +69,13 @@ def pattern(leds: str) -> frozenset[tuple[str, str]]:
     return frozenset((led, lit[3]) for led in lit.groups()[:2] if led)
 
 
+def short_pattern(leds: str) -> frozenset[tuple[str, str]]:
+    """LEDs and colours of "remote and main, pass colour", or of "fail", which needs no colour."""
+    lit, _, color = leds.partition(", ")
+    return pattern(f"{lit.replace('remote', 'REMOTE').replace('main', 'MAIN')}, {color}" if color else
+                   f"{lit.upper()}, {lit} colour")
+
+
 def product_patterns() -> dict[str, tuple[frozenset[tuple[str, str]], str]]:
     """What the operator is shown and played for each report of the engine; none of those that light nothing."""
     found = {}
@@ -93,6 +100,16 @@ class Patterns(unittest.TestCase):
         self.assertEqual(set(shown), set(MEANINGS))
         for report, view in shown.items():
             self.assertIn(MEANINGS[report], told[view], report)
+
+    def test_readme_and_manual_page_say_the_same(self) -> None:
+        rows = table(OPERATOR, "LEDs", "Sound", "What it means", "What you do")
+        expected = {(pattern(leds), sound, meaning) for leds, sound, meaning, _ in rows}
+        readme = table((ROOT / "README.md").read_text(), "LEDs", "Sound", "Outcome")
+        self.assertEqual({(short_pattern(leds), *rest) for leds, *rest in readme},
+                         {row for row in expected if row[:2] != BY_SERVICE})
+        manual = (ROOT / "docs/man/harl-updater.8").read_text().partition("\n_\n")[2].partition("\n.TE")[0]
+        told = [line.split("\t") for line in re.sub(r"T{\n(.*)\nT}", r"\1", manual).splitlines()]
+        self.assertEqual({(short_pattern(leds), *rest) for leds, *rest in told}, expected)
 
     def test_technician_has_each_report_with_its_pattern(self) -> None:
         shown = product_patterns()

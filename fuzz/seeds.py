@@ -1,9 +1,11 @@
 """Usage: seeds.py FOLDER
 
-Writes the fuzzers' first inputs: what the tools print in each of the bench's scenarios.
+Writes the fuzzers' first inputs: what the tools print in each of the bench's scenarios, its sticks, and some archives.
 """
 
+import io
 import sys
+import zipfile
 from pathlib import Path
 
 sys.path.insert(0, str(Path(__file__).parents[1] / "bench"))
@@ -43,13 +45,69 @@ def teamviewer_seed(unit: dict[str, dict[str, object]]) -> str:
     return {"absent": "2", "file": "0" + MARKER, "directory": "0", "unreadable": "1"}[str(unit["stick"]["teamviewer"])]
 
 
+BOARD_FOLDER = "debs/QUORB/armhf"
+FIT_STICK = (
+    f"ddebs\x1eddebs/QUORB\x1ed{BOARD_FOLDER}\x1ed{BOARD_FOLDER}/quorb2.2.0\x1ez{BOARD_FOLDER}/quorb2.2.0/OSUpgrade.zip"
+    f"\x1ex{BOARD_FOLDER}/quorb2.2.0/unzipUpgrade.sh\x1f#!/bin/sh\nexit 0\n"
+)
+# What else can lie on a stick that the bench has not.
+ODD_STICKS = {
+    "hidden": f"{FIT_STICK}\x1ef{BOARD_FOLDER}/.hidden",
+    "hidden-folder": FIT_STICK.replace("quorb2", ".quorb2"),
+    "file-before": f"{FIT_STICK}\x1ef{BOARD_FOLDER}/README",
+    "file-behind": f"{FIT_STICK}\x1ef{BOARD_FOLDER}/zero",
+    "line-break": FIT_STICK.replace("2.2.0", "2.2.0\nnext"),
+    "lower-case": FIT_STICK.replace("OSUpgrade", "osupgrade"),
+    "link-inside": FIT_STICK.replace("/quorb2", "/.quorb2") + f"\x1el{BOARD_FOLDER}/quorb2.2.0\x1f.quorb2.2.0",
+    "link-outside": f"{FIT_STICK}\x1el{BOARD_FOLDER}/aaaaa1\x1f../../../..",
+    "link-in-place": FIT_STICK.replace("/OSUpgrade.zip", "/kept.zip")
+    + f"\x1el{BOARD_FOLDER}/quorb2.2.0/OSUpgrade.zip\x1fkept.zip",
+    "pipe": FIT_STICK.replace(f"\x1ez{BOARD_FOLDER}", f"\x1ep{BOARD_FOLDER}"),
+    "no-run-bit": FIT_STICK.replace("\x1ex", "\x1ef"),
+    "windows-lines": FIT_STICK.replace("\n", "\r\n"),
+}
+
+
+def stick_seed(unit: dict[str, dict[str, object]]) -> str:
+    """The names on the stick."""
+    stick = unit["stick"]
+    if not stick["inserted"]:
+        return ""
+    directories = stick["directories"]
+    assert isinstance(directories, list)
+    names = "\x1e".join([FIT_STICK.replace("quorb2.2.0", directory) for directory in directories] or ["ddebs"])
+    marker = {"absent": "", "directory": "\x1eddebs/installTV"}
+    return names + marker.get(str(stick["teamviewer"]), "\x1efdebs/installTV")
+
+
+def archive_seeds() -> dict[str, bytes]:
+    """Intact archives of every kind that is tested, on a sound medium."""
+    seeds = {}
+    for method in (zipfile.ZIP_STORED, zipfile.ZIP_DEFLATED, zipfile.ZIP_BZIP2):
+        file = io.BytesIO()
+        with zipfile.ZipFile(file, "w", method) as archive:
+            archive.writestr("folder/", "")
+            archive.writestr("folder/version.txt", "Brimvale\t2.2.0\r\n" * 20)
+            with archive.open("zip64", "w", force_zip64=True) as entry:
+                entry.write(b"x" * 100)
+            archive.comment = b"comment"
+        seeds[f"method-{method}"] = b"\xff" + file.getvalue()
+    return seeds
+
+
 def main() -> None:
     """The command."""
-    for target, seed in {"package": package_seed, "board": board_seed, "teamviewer": teamviewer_seed}.items():
+    readable = {"package": package_seed, "board": board_seed, "teamviewer": teamviewer_seed, "stick": stick_seed}
+    (Path(sys.argv[1]) / "archive").mkdir(parents=True, exist_ok=True)
+    for target, seed in readable.items():
         folder = Path(sys.argv[1]) / target
         folder.mkdir(parents=True, exist_ok=True)
         for name in scenario.names():
             (folder / name).write_bytes(seed(scenario.load(name).unit).encode())
+    for name, content in archive_seeds().items():
+        (Path(sys.argv[1]) / "archive" / name).write_bytes(content)
+    for name, odd in ODD_STICKS.items():
+        (Path(sys.argv[1]) / "stick" / name).write_bytes(odd.encode())
 
 
 main()

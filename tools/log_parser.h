@@ -76,7 +76,6 @@ private:
     std::string mHeadText;
     std::size_t mPrefixLength = 0; // bytes in front of the head
     bool mHeadOpen = false;
-    bool mHeadTorn = false;
 
     std::string mDate; // of the last head, and the time its day began
     std::int64_t mMidnight = 0;

@@ -1,0 +1,74 @@
+/// The check of the stick's archive against the zip library's own reading. Input: a byte that tells how much of the
+/// medium can be read, in 256ths (255: all of it), then the archive.
+
+#include "Input.h"
+#include "Printable.h"
+#include "stick_archive.h"
+
+#include <cstdio>
+#include <cstring>
+
+#include <minizip/unzip.h>
+
+namespace
+{
+
+const std::uint64_t mostUnpacked = 1'000'000; // bytes
+const std::size_t buffers = 200'000;          // bytes that the check may read beyond it
+
+/// True when the zip library reads every entry to its end and finds its checksum right.
+bool libraryReadsAll(const std::string& bytes)
+{
+    zlib_filefunc64_def functions = {};
+    fill_fopen64_filefunc(&functions);
+    functions.zopen64_file = [](voidpf, const void* archive, int) -> voidpf {
+        const auto& text = *static_cast<const std::string*>(archive);
+        return fmemopen(const_cast<char*>(text.data()), text.size(), "rb");
+    };
+    unzFile archive = unzOpen2_64(&bytes, &functions);
+    bool good = archive != nullptr;
+    int status = good ? unzGoToFirstFile(archive) : UNZ_OK;
+    for (; good && status == UNZ_OK; status = unzGoToNextFile(archive)) {
+        char buffer[4096];
+        int count = 0;
+        good = unzOpenCurrentFile(archive) == UNZ_OK;
+        while (good && (count = unzReadCurrentFile(archive, buffer, sizeof buffer)) > 0) {
+        }
+        good = good && count == 0 && unzCloseCurrentFile(archive) == UNZ_OK;
+    }
+    if (archive != nullptr) {
+        unzClose(archive);
+    }
+    return good && status == UNZ_END_OF_LIST_OF_FILE;
+}
+
+} // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size)
+{
+    if (size < 2) {
+        return 0;
+    }
+    const std::string archive(reinterpret_cast<const char*>(data) + 1, size - 1);
+    const std::size_t readable = data[0] == 255 ? archive.size() : archive.size() * data[0] / 256;
+    const auto read = [&](std::uint64_t offset, char* buffer, std::size_t length) {
+        const auto from = static_cast<std::size_t>(offset);
+        expect(from <= archive.size() && length <= archive.size() - from, "reads within the archive");
+        const std::size_t count = from < readable ? std::min(length, readable - from) : 0;
+        std::memcpy(buffer, archive.data() + from, count);
+        return count;
+    };
+    Report report("stick", "An archive");
+    checkArchive({archive.size(), read}, "\"OSUpgrade.zip\"", report, mostUnpacked);
+
+    expectPrintable(report);
+    const nlohmann::ordered_json facts = report.toJson()["facts"];
+    if (facts.contains("archive_unpacked_bytes")) {
+        expect(facts["archive_unpacked_bytes"].get<std::uint64_t>() <= mostUnpacked + buffers, "work is bounded");
+    }
+    if (report.status() == Report::STATUS_FIT) {
+        expect(readable == archive.size(), "a damaged medium is not fit");
+        expect(libraryReadsAll(archive), "what is fit can be unpacked");
+    }
+    return 0;
+}

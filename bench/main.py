@@ -10,7 +10,7 @@ from pathlib import Path
 import scenario
 from compare import differences
 from display import PlainDisplay, print_outcome
-from session import UnitMaker, run_on, temporary_folder
+from session import KINDS, UnitMaker, run_on, temporary_folder
 from table import run_all
 from unit import UnitError
 
@@ -23,13 +23,16 @@ TARGETS = ["harl-updater", "main-head-driver", "tap", "i2c_bus"]
 
 def build() -> None:
     """Brings the updater and the bench's own programs up to date. Says nothing unless something fails."""
-    if subprocess.run(["scripts/install-packages", *PACKAGES], cwd=ROOT, stdout=sys.stderr, check=False).returncode != 0:
+    install = ["scripts/install-packages", *PACKAGES]
+    if subprocess.run(install, cwd=ROOT, stdout=sys.stderr, check=False).returncode != 0:
         sys.exit(1)
     for command in (
         ["cmake", "--preset", "default"],
         ["cmake", "--build", "--preset", "default", "--target", *TARGETS],
     ):
-        done = subprocess.run(command, cwd=ROOT, stdout=subprocess.PIPE, stderr=subprocess.STDOUT, text=True, check=False)
+        done = subprocess.run(
+            command, cwd=ROOT, stdout=subprocess.PIPE, stderr=subprocess.STDOUT, text=True, check=False
+        )
         if done.returncode != 0:
             sys.exit(f"{done.stdout}bench: {' '.join(command)} failed with status {done.returncode}")
 
@@ -58,15 +61,22 @@ def arguments() -> argparse.Namespace:
     )
     parser.add_argument(
         "--unit",
-        choices=["best", "real", "stand-in"],
+        choices=KINDS,
         default="best",
         help="the real tools or stand-ins for all of them (default: the real ones where this machine allows it)",
     )
     parser.add_argument(
-        "--speed", type=float, default=300, metavar="N", help="shorten the updater's waits N times (default: %(default)s)"
+        "--speed",
+        type=float,
+        default=300,
+        metavar="N",
+        help="shorten the updater's waits N times (default: %(default)s)",
     )
     parser.add_argument(
-        "--build", type=Path, metavar="FOLDER", help="use the build in FOLDER as it is (default: build/default, built first)"
+        "--build",
+        type=Path,
+        metavar="FOLDER",
+        help="use the build in FOLDER as it is (default: build/default, built first)",
     )
     parser.add_argument("--full-length", action="store_true", help="keep every wait: up to 14 minutes")
     given = parser.parse_args()

@@ -93,7 +93,8 @@ class Run:
 
     def commands(self) -> list[Call]:
         """All commands but those of the panel and the sound, in order."""
-        return [call for call in self.calls if call.call != "nanosleep" and not call.text.startswith(("i2cset ", "aplay "))]
+        apart = ("i2cset ", "aplay ")
+        return [call for call in self.calls if call.call != "nanosleep" and not call.text.startswith(apart)]
 
     def waits(self) -> list[Call]:
         """The waits, in order, those of the flashing thread left out."""

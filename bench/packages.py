@@ -56,6 +56,7 @@ def _build(name: str, version: str, scripts: str, work: Path) -> None:
         if path.is_dir():
             path.chmod(0o755)
     repository = work / "repository"
-    subprocess.run(["dpkg-deb", "--root-owner-group", "--build", tree, repository], check=True, stdout=subprocess.DEVNULL)
+    build = ["dpkg-deb", "--root-owner-group", "--build", tree, repository]
+    subprocess.run(build, check=True, stdout=subprocess.DEVNULL)
     with (repository / "Packages").open("wb") as index:
         subprocess.run(["dpkg-scanpackages", "."], cwd=repository, check=True, stdout=index, stderr=subprocess.DEVNULL)

@@ -1,4 +1,4 @@
-"""Scenario files: what a unit is like before an update, and what must come out. CONTRIBUTING.md tells how to add one."""
+"""Scenario files: what a unit is like before an update, and what must come out. docs/bench.md tells how to add one."""
 
 import re
 import tomllib
@@ -68,9 +68,9 @@ EXPECT: dict[str, Any] = {
     "sound": ["", "pass", "fail"],  # the one sound that was played to its end
     "commands": list,  # all but the panel's and the sound's, in order: names of COMMANDS, " x20" behind one repeats it
     "waits": list,  # s, in order, those of the flashing thread left out
-    # of the update's thread, a line each: the operation's name, a colon, the message. "(name ...)" stands for a block of
-    # compare.py, "(N more)" repeats the line above, "{name}" stands for a command of COMMANDS, "..." for any records, and
-    # at a line's end for any rest of it.
+    # of the update's thread, a line each: the operation's name, a colon, the message. "(name ...)" stands for a block
+    # of compare.py, "(N more)" repeats the line above, "{name}" is a command of COMMANDS, "..." for any records,
+    # and at a line's end for any rest of it.
     "log": str,
     "package": str,
     "board": str,
@@ -197,7 +197,7 @@ def read(path: Path) -> Scenario:
 
 
 def _line_of(text: str, name: str) -> int:
-    """The number of the line with the key or section `name`, such as "board.link"; of its section when it is missing."""
+    """The number of the line with the key or section `name`, such as "board.link"; otherwise of its section."""
     section, _, key = name.rpartition(".")
     found, inside = 1, ""
     for number, line in enumerate(text.splitlines(), 1):

@@ -1,6 +1,7 @@
 """Runs a scenario once, on the best unit that this machine can make, and leaves nothing behind."""
 
 import contextlib
+import os
 import subprocess
 import tempfile
 import time
@@ -8,20 +9,27 @@ from collections.abc import Callable, Iterator
 from dataclasses import dataclass
 from pathlib import Path
 
+import systemd
 from observe import Run, now
 from scenario import Scenario
 from unit import State, Unit, UnitError
 from unit_real import RealUnit, forbidden
 from unit_standin import StandInUnit
 
+# best: real where this machine allows it. real: with systemd where this machine allows that.
+KINDS = ["best", "real", "real-without-systemd", "stand-in"]
 POLL = 0.02  # s
 LONGEST_RUN = 120  # s, besides the waits; a run that takes longer hangs
 WAITS = 820  # s, of an update at full length
 # Reads until its owner has ended, then clears away what still runs and lies there.
 GUARD = """
 read -r _
-for _ in 1 2 3 4 5; do
+for _ in $(seq 50); do
     read -r pid <"$0/unit.pid" && kill -s KILL -- "-$pid"
+    if read -r group <"$0/control-group"; then
+        find "$group" -depth -type d -exec rmdir {} +
+        [ ! -e "$group" ] || { sleep 0.2; continue; }
+    fi
     rm -rf "$0" && exit
     sleep 0.2
 done
@@ -36,18 +44,23 @@ class Result:
     state: State
     status: int
     seconds: float
+    log_is_exact: bool  # see Unit
 
 
 @contextlib.contextmanager
 def temporary_folder() -> Iterator[Path]:
     """A folder that goes with this process, in whatever way the process ends, and with it the updater."""
     folder = tempfile.mkdtemp(prefix="bench-")
-    guard = subprocess.Popen(
-        ["/bin/sh", "-c", GUARD, folder],
-        stdin=subprocess.PIPE,
-        stderr=subprocess.DEVNULL,
-        start_new_session=True,
-    )
+    try:
+        guard = subprocess.Popen(
+            ["/bin/sh", "-c", GUARD, folder],
+            stdin=subprocess.PIPE,
+            stderr=subprocess.DEVNULL,
+            start_new_session=True,
+        )
+    except OSError:
+        os.rmdir(folder)
+        raise
     try:
         yield Path(folder)
     finally:
@@ -62,14 +75,14 @@ class NotServed(UnitError):
 
 @dataclass
 class UnitMaker:
-    """Makes units of one kind: "real", "stand-in", or "best", which is real where this machine allows it."""
+    """Makes units of one of the KINDS."""
 
     kind: str
     speed: float
     build: Path  # folder of the programs
 
     def make(self, scenario: Scenario, folder: Path) -> Unit:
-        """A unit for `scenario` in the empty `folder`. Raises UnitError, NotServed when another kind of unit can do it."""
+        """A unit for `scenario` in the empty `folder`. Raises UnitError; NotServed when another kind can do it."""
         unit = self._make(scenario, folder)
         if scenario.only not in ("", unit.kind):
             raise NotServed(f"{scenario.name} needs the {scenario.only} unit")
@@ -77,10 +90,11 @@ class UnitMaker:
 
     def _make(self, scenario: Scenario, folder: Path) -> Unit:
         reason = forbidden() if self.kind != "stand-in" else ""
-        if reason and self.kind == "real":
+        if reason and self.kind.startswith("real"):
             raise UnitError(f"no real unit on this machine, it forbids namespaces: {reason}. Use --unit stand-in.")
         if not reason and self.kind != "stand-in":
-            return RealUnit(scenario, folder, self.speed, self.build)
+            no_systemd = "as asked for" if self.kind == "real-without-systemd" else systemd.obstacle()
+            return RealUnit(scenario, folder, self.speed, self.build, no_systemd)
         unit = StandInUnit(scenario, folder, self.speed, self.build)
         unit.name += f" (this machine forbids namespaces: {reason})" if reason else ""
         return unit
@@ -98,6 +112,6 @@ def run_on(unit: Unit, show: Callable[[Run, str], None], speed: float) -> Result
                 raise UnitError(f"the updater still runs after {now() - begin:.0f} s: ended")
             time.sleep(POLL)
         show(seen, seen.update())
-        return Result(seen, unit.state(), status, now() - begin)
+        return Result(seen, unit.state(), status, now() - begin, unit.log_is_exact)
     finally:
         unit.close()

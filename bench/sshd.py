@@ -40,7 +40,8 @@ def _fetch(target: Path) -> None:
         work = Path(name)
         (work / "files/sbin").mkdir(parents=True)
         (work / "files/lib").mkdir()
-        fetched = subprocess.run(["apt-get", "download", *PACKAGES], cwd=work, capture_output=True, text=True, check=False)
+        download = ["apt-get", "download", *PACKAGES]
+        fetched = subprocess.run(download, cwd=work, capture_output=True, text=True, check=False)
         if fetched.returncode != 0:
             reason = (fetched.stderr.strip().splitlines() or ["no reason given"])[-1]
             raise UnitError(

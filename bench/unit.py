@@ -22,7 +22,7 @@ class State:
 
 @dataclass
 class Files:
-    """Where a unit writes what happens, each file appended to while the updater runs. The bench reads them as they grow.
+    """Where a unit writes what happens, each file appended to while the updater runs and read as it grows.
 
     `log`: the updater's standard output.
     `calls`: what bench/tap.c, preloaded into the updater alone, writes: one line for each start and each end of a
@@ -42,15 +42,15 @@ class UnitError(Exception):
 class Unit(Protocol):
     """A head with its board, stick and panel as a scenario describes them, in which the updater runs once.
 
-    `__init__(scenario, folder, speed, build)` only keeps its arguments: the scenario, an empty folder for everything the
-    unit needs, how many times faster the updater's own clock and waits run (1: full length), and the folder of the
-    programs. The rest of the bench calls
-    `start`, then `ended` and `state` again and again, and `close` in any case.
+    `__init__(scenario, folder, speed, build)` only keeps its arguments: the scenario, an empty folder for everything
+    the unit needs, how many times faster the updater's own clock and waits run (1: full length), and the folder of the
+    programs. The rest of the bench calls `start`, then `ended` and `state` again and again, and `close` in any case.
     """
 
     kind: str  # "real" or "stand-in"
     name: str  # one line for the output: what is real and what is a stand-in
     files: Files
+    log_is_exact: bool  # False: blanks at the ends of the log's lines are lost
 
     def start(self) -> None:
         """Makes the unit and starts the updater. Raises UnitError."""

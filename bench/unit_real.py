@@ -1,7 +1,7 @@
 """The real unit: a head and a board with the real tools, in namespaces of their own on this machine.
 
-Nothing of it is on the host but one temporary folder: the roots lie in a tmpfs, the network in namespaces, and all of it
-ends with its first process.
+Nothing of it is on the host but one temporary folder: the roots lie in a tmpfs, the network in namespaces, and all of
+it ends with its first process.
 """
 
 import contextlib
@@ -15,12 +15,13 @@ import wave
 from pathlib import Path
 
 import sshd
+import systemd
 from scenario import Scenario, variables
 from unit import PROGRAMS, Files, State, UnitError, with_pid_file
-from unit_real_files import HERE, SEARCH_PATH, SOUND_LENGTH, SOUNDS, head_package, write_board, write_head, write_stick
+from unit_real_files import HERE, SOUND_LENGTH, SOUNDS, head_package, search_path, write_board, write_head, write_stick
 
-NAMESPACES = ["unshare", "--map-root-user", "--mount", "--net", "--ipc", "--uts"]
-NAMESPACES += ["--pid", "--fork", "--kill-child", "--mount-proc"]
+NAMESPACES = ["unshare", "--mount", "--net", "--ipc", "--uts", "--pid", "--fork", "--kill-child", "--mount-proc"]
+ONE_USER = "--map-root-user"  # needs no right of root's; systemd does
 # Everything that unit.sh does and a machine may forbid.
 PROBE = (
     "mount -t tmpfs probe /tmp && ip link add name probe0 type veth peer name probe1"
@@ -31,7 +32,7 @@ LONGEST_SETUP = 60  # s
 
 def forbidden() -> str:
     """Why this machine cannot have a real unit; "" when it can."""
-    probe = subprocess.run([*NAMESPACES, "sh", "-c", PROBE], capture_output=True, text=True, check=False)
+    probe = subprocess.run([*NAMESPACES, ONE_USER, "sh", "-c", PROBE], capture_output=True, text=True, check=False)
     return "" if probe.returncode == 0 else (probe.stderr.strip().splitlines() or ["no reason given"])[-1]
 
 
@@ -39,29 +40,41 @@ class RealUnit:
     """A unit (see unit.py) made of real tools."""
 
     kind = "real"
-    name = "real tools; a stand-in for systemctl"
 
-    def __init__(self, scenario: Scenario, folder: Path, speed: float, build: Path) -> None:
+    def __init__(self, scenario: Scenario, folder: Path, speed: float, build: Path, no_systemd: str) -> None:
+        self.name = "real tools and systemd"
+        if no_systemd:
+            self.name = f"real tools, but a stand-in for systemd: {no_systemd}"
+        self.log_is_exact = bool(no_systemd)
+        self._has_systemd = not no_systemd
         self._settings = scenario.unit
         self._folder = folder
         self._speed = speed
         self._build = build
         self._namespaces: subprocess.Popen[bytes] | None = None
         self._out = folder / "out"
+        self._control_group: Path | None = None
         self.files = Files(log=self._out / "log", calls=self._out / "calls", panel=self._out / "panel")
+        self._journal = systemd.Journal(self._out / "journal", self.files.log)
 
     def start(self) -> None:
         """Makes the unit and starts the updater. Raises UnitError."""
         server = sshd.find(self._build / "bench")
         for name in ("out", "unit"):
             (self._folder / name).mkdir()
-        write_head(self._folder / "head", self._settings, self._build / "bench/packages")
+        if self._has_systemd:
+            self._control_group = systemd.make_control_group(self._folder)
+        write_head(self._folder / "head", self._settings, self._build / "bench/packages", self._has_systemd)
         write_board(self._folder / "board", self._settings, self._folder / "head")
         write_stick(self._folder / "stick", self._settings)
-        self._add_programs(server)
+        command = self._add_programs()
+        if self._has_systemd:
+            systemd.write_services(self._folder / "head", self._settings, command)
+        self._write_variables(server, command)
+        users = [] if self._has_systemd else [ONE_USER]
         with (self._out / "setup").open("wb") as messages:
             self._namespaces = subprocess.Popen(
-                with_pid_file(self._folder, [*NAMESPACES, HERE / "unit.sh", self._folder]),
+                with_pid_file(self._folder, [*NAMESPACES, *users, HERE / "unit.sh", self._folder]),
                 stdin=subprocess.DEVNULL,
                 stdout=messages,
                 stderr=messages,
@@ -76,22 +89,27 @@ class RealUnit:
 
     def ended(self) -> int | None:
         """None while the updater runs, then its status."""
-        if (self._out / "status").exists():
-            return int((self._out / "status").read_text())
-        self._check_alive()
-        return None
+        if self._has_systemd:
+            self._journal.update()
+            ended = self._journal.ended
+        else:
+            ended = (self._out / "status").read_text() if (self._out / "status").exists() else ""
+        if not ended:
+            self._check_alive()
+            return None
+        how, value = ended.split()
+        return int(value) if how == "exited" else -signal.Signals[f"SIG{value}"]
 
     def state(self) -> State:
         """The unit as it is now."""
         head, board = self._root() / "head", self._root() / "board"
         stick = f"{self._folder}/unit/head/root/USB_MOUNT "
-        known = self._settings["head"]["harl"] == "known"
         return State(
             package=self._package_version(head / "var/lib/dpkg/status"),
             board=_board_version(board / "root/App/AppExe/version.txt"),
             marker=(head / "root/RESOURCES/tavren1stboot").exists(),
             stick=stick in Path(f"/proc/{self._first_process()}/mountinfo").read_text(),
-            harl=(head / "run/harl").read_text().strip() if known else "unknown",
+            harl=self._harl_state(),
             sounds=self._sounds_played(),
         )
 
@@ -105,26 +123,45 @@ class RealUnit:
         self._namespaces.kill()
         self._namespaces.wait()
         self._namespaces = None
+        if self._control_group:
+            systemd.remove_control_group(self._control_group)
 
-    def _add_programs(self, server: sshd.Server) -> None:
+    def _add_programs(self) -> str:
+        """Puts the programs on the head. Returns the command that runs the updater there."""
         program = PROGRAMS[self._settings["updater"]["program"]]
         for file in (program, "bench/tap.so", "bench/i2c_bus.so"):
             shutil.copy(self._build / file, self._folder / "head/opt/bench")
+        words = ["/usr/bin/env", "-i"]
+        if self._settings["updater"]["children"] == "ignored":
+            words.append("--ignore-signal=CHLD")
+        words += ["HOME=/root", "LANG=C.UTF-8", f"PATH={search_path(self._settings)}", "LD_PRELOAD=/opt/bench/tap.so"]
+        words += ["BENCH_CALLS=/opt/bench/out/calls", f"BENCH_SPEED={self._speed}"]
+        if self._settings["head"]["panel"] == "present":
+            words.append("BENCH_PANEL=/opt/bench/out/panel")
+        return " ".join([*words, f"/opt/bench/{program.name}", *self._settings["updater"]["arguments"]])
+
+    def _write_variables(self, server: sshd.Server, command: str) -> None:
         if server.files:
             shutil.copytree(server.files, self._folder / "board/opt/bench", dirs_exist_ok=True)
-        missing = self._settings["tools"]["missing"]
         values = variables(self._settings) | {
+            "BENCH_COMMAND": command,
+            "BENCH_CONTROL_GROUP": str(self._control_group or ""),
             "BENCH_PACKAGE": head_package(self._settings),
-            "BENCH_PATH": "/opt/bench/tools" if missing else SEARCH_PATH,
-            "BENCH_PROGRAM": program.name,
-            "BENCH_SPEED": str(self._speed),
+            "BENCH_SERVICE": systemd.updater_service(self._settings),
+            "BENCH_SFTP_SERVER": server.sftp_server,
             "BENCH_SOUND_LENGTH": f"{SOUND_LENGTH / self._speed:.3f}",
             "BENCH_SSHD": server.sshd,
-            "BENCH_SFTP_SERVER": server.sftp_server,
         }
         text = "".join(f"{name}={shlex.quote(value)}\n" for name, value in values.items())
         for folder in (self._folder, self._folder / "head/opt/bench", self._folder / "board/opt/bench"):
             (folder / "variables").write_text(text)
+
+    def _harl_state(self) -> str:
+        if self._settings["head"]["harl"] == "unknown":
+            return "unknown"
+        if self._control_group:
+            return "active" if systemd.service_active(self._control_group, "harl") else "inactive"
+        return (self._root() / "head/run/harl").read_text().strip()
 
     def _check_alive(self) -> None:
         assert self._namespaces

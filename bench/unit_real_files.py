@@ -14,7 +14,6 @@ from packages import package
 
 HERE = Path(__file__).parent / "unit_real"
 TOOLS = ["systemctl", "umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp", "i2cset", "aplay"]
-SEARCH_PATH = "/opt/bench/bin:/usr/sbin:/usr/bin:/sbin:/bin"
 SOUNDS = {"SND_RESULT_PASS.wav": 880, "SND_RESULT_FAIL.wav": 220}  # Hz
 SOUND_LENGTH = 1.5  # s
 ARCHIVE_PAYLOAD = 200_000  # bytes; more than a full board has left
@@ -27,7 +26,12 @@ def head_package(settings: Settings) -> str:
     return "solvik4-dh" if settings["updater"]["program"] == "main" else "solvik4-rh"
 
 
-def write_head(folder: Path, settings: Settings, kept: Path) -> None:
+def search_path(settings: Settings) -> str:
+    """The updater's search path: with a tool missing, one that holds the other tools only."""
+    return "/opt/bench/tools" if settings["tools"]["missing"] else "/opt/bench/bin:/usr/sbin:/usr/bin:/sbin:/bin"
+
+
+def write_head(folder: Path, settings: Settings, kept: Path, has_systemd: bool) -> None:
     """The head's files: package sources, sounds, marker and what the bench adds to the tools."""
     write(folder / "etc/apt/apt.conf.d/50bench", 'APT::Sandbox::User "root";\n')
     write(folder / "etc/dpkg/dpkg.cfg.d/bench", "force-unsafe-io\n")
@@ -45,7 +49,7 @@ def write_head(folder: Path, settings: Settings, kept: Path) -> None:
         # ALSA has no sound card here: the default device is a file, in fact a program that reads the samples.
         device = 'pcm.!default { type file slave.pcm null file "|/opt/bench/bin/play" format raw }\n'
         write(folder / "etc/asound.conf", device)
-    _write_tools(folder / "opt/bench", settings)
+    _write_tools(folder / "opt/bench", settings, has_systemd)
 
 
 def write_board(folder: Path, settings: Settings, head: Path) -> None:
@@ -74,7 +78,7 @@ def write_board(folder: Path, settings: Settings, head: Path) -> None:
 
 
 def write_stick(folder: Path, settings: Settings) -> None:
-    """The stick's files: a zip archive and the script that unpacks it for each version, and the marker for TeamViewer."""
+    """The stick's files: for each version a zip archive and a script that unpacks it; the marker for TeamViewer."""
     versions = folder / "debs/QUORB/armhf"
     versions.mkdir(parents=True)
     script = (HERE / "stick" / f"{settings['board']['script']}.sh").read_text()
@@ -129,11 +133,13 @@ def _write_packages(folder: Path, settings: Settings, kept: Path) -> None:
     write(folder / "etc/apt/apt.conf.d/60downgrade", 'APT::Get::allow-downgrades "true";\n')
 
 
-def _write_tools(folder: Path, settings: Settings) -> None:
+def _write_tools(folder: Path, settings: Settings, has_systemd: bool) -> None:
     """What stands in front of the real tools, and with a tool missing, a search path without it."""
     wrappers = folder / "bin"
     shutil.copytree(HERE / "head", wrappers)
     (wrappers / "killed").unlink()
+    if has_systemd:
+        (wrappers / "systemctl").unlink()
     if settings["stick"]["teamviewer"] != "unreadable":
         (wrappers / "ls").unlink()
     for tool in settings["tools"]["killed"]:

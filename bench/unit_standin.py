@@ -17,6 +17,7 @@ class StandInUnit:
 
     kind = "stand-in"
     name = "stand-ins for all tools"
+    log_is_exact = True
 
     def __init__(self, scenario: Scenario, folder: Path, speed: float, build: Path) -> None:
         self._settings = scenario.unit
@@ -103,7 +104,8 @@ class StandInUnit:
         for directory in stick["directories"]:
             (versions / directory).mkdir()
             # The stand-in archive is the new version file itself.
-            (versions / directory / "OSUpgrade.zip").write_text(f"Name\tQuorb\r\nBrimvale\t{directory[5:]}\r\n", newline="")
+            content = f"Name\tQuorb\r\nBrimvale\t{directory[5:]}\r\n"
+            (versions / directory / "OSUpgrade.zip").write_text(content, newline="")
             unpack = "/bin/cp root/OSUpgrade.zip root/App/AppExe/version.txt\n"
             script = "exit 3\n" if self._settings["board"]["script"] == "fails" else unpack
             (versions / directory / "unzipUpgrade.sh").write_text(script)

@@ -122,7 +122,7 @@ start_events() {
         in_head apt-get --assume-yes install /srv/other.deb >"$folder/out/other" 2>&1 &
         until [ -e "$head/run/other-package-installs" ]; do sleep 0.01; done
     fi
-    if [ "$UPDATER_STOPPED" = in-install ]; then
+    if [ "$UPDATER_STOPPED" = in-install ] && [ -z "$BENCH_CONTROL_GROUP" ]; then # systemd does it by itself
         (until [ -e "$head/run/package-installs" ]; do sleep 0.01; done && in_head systemctl stop harl-updater) &
     fi
 }
@@ -131,21 +131,38 @@ start_events() {
 run_updater() {
     echo active >"$head/run/harl"
     start_events
-    ignored=
-    if [ "$UPDATER_CHILDREN" = ignored ]; then ignored=--ignore-signal=CHLD; fi
-    panel=
-    if [ "$HEAD_PANEL" = present ]; then panel=BENCH_PANEL=/opt/bench/out/panel; fi
     # shellcheck disable=SC2086 # words by intention
-    setsid chroot "$head" env -i $ignored HOME=/root LANG=C.UTF-8 PATH="$BENCH_PATH" LD_PRELOAD=/opt/bench/tap.so \
-        BENCH_CALLS=/opt/bench/out/calls BENCH_SPEED="$BENCH_SPEED" $panel "/opt/bench/$BENCH_PROGRAM" $UPDATER_ARGUMENTS \
-        </dev/null >"$folder/out/log" 2>"$folder/out/errors" &
+    setsid chroot "$head" $BENCH_COMMAND </dev/null >"$folder/out/log" 2>"$folder/out/errors" &
     updater=$!
     echo $updater >"$head/run/updater.pid"
     echo >"$folder/out/started"
     status=0
     wait $updater || status=$?
-    echo $status >"$folder/out/status.part"
+    echo "exited $status" >"$folder/out/status.part"
     mv "$folder/out/status.part" "$folder/out/status"
+    exec sleep infinity # unit_real.py still looks at the unit, then ends it
+}
+
+# Runs systemd as the first process of the head's own process namespace, with the updater as one of its services.
+run_systemd() {
+    mount -t tmpfs -o mode=755 run "$head/run"
+    start_events
+    umount "$head/proc"
+    mkdir "$head/sys"
+    mount -t sysfs -o ro sysfs "$head/sys"
+    : >"$head/dev/console"
+    # The control group is joined first: it becomes the root of those that systemd sees.
+    (
+        sh -c 'echo $PPID' >"$BENCH_CONTROL_GROUP/cgroup.procs"
+        exec unshare --cgroup --pid --ipc --fork --kill-child "$here/systemd.sh" "$head"
+    ) </dev/null >"$folder/out/systemd" 2>&1 &
+    systemd=$!
+    echo >"$folder/out/started"
+    # journalctl fails until the journal has its first entry.
+    until journalctl --directory="$head/run/log/journal" --follow --no-tail --quiet --output=cat \
+        "_SYSTEMD_UNIT=$BENCH_SERVICE" >"$folder/out/journal" 2>"$folder/out/journalctl"; do sleep 0.02; done &
+    wait $systemd || true
+    fail "systemd has ended: $(tail -n 1 "$folder/out/systemd")"
 }
 
 mount -t tmpfs unit "$folder/unit"
@@ -157,5 +174,8 @@ mount --bind "$board/run" "$head/opt/bench/board"
 install_package
 insert_stick
 wait_for_board
-run_updater
-exec sleep infinity # unit_real.py still looks at the unit, then ends it
+if [ -n "$BENCH_CONTROL_GROUP" ]; then
+    run_systemd
+else
+    run_updater
+fi

@@ -46,7 +46,8 @@ class BadInput(unittest.TestCase):
 
     def test_unknown_section(self) -> None:
         sections = "package, mirrors, board, stick, head, tools, updater"
-        self.check_file(GOOD.replace("[board]", "[bord]"), 6, f"bord: not known; the sections are {sections} and expect")
+        reason = f"bord: not known; the sections are {sections} and expect"
+        self.check_file(GOOD.replace("[board]", "[bord]"), 6, reason)
 
     def test_unknown_key(self) -> None:
         text = GOOD.replace('[board]\n', '[board]\ncolour = "red"\n')

@@ -28,14 +28,14 @@ def output(*command: str) -> str:
     return subprocess.run(command, capture_output=True, text=True, check=False).stdout
 
 
-def machine() -> dict[str, str]:
-    """What a run must not change on this machine."""
+def machine(folder: str) -> dict[str, str]:
+    """What a run with the temporary folder `folder` must not change on this machine."""
     return {
         "mounts": Path("/proc/self/mountinfo").read_text(),
         "links": output("ip", "-brief", "link"),
         "addresses": output("ip", "-brief", "address"),
         "routes": output("ip", "route", "show", "table", "all"),
-        "control groups": output("find", "/sys/fs/cgroup", "-name", "*bench*"),
+        "control groups": output("find", "/sys/fs/cgroup", "-name", f"{Path(folder).name}-*"),
         "package": output("grep", "-c", "^Package: solvik4", "/var/lib/dpkg/status"),
         "instrument": str([Path(path).exists() for path in INSTRUMENT if os.access("/root", os.X_OK)]),
         "users": Path("/etc/passwd").read_text(),
@@ -59,10 +59,10 @@ class HostTest(unittest.TestCase):
     """Each test runs the bench with a temporary folder of its own, which must be empty and unused in the end."""
 
     def setUp(self) -> None:
-        self.before = machine()
         holder = tempfile.TemporaryDirectory(prefix="bench-host-test-")
         self.addCleanup(holder.cleanup)
         self.folder = holder.name
+        self.before = machine(self.folder)
 
     def start(self, *arguments: str) -> subprocess.Popen[str]:
         return subprocess.Popen(
@@ -82,7 +82,7 @@ class HostTest(unittest.TestCase):
 
     def check_untouched(self) -> None:
         self.wait_until("not cleared away", lambda: not os.listdir(self.folder) and not users_of(self.folder))
-        self.assertEqual(machine(), self.before)
+        self.assertEqual(machine(self.folder), self.before)
 
     def test_after_a_run(self) -> None:
         for kind in KINDS:
@@ -95,7 +95,8 @@ class HostTest(unittest.TestCase):
     def test_after_a_run_that_fails(self) -> None:
         wrong = Path(self.folder).with_suffix(".toml")
         self.addCleanup(wrong.unlink)
-        wrong.write_text((ROOT / "bench/scenarios/up-to-date.toml").read_text().replace("marker = true", "marker = false"))
+        text = (ROOT / "bench/scenarios/up-to-date.toml").read_text()
+        wrong.write_text(text.replace("marker = true", "marker = false"))
         for kind in KINDS:
             with self.subTest(kind):
                 with self.start("--unit", kind, str(wrong)) as bench:
@@ -107,7 +108,8 @@ class HostTest(unittest.TestCase):
     def test_after_a_signal_while_the_updater_runs(self) -> None:
         for kind in KINDS:
             for number, status in ((signal.SIGINT, 130), (signal.SIGTERM, 143), (signal.SIGKILL, -9)):
-                with self.subTest(kind, number=number), self.start("--unit", kind, "package-and-board", "--speed", "1") as bench:
+                arguments = ["--unit", kind, "package-and-board", "--speed", "1"]
+                with self.subTest(kind, number=number), self.start(*arguments) as bench:
                     while "Running command: apt-cache" not in (line := bench.stdout.readline()):
                         self.assertNotEqual(line, "", "the bench ended early")
                     self.assertTrue(users_of(self.folder))

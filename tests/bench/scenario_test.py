@@ -11,14 +11,18 @@ sys.path.insert(0, str(Path(__file__).parents[2] / "bench"))
 import scenario
 from compare import differences
 from session import NotServed, UnitMaker, run_on, temporary_folder
+from systemd import obstacle
 from unit_real import forbidden
 
 SPEED = 2000  # times shorter waits, each 0.2 s at least
 SKIPPED = 77
 
 name, kind, build = sys.argv[1:]
-if kind == "real" and (reason := forbidden()):
+if kind != "stand-in" and (reason := forbidden()):
     print(f"skipped: this machine forbids namespaces: {reason}")
+    sys.exit(SKIPPED)
+if kind == "real" and (reason := obstacle()):
+    print(f"skipped: no systemd in the unit: {reason}")
     sys.exit(SKIPPED)
 what = scenario.load(name)
 maker = UnitMaker(kind, SPEED, Path(build))

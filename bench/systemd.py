@@ -1,0 +1,156 @@
+"""The real unit's systemd: first process of the head, with the updater and the instrument's application as services.
+
+It needs root and a control group; elsewhere unit_real/head/systemctl stands in for it.
+"""
+
+import contextlib
+import os
+import subprocess
+from pathlib import Path
+
+from unit_real_files import Settings, write
+
+PROGRAM = Path("/lib/systemd/systemd")
+ENDED = "bench: the updater has ended: "  # the journal's line behind the updater's last one
+
+TARGET = """[Unit]
+DefaultDependencies=no
+Wants=systemd-journald.service {services}
+"""
+APPLICATION = """[Unit]
+DefaultDependencies=no
+[Service]
+ExecStart=/bin/sleep infinity
+"""
+# Standard error stays out of the journal: the log of a run is the updater's standard output.
+UPDATER = f"""[Unit]
+DefaultDependencies=no
+After=systemd-journald.service harl.service
+[Service]
+ExecStart={{command}}
+StandardOutput=journal
+StandardError=append:/opt/bench/out/errors
+ExecStopPost=/bin/sh -c 'echo "{ENDED}$$EXIT_CODE $$EXIT_STATUS"'
+"""
+# The service manager stops the updater while the package's own script runs, see packages.py.
+STOP_WHEN = """[Unit]
+DefaultDependencies=no
+[Path]
+PathExists=/run/package-installs
+"""
+STOP = """[Unit]
+DefaultDependencies=no
+[Service]
+Type=oneshot
+ExecStart=/bin/systemctl stop harl-updater
+RemainAfterExit=yes
+"""
+JOURNAL = """[Journal]
+Storage=volatile
+RateLimitIntervalSec=0
+"""
+
+
+def obstacle() -> str:
+    """Why systemd cannot run on this machine; "" when it can."""
+    if os.geteuid() != 0 or "4294967295" not in Path("/proc/self/uid_map").read_text():
+        return "not root"
+    if not PROGRAM.exists():
+        return "systemd is not installed"
+    probe = ["unshare", "--mount", "--cgroup", "sh", "-c", "mount -t cgroup2 cgroup2 /tmp && mount -t sysfs sysfs /tmp"]
+    if _own_control_group() is None or subprocess.run(probe, stderr=subprocess.DEVNULL, check=False).returncode != 0:
+        return "no control group"
+    return ""
+
+
+def make_control_group(folder: Path) -> Path:
+    """A control group for the head, named in the file `control-group` of the folder; see session.GUARD."""
+    parent = _own_control_group()
+    assert parent
+    group = parent / f"{folder.parent.name}-{folder.name}"
+    (folder / "control-group").write_text(f"{group}\n")
+    group.mkdir()
+    return group
+
+
+def remove_control_group(group: Path) -> None:
+    """Removes the group and those within it, once no process is left in them."""
+    for directory, _, _ in os.walk(group, topdown=False):
+        with contextlib.suppress(OSError):
+            os.rmdir(directory)
+
+
+def service_active(group: Path, name: str) -> bool:
+    """Whether the service `name` runs."""
+    with contextlib.suppress(OSError):
+        return bool((group / "system.slice" / f"{name}.service" / "cgroup.procs").read_text())
+    return False
+
+
+def updater_service(settings: Settings) -> str:
+    """The service that the updater runs in: not its own when it must not end with that."""
+    return "by-hand.service" if settings["updater"]["stopped"] == "never" else "harl-updater.service"
+
+
+def write_services(folder: Path, settings: Settings, command: str) -> None:
+    """The head's services, with `command` as the updater."""
+    units = folder / "etc/systemd/system"
+    wanted = [updater_service(settings)]
+    write(units / "harl-updater.service", APPLICATION)
+    write(units / updater_service(settings), UPDATER.format(command=command))
+    if settings["head"]["harl"] == "known":
+        write(units / "harl.service", APPLICATION)
+        wanted.append("harl.service")
+    if settings["updater"]["stopped"] == "in-install":
+        write(units / "stop-in-install.path", STOP_WHEN)
+        write(units / "stop-in-install.service", STOP)
+        wanted.append("stop-in-install.path")
+    write(units / "bench.target", TARGET.format(services=" ".join(wanted)))
+    write(folder / "etc/systemd/journald.conf", JOURNAL)
+    write(folder / "etc/machine-id", f"{os.urandom(16).hex()}\n")
+
+
+class Journal:
+    """Turns the updater's journal back into its output, as far as the journal keeps it.
+
+    The journal drops empty lines and the blanks at the end of lines, and with them the second line of a record without
+    a message.
+    """
+
+    def __init__(self, source: Path, target: Path) -> None:
+        self._source = source
+        self._target = target
+        self._offset = 0
+        self._in_head = False  # behind the first line of a record
+        self.ended = ""  # how the updater ended: "exited 0", "killed TERM"
+
+    def update(self) -> None:
+        """Takes over what is new."""
+        if not self._source.exists():
+            return
+        with self._source.open("rb") as source, self._target.open("ab") as target:
+            source.seek(self._offset)
+            data = source.read()
+            data = data[: data.rfind(b"\n") + 1]
+            self._offset += len(data)
+            for line in data.splitlines(keepends=True):
+                is_head, is_end = line.startswith(b"Updater | "), line.startswith(ENDED.encode())
+                if self._in_head and (is_head or is_end):
+                    target.write(b"\t\t\t\n")
+                self._in_head = is_head
+                if is_end:
+                    target.flush()
+                    self.ended = line.decode().removeprefix(ENDED).strip()
+                    return
+                target.write(line)
+
+
+def _own_control_group() -> Path | None:
+    """This process's group in the unified hierarchy."""
+    mounts = [line.split() for line in Path("/proc/self/mountinfo").read_text().splitlines()]
+    mounted = [Path(fields[4]) for fields in mounts if "cgroup2" in fields[fields.index("-") :]]
+    own = [line[3:] for line in Path("/proc/self/cgroup").read_text().splitlines() if line.startswith("0::")]
+    if not mounted or not own:
+        return None
+    group = mounted[0] / own[0].lstrip("/")
+    return group if os.access(group / "cgroup.procs", os.W_OK) else None

@@ -1,6 +1,7 @@
 """The stand-in unit: the updater runs on this machine, with a search path that holds only the tools of standins.sh."""
 
 import os
+import re
 import signal
 import subprocess
 from pathlib import Path
@@ -10,6 +11,12 @@ from unit import PROGRAMS, Files, State, with_pid_file
 
 HERE = Path(__file__).parent
 TOOLS = ["systemctl", "umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp", "i2cset", "aplay"]
+
+
+def sanitizers(program: Path) -> list[str]:
+    """The sanitizers that `program` was built with: they have to be loaded before anything else."""
+    libraries = subprocess.run(["ldd", program], stdout=subprocess.PIPE, text=True, check=True).stdout
+    return re.findall(r"^\s*(lib[at]san\.so\.\d+) ", libraries, re.MULTILINE)
 
 
 class StandInUnit:
@@ -127,8 +134,8 @@ class StandInUnit:
         env = ["/usr/bin/env"]
         if self._settings["updater"]["children"] == "ignored":
             env.append("--ignore-signal=CHLD")
-        env.append(f"LD_PRELOAD={self._build / 'bench/tap.so'}")
         program = self._build / PROGRAMS[self._settings["updater"]["program"]]
+        env.append("LD_PRELOAD=" + ":".join([*sanitizers(program), str(self._build / "bench/tap.so")]))
         with self.files.log.open("wb") as log, (self._folder / "errors").open("wb") as errors:
             self._updater = subprocess.Popen(
                 with_pid_file(self._folder, [*env, program, *self._settings["updater"]["arguments"]]),

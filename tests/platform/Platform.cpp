@@ -52,7 +52,7 @@ std::vector<Entry> entryList;
 std::map<std::string, Script> scripts;
 std::map<FILE*, int> pipes;
 std::function<int(const timespec*, timespec*)> sleepScript;
-LogBuffer logBuffer;
+LogBuffer& logBuffer = *new LogBuffer; // lives on: std::cout is flushed once more at exit
 
 const std::string separator = "\n\t\t\t";
 

@@ -108,8 +108,8 @@ std::vector<UpdateManager::UpdateComponent> offered;
 
 void keepOffer(std::vector<UpdateManager::UpdateComponent> components)
 {
-    noteUpdateFound(components);
     offered = components;
+    noteUpdateFound(components); // what the test waits for
 }
 
 TEST_F(Manager, MainHeadChecksInstallsWhatItOfferedAndClosesOnWorkerThreads)

@@ -8,9 +8,9 @@
 /// For a command the text is its command line and the value at its end the raw status. For a wait the value is what was
 /// asked for (s) and the text how long it takes in fact (s).
 ///
-/// Shortens the waits: BENCH_SPEED times (1: full length), but to no less than 0.2 s so that the panel's flashing stays
-/// visible. The wall clock that the updater sees moves on by what waits of 2 s and more were shortened by: the log
-/// reads like a run at full length.
+/// Shortens the waits: BENCH_SPEED times (1: full length), but to no less than BENCH_SHORTEST_WAIT (s; 0.2 when it is
+/// not set) so that the panel's flashing stays visible. The wall clock that the updater sees moves on by what waits of
+/// 2 s and more were shortened by: the log reads like a run at full length.
 
 #include <algorithm>
 #include <atomic>
@@ -27,8 +27,7 @@
 namespace
 {
 
-const double shortestWait = 0.2; // s
-const double clockWait = 2;      // s, the shortest wait whose shortening moves the wall clock
+const double clockWait = 2; // s, the shortest wait whose shortening moves the wall clock
 
 std::atomic<double> clockOffset{0};   // s, by which the updater's wall clock is ahead
 thread_local std::string pipeCommand; // the updater reads one command at a time on a thread
@@ -45,10 +44,10 @@ Function next(const char* name, Function)
     return reinterpret_cast<Function>(dlsym(RTLD_NEXT, name));
 }
 
-double speed()
+double number(const char* variable, double otherwise)
 {
-    const char* text = getenv("BENCH_SPEED");
-    return text == nullptr ? 1 : std::max(1.0, std::atof(text));
+    const char* text = getenv(variable);
+    return text == nullptr ? otherwise : std::atof(text);
 }
 
 void writeLine(const char* call, const char* phase, long value, const std::string& text)
@@ -104,7 +103,9 @@ int pclose(FILE* pipe)
 int nanosleep(const timespec* asked, timespec* remaining)
 {
     const double length = static_cast<double>(asked->tv_sec) + static_cast<double>(asked->tv_nsec) / 1e9;
-    const double factor = std::max(std::min(1.0, shortestWait / length), 1 / speed());
+    const double shortestWait = number("BENCH_SHORTEST_WAIT", 0.2);
+    const double speed = std::max(1.0, number("BENCH_SPEED", 1));
+    const double factor = std::max(std::min(1.0, shortestWait / length), 1 / speed);
     const double shortened = length * factor;
     timespec wait = {static_cast<std::time_t>(shortened), 0};
     wait.tv_nsec = static_cast<long>((shortened - std::floor(shortened)) * 1e9);

@@ -9,7 +9,8 @@ from pathlib import Path
 
 import scenario
 from compare import differences
-from display import PlainDisplay, print_outcome
+from display import PlainDisplay, print_outcome, terminal
+from live import LiveDisplay
 from session import KINDS, UnitMaker, run_on, temporary_folder
 from table import run_all
 from unit import UnitError
@@ -42,7 +43,8 @@ def run(maker: UnitMaker, what: scenario.Scenario) -> int:
     with temporary_folder() as folder:
         unit = maker.make(what, folder)
         print(f"{what.name}: {what.summary}\nUnit: {unit.name}\n", flush=True)
-        result = run_on(unit, PlainDisplay().show, maker.speed)
+        with LiveDisplay(unit) if terminal() else PlainDisplay() as display:
+            result = run_on(unit, display.show, maker.speed)
     print_outcome(what, result)
     wrong = differences(what, result)
     for line in wrong:
@@ -92,6 +94,7 @@ def arguments() -> argparse.Namespace:
 def main() -> int:
     """The command."""
     given = arguments()
+    sys.stdout.reconfigure(errors="replace")  # type: ignore[union-attr]
     signal.signal(signal.SIGTERM, lambda *_: sys.exit(143))
     try:
         if given.list:

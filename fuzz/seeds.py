@@ -1,6 +1,7 @@
 """Usage: seeds.py FOLDER
 
-Writes the fuzzers' first inputs: what the tools print in each of the bench's scenarios, its sticks, and some archives.
+Writes the fuzzers' first inputs: what the tools print in each of the bench's scenarios, its sticks, some archives,
+and the golden logs.
 """
 
 import io
@@ -95,17 +96,25 @@ def archive_seeds() -> dict[str, bytes]:
     return seeds
 
 
+def log_seeds() -> dict[str, bytes]:
+    """The golden logs, in blocks of 65 bytes."""
+    golden = Path(__file__).parents[1] / "tools/tests/golden/log"
+    return {path.stem: b"@" + path.read_bytes() for path in golden.glob("*.log")}
+
+
 def main() -> None:
     """The command."""
     readable = {"package": package_seed, "board": board_seed, "teamviewer": teamviewer_seed, "stick": stick_seed}
-    (Path(sys.argv[1]) / "archive").mkdir(parents=True, exist_ok=True)
     for target, seed in readable.items():
         folder = Path(sys.argv[1]) / target
         folder.mkdir(parents=True, exist_ok=True)
         for name in scenario.names():
             (folder / name).write_bytes(seed(scenario.load(name).unit).encode())
-    for name, content in archive_seeds().items():
-        (Path(sys.argv[1]) / "archive" / name).write_bytes(content)
+    for target, seeds in {"archive": archive_seeds(), "log": log_seeds()}.items():
+        folder = Path(sys.argv[1]) / target
+        folder.mkdir(parents=True, exist_ok=True)
+        for name, content in seeds.items():
+            (folder / name).write_bytes(content)
     for name, odd in ODD_STICKS.items():
         (Path(sys.argv[1]) / "stick" / name).write_bytes(odd.encode())
 

@@ -183,9 +183,8 @@ void LogParser::takeLine(std::string_view line)
     std::string_view program;
     const std::string_view front = line.substr(0, position);
     const std::string_view before = withoutJournalPrefix(front, program);
-    if (before.find(mark) != std::string_view::npos) {
-        mSink.torn(mLines);
-    } else if (!before.empty() && !isConsolePrefix(before)) {
+    const bool interrupted = before.find(mark) != std::string_view::npos;
+    if (!interrupted && !before.empty() && !isConsolePrefix(before)) {
         takeText(front, indentationOf(front)); // a line that another program, or a message, has not ended
     }
     if (mHeadOpen) {
@@ -194,6 +193,9 @@ void LogParser::takeLine(std::string_view line)
             mSink.torn(mHead.line);
         }
         takeMessage({});
+    }
+    if (interrupted) {
+        mSink.torn(mLines);
     }
     if (!parseHead(line.substr(position))) {
         mSink.torn(mLines);

@@ -152,6 +152,12 @@ TEST(LogParser, HeadInterruptedByAnotherIsTorn)
               (List{"torn 1", "record 1" + mirrorsEvent + "OK"}));
 }
 
+TEST(LogParser, OpenRecordComesBeforeTheTornOneOfTheNextLine)
+{
+    EXPECT_EQ(parsed(mirrors + "Updater | 02-03-20" + mirrors + "\t\t\tOK\n"),
+              (List{"torn 1", "record 1" + mirrorsEvent, "torn 2", "record 2" + mirrorsEvent + "OK"}));
+}
+
 TEST(LogParser, MessageInterruptedByAHeadKeepsWhatIsThere)
 {
     EXPECT_EQ(parsed(mirrors + "\t\t\tRunning com" + mirrors + "\t\t\tOK\n"),

@@ -20,7 +20,7 @@ int main(int argc, char** argv)
     CLI::App* stick = app.add_subcommand("stick", "Tell what the updater would do with a stick. Reads only.");
     stick->add_option("PATH", stickPath, "the folder that the stick is mounted at")->capture_default_str();
     stick->add_flag("--json", json, "print one JSON object");
-    stick->footer("Exit status: 0 fit for an update, 1 not fit, 2 wrong usage or not everything could be read.");
+    stick->footer("Exit status: 0 fit for an update, 1 not fit, 2 wrong usage or not everything could be read.\n");
 
     UnitOptions unitOptions;
     CLI::App* unit = app.add_subcommand("unit", "Tell whether this unit is fit for an update. Changes nothing.");
@@ -28,7 +28,7 @@ int main(int argc, char** argv)
     unit->add_flag("--sound", unitOptions.sound, "play both sounds instead");
     unit->add_flag("--json", unitOptions.json, "print one JSON object");
     unit->footer("Exit status: 0 fit or test passed, 1 not fit or test failed, 2 wrong usage, test refused or not "
-                 "everything could be checked.");
+                 "everything could be checked.\n");
 
     LogOptions logOptions;
     CLI::App* log = app.add_subcommand("log", "Explain the updater's log: what happened, why, and what to do now.");
@@ -40,7 +40,7 @@ int main(int argc, char** argv)
     log->add_option("--html", logOptions.htmlFile, "also write a page with each run's timeline")
         ->type_name("FILE")
         ->excludes(follow);
-    log->footer("Exit status: 0 the last run went well, 1 it failed or did not finish, 2 wrong usage or no log.");
+    log->footer("Exit status: 0 the last run went well, 1 it failed or did not finish, 2 wrong usage or no log.\n");
 
     try {
         app.parse(argc, argv);

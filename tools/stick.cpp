@@ -31,7 +31,6 @@ const std::string uploadFailsEffect =
     "tries the upload 20 times when the board has another version, gives up and shows the fail pattern; the board "
     "stays as it is.";
 const std::string nameFolderRemedy = "Name the folder with its five-character prefix and the version behind it.";
-const std::string oneFolderRemedy = "Leave only the folder of the version that is to be installed.";
 
 std::string lowerCase(std::string text)
 {
@@ -259,7 +258,7 @@ private:
                 "reads the version from the first name in byte order, " + shown(names.front()) +
                     ", but its upload takes the files of every one of them, one over the other: the board gets those of "
                     "the last. It may install another version than it compared with, and do so at every run.",
-                oneFolderRemedy);
+                "Leave only the folder of the version that is to be installed.");
         }
         const auto first = std::find_if(others.begin(), others.end(),
                                         [&](const auto& name) { return !surelyBehind(name, folders[0]); });
@@ -310,11 +309,11 @@ private:
         checkRunBit(node.mode, mStick.keepsPermissions(), mOnUnit, shown(path), mReport);
     }
 
-    /// What the `*` of the upload's command line finds of `file`: the path that arrives last, so the one that stays.
-    /// Reported, and empty, when there is none.
+    /// What the `*` of the upload's command line finds of `file`: of several paths the one that arrives last and so
+    /// stays. Reported, and empty, when there is none.
     std::string uploadedPath(const std::vector<std::string>& names, const std::string& file)
     {
-        std::vector<std::string> paths;
+        std::string last;
         std::vector<std::string> similar;
         bool misspelled = false;
         for (const std::string& name : names) {
@@ -323,26 +322,20 @@ private:
             const bool found = mStick.node(path).present;
             misspelled = reportCase(folder, file, found, Severity::ERROR, uploadFailsEffect) || misspelled;
             if (found) {
-                paths.push_back(path);
+                last = path;
                 continue;
             }
             const std::vector<std::string> likes = lookalikes(folder, file);
             similar.insert(similar.end(), likes.begin(), likes.end());
         }
-        if (paths.size() > 1) {
-            add(Severity::ERROR, "several-uploads",
-                counted(paths.size(), "folder") + " hold " + shown(file) + ": " + listed(paths) + '.',
-                "copies all of them to the same place on the board: " + shown(paths.back()) + " is the one that stays.",
-                oneFolderRemedy);
-        }
-        if (paths.empty() && !misspelled) {
+        if (last.empty() && !misspelled) {
             add(Severity::ERROR, "file-missing",
                 shown(file) + " is missing in the version folder" +
                     (similar.empty() ? "." : ", which holds " + listed(similar) + '.'),
                 uploadFailsEffect,
                 similar.empty() ? "Copy it into the version folder." : "Rename it to " + shown(file) + '.');
         }
-        return paths.empty() ? "" : paths.back();
+        return last;
     }
 
     /// Opens the file at `path` when it is a plain and not an empty one, and reports anything else. An empty path has

@@ -30,17 +30,6 @@ const std::string boardNotRead =
     "logs \"Failed to checkUpdate\" and leaves the board as it is. The panel shows \"nothing to update\" when the "
     "head's package is up to date, and a failed check when it has just been installed.";
 
-/// The line of a command's standard error that holds `text`, quoted.
-std::string complaintLine(const CommandResult& result, const std::string& text)
-{
-    for (const std::string& line : linesOf(result.errors)) {
-        if (contains(line, text)) {
-            return shown(line);
-        }
-    }
-    return complaint(result);
-}
-
 /// The unit check: each operation adds to the report what it finds.
 class UnitCheck
 {
@@ -144,8 +133,7 @@ private:
         const CommandResult address = mUnit.run({"i2cset", "-y", "0", "0x07", "0x100", "c"}, quick);
         if (contains(address.errors, "hip address")) {
             add(Severity::ERROR, "panel-address-refused",
-                shown(mUnit.program("i2cset")) +
-                    " refuses the panel's address 0x07: " + complaintLine(address, "hip address") + '.',
+                shown(mUnit.program("i2cset")) + " refuses the panel's address 0x07: " + complaint(address) + '.',
                 darkPanel,
                 "i2c-tools since 4.2 needs the option -a. Put a command i2cset that adds it before it on the service's "
                 "search path, or install an older i2c-tools.");
@@ -227,7 +215,7 @@ private:
         } else if (refused || answer.exitCode < 0) {
             add(Severity::ERROR, "board-unreachable",
                 "The board at 192.168.9.2 cannot be asked: " + complaint(answer) + '.', boardNotRead,
-                "Check the board's supply and link: ping 192.168.9.2");
+                "Check the board's supply and link: ping 192.168.9.2. When it answers: ssh 192.168.9.2");
         } else {
             checkBoardVersion(answer);
         }

@@ -132,18 +132,21 @@ std::string errorText(int error)
 std::string complaint(const CommandResult& result)
 {
     if (!result.started) {
-        return "it could not be started";
+        return "the command could not be started";
     }
     if (result.timedOut) {
-        return "it did not end in time";
+        return "the command did not end in time";
     }
     std::string last;
+    std::string error; // i2cset(8) explains its usage behind it
     for (const std::string& line : linesOf(result.errors)) {
         const std::string text = line.substr(0, line.find('\r')); // ssh(1) ends its lines so
         last = text.empty() ? last : text;
+        error = text.rfind("Error: ", 0) == 0 ? text : error;
     }
     if (!last.empty()) {
-        return shown(last);
+        return shown(error.empty() ? last : error);
     }
-    return result.exitCode < 0 ? "a signal ended it" : "it ended with status " + std::to_string(result.exitCode);
+    return result.exitCode < 0 ? "a signal ended the command"
+                               : "the command ended with status " + std::to_string(result.exitCode);
 }

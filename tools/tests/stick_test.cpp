@@ -140,24 +140,21 @@ TEST_F(Stick, OnlyAFileIsNoVersionFolder)
     EXPECT_EQ(findings(), Lines{"error no-version-folder"});
 }
 
-TEST_F(Stick, SeveralVersionFoldersAreAnErrorThatNamesTheOneReadAndTheOneThatStays)
+TEST_F(Stick, SeveralVersionFoldersAreAnErrorThatNamesTheOneRead)
 {
     putVersion("quorb2.10.0");
     putVersion("quorb2.3.0");
     const Report report = check();
-    EXPECT_EQ(findingsOf(report),
-              (Lines{"error several-version-folders", "error several-uploads", "error several-uploads"}));
+    EXPECT_EQ(findingsOf(report), Lines{"error several-version-folders"});
     EXPECT_EQ(factOf(report, "version"), "\"2.10.0\"");
-    const Finding& upload = report.findings().at(1);
-    EXPECT_THAT(upload.effect, HasSubstr("\"debs/QUORB/armhf/quorb2.3.0/OSUpgrade.zip\" is the one that stays"));
+    EXPECT_THAT(report.findings().at(0).effect, HasSubstr("\"quorb2.10.0\", but its upload takes the files of every"));
 }
 
 TEST_F(Stick, FilesOfTheLastFolderAreTheOnesTested)
 {
     putVersion("quorb2.3.0");
     stick.put(std::string(board) + "quorb2.3.0/OSUpgrade.zip", "no archive");
-    EXPECT_EQ(findings(), (Lines{"error several-version-folders", "error several-uploads", "error archive-not-zip",
-                                 "error several-uploads"}));
+    EXPECT_EQ(findings(), (Lines{"error several-version-folders", "error archive-not-zip"}));
 }
 
 TEST_F(Stick, NameInFrontOfTheVersionFolderIsReadInItsPlace)
@@ -394,6 +391,27 @@ TEST_F(Stick, LinksToNothingAndToThemselvesAreBroken)
         stick.makeLink(std::string(board) + "quorb2.2.0/OSUpgrade.zip", target);
         EXPECT_EQ(findings(), Lines{"error link-broken"}) << target;
     }
+}
+
+TEST_F(Stick, HostileNamesBesideTheUpdatersOwnAreShownEscaped)
+{
+    const std::string hostile = " a\n\x1b[2J\xff";
+    const std::string folder = std::string(board) + "quorb2.2.0/";
+    rename(folder + "OSUpgrade.zip", folder + "OSUpgrade" + hostile);
+    remove(folder + "unzipUpgrade.sh");
+    stick.makeLink(folder + "unzipUpgrade.sh", "/nowhere" + hostile);
+    stick.put(board + ("zz" + hostile), "");
+    stick.put("debs/installTV" + hostile, "");
+    const Report report = check();
+    EXPECT_EQ(findingsOf(report), (Lines{"note name-beside-version-folder", "error file-missing",
+                                         "error link-leaves-stick", "warning marker-name"}));
+    for (const Finding& finding : report.findings()) {
+        EXPECT_THAT(finding.what, HasSubstr(" a\\n\\x1b[2J\\xff\""));
+    }
+    std::ostringstream out;
+    std::ostringstream errors;
+    EXPECT_EQ(runStick(stick.path(hostile), false, out, errors), Report::STATUS_UNCHECKED);
+    EXPECT_THAT(errors.str(), HasSubstr(" a\\n\\x1b[2J\\xff\""));
 }
 
 TEST_F(Stick, HostileNamesAreShownEscapedAndNeverRun)

@@ -76,4 +76,5 @@ TEST_F(ToolProgram, HelpNamesThePlaceOfTheStickAndTheExitStatuses)
     EXPECT_EQ(result.exitCode, 0);
     EXPECT_THAT(result.output, HasSubstr("/root/USB_MOUNT"));
     EXPECT_THAT(result.output, HasSubstr("Exit status: 0 fit for an update, 1 not fit, 2 "));
+    EXPECT_EQ(result.output.back(), '\n');
 }

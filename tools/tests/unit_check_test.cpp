@@ -206,9 +206,9 @@ TEST_F(UnitCheck, SearchPathOfTheServiceCounts)
 
 TEST_F(UnitCheck, ToolThatRefusesThePanelsAddressIsAnError)
 {
-    unit.replaceTool("i2cset", "echo 'Error: Chip address out of range (0x08-0x77)!' >&2; exit 1");
+    unit.replaceTool("i2cset", "echo 'Error: Chip address out of range (0x08-0x77)!' >&2; echo Usage: >&2; exit 1");
     EXPECT_EQ(findings(), Lines{"error panel-address-refused"});
-    EXPECT_THAT(what(), HasSubstr("\"Error: Chip address out of range (0x08-0x77)!\""));
+    EXPECT_THAT(what(), HasSubstr("address 0x07: \"Error: Chip address out of range (0x08-0x77)!\"."));
 }
 
 TEST_F(UnitCheck, ToolWithAnotherAnswerToThePanelsAddressIsUnchecked)
@@ -278,7 +278,7 @@ TEST_F(UnitCheck, LoginEndedByASignalIsUnreachable)
 {
     unit.set("TOOLS_KILLED", "ssh");
     EXPECT_EQ(findings(), Lines{"error board-unreachable"});
-    EXPECT_EQ(what(), "The board at 192.168.9.2 cannot be asked: a signal ended it.");
+    EXPECT_EQ(what(), "The board at 192.168.9.2 cannot be asked: a signal ended the command.");
 }
 
 TEST_F(UnitCheck, RefusedKeyIsALoginError)

@@ -2,6 +2,7 @@
 
 import os
 import sys
+from dataclasses import dataclass
 
 from observe import Run, now
 from panel import color_name, led_name
@@ -60,28 +61,50 @@ class PlainDisplay:
         sys.stdout.flush()
 
 
-def outcome(run: Run) -> str:
-    """What the operator learns from the panel, in words."""
-    return OUTCOMES.get(panel_line(run.panel.shown(now())), "none: the panel shows no outcome")
+@dataclass
+class Summary:
+    """What is told about a run at its end."""
+
+    scenario: Scenario
+    unit: str  # what is real and what is a stand-in
+    result: Result
+    wrong: list[str]  # what came out other than the scenario says
+
+    @property
+    def outcome(self) -> str:
+        """What the operator learns from the panel, in words."""
+        return OUTCOMES.get(panel_line(self.result.run.panel.shown(now())), "the panel shows no outcome")
+
+    def rows(self) -> list[tuple[str, str]]:
+        """Names and values."""
+        result, state, before = self.result, self.result.state, self.scenario.unit
+        status = f"ended by signal {-result.status}" if result.status < 0 else f"exit status {result.status}"
+        return [
+            ("Outcome", self.outcome),
+            ("Panel", panel_line(result.run.panel.shown(now()))),
+            ("Sound", ", ".join(state.sounds) or "none"),
+            ("Package", f"{before['package']['installed']} -> {state.package}"),
+            ("Board", f"{before['board']['installed']} -> {state.board or '(cannot be read)'}"),
+            ("First-boot marker", "there" if state.marker else "gone"),
+            ("Stick", "mounted" if state.stick else "released"),
+            ("harl", state.harl),
+            ("Updater", status),
+            ("Wall time", f"{result.seconds:.1f} s, set-up included"),
+        ]
 
 
-def print_outcome(scenario: Scenario, result: Result) -> None:
-    """The summary at the end of a run."""
-    run, state, before = result.run, result.state, scenario.unit
+def print_summary(summary: Summary) -> None:
+    """The summary at the end of a run, with the commands and their times."""
+    run = summary.result.run
     begin = run.calls[0].start if run.calls else 0
-    leds = run.panel.shown(now())
     print("\nCommands")
     for call in run.commands():
         took = f"{call.end - call.start:6.2f} s" if call.end is not None else "   ended"
         print(f"  {call.start - begin:7.2f} s  {took}  {call.text}")
     print("Waits: " + (", ".join(f"{call.seconds} s in {call.real:.1f} s" for call in run.waits()) or "none"))
-    print(f"\nOutcome: {paint(outcome(run), next(filter(None, map(color_name, filter(None, leds.values()))), 'off'))}")
-    print(f"Panel: {panel_line(leds)}")
-    print(f"Sound: {', '.join(state.sounds) or 'none'}")
-    print(f"Package: {before['package']['installed']} -> {state.package}")
-    print(f"Board: {before['board']['installed']} -> {state.board or '(cannot be read)'}")
-    print(f"First-boot marker: {'there' if state.marker else 'gone'}")
-    print(f"Stick: {'mounted' if state.stick else 'released'}")
-    print(f"harl: {state.harl}")
-    print(f"Updater: {f'ended by signal {-result.status}' if result.status < 0 else f'exit status {result.status}'}")
-    print(f"Wall time: {result.seconds:.1f} s, set-up included")
+    print()
+    lit = [color_name(color) for color in run.panel.shown(now()).values() if color]
+    for name, value in summary.rows():
+        print(f"{name}: {paint(value, lit[0]) if lit and name == 'Outcome' else value}")
+    for line in summary.wrong:
+        print(f"DIFFERENCE: {line}")

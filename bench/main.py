@@ -9,8 +9,9 @@ from pathlib import Path
 
 import scenario
 from compare import differences
-from display import PlainDisplay, print_outcome, terminal
+from display import PlainDisplay, Summary, print_summary, terminal
 from live import LiveDisplay
+from record import page
 from session import KINDS, UnitMaker, run_on, temporary_folder
 from table import run_all
 from unit import UnitError
@@ -38,18 +39,21 @@ def build() -> None:
             sys.exit(f"{done.stdout}bench: {' '.join(command)} failed with status {done.returncode}")
 
 
-def run(maker: UnitMaker, what: scenario.Scenario) -> int:
-    """Runs the scenario `what` and shows it. Returns the status of the command."""
+def run(maker: UnitMaker, what: scenario.Scenario, record: Path | None) -> int:
+    """Runs the scenario `what`, shows it and writes the page `record`. Returns the status of the command."""
+    if record and (record.is_dir() or not os.access(record.parent, os.W_OK)):
+        raise UnitError(f"--record: {record} cannot be written")
     with temporary_folder() as folder:
         unit = maker.make(what, folder)
         print(f"{what.name}: {what.summary}\nUnit: {unit.name}\n", flush=True)
         with LiveDisplay(unit) if terminal() else PlainDisplay() as display:
             result = run_on(unit, display.show, maker.speed)
-    print_outcome(what, result)
-    wrong = differences(what, result)
-    for line in wrong:
-        print(f"DIFFERENCE: {line}")
-    return 1 if wrong else 0
+    summary = Summary(what, unit.name, result, differences(what, result))
+    print_summary(summary)
+    if record:
+        record.write_text(page(summary, maker.speed), encoding="utf-8", errors="replace")
+        print(f"Page: {record}")
+    return 1 if summary.wrong else 0
 
 
 def arguments() -> argparse.Namespace:
@@ -81,9 +85,12 @@ def arguments() -> argparse.Namespace:
         help="use the build in FOLDER as it is (default: build/default, built first)",
     )
     parser.add_argument("--full-length", action="store_true", help="keep every wait: up to 14 minutes")
+    parser.add_argument("--record", type=Path, metavar="FILE", help="write the run as an HTML page with its timeline")
     given = parser.parse_args()
     if given.speed < 1:
         parser.error("--speed: must be 1 or more")
+    if given.record and given.all:
+        parser.error("--record: takes one scenario, not --all")
     if given.jobs < 1:
         parser.error("--jobs: must be 1 or more")
     if given.full_length:
@@ -107,7 +114,7 @@ def main() -> int:
         maker = UnitMaker(given.unit, given.speed, (given.build or BUILD).resolve())
         if given.all:
             return 0 if run_all(maker, wanted, given.jobs) else 1
-        return run(maker, wanted[0])
+        return run(maker, wanted[0], given.record)
     except BrokenPipeError:
         os.dup2(os.open(os.devnull, os.O_WRONLY), sys.stdout.fileno())
         return 1

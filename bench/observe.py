@@ -67,6 +67,7 @@ class Run:
     log: str = ""
     calls: list[Call] = field(default_factory=list)
     panel: Panel = field(default_factory=Panel)
+    sent: list[tuple[float, int]] = field(default_factory=list)  # to the panel: time (s), byte
     changes: list[Change] = field(default_factory=list)
     _offsets: dict[Path, int] = field(default_factory=dict)
 
@@ -76,6 +77,7 @@ class Run:
             self._take_call(line)
         for line in self._new_lines(self.files.panel).splitlines():
             moment, byte = line.split()
+            self.sent.append((float(moment), int(byte, 16)))
             self.panel.send(int(byte, 16), float(moment))
             leds = self.panel.shown(float(moment))
             if leds != (self.changes[-1].leds if self.changes else dict.fromkeys(leds, 0)):

@@ -44,7 +44,7 @@ class Result:
     state: State
     status: int
     seconds: float
-    log_is_exact: bool  # see Unit
+    log_is_exact: bool = True  # see Unit
 
 
 @contextlib.contextmanager

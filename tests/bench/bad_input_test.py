@@ -37,6 +37,16 @@ class BadInput(unittest.TestCase):
         file = self.folder / "none.toml"
         self.assertEqual(self.bench(file), (1, "", f"bench: {file}: No such file or directory\n"))
 
+    def test_page_that_cannot_be_written(self) -> None:
+        for file in (self.folder / "none/page.html", self.folder):
+            message = f"bench: --record: {file} cannot be written\n"
+            self.assertEqual(self.bench("--build", "none", "--record", file, "up-to-date"), (1, "", message))
+
+    def test_page_of_many_scenarios(self) -> None:
+        status, shown, message = self.bench("--all", "--record", self.folder / "page.html")
+        self.assertEqual((status, shown), (2, ""))
+        self.assertIn("--record: takes one scenario, not --all\n", message)
+
     def test_no_toml(self) -> None:
         self.check_file(GOOD.replace("[board]", "[board"), 6, "Expected ']' at the end of a table declaration")
 

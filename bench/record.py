@@ -1,0 +1,174 @@
+"""Writes a run as a page of its own: the panel's LEDs and the commands against time, the summary and the log."""
+
+import re
+from collections.abc import Iterator
+from html import escape
+from itertools import pairwise
+from string import Template
+
+from display import Summary
+from observe import Call, Run, now
+from panel import STEP_UNIT, Panel, color_name, led_name
+
+WIDTH = 1200  # of the timeline; all lengths are in the drawing's own unit
+LEFT = 90  # of the time axis; before it stand the names of the LEDs
+RIGHT = 16  # margin behind the axis
+ROW = 20
+LETTER = 6.2  # about the width of one
+FILLS = {"off": "#e4e6ea", "blue": "#1f6feb", "pass": "#1a9c3e", "fail": "#d1242f"}
+OTHER_FILL = "#a020a0"
+COMMAND, WAIT = "#57606a", "#c9a227"
+TICKS = [0.1, 0.2, 0.5, 1, 2, 5, 10, 20, 30, 60, 120, 300]  # s
+MOST_TICKS = 16
+
+PAGE = Template(
+    """<!DOCTYPE html>
+<html lang="en">
+<meta charset="utf-8">
+<title>$name: $outcome</title>
+<style>
+body { font: 14px/1.4 sans-serif; margin: 24px auto; max-width: ${width}px; padding: 0 16px; color: #1c1f24; }
+h1 { font-size: 22px; margin: 0; } h2 { font-size: 16px; margin: 28px 0 8px; }
+table { border-collapse: collapse; } th { text-align: left; font-weight: 600; }
+td, th { padding: 2px 16px 2px 0; vertical-align: top; }
+svg { width: 100%; height: auto; } svg text { font-size: 11px; fill: #1c1f24; }
+code, pre { font: 12px monospace; white-space: pre-wrap; overflow-wrap: anywhere; }
+.number { text-align: right; white-space: nowrap; } .wrong { color: #d1242f; }
+</style>
+<h1>$name: $outcome</h1>
+<p>$summary<br>Unit: $unit. $speed</p>
+$wrong<h2>Panel at the end</h2>
+$panel
+<h2>Timeline</h2>
+$timeline
+<h2>Summary</h2>
+<table>$rows</table>
+<h2>Commands</h2>
+<table><tr><th class="number">after</th><th class="number">took</th><th class="number">status</th><th>command</th></tr>
+$commands</table>
+<h2>Log</h2>
+<pre>$log</pre>
+</html>
+"""
+)
+
+
+def page(summary: Summary, speed: float) -> str:
+    """The page for a run whose waits were `speed` times shorter."""
+    run, scenario = summary.result.run, summary.scenario
+    begin = run.calls[0].start if run.calls else now()
+    ends = [call.end or call.start for call in run.calls] + [moment for moment, _ in run.sent]
+    end = max([begin + 0.1, *ends])
+    speeded = f"The updater's waits are {speed:g} times shorter, commands take their real time." if speed > 1 else ""
+    wrong = "".join(f'<p class="wrong">Not as the scenario says: {escape(line)}</p>\n' for line in summary.wrong)
+    return PAGE.substitute(
+        width=WIDTH,
+        name=escape(scenario.name),
+        outcome=escape(summary.outcome),
+        summary=escape(scenario.summary),
+        unit=escape(summary.unit),
+        speed=speeded,
+        wrong=wrong,
+        panel=_panel(run.panel.shown(now())),
+        timeline=_timeline(run, begin, end),
+        rows="".join(f"<tr><th>{escape(name)}<td>{escape(value)}\n" for name, value in summary.rows()),
+        commands="".join(_command(call, begin) for call in run.commands()),
+        log=escape(run.log),
+    )
+
+
+def lit(run: Run, end: float) -> dict[int, list[tuple[float, float, int]]]:
+    """For each LED the times from, to (s) in which it was lit, and its colour. Sequences are played until `end`."""
+    found: dict[int, list[tuple[float, float, int]]] = {led: [] for led in Panel().leds}
+    for start, stop, leds in _shown(run, end):
+        for led, color in leds.items():
+            spans = found[led]
+            if not color:
+                continue
+            if spans and spans[-1][1:] == (start, color):
+                start = spans.pop()[0]
+            spans.append((start, stop, color))
+    return found
+
+
+def _shown(run: Run, end: float) -> Iterator[tuple[float, float, dict[int, int]]]:
+    """Times from, to (s), and what the LEDs show between."""
+    panel = Panel()
+    for (moment, byte), (following, _) in pairwise([*run.sent, (end, 0)]):
+        panel.send(byte, moment)
+        flashing = any(led.started is not None for led in panel.leds.values())
+        while moment < following:
+            stop = min(following, moment + STEP_UNIT) if flashing else following
+            yield moment, stop, panel.shown(moment)
+            moment = stop
+
+
+def _panel(leds: dict[int, int]) -> str:
+    lights = ""
+    for number, (led, color) in enumerate(leds.items()):
+        x = 40 + number * 80
+        lights += f'<circle cx="{x}" cy="24" r="12" fill="{_fill(color)}" stroke="#8a9099"/>'
+        lights += f'<text x="{x}" y="54" text-anchor="middle">{led_name(led).removeprefix("0x")}</text>\n'
+    return f'<svg id="panel" viewBox="0 0 {len(leds) * 80} 64" style="max-width: 900px">{lights}</svg>'
+
+
+def _timeline(run: Run, begin: float, end: float) -> str:
+    scale = (WIDTH - LEFT - RIGHT) / (end - begin)
+
+    def across(moment: float) -> float:
+        return LEFT + (moment - begin) * scale
+
+    def bar(start: float, stop: float, top: float, fill: str, title: str) -> str:
+        length = max(1.0, (stop - start) * scale)
+        place = f'x="{across(start):.1f}" y="{top}" width="{length:.1f}" height="{ROW - 6}"'
+        return f'<rect {place} fill="{fill}"><title>{escape(title)}</title></rect>\n'
+
+    drawn, top = "", 4
+    for led, spans in lit(run, end).items():
+        drawn += f'<text x="{LEFT - 8}" y="{top + 11}" text-anchor="end">{led_name(led).removeprefix("0x")}</text>'
+        drawn += bar(begin, end, top, FILLS["off"], f"{led_name(led)} dark")
+        for start, stop, color in spans:
+            title = f"{led_name(led)} {color_name(color)} from {start - begin:.2f} s to {stop - begin:.2f} s"
+            drawn += bar(start, stop, top, _fill(color), title)
+        top += ROW
+    top += 10
+    waits = run.waits()
+    for call in [call for call in run.calls if call in waits or _is_command(call)]:
+        text = f"wait of {call.seconds} s" if call in waits else call.text
+        stop = call.end if call.end is not None else end
+        fill = WAIT if call in waits else COMMAND
+        drawn += bar(call.start, stop, top, fill, f"{text}: {stop - call.start:.2f} s")
+        left = across(call.start)
+        drawn += _label(re.sub(r"( +-o \S+)+", " …", text), left, max(across(stop), left + 1), top + 11)
+        top += ROW
+    step = next((tick for tick in TICKS if (end - begin) / tick <= MOST_TICKS), TICKS[-1])
+    grid = ""
+    for number in range(int((end - begin) / step) + 1):
+        x = across(begin + number * step)
+        grid += f'<line x1="{x:.1f}" y1="0" x2="{x:.1f}" y2="{top}" stroke="#f0f1f3"/>'
+        grid += f'<text x="{x:.1f}" y="{top + 14}" text-anchor="middle">{number * step:g} s</text>\n'
+    return f'<svg id="timeline" viewBox="0 0 {WIDTH} {top + 20}">\n{grid}{drawn}</svg>'
+
+
+def _label(text: str, left: float, right: float, baseline: float) -> str:
+    """`text` behind its bar, or before it where there is more room; cut to what fits."""
+    behind = WIDTH - right >= left - LEFT
+    room = int(((WIDTH - right if behind else left - LEFT) - 12) / LETTER)
+    shown = text if len(text) <= room else f"{text[: max(room - 1, 0)]}…"
+    place = f'x="{right + 5:.1f}"' if behind else f'x="{left - 5:.1f}" text-anchor="end"'
+    return f'<text {place} y="{baseline}">{escape(shown)}</text>\n'
+
+
+def _is_command(call: Call) -> bool:
+    return call.call != "nanosleep" and not call.text.startswith("i2cset ")
+
+
+def _command(call: Call, begin: float) -> str:
+    took = f"{call.end - call.start:.2f} s" if call.end is not None else "ended"
+    status = "" if call.status is None else str(call.status)
+    cells = "".join(f'<td class="number">{value}' for value in (f"{call.start - begin:.2f} s", took, status))
+    return f"<tr>{cells}<td><code>{escape(call.text)}</code>\n"
+
+
+def _fill(color: int) -> str:
+    return FILLS.get(color_name(color), OTHER_FILL)

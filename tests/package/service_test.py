@@ -295,6 +295,21 @@ class Ends(ServiceTest):
         self.assertEqual(self.package_state(), "install ok installed 1.3.0")
         self.assertEqual(self.panel(), {"REMOTE": "pass", "MAIN": "pass"})  # up to date
 
+    def test_unpacking_that_a_power_cut_broke_off_is_done_again(self) -> None:
+        self.offer()
+        # What dpkg notes of its steps stays in this folder until it ends; apt installs nothing as long as it is there.
+        self.inside(
+            "sh",
+            "-c",
+            "cd /var/lib/dpkg && sed -n '/^Package: solvik4-rh$/,/^$/p' status |"
+            " sed 's/^Status: .*/Status: install reinstreq half-installed/' >updates/0000",
+        )
+        self.assertEqual(self.package_state(), "install reinstreq half-installed 1.2.0")
+        self.start()
+        self.wait_for_end()
+        self.assertEqual(self.package_state(), "install ok installed 1.3.0")
+        self.assertEqual(self.panel(), {"PASS": "pass"})
+
     def test_package_that_cannot_be_set_up_does_not_keep_the_updater(self) -> None:
         self.offer("exit 1")
         self.inside("dpkg", "--unpack", "/srv/repository/solvik4-rh_1.3.0.deb")

@@ -17,7 +17,7 @@
 namespace
 {
 
-std::string resultPath;
+std::ofstream* result = nullptr;
 sem_t ending;
 
 double seconds(const timeval& time)
@@ -28,7 +28,7 @@ double seconds(const timeval& time)
 __attribute__((constructor)) void begin()
 {
     const char* path = getenv("MEASURED");
-    resultPath = path == nullptr ? "" : path;
+    result = new std::ofstream(path == nullptr ? "" : path);
     unsetenv("MEASURED");
     unsetenv("LD_PRELOAD");
     sem_init(&ending, 0, 0);
@@ -43,7 +43,7 @@ __attribute__((destructor)) void end()
     while (status >> peak && peak != "VmHWM:") {
     }
     status >> peak;
-    std::ofstream(resultPath) << seconds(used.ru_utime) + seconds(used.ru_stime) << ' ' << peak << '\n';
+    *result << seconds(used.ru_utime) + seconds(used.ru_stime) << ' ' << peak << std::endl;
 }
 
 } // namespace

@@ -194,11 +194,18 @@ private:
                 continue;
             }
             cell(index, index + 1, "");
-            for (const Action& action : step.actions) {
-                if (!isWait(action)) {
-                    mOut << "<div><code>" << html(action.text) << "</code> <span class=\"status\">"
-                         << html(action.status) << "</span></div>";
+            for (auto action = step.actions.begin(); action != step.actions.end();) {
+                // Attempts that came out alike are one line.
+                const auto next = std::find_if(action, step.actions.end(), [&](const Action& other) {
+                    return other.text != action->text || other.status != action->status;
+                });
+                if (!isWait(*action)) {
+                    mOut << "<div><code>" << html(action->text) << "</code> <span class=\"status\">"
+                         << html(action->status);
+                    mOut << (next - action > 1 ? " (" + std::to_string(next - action) + " times)" : "")
+                         << "</span></div>";
                 }
+                action = next;
             }
             mOut << "</div>\n";
         }

@@ -278,6 +278,15 @@ class Page(Base):
             self.assertIn(f">{lane}</div>", text)
         self.assertIn("wait 780 s", text)
 
+    def test_attempts_that_came_out_alike_are_one_line(self) -> None:
+        command = "scp: OSUpgrade.zip and unzipUpgrade.sh"
+        text = self.page("board-upload-fails.log")
+        self.assertEqual(text.count(command), 1)
+        self.assertIn("failed (20 times)", text)
+        text = self.page("board-upload-succeeds-at-last.log")
+        self.assertEqual(text.count(command), 2)
+        self.assertIn("failed (19 times)", text)
+
 
 class Memory(Base):
     """Memory is bounded whatever the log."""

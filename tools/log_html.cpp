@@ -315,13 +315,17 @@ void writeScale(const Run& run, std::ostream& out)
 void writeProblem(const Run& run, const Problem& problem, const std::string& heading, const char* style,
                   std::ostream& out)
 {
-    const Step& step = run.steps[problem.step];
-    out << "<div class=\"problem " << style << "\"><b>" << heading << html(stepTitle(step.kind)) << "</b> (line "
-        << step.line << ")<br>\n"
-        << html(problem.why) << "<br>\n<b>Do now:</b> " << html(problem.remedy) << '\n';
-    if (step.said.count > 0) {
+    const Step* step = run.stepOf(problem);
+    out << "<div class=\"problem " << style << "\"><b>" << heading;
+    if (step == nullptr) {
+        out << "a step that is not in this log</b><br>\n";
+    } else {
+        out << html(stepTitle(step->kind)) << "</b> (line " << step->line << ")<br>\n";
+    }
+    out << html(problem.why) << "<br>\n<b>Do now:</b> " << html(problem.remedy) << '\n';
+    if (step != nullptr && step->said.count > 0) {
         out << "<pre>";
-        for (const std::string& line : step.said.shown()) {
+        for (const std::string& line : step->said.shown()) {
             out << html(line) << '\n';
         }
         out << "</pre>\n";

@@ -58,10 +58,10 @@ Json stepToJson(const Step& step)
 
 Json problemToJson(const Run& run, const Problem& problem)
 {
-    const Step& step = run.steps[problem.step];
+    const Step* step = run.stepOf(problem);
     return {{"name", problem.name},
-            {"step", stepName(step.kind)},
-            {"line", step.line},
+            {"step", step == nullptr ? Json() : Json(stepName(step->kind))},
+            {"line", step == nullptr ? Json() : Json(step->line)},
             {"why", problem.why},
             {"remedy", problem.remedy}};
 }

@@ -65,13 +65,19 @@ void printLines(const OtherLines& lines, std::ostream& out)
 
 void printProblem(const Run& run, const Problem& problem, const std::string& heading, std::ostream& out)
 {
-    const Step& step = run.steps[problem.step];
-    out << '\n' << heading << stepTitle(step.kind) << " (line " << step.line << ") [" << problem.name << "]\n";
+    const Step* step = run.stepOf(problem);
+    out << '\n' << heading;
+    if (step == nullptr) {
+        out << "a step that is not in this log";
+    } else {
+        out << stepTitle(step->kind) << " (line " << step->line << ')';
+    }
+    out << " [" << problem.name << "]\n";
     printWrapped("  Why:     ", problem.why, out);
     printWrapped("  Do now:  ", problem.remedy, out);
-    if (step.said.count > 0) {
+    if (step != nullptr && step->said.count > 0) {
         out << "  The tools said:\n";
-        printLines(step.said, out);
+        printLines(step->said, out);
     }
 }
 

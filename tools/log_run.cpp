@@ -154,6 +154,11 @@ const Step* Run::find(StepKind kind) const
     return found == steps.rend() ? nullptr : &*found;
 }
 
+const Step* Run::stepOf(const Problem& problem) const
+{
+    return problem.step < steps.size() ? &steps[problem.step] : nullptr;
+}
+
 const char* stepTitle(StepKind kind)
 {
     return kindTexts.at(static_cast<std::size_t>(kind)).title;

@@ -117,7 +117,7 @@ enum class RunEnd {
 struct Problem
 {
     std::string name; ///< fixed name in kebab-case, for programs and the documents
-    std::size_t step; ///< index of the run's step
+    std::size_t step; ///< index of the run's step; see Run::stepOf()
     std::string why;
     std::string remedy;
 };
@@ -160,6 +160,9 @@ struct Run
     std::vector<std::string> untold; ///< what the log cannot tell
 
     const Step* find(StepKind kind) const; ///< the last one, or null
+
+    /// The step that `problem` is about; null when the log shows none of this run's steps.
+    const Step* stepOf(const Problem& problem) const;
 };
 
 /// Name of a step for people, such as "Refresh the package mirrors".

@@ -81,6 +81,35 @@ class Outcomes(Base):
         self.assertEqual(run_tool(text=both[1] + both[0]).returncode, 1)
 
 
+class Pieces(Base):
+    """Logs of which next to nothing is left."""
+
+    def test_only_the_feedback_is_left(self) -> None:
+        log = (GOLDEN / "aplay-missing.log").read_bytes()
+        start = log.rindex(b"Updater |", 0, log.index(b"Failed to play a sound"))
+        piece = log[start : log.index(b"\n", log.index(b"Failed to play a sound")) + 1]
+        self.assertEqual(piece.count(b"Updater |"), 1)
+        done = run_tool(text=piece)
+        self.assertEqual(done.returncode, 1)
+        self.assertIn(b"Besides: a step that is not in this log [sound-failed]", done.stdout)
+        [problem] = json.loads(run_tool("--json", text=piece).stdout)["runs"][0]["besides"]
+        self.assertEqual((problem["name"], problem["step"], problem["line"]), ("sound-failed", None, None))
+        page = self.folder / "page.html"
+        self.assertEqual(run_tool("--html", str(page), text=piece).returncode, 1)
+        self.assertIn("a step that is not in this log</b>", page.read_text())
+
+    def test_each_record_alone(self) -> None:
+        log = (GOLDEN / "journal-short-board-disk-full.log").read_bytes()
+        lines = log.splitlines(keepends=True)
+        for name in ("panel-absent", "services-killed", "main-head-all", "upload-not-waited-for"):
+            lines += (GOLDEN / f"{name}.log").read_bytes().splitlines(keepends=True)
+        alone = {lines[index] + lines[index + 1] for index in range(len(lines) - 1) if b"Updater |" in lines[index]}
+        kinds = {line[line.index(b"(") :] if b"(" in line else line: line for line in alone}
+        for piece in kinds.values():
+            with self.subTest(piece):
+                self.assertIn(run_tool(text=piece).returncode, (0, 1))
+
+
 class BadInput(Base):
     """One clear line on standard error, and status 2."""
 

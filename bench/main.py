@@ -3,11 +3,11 @@
 import argparse
 import os
 import signal
-import subprocess
 import sys
 from pathlib import Path
 
 import scenario
+from build import BUILD, build
 from compare import differences
 from display import PlainDisplay, Summary, print_summary, terminal
 from live import LiveDisplay
@@ -15,28 +15,6 @@ from record import page
 from session import KINDS, UnitMaker, run_on, temporary_folder
 from table import run_all
 from unit import UnitError
-
-ROOT = Path(__file__).parent.parent
-BUILD = ROOT / "build/default"
-PACKAGES = ["cmake", "ninja-build", "g++-11", "libgtest-dev", "libgmock-dev"]
-PACKAGES += ["util-linux", "iproute2", "openssh-client", "i2c-tools", "alsa-utils", "dpkg-dev", "unzip"]
-TARGETS = ["harl-updater", "main-head-driver", "tap", "i2c_bus"]
-
-
-def build() -> None:
-    """Brings the updater and the bench's own programs up to date. Says nothing unless something fails."""
-    install = ["scripts/install-packages", *PACKAGES]
-    if subprocess.run(install, cwd=ROOT, stdout=sys.stderr, check=False).returncode != 0:
-        sys.exit(1)
-    for command in (
-        ["cmake", "--preset", "default"],
-        ["cmake", "--build", "--preset", "default", "--target", *TARGETS],
-    ):
-        done = subprocess.run(
-            command, cwd=ROOT, stdout=subprocess.PIPE, stderr=subprocess.STDOUT, text=True, check=False
-        )
-        if done.returncode != 0:
-            sys.exit(f"{done.stdout}bench: {' '.join(command)} failed with status {done.returncode}")
 
 
 def run(maker: UnitMaker, what: scenario.Scenario, record: Path | None) -> int:

@@ -24,14 +24,14 @@ WAITS = 820  # s, of an update at full length
 # Reads until its owner has ended, then clears away what still runs and lies there.
 GUARD = """
 read -r _
-for _ in $(seq 50); do
+for _ in $(seq 200); do
     read -r pid <"$0/unit.pid" && kill -s KILL -- "-$pid"
     if read -r group <"$0/control-group"; then
         find "$group" -depth -type d -exec rmdir {} +
-        [ ! -e "$group" ] || { sleep 0.2; continue; }
+        [ ! -e "$group" ] || { sleep 0.05; continue; }
     fi
     rm -rf "$0" && exit
-    sleep 0.2
+    sleep 0.05
 done
 """
 

@@ -52,6 +52,7 @@ std::vector<Entry> entryList;
 std::map<std::string, Script> scripts;
 std::map<FILE*, int> pipes;
 std::function<int(const timespec*, timespec*)> sleepScript;
+std::function<void()> recordHook;
 LogBuffer& logBuffer = *new LogBuffer; // lives on: std::cout is flushed once more at exit
 
 const std::string separator = "\n\t\t\t";
@@ -80,8 +81,15 @@ std::streamsize LogBuffer::xsputn(const char* text, std::streamsize size)
 {
     const std::string record(text, static_cast<std::size_t>(size));
     enter("log:" + messageOf(record));
-    const std::lock_guard<std::mutex> lock(mutex);
-    mTexts.push_back({record, false});
+    std::function<void()> hook;
+    {
+        const std::lock_guard<std::mutex> lock(mutex);
+        mTexts.push_back({record, false});
+        hook = recordHook;
+    }
+    if (hook) {
+        hook();
+    }
     return size;
 }
 
@@ -132,6 +140,7 @@ void reset()
     entryList.clear();
     scripts.clear();
     sleepScript = {};
+    recordHook = {};
     logBuffer.mTexts.clear();
     std::cout.clear();
     std::cout.rdbuf(&logBuffer);
@@ -147,6 +156,12 @@ void scriptSleep(const std::function<int(const timespec*, timespec*)>& pause)
 {
     const std::lock_guard<std::mutex> lock(mutex);
     sleepScript = pause;
+}
+
+void afterRecord(const std::function<void()>& hook)
+{
+    const std::lock_guard<std::mutex> lock(mutex);
+    recordHook = hook;
 }
 
 void note(const std::string& text)

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstddef>
 #include <cstdint>
 #include <functional>
 #include <string>
@@ -42,7 +43,7 @@ struct Record
     std::string text; ///< the whole record as it was written
 };
 
-/// Forgets the journal, the answers and the pauses, and takes over std::cout.
+/// Forgets the journal, the answers, the pauses and the hook, and takes over std::cout.
 void reset();
 
 /// Scripts the answers of an exact command line, in order; the last one repeats.
@@ -50,6 +51,9 @@ void script(const std::string& command, const std::vector<Answer>& answers);
 
 /// Replaces the pauses: `pause` gets and returns what nanosleep(2) does, errno included.
 void scriptSleep(const std::function<int(const timespec* duration, timespec* remaining)>& pause);
+
+/// Runs `hook` on the thread that has just written a record, before it goes on.
+void afterRecord(const std::function<void()>& hook);
 
 /// Adds an entry of the test's own, for example from a callback.
 void note(const std::string& text);
@@ -65,6 +69,9 @@ Lines entries(const std::string& prefix);
 
 /// The log records so far. Fails the test when one is not well-formed.
 std::vector<Record> records();
+
+/// How many objects of `size` bytes (less than 64) the calling thread has released with delete.
+int released(std::size_t size);
 
 /// Waits until `condition` holds. Fails the test after ten seconds.
 void waitFor(const std::function<bool()>& condition);

@@ -161,6 +161,35 @@ TEST_F(UnitTest, UnlockWithoutAWaiterIsForgotten)
     waiting.join();
 }
 
+TEST_F(UnitTest, UnlockWaitsUntilTheWokenThreadHasLeftTheLock)
+{
+    std::atomic<bool> leave{false};
+    std::thread waiting(RemoteUpdateManager::lockApp);
+    const std::thread::id waiter = waiting.get_id();
+    platform::waitFor([] { return journal().size() == 1; });
+    platform::delay(100); // from its first record to the wait
+    platform::afterRecord([waiter, &leave] {
+        if (std::this_thread::get_id() == waiter) { // its second record, written under the lock
+            platform::note("woken");
+            platform::waitFor([&leave] { return leave.load(); });
+        }
+    });
+    RemoteUpdateManager::unlockApp();
+    platform::waitFor([] { return journal().back() == "woken"; });
+
+    std::atomic<bool> unlocked{false};
+    std::thread second([&unlocked] {
+        RemoteUpdateManager::unlockApp();
+        unlocked = true;
+    });
+    platform::waitFor([] { return journal().back() == "log:"; });
+    platform::delay(50);
+    EXPECT_FALSE(unlocked);
+    leave = true;
+    waiting.join();
+    second.join();
+}
+
 /// A whole update of the remote head. The application takes a moment to stop, as a real one does: the update must not
 /// be over before the main thread waits for it.
 class WholeUpdate : public UnitTest

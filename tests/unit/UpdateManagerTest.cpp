@@ -45,6 +45,20 @@ TEST_F(Manager, IsOneObject)
     EXPECT_NE(manager, nullptr);
 }
 
+TEST_F(Manager, ReportsHaveTheirNumbers)
+{
+    EXPECT_EQ((Lines{std::to_string(UpdateManager::RESULT_NO_UPDATE), std::to_string(UpdateManager::RESULT_UPDATED)}),
+              (Lines{"0", "1"}));
+    EXPECT_EQ(
+        (Lines{std::to_string(UpdateManager::ERROR_CHECK_UPDATE), std::to_string(UpdateManager::ERROR_UPDATE_MIRRORS),
+               std::to_string(UpdateManager::ERROR_INSTALL_PACKAGE), std::to_string(UpdateManager::ERROR_INSTALL_QUORB),
+               std::to_string(UpdateManager::ERROR_INSTALL_TEAMVIEWER)}),
+        (Lines{"0", "1", "2", "3", "4"}));
+    EXPECT_EQ((Lines{std::to_string(UpdateManager::COMPONENT_PACKAGE), std::to_string(UpdateManager::COMPONENT_QUORB),
+                     std::to_string(UpdateManager::COMPONENT_TEAMVIEWER)}),
+              (Lines{"0", "1", "2"}));
+}
+
 TEST_F(Manager, CallbacksAreValidWhenNoneIsNull)
 {
     for (const bool result : {false, true}) {
@@ -170,7 +184,9 @@ TEST_F(Manager, UpdateOfTheMainHeadWaitsForTheCheckAndReturnsBeforeTheInstallati
     script(mirrorsCommand, {exits(100)});
     script(teamViewerScriptCommand, {{0, "", true, [] { platform::delay(100); }}});
     manager->init(false);
+    const int before = platform::released(sizeof(std::thread));
     manager->update({{UpdateManager::COMPONENT_TEAMVIEWER, "TV", "1", "2"}}, false);
+    EXPECT_EQ(platform::released(sizeof(std::thread)) - before, 1) << "the check's thread object";
     EXPECT_TRUE(noted("error:1")) << "update() did not wait for the check";
     EXPECT_FALSE(noted("result:1")) << "update() waited for the installation";
     platform::waitFor([] { return noted("result:1"); });

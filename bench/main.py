@@ -3,6 +3,7 @@
 import argparse
 import os
 import signal
+import subprocess
 import sys
 from pathlib import Path
 
@@ -96,7 +97,7 @@ def main() -> int:
     except BrokenPipeError:
         os.dup2(os.open(os.devnull, os.O_WRONLY), sys.stdout.fileno())
         return 1
-    except (scenario.ScenarioError, UnitError, OSError) as error:
+    except (scenario.ScenarioError, UnitError, OSError, subprocess.SubprocessError) as error:
         print(f"bench: {error}", file=sys.stderr)
         return 1
     except KeyboardInterrupt:

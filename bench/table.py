@@ -1,5 +1,6 @@
 """Runs many scenarios side by side and shows how each came out."""
 
+import subprocess
 import threading
 import time
 from concurrent.futures import ThreadPoolExecutor, as_completed
@@ -40,7 +41,7 @@ def run_one(maker: UnitMaker, what: Scenario, stop: threading.Event) -> Outcome:
             wrong = differences(what, run_on(unit, check, maker.speed))
         except NotServed as error:
             return outcome("none", f"not run: {error}", [])
-        except (UnitError, OSError) as error:
+        except (UnitError, OSError, subprocess.SubprocessError) as error:
             return outcome("none", "FAILED", [str(error)])
     return outcome(unit.kind, "DIFFERENT" if wrong else "as it says", wrong)
 

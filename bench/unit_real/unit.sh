@@ -6,6 +6,7 @@
 # scenario, and `out` for what the unit writes. The roots lie in a tmpfs that only these namespaces see.
 set -eu
 
+PATH=$PATH:/usr/sbin:/sbin # a plain user's goes without
 folder=$1
 here=$(dirname "$0")
 head=$folder/unit/head

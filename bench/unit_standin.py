@@ -15,7 +15,8 @@ TOOLS = ["systemctl", "umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp", "i
 
 def sanitizers(program: Path) -> list[str]:
     """The sanitizers that `program` was built with: they have to be loaded before anything else."""
-    libraries = subprocess.run(["ldd", program], stdout=subprocess.PIPE, text=True, check=True).stdout
+    # A script in the program's place has none: ldd fails.
+    libraries = subprocess.run(["ldd", program], capture_output=True, text=True, check=False).stdout
     return re.findall(r"^\s*(lib[at]san\.so\.\d+) ", libraries, re.MULTILINE)
 
 

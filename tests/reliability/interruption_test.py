@@ -17,7 +17,6 @@ sys.path.insert(0, str(Path(__file__).parents[2] / "bench"))
 
 import scenario
 from disturbed import SPEED, DisturbedUnit, outcome
-from scenario import Scenario
 from session import run_on, temporary_folder
 from unit import State
 

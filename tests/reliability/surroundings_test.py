@@ -130,7 +130,8 @@ class SurroundingsTest(unittest.TestCase):
         if os.geteuid() != 0:
             self.skipTest("needs root, to run as a user without other processes")
         unit = self.unit(
-            runner=f"/usr/bin/prlimit --nproc={limit} /usr/bin/setpriv --reuid={PLAIN_USER} --regid={PLAIN_USER} --clear-groups",
+            runner=f"/usr/bin/prlimit --nproc={limit} "
+            f"/usr/bin/setpriv --reuid={PLAIN_USER} --regid={PLAIN_USER} --clear-groups",
         )
         self.folder.chmod(0o777)
         make = unit._start_updater

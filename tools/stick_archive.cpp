@@ -453,6 +453,11 @@ private:
                 "copies it without looking into it; unpacking it may fill the board.",
                 "Make sure that this is the board's own upgrade archive.");
         }
+        const std::uint64_t padding = mSource.size - mPackedBytes;
+        if (padding > suspiciousSize) {
+            add(Severity::WARNING, "archive-padding", " holds " + byteCount(padding) + " that belong to no entry.",
+                "copies all of it, which takes its time and may fill the board.", anotherArchive);
+        }
         const std::uint64_t boardBytes = mSource.size + mUnpackedBytes;
         mReport.addFact("board_bytes", "Needed on the board",
                         byteCount(boardBytes) + ": the archive and everything in it side by side", boardBytes);

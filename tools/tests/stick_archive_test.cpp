@@ -262,3 +262,9 @@ TEST(StickArchive, ContentsOfAHundredTimesTheSizeAreAWarning)
 {
     EXPECT_EQ(findingsOf(check(zipArchive({{"a", std::string(101'000'000, '\0')}}))), Lines{"warning archive-ratio"});
 }
+
+TEST(StickArchive, MuchInFrontOfTheArchiveIsAWarning)
+{
+    EXPECT_EQ(findingsOf(check(std::string(101'000'000, '\0') + zipArchive({{"a", "abc"}}))),
+              Lines{"warning archive-padding"});
+}

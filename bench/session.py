@@ -2,6 +2,7 @@
 
 import contextlib
 import os
+import shutil
 import subprocess
 import tempfile
 import time
@@ -20,6 +21,7 @@ from unit_standin import StandInUnit
 KINDS = ["best", "real", "real-without-systemd", "stand-in"]
 POLL = 0.02  # s
 LONGEST_RUN = 120  # s, besides the waits; a run that takes longer hangs
+SPACE = 20  # MB, that a unit may take in its temporary folder
 WAITS = 820  # s, of an update at full length
 # Reads until its owner has ended, then clears away what still runs and lies there.
 GUARD = """
@@ -49,7 +51,14 @@ class Result:
 
 @contextlib.contextmanager
 def temporary_folder() -> Iterator[Path]:
-    """A folder that goes with this process, in whatever way the process ends, and with it the updater."""
+    """A folder that goes with this process, in whatever way the process ends, and with it the updater.
+
+    Raises UnitError when there is no room for a unit in it.
+    """
+    place = tempfile.gettempdir()
+    free = shutil.disk_usage(place).free // 1_000_000
+    if free < SPACE:
+        raise UnitError(f"{free} MB are free in {place}, a unit needs {SPACE}: make room there or name another TMPDIR")
     folder = tempfile.mkdtemp(prefix="bench-")
     try:
         guard = subprocess.Popen(

@@ -82,6 +82,16 @@ class BadInput(unittest.TestCase):
         status, _, message = self.bench("up-to-date", TMPDIR=str(self.folder))
         self.assertEqual((status, message.count("\n")), (1, 1))
 
+    def test_too_little_space(self) -> None:
+        bench = f"{sys.executable} -B {ROOT}/bench/main.py --build none --unit stand-in up-to-date"
+        script = f"mount -t tmpfs -o size=3m small {self.folder} || exit 77; TMPDIR={self.folder} exec {bench}"
+        unshare = ["unshare", "--map-root-user", "--mount", "sh", "-c", script]
+        done = subprocess.run(unshare, capture_output=True, text=True, check=False)
+        if done.returncode == 77 or "unshare" in done.stderr:
+            self.skipTest("this machine forbids namespaces")
+        message = f"bench: 3 MB are free in {self.folder}, a unit needs 20: make room there or name another TMPDIR\n"
+        self.assertEqual((done.returncode, done.stdout, done.stderr), (1, "", message))
+
     def test_missing_package(self) -> None:
         tools = self.folder / "bin"
         tools.mkdir()

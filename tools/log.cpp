@@ -28,9 +28,9 @@ namespace
 
 using Json = nlohmann::ordered_json;
 
-const std::size_t blockSize = 256 * 1024; // bytes
-const int pollTime = 250;                 // ms between two looks at a file, and at the clock
-const int settleTime = 2;                 // s, at most, for the earlier runs in a pipe
+const std::size_t blockSize = std::size_t{256} * 1024; // bytes
+const int pollTime = 250;                              // ms between two looks at a file, and at the clock
+const int settleTime = 2;                              // s, at most, for the earlier runs in a pipe
 
 /// What an input that holds no text begins with, and what to do about it.
 struct Magic

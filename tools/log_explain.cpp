@@ -70,7 +70,7 @@ const Hint hints[] = {
 const Hint* hintFor(const Step& step)
 {
     const auto fits = [&](const Hint& hint) { return step.said.contain(hint.said); };
-    const auto found = std::find_if(std::begin(hints), std::end(hints), fits);
+    const Hint* const found = std::find_if(std::begin(hints), std::end(hints), fits);
     return found == std::end(hints) ? nullptr : found;
 }
 

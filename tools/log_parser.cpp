@@ -297,6 +297,6 @@ bool LogParser::parseTime(std::string_view text)
         mDate = text.substr(0, 10);
         mMidnight = daysSinceEpoch(year, month, day) * 86400;
     }
-    mHead.time = mMidnight + hour * 3600 + minute * 60 + second;
+    mHead.time = mMidnight + hour * std::int64_t{3600} + minute * std::int64_t{60} + second;
     return true;
 }

@@ -33,7 +33,7 @@ std::string rawStatusText(long status)
 
 std::string exitCodeText(long code)
 {
-    const std::string text = "exit " + std::to_string(code);
+    std::string text = "exit " + std::to_string(code);
     if (code == 126) {
         return text + " (command cannot be run)";
     }

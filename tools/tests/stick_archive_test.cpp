@@ -1,6 +1,7 @@
 #include "stick_archive.h"
 
 #include "finding_lines.h"
+#include "little_endian.h"
 #include "zip_file.h"
 
 #include <gmock/gmock.h>
@@ -228,18 +229,13 @@ TEST(StickArchive, TooManyEntriesAreABomb)
         directory += record;
     }
     // The number of entries and the size need the 64-bit end record, APPNOTE.TXT 4.3.14.
-    const auto number = [](std::uint64_t value, int length) {
-        std::string bytes;
-        for (int index = 0; index < length; ++index, value >>= 8U) {
-            bytes += static_cast<char>(value & 0xFFU);
-        }
-        return bytes;
-    };
     const std::uint64_t endRecord = start + directory.size();
-    archive = archive.substr(0, start) + directory + "PK\x06\x06" + number(44, 8) + number(45, 2) + number(45, 2) +
-              number(0, 8) + number(100'001, 8) + number(100'001, 8) + number(directory.size(), 8) + number(start, 8) +
-              "PK\x06\x07" + number(0, 4) + number(endRecord, 8) + number(1, 4) + "PK\x05\x06" + number(0, 4) +
-              number(0xFFFF, 2) + number(0xFFFF, 2) + number(0xFFFFFFFF, 4) + number(0xFFFFFFFF, 4) + number(0, 2);
+    archive = archive.substr(0, start) + directory + "PK\x06\x06" + littleEndian(44, 8) + littleEndian(45, 2) +
+              littleEndian(45, 2) + littleEndian(0, 8) + littleEndian(100'001, 8) + littleEndian(100'001, 8) +
+              littleEndian(directory.size(), 8) + littleEndian(start, 8) + "PK\x06\x07" + littleEndian(0, 4) +
+              littleEndian(endRecord, 8) + littleEndian(1, 4) + "PK\x05\x06" + littleEndian(0, 4) +
+              littleEndian(0xFFFF, 2) + littleEndian(0xFFFF, 2) + littleEndian(0xFFFFFFFF, 4) +
+              littleEndian(0xFFFFFFFF, 4) + littleEndian(0, 2);
     const Report report = check(archive);
     EXPECT_EQ(findingsOf(report), Lines{"error archive-bomb"});
     EXPECT_THAT(whatOf(report, "archive-bomb"), HasSubstr("more than 100,000 entries"));

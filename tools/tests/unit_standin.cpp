@@ -1,5 +1,7 @@
 #include "unit_standin.h"
 
+#include "little_endian.h"
+
 #include <csignal>
 #include <cstdint>
 #include <filesystem>
@@ -162,16 +164,9 @@ void StandInUnit::writeSettings() const
 
 std::string waveFile(std::size_t samples)
 {
-    const auto number = [](std::size_t value, int length) {
-        std::string bytes;
-        for (int index = 0; index < length; ++index, value >>= 8U) {
-            bytes += static_cast<char>(value & 0xFFU);
-        }
-        return bytes;
-    };
     // One channel of 8-bit samples, 8000 each second.
-    const std::string format =
-        number(1, 2) + number(1, 2) + number(8000, 4) + number(8000, 4) + number(1, 2) + number(8, 2);
-    return "RIFF" + number(36 + samples, 4) + "WAVEfmt " + number(16, 4) + format + "data" + number(samples, 4) +
-           std::string(samples, '\x80');
+    const std::string format = littleEndian(1, 2) + littleEndian(1, 2) + littleEndian(8000, 4) + littleEndian(8000, 4) +
+                               littleEndian(1, 2) + littleEndian(8, 2);
+    return "RIFF" + littleEndian(36 + samples, 4) + "WAVEfmt " + littleEndian(16, 4) + format + "data" +
+           littleEndian(samples, 4) + std::string(samples, '\x80');
 }

@@ -1,18 +1,13 @@
 #include "zip_file.h"
 
+#include "little_endian.h"
+
 #include <stdexcept>
 
 #include <zlib.h>
 
 namespace
 {
-
-void append(std::string& bytes, std::uint64_t value, int length)
-{
-    for (int index = 0; index < length; ++index, value >>= 8U) {
-        bytes += static_cast<char>(value & 0xFFU);
-    }
-}
 
 uLong checksumOf(const std::string& content)
 {
@@ -23,15 +18,15 @@ uLong checksumOf(const std::string& content)
 std::string commonFields(const ZipEntry& entry, std::size_t packedSize)
 {
     std::string fields;
-    append(fields, 20, 2); // version needed
-    append(fields, entry.flags, 2);
-    append(fields, entry.method, 2);
-    append(fields, 0, 4); // time and date
-    append(fields, entry.checksum.value_or(static_cast<std::uint32_t>(checksumOf(entry.content))), 4);
-    append(fields, entry.packedSize.value_or(static_cast<std::uint32_t>(packedSize)), 4);
-    append(fields, entry.unpackedSize.value_or(static_cast<std::uint32_t>(entry.content.size())), 4);
-    append(fields, entry.name.size(), 2);
-    append(fields, 0, 2); // length of the extra field
+    fields += littleEndian(20, 2); // version needed
+    fields += littleEndian(entry.flags, 2);
+    fields += littleEndian(entry.method, 2);
+    fields += littleEndian(0, 4); // time and date
+    fields += littleEndian(entry.checksum.value_or(static_cast<std::uint32_t>(checksumOf(entry.content))), 4);
+    fields += littleEndian(entry.packedSize.value_or(static_cast<std::uint32_t>(packedSize)), 4);
+    fields += littleEndian(entry.unpackedSize.value_or(static_cast<std::uint32_t>(entry.content.size())), 4);
+    fields += littleEndian(entry.name.size(), 2);
+    fields += littleEndian(0, 2); // length of the extra field
     return fields;
 }
 
@@ -45,21 +40,21 @@ std::string zipArchive(const std::vector<ZipEntry>& entries)
         const std::string data = entry.method == 8 ? deflated(entry.content) : entry.content;
         const std::string fields = commonFields(entry, data.size());
         directory += "PK\x01\x02";
-        append(directory, 20, 2); // version made by
+        directory += littleEndian(20, 2); // version made by
         directory += fields;
-        append(directory, 0, 10); // comment, disk, attributes
-        append(directory, archive.size(), 4);
+        directory += littleEndian(0, 10); // comment, disk, attributes
+        directory += littleEndian(archive.size(), 4);
         directory += entry.name;
         archive += "PK\x03\x04" + fields + entry.name + data;
     }
     const std::size_t start = archive.size();
     archive += directory + "PK\x05\x06";
-    append(archive, 0, 4); // disks
-    append(archive, entries.size(), 2);
-    append(archive, entries.size(), 2);
-    append(archive, directory.size(), 4);
-    append(archive, start, 4);
-    append(archive, 0, 2); // comment
+    archive += littleEndian(0, 4); // disks
+    archive += littleEndian(entries.size(), 2);
+    archive += littleEndian(entries.size(), 2);
+    archive += littleEndian(directory.size(), 4);
+    archive += littleEndian(start, 4);
+    archive += littleEndian(0, 2); // comment
     return archive;
 }
 

@@ -241,7 +241,6 @@ void delay(int milliseconds)
 
 } // namespace platform
 
-// NOLINTBEGIN(readability-inconsistent-declaration-parameter-name): the C library names its parameters with underscores
 extern "C" {
 
 int system(const char* command)
@@ -295,4 +294,3 @@ int nanosleep(const timespec* duration, timespec* remaining)
 }
 
 } // extern "C"
-// NOLINTEND(readability-inconsistent-declaration-parameter-name)

@@ -1,9 +1,9 @@
 # GoogleTest: the distribution's library, or built from the distribution's source where the target has no library.
 find_package(GTest QUIET)
-if(NOT GTest_FOUND)
+if(NOT GTest_FOUND AND NOT TARGET gtest)
   set(INSTALL_GTEST OFF)
-  set(BUILD_GMOCK OFF)
   add_subdirectory(/usr/src/googletest ${PROJECT_BINARY_DIR}/googletest EXCLUDE_FROM_ALL)
-  target_compile_options(gtest PRIVATE -w)
-  target_compile_options(gtest_main PRIVATE -w)
+  foreach(library gtest gtest_main gmock)
+    target_compile_options(${library} PRIVATE -w)
+  endforeach()
 endif()

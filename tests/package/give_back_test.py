@@ -1,4 +1,4 @@
-"""What runs after the service has ended, on stand-in tools, in a process namespace of its own: it looks for processes."""
+"""What runs after the service has ended, on stand-in tools; it looks for processes, in a namespace of its own here."""
 
 import shutil
 import subprocess
@@ -56,8 +56,9 @@ class GiveBack(unittest.TestCase):
     def give_back(self, beside: str = ":", after: str = ":") -> str:
         """Runs it with the shell line `beside` started before it, and `after` run next; what it says."""
         line = f'cd "$UNIT"\n{beside}\n./give-back\n{after}'
+        command = [*NAMESPACES, "sh", "-c", line]
         done = subprocess.run(
-            [*NAMESPACES, "sh", "-c", line], env=self.environment, capture_output=True, text=True, check=False, timeout=60
+            command, env=self.environment, capture_output=True, text=True, check=False, timeout=60
         )
         self.assertEqual(done.stderr, "")
         return done.stdout

@@ -12,7 +12,7 @@ OLD = f"""#!/bin/sh
 # i2c-tools before 4.2
 case $1 in
 -y) ;;
-*) {UNKNOWN.format(usage="Usage: i2cset [-f] [-y] [-m MASK] [-r] I2CBUS CHIP-ADDRESS DATA-ADDRESS [VALUE] ... [MODE]")} ;;
+*) {UNKNOWN.format(usage="Usage: i2cset [-f] [-y] [-m MASK] [-r] I2CBUS CHIP-ADDRESS DATA-ADDRESS [VALUE]")} ;;
 esac
 echo "$*" >>"$SENT"
 exit "$STATUS"
@@ -75,8 +75,9 @@ class I2cset(unittest.TestCase):
     def test_it_never_takes_itself_for_the_real_one(self) -> None:
         own = str(I2CSET.parent)
         for path in (own, f"{own}:{own}/", f"{own}/.:{own}"):
+            command = ["i2cset", "-y", "0", "0x07", "0x12", "c"]
             done = subprocess.run(
-                ["i2cset", "-y", "0", "0x07", "0x12", "c"], env={"PATH": path}, capture_output=True, text=True, check=False, timeout=10
+                command, env={"PATH": path}, capture_output=True, text=True, check=False, timeout=10
             )
             self.assertEqual(done.returncode, 127)
             self.assertIn("install i2c-tools", done.stderr)

@@ -1,4 +1,4 @@
-"""A machine with real systemd, apt and dpkg in namespaces of its own on this one. Needs root; nothing of it outlives it."""
+"""A machine with real systemd, apt and dpkg in namespaces of its own on this one. Needs root."""
 
 import contextlib
 import os
@@ -9,8 +9,11 @@ import time
 from collections.abc import Iterator
 from pathlib import Path
 
-NAMESPACES = ["unshare", "--mount", "--net", "--ipc", "--uts", "--pid", "--fork", "--kill-child"]
+# The machine goes with the process that made it, however that ends.
+NAMESPACES = ["setpriv", "--pdeathsig", "KILL", "unshare", "--mount", "--net", "--ipc", "--uts", "--pid", "--fork"]
+NAMESPACES += ["--kill-child"]
 LONGEST_START = 60  # s
+LONGEST_COMMAND = 120  # s
 
 
 class MachineError(Exception):
@@ -71,9 +74,11 @@ class Machine:
         return Path(f"/proc/{self._first_process()}/root")
 
     def _remove_control_groups(self) -> None:
-        for top in [*Path("/sys/fs/cgroup").glob(self._folder.name), *Path("/sys/fs/cgroup").glob(f"*/{self._folder.name}")]:
-            for attempt in range(100):  # a group stays busy until its last process is gone
-                subprocess.run(["find", top, "-depth", "-type", "d", "-exec", "rmdir", "{}", "+"], capture_output=True, check=False)
+        groups = Path("/sys/fs/cgroup")
+        for top in [*groups.glob(self._folder.name), *groups.glob(f"*/{self._folder.name}")]:
+            for _ in range(100):  # a group stays busy until its last process is gone
+                remove = ["find", top, "-depth", "-type", "d", "-exec", "rmdir", "{}", "+"]
+                subprocess.run(remove, capture_output=True, check=False)
                 if not top.exists():
                     break
                 time.sleep(0.05)
@@ -84,7 +89,9 @@ class Machine:
         except OSError:
             return subprocess.CompletedProcess(command, 1, "", "not started")
         environment = {"PATH": "/usr/sbin:/usr/bin:/sbin:/bin", "HOME": "/root", "LC_ALL": "C"}
-        return subprocess.run([*enter, *command], env=environment, capture_output=True, text=True, check=False)
+        return subprocess.run(
+            [*enter, *command], env=environment, capture_output=True, text=True, check=False, timeout=LONGEST_COMMAND
+        )
 
     def _first_process(self) -> int:
         """systemd, as the host numbers it."""

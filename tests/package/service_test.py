@@ -55,6 +55,10 @@ Description: test
 HARL = "[Unit]\nAfter=harl-updater.service\n[Service]\nExecStart=/bin/sleep infinity\n"
 
 
+FOLDERS = ["etc/apt/preferences.d", "opt", "root/RESOURCES/SOUNDS", "root/USB_MOUNT", "srv/repository", "var/log/apt"]
+FOLDERS += ["var/cache/apt/archives/partial", "var/lib/apt/lists/partial", "var/lib/dpkg/info", "var/lib/dpkg/updates"]
+
+
 def make_files(files: Path, package: Path, build: Path) -> None:
     """Writes what the machine has: tools, packages and the application."""
     for name, text in TOOLS.items():
@@ -64,9 +68,7 @@ def make_files(files: Path, package: Path, build: Path) -> None:
     write(files / "etc/apt/apt.conf.d/50test", 'APT::Sandbox::User "root";\n')
     (files / "etc/systemd/system/dbus.socket").symlink_to("/dev/null")  # apt would wait for a login manager behind it
     write(files / "srv/board", "2.2.0\n")
-    for folder in ("etc/apt/preferences.d", "var/lib/dpkg/info", "var/lib/dpkg/updates", "var/lib/apt/lists/partial", "srv/repository"):
-        (files / folder).mkdir(parents=True)
-    for folder in ("var/cache/apt/archives/partial", "var/log/apt", "root/USB_MOUNT", "root/RESOURCES/SOUNDS", "opt"):
+    for folder in FOLDERS:
         (files / folder).mkdir(parents=True)
     write(files / "var/lib/dpkg/status", "")
     shutil.copy(package, files / "srv/updater.deb")
@@ -98,7 +100,8 @@ def install(unit: Machine) -> None:
     """Installs the package under test, and a package that stands for all that it depends on."""
     depends = unit.run("dpkg-deb", "--field", "/srv/updater.deb", "Depends")
     names = ", ".join(f"{item.split()[0]} (= 9999)" for item in depends.split(","))
-    unit.run("dpkg", "--install", make_package(unit, "/srv", "tools", "1.0", fields=f"Provides: {names}"), "/srv/updater.deb")
+    tools = make_package(unit, "/srv", "tools", "1.0", fields=f"Provides: {names}")
+    unit.run("dpkg", "--install", tools, "/srv/updater.deb")
 
 
 def wait_for(what: str, condition: Callable[[], bool], seconds: float = 60) -> None:
@@ -124,7 +127,8 @@ class ServiceTest(unittest.TestCase):
         self.inside("sh", "-c", "mount -t tmpfs stick /root/USB_MOUNT")
         self.inside("mkdir", "-p", "/root/USB_MOUNT/debs/QUORB/armhf/quorb2.2.0")
         self.inside("touch", "/root/USB_MOUNT/debs/QUORB/armhf/quorb2.2.0/OSUpgrade.zip")
-        self.inside("sh", "-c", "echo 2.2.0 >/srv/board; dpkg --purge solvik4-rh solvik4-data; rm -rf /srv/repository/*")
+        self.inside("sh", "-c", "echo 2.2.0 >/srv/board; rm -rf /srv/repository/*")
+        self.inside("dpkg", "--purge", "solvik4-rh", "solvik4-data")
         self.inside("dpkg", "--install", make_package(self.unit, "/srv", "solvik4-rh", "1.2.0"))
         self.set_speed(SPEED)
         self.inside("systemctl", "start", "harl")
@@ -220,7 +224,8 @@ class Ends(ServiceTest):
         self.assertEqual(self.package_state(), "install ok installed 1.3.0")
         log = self.journal()
         self.assertIn("TavrenUpdater version: ", log)
-        self.assertEqual([record["function"] for record in RECORD.finditer(log)][-1], "static void UpdateManager::stopUpdater()")
+        last = list(RECORD.finditer(log))[-1]
+        self.assertEqual(last["function"], "static void UpdateManager::stopUpdater()")
         self.assertNotIn("give-back", log)
 
     def test_failure_keeps_its_own_outcome(self) -> None:
@@ -356,7 +361,7 @@ def skip(why: str) -> None:
 
 if __name__ == "__main__":
     build, package = Path(sys.argv[1]), sys.argv[2]
-    architecture = subprocess.run(["dpkg", "--print-architecture"], capture_output=True, text=True, check=True).stdout.strip()
+    architecture = subprocess.check_output(["dpkg", "--print-architecture"], text=True).strip()
     found = sorted((ROOT / "build/package").glob(f"{package}_*_{architecture}.deb"))
     if not found:
         skip("there is no package for this machine: package/build")

@@ -17,7 +17,7 @@ NAMESPACES = ["unshare", "--map-root-user", "--mount", "--pid", "--fork", "--kil
 GIVE_BACK = ROOT / "package/service/give-back"
 START = "systemctl --no-block start harl"
 TOOLS = {
-    "systemctl": "",
+    "systemctl": 'for tool in apt dpkg; do ! pgrep -x $tool >/dev/null || echo "beside $tool" >>"$UNIT/calls"; done',
     "i2cset": 'exit "$I2CSET_STATUS"',
     "umount": '[ ! -e "$UNIT/busy" ] || { rm "$UNIT/busy"; exit 32; }; [ -e "$UNIT/stuck" ] || rm "$UNIT/mounted"',
     "mountpoint": '[ -e "$UNIT/mounted" ]',
@@ -53,9 +53,10 @@ class GiveBack(unittest.TestCase):
             shutil.copy("/usr/bin/sleep", self.unit / name)
         shutil.copy(GIVE_BACK, self.unit / "give-back")
 
-    def give_back(self, beside: str = ":", after: str = ":") -> str:
-        """Runs it with the shell line `beside` started before it, and `after` run next; what it says."""
-        line = f'cd "$UNIT"\n{beside}\n./give-back\n{after}'
+    def give_back(self, beside: str = ":", after: str = ":", at_work: tuple[str, ...] = ()) -> str:
+        """Runs it once what the shell line `beside` starts is `at_work`, and `after` next; what it says."""
+        waits = "".join(f"until pgrep -x {name} >/dev/null; do /usr/bin/sleep 0.01; done\n" for name in at_work)
+        line = f'cd "$UNIT"\n{beside}\n{waits}./give-back\n{after}'
         command = [*NAMESPACES, "sh", "-c", line]
         done = subprocess.run(
             command, env=self.environment, capture_output=True, text=True, check=False, timeout=60
@@ -98,9 +99,8 @@ class GiveBack(unittest.TestCase):
 
     def test_package_tools_are_waited_for(self) -> None:
         for tool in ("apt", "dpkg"):
-            said = self.give_back(f'(./{tool} 0.5; echo "{tool} ended" >>"$UNIT/calls") &')
+            said = self.give_back(f"./{tool} 2 &", at_work=(tool,))
             self.assertIn("still at work", said)
-            self.assertEqual(self.calls()[0], f"{tool} ended")
             self.assertEqual(self.calls()[-1], START)
             (self.unit / "calls").unlink()
 
@@ -108,15 +108,16 @@ class GiveBack(unittest.TestCase):
         text = GIVE_BACK.read_text()
         (self.unit / "give-back").write_text(text.replace("package_tools_wait=1800", "package_tools_wait=3"))
         self.assertNotEqual((self.unit / "give-back").read_text(), text)
-        said = self.give_back("./dpkg 30 &", 'kill -0 $! && echo "it lives"')
+        said = self.give_back("./dpkg 30 &", 'kill -0 $! && echo "it lives"', at_work=("dpkg",))
         self.assertIn("going on beside it", said)
         self.assertIn("it lives", said)
-        self.assertEqual(self.calls()[-1], START)
+        self.assertEqual(self.calls()[-2:], [START, "beside dpkg"])
 
     def test_upload_is_ended_and_the_board_script_is_not(self) -> None:
         said = self.give_back(
             "./scp 30 & upload=$!; ./ssh 30 & board=$!",
             "/usr/bin/sleep 0.1; kill -0 $board && echo board lives; wait $upload; echo upload $?",
+            at_work=("scp", "ssh"),
         )
         self.assertIn("board lives", said)
         self.assertIn("upload 143", said)

@@ -496,6 +496,7 @@ void UpdateManager::stopUpdater()
 std::int32_t UpdateManager::runProcess(const std::string& command, std::string& output)
 {
     char buffer[1024];
+    char streamBuffer[64 * 1024]; // as much as a pipe holds: fewer calls for long outputs
 
     output.clear();
     LOG() << "Running command: " << command;
@@ -503,6 +504,7 @@ std::int32_t UpdateManager::runProcess(const std::string& command, std::string& 
     if (pipe == nullptr) {
         return 0;
     }
+    std::setvbuf(pipe, streamBuffer, _IOFBF, sizeof streamBuffer);
     while (fgets(buffer, sizeof buffer, pipe) != nullptr) {
         output.append(buffer);
     }

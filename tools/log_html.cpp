@@ -83,17 +83,7 @@ const char* resultClass(const Step& step)
     if (step.kind == StepKind::STOP_UPDATER && step.result == StepResult::UNFINISHED) {
         return "done";
     }
-    switch (step.result) {
-    case StepResult::UNFINISHED:
-        return "unfinished";
-    case StepResult::DONE:
-        return "done";
-    case StepResult::FAILED:
-        return "failed";
-    case StepResult::UNTOLD:
-        return "untold";
-    }
-    return "";
+    return resultName(step.result);
 }
 
 std::int64_t length(const Run& run, const Step& step)

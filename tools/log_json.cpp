@@ -18,21 +18,6 @@ Json linesToJson(const OtherLines& lines)
     return {{"count", lines.count}, {"shown", lines.shown()}};
 }
 
-const char* resultName(StepResult result)
-{
-    switch (result) {
-    case StepResult::UNFINISHED:
-        return "unfinished";
-    case StepResult::DONE:
-        return "done";
-    case StepResult::FAILED:
-        return "failed";
-    case StepResult::UNTOLD:
-        return "untold";
-    }
-    return "";
-}
-
 Json stepToJson(const Step& step)
 {
     Json actions = Json::array();

@@ -169,6 +169,21 @@ const char* stepName(StepKind kind)
     return kindTexts.at(static_cast<std::size_t>(kind)).name;
 }
 
+const char* resultName(StepResult result)
+{
+    switch (result) {
+    case StepResult::UNFINISHED:
+        return "unfinished";
+    case StepResult::DONE:
+        return "done";
+    case StepResult::FAILED:
+        return "failed";
+    case StepResult::UNTOLD:
+        return "untold";
+    }
+    return "";
+}
+
 // Runs
 
 void RunBuilder::record(const ParsedRecord& record)

@@ -171,6 +171,9 @@ const char* stepTitle(StepKind kind);
 /// Name of a step for programs, such as "refresh-mirrors".
 const char* stepName(StepKind kind);
 
+/// Name of a result for programs, such as "failed".
+const char* resultName(StepResult result);
+
 /// Makes runs of records. Memory is bounded: of each run the first steps and a few lines of other programs are kept.
 class RunBuilder : public LogSink
 {

@@ -8,6 +8,8 @@
 #include <cstdlib>
 #include <utility>
 
+#include <stdio_ext.h>
+
 // A missing callback must end the process in release builds too.
 #undef NDEBUG
 #include <cassert>
@@ -505,6 +507,7 @@ std::int32_t UpdateManager::runProcess(const std::string& command, std::string& 
         return 0;
     }
     std::setvbuf(pipe, streamBuffer, _IOFBF, sizeof streamBuffer);
+    __fsetlocking(pipe, FSETLOCKING_BYCALLER); // no other thread reads it, and short lines are mostly locking
     while (fgets(buffer, sizeof buffer, pipe) != nullptr) {
         output.append(buffer);
     }

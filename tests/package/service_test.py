@@ -273,6 +273,23 @@ class Ends(ServiceTest):
         self.assertEqual(self.panel(), {"FAIL": "fail"})
         self.assertNotEqual(self.unit.status("pgrep", "--exact", "scp"), 0)
 
+    def test_journal_goes_away_during_the_installation(self) -> None:
+        # From then on the updater writes into a broken pipe: systemd ignores the signal for its services.
+        self.offer(SLOW_SCRIPT)
+        self.start()
+        self.wait_for_file("/run/package-installs")
+        parts = self.inside("systemctl", "list-units", "--plain", "--no-legend", "systemd-journald*").splitlines()
+        units = [part.split()[0] for part in parts]
+        self.addCleanup(self.inside, "systemctl", "start", *units)
+        self.inside("systemctl", "stop", *units)
+        self.assertNotEqual(self.unit.status("systemctl", "is-active", "--quiet", "systemd-journald"), 0)
+        self.wait_for_end()
+        self.assertEqual(self.ended_as(), ("success", "2", "15"))
+        self.assert_installation_ended_well()
+        self.assert_given_back()
+        self.assertEqual(self.panel(), {"PASS": "pass"})
+        self.assertEqual(self.read("/var/log/sounds"), "SND_RESULT_PASS.wav\n")
+
     def test_crash_after_the_outcome_was_shown(self) -> None:
         self.offer()
         self.start()

@@ -47,7 +47,7 @@ def write_sound(file: Path) -> None:
     file.write_bytes(header + struct.pack("<4sI", b"data", len(data)) + data)
 
 
-def write_package(folder: Path, version: str, seconds: int, depends: str) -> None:
+def write_package(folder: Path, version: str, depends: str, seconds: int, use_up_memory: bool) -> None:
     """Writes the head's package of `version` into `folder`; its maintainer script tells that it began and ended."""
     tree = folder / "tree"
     (tree / "DEBIAN").mkdir(parents=True)
@@ -60,8 +60,11 @@ def write_package(folder: Path, version: str, seconds: int, depends: str) -> Non
     script = tree / "DEBIAN/postinst"
     if seconds:
         note = 'echo "{}" "$(cut -d " " -f 1 /proc/uptime)" >> /run/package-script'
+        lines = ["#!/bin/sh", "set -e", note.format("began")]
+        # A tool that keeps a line without an end in memory is killed for it.
+        lines += ["tail /dev/zero || true"] if use_up_memory else []
         # It goes on talking after its long work, to whoever listens then.
-        lines = ["#!/bin/sh", "set -e", note.format("began"), f"sleep {seconds}", "echo set up", note.format("ended")]
+        lines += [f"sleep {seconds}", "echo set up", note.format("ended")]
         script.write_text("".join(f"{line}\n" for line in lines))
         script.chmod(0o755)
     run("dpkg-deb", "--root-owner-group", "-Zgzip", "--build", tree, folder)
@@ -93,9 +96,10 @@ def write_scenario(folder: Path, plan: Plan, updater: Path, speed: float, again:
     if plan.settings["needs_newer_updater"]:
         depends = f"harl-updater (>= {package_version(updater)}+newer)"
         write_newer_updater(updater, repository)
-    write_package(folder, unit["package"]["installed"], 0, "")
+    write_package(folder, unit["package"]["installed"], "", 0, False)
     os.rename(folder / f"solvik4-rh_{unit['package']['installed']}_armhf.deb", folder / "installed.deb")
-    write_package(repository, unit["package"]["offered"], plan.settings["script_seconds"], depends)
+    use_up_memory = plan.settings["event"] == "out-of-memory"
+    write_package(repository, unit["package"]["offered"], depends, plan.settings["script_seconds"], use_up_memory)
     with (repository / "Packages").open("w") as index:
         scan = ["dpkg-scanpackages", "--multiversion", "."]
         subprocess.run(scan, cwd=repository, stdout=index, stderr=subprocess.PIPE, text=True, check=True)

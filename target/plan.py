@@ -15,7 +15,7 @@ FOLDER = Path(__file__).parent / "scenarios"
 # What a file may say beside `summary`, `like` and `expect`: the default and what else is allowed.
 SETTINGS: dict[str, tuple[Any, Any]] = {
     # what befalls the updater while the package's maintainer script is at work
-    "event": ("nothing", ["nothing", "crash", "stop", "power-cut"]),
+    "event": ("nothing", ["nothing", "crash", "stop", "out-of-memory", "power-cut"]),
     "script_seconds": (0, int),  # that the package's maintainer script takes
     "needs_newer_updater": (False, bool),  # the offered package depends on a newer harl-updater, which is offered too
 }

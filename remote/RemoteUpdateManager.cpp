@@ -7,6 +7,20 @@
 std::mutex RemoteUpdateManager::mAppLockMutex;
 std::condition_variable RemoteUpdateManager::mAppLocker;
 
+namespace
+{
+
+/// What comes before the LEDs of an outcome: the flashing ends, the panel goes dark, `sound` plays to its end.
+void announceOutcome(SoundManager::Sound sound)
+{
+    LedManager::instance()->stopFlashRemoteAndMainInBlue();
+    LedManager::instance()->waitForFlashingEnd(); // else its last cycle would darken the outcome
+    LedManager::turnOffAll();
+    SoundManager::play(sound);
+}
+
+} // namespace
+
 void RemoteUpdateManager::update()
 {
     LOG();
@@ -53,10 +67,7 @@ void RemoteUpdateManager::unlockApp()
 void RemoteUpdateManager::resultCallback(UpdateManager::Result result)
 {
     LOG();
-    LedManager::instance()->stopFlashRemoteAndMainInBlue();
-    LedManager::instance()->waitForFlashingEnd(); // else its last cycle would darken the outcome
-    LedManager::turnOffAll();
-    SoundManager::play(SoundManager::SOUND_PASS);
+    announceOutcome(SoundManager::SOUND_PASS);
     switch (result) {
     case UpdateManager::RESULT_NO_UPDATE:
         LedManager::turnOn(LedManager::LED_REMOTE, LedManager::COLOR_PASS);
@@ -71,10 +82,7 @@ void RemoteUpdateManager::resultCallback(UpdateManager::Result result)
 void RemoteUpdateManager::errorCallback(UpdateManager::Error error)
 {
     LOG();
-    LedManager::instance()->stopFlashRemoteAndMainInBlue();
-    LedManager::instance()->waitForFlashingEnd(); // else its last cycle would darken the outcome
-    LedManager::turnOffAll();
-    SoundManager::play(SoundManager::SOUND_FAIL);
+    announceOutcome(SoundManager::SOUND_FAIL);
     switch (error) {
     case UpdateManager::ERROR_CHECK_UPDATE:
     case UpdateManager::ERROR_UPDATE_MIRRORS:

@@ -28,6 +28,7 @@ SPACE = 2000  # MiB, for disks and results
 SPEED = 300  # how many times shorter the updater's waits are
 TOOL_LIMIT = 3000  # s, to build the package or the image
 SCENARIO_LIMIT = 420  # s, for one scenario besides the updater's waits; guest/main gives up before that
+SLOWNESS = 5  # how many times longer than by the unit's clock a wait with the flashing in it may take
 
 
 class TargetError(Exception):
@@ -82,7 +83,7 @@ def make_image() -> Path:
 
 def time_limit(plans: list[Plan], speed: float) -> float:
     """How long `plans` may take in one boot, s."""
-    return sum(SCENARIO_LIMIT + sum(plan.like.expect["waits"]) / speed for plan in plans)
+    return sum(SCENARIO_LIMIT + SLOWNESS * sum(plan.like.expect["waits"]) / speed for plan in plans)
 
 
 def run_shared(plans: list[Plan], image: Path, updater: Path, speed: float) -> dict[str, tuple[Outcome, list[str]]]:

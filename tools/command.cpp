@@ -18,7 +18,7 @@
 namespace
 {
 
-const std::size_t mostOutput = 256 * 1024;
+const std::size_t mostOutput = std::size_t{256} * 1024; // bytes
 
 struct Pipe
 {
@@ -39,6 +39,7 @@ Pipe makePipe()
 std::vector<char*> pointers(const std::vector<std::string>& texts)
 {
     std::vector<char*> result;
+    result.reserve(texts.size() + 1);
     for (const std::string& text : texts) {
         result.push_back(const_cast<char*>(text.c_str())); // posix_spawn(3) does not change them
     }
@@ -156,9 +157,9 @@ std::string findProgram(const std::string& name, const std::string& searchPath)
         return canRun(name) ? name : "";
     }
     std::istringstream folders(searchPath);
-    std::string folder;
-    while (std::getline(folders, folder, ':')) {
-        const std::string path = folder + '/' + name;
+    std::string path;
+    while (std::getline(folders, path, ':')) {
+        path.append("/").append(name);
         if (canRun(path)) {
             return path;
         }

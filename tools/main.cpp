@@ -3,13 +3,21 @@
 #include "stick.h"
 #include "unit.h"
 
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <exception>
 #include <iostream>
+#include <new>
 #include <string>
 
 #include <CLI/CLI.hpp>
 #include <unistd.h>
 
-int main(int argc, char** argv)
+namespace
+{
+
+int run(int argc, char** argv)
 {
     CLI::App app("Answers what a technician asks before and after an update. It never changes the updater.",
                  "harl-updater-tool");
@@ -55,4 +63,25 @@ int main(int argc, char** argv)
         return runLog(logOptions, std::cout, std::cerr);
     }
     return runUnit(unitOptions, thisUnit(), std::cout, std::cerr);
+}
+
+} // namespace
+
+int main(int argc, char** argv)
+{
+    try {
+        std::cout.exceptions(std::ios::badbit); // a full disk must not pass for a good answer
+        const int status = run(argc, argv);
+        std::cout.flush();
+        return status;
+    } catch (const std::ios_base::failure&) {
+        std::fprintf(stderr, "harl-updater-tool: the output cannot be written: %s. Make room or name another file.\n",
+                     std::strerror(errno));
+    } catch (const std::bad_alloc&) {
+        std::fputs("harl-updater-tool: there is not enough memory. End other programs and try again.\n", stderr);
+    } catch (const std::exception& error) {
+        std::fprintf(stderr, "harl-updater-tool: gave up: %s. Report this line with the command to the maker.\n",
+                     error.what());
+    }
+    return Report::STATUS_UNCHECKED;
 }

@@ -40,6 +40,11 @@ std::string lowerCase(std::string text)
     return text;
 }
 
+std::string inFolder(const std::string& folder, const std::string& name)
+{
+    return folder + '/' + name;
+}
+
 bool isDigit(char letter)
 {
     return letter >= '0' && letter <= '9';
@@ -240,7 +245,7 @@ private:
         std::vector<std::string> folders;
         std::vector<std::string> others;
         for (const std::string& name : names) {
-            const std::string path = std::string(boardFolder) + '/' + name;
+            const std::string path = inFolder(boardFolder, name);
             const Node node = mStick.node(path);
             reportUnusable(path, node, "may take its name for the version folder.");
             (node.kind == Node::FOLDER ? folders : others).push_back(name);
@@ -317,8 +322,8 @@ private:
         std::vector<std::string> similar;
         bool misspelled = false;
         for (const std::string& name : names) {
-            const std::string folder = std::string(boardFolder) + '/' + name;
-            const std::string path = folder + '/' + file;
+            const std::string folder = inFolder(boardFolder, name);
+            const std::string path = inFolder(folder, file);
             const bool found = mStick.node(path).present;
             misspelled = reportCase(folder, file, found, Severity::ERROR, uploadFailsEffect) || misspelled;
             if (found) {
@@ -368,7 +373,7 @@ private:
     void checkMarker()
     {
         const std::string effect = "installs no TeamViewer.";
-        const std::string path = std::string(markerFolder) + '/' + markerName;
+        const std::string path = inFolder(markerFolder, markerName);
         const Node node = mStick.node(path);
         const bool requested = node.present && node.kind != Node::FOLDER;
         mReport.addFact("teamviewer_requested", "TeamViewer",
@@ -427,7 +432,7 @@ void checkStick(const StickFolder& stick, bool onUnit, Report& report)
 std::string checkVersionName(const std::string& name, Report& report)
 {
     const std::string line = name.substr(0, name.find('\n'));
-    const std::string version = line.size() > prefixLength ? line.substr(prefixLength) : "";
+    std::string version = line.size() > prefixLength ? line.substr(prefixLength) : "";
     if (version.empty()) {
         report.add({Severity::ERROR, "version-missing",
                     shown(line) + " is too short: five bytes are the prefix, and behind them is no version.",

@@ -14,7 +14,8 @@
 namespace
 {
 
-const std::uint64_t largestArchive = 4ULL << 30U; // bytes; a file on a FAT stick is smaller
+const std::size_t blockSize = std::size_t{64} * 1024; // bytes
+const std::uint64_t largestArchive = 4ULL << 30U;     // bytes; a file on a FAT stick is smaller
 const std::uint64_t mostEntries = 100'000;
 const std::uint64_t suspiciousRatio = 100;        // unpacked to packed; software packs to a half or a tenth
 const std::uint64_t suspiciousSize = 100'000'000; // bytes
@@ -31,7 +32,7 @@ const char* const bombEffect = "copies it without looking into it; unpacking it 
 class Window
 {
 public:
-    explicit Window(const ArchiveSource& source) : mSource(source), mBytes(64 * 1024) {}
+    explicit Window(const ArchiveSource& source) : mSource(source), mBytes(blockSize) {}
 
     std::size_t read(char* buffer, std::size_t length)
     {
@@ -202,7 +203,7 @@ int readPacked(unzFile archive, std::vector<Bytef>& buffer)
 Unpacked readStored(unzFile archive, std::uint64_t limit)
 {
     Unpacked result;
-    std::vector<Bytef> plain(64 * 1024);
+    std::vector<Bytef> plain(blockSize);
     int count = 0;
     while (result.bytes <= limit && (count = readPacked(archive, plain)) > 0) {
         result.add(plain.data(), static_cast<std::size_t>(count));
@@ -217,8 +218,8 @@ Unpacked readStored(unzFile archive, std::uint64_t limit)
 Unpacked inflateEntry(unzFile archive, std::uint64_t limit)
 {
     Unpacked result;
-    std::vector<Bytef> packed(64 * 1024);
-    std::vector<Bytef> plain(64 * 1024);
+    std::vector<Bytef> packed(blockSize);
+    std::vector<Bytef> plain(blockSize);
     z_stream stream = {};
     if (inflateInit2(&stream, -MAX_WBITS) != Z_OK) {
         throw std::bad_alloc();
@@ -370,7 +371,7 @@ private:
     /// Reads the archive from end to end, as the upload does.
     bool readWhole()
     {
-        std::vector<char> buffer(1024 * 1024);
+        std::vector<char> buffer(16 * blockSize);
         for (std::uint64_t offset = 0; offset < mSource.size;) {
             const auto wanted = static_cast<std::size_t>(std::min<std::uint64_t>(buffer.size(), mSource.size - offset));
             const std::size_t count = mSource.read(offset, buffer.data(), wanted);

@@ -2,13 +2,14 @@
 
 #include "findings.h"
 
+#include <cstddef>
 #include <cstdint>
 #include <string>
 #include <string_view>
 
 #include <sys/types.h>
 
-inline constexpr std::size_t scriptBytesChecked = 1024 * 1024;
+inline constexpr std::size_t scriptBytesChecked = std::size_t{1024} * 1024;
 
 /// Checks that the board's kernel can run the install script, and its line ends.
 ///

@@ -185,7 +185,7 @@ private:
         std::error_code error;
         const std::uintmax_t size = std::filesystem::file_size(path, error);
         std::ifstream file(path, std::ios::binary);
-        std::string start(64 * 1024, '\0');
+        std::string start(std::size_t{64} * 1024, '\0');
         file.read(start.data(), static_cast<std::streamsize>(start.size()));
         start.resize(static_cast<std::size_t>(file.gcount()));
         return error ? "it cannot be read: " + error.message() : waveFault(start, size);

@@ -8,6 +8,16 @@
 #include <sstream>
 #include <system_error>
 
+namespace
+{
+
+std::string assignment(const std::string& name, const std::string& value)
+{
+    return name + '=' + value;
+}
+
+} // namespace
+
 Unit::Unit(const UnitSite& site) : mSite(site)
 {
     mEnvironment["PATH"] = site.searchPath;
@@ -25,7 +35,7 @@ CommandResult Unit::run(const std::vector<std::string>& arguments, std::chrono::
 {
     std::vector<std::string> environment = {"RES_OPTIONS=timeout:1 attempts:2"}; // resolv.conf(5)
     for (const auto& [name, value] : mEnvironment) {
-        environment.push_back(name + '=' + value);
+        environment.push_back(assignment(name, value));
     }
     return runCommand(arguments, environment, limit);
 }
@@ -35,7 +45,8 @@ std::string Unit::locale() const
     std::string result;
     for (const auto& [name, value] : mEnvironment) {
         if (name != "PATH") {
-            result += (result.empty() ? "" : " ") + name + '=' + value;
+            result += result.empty() ? "" : " ";
+            result += assignment(name, value);
         }
     }
     return result;

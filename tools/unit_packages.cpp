@@ -55,12 +55,10 @@ void checkLocks(const Unit& unit, Report& report)
 bool dpkgWasInterrupted(const Unit& unit)
 {
     std::error_code error;
-    for (const auto& entry : std::filesystem::directory_iterator(unit.path("/var/lib/dpkg/updates"), error)) {
-        if (entry.path().filename().string().find_first_not_of("0123456789") == std::string::npos) {
-            return true;
-        }
-    }
-    return false;
+    const std::filesystem::directory_iterator files(unit.path("/var/lib/dpkg/updates"), error);
+    return std::any_of(begin(files), end(files), [](const auto& file) {
+        return file.path().filename().string().find_first_not_of("0123456789") == std::string::npos;
+    });
 }
 
 void checkUnfinishedWork(const Unit& unit, Report& report)

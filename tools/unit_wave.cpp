@@ -52,7 +52,7 @@ std::string waveFault(std::string_view start, std::uint64_t size)
         const std::uint64_t length = numberAt(start, at + 4, 4);
         const std::uint64_t body = offset + headerLength;
         if (name == "fmt ") {
-            const std::string fault = formatFault(start.substr(at + headerLength, static_cast<std::size_t>(length)));
+            std::string fault = formatFault(start.substr(at + headerLength, static_cast<std::size_t>(length)));
             if (!fault.empty()) {
                 return fault;
             }

@@ -337,6 +337,33 @@ class Memory(Base):
                                       preexec_fn=lambda: resource.setrlimit(resource.RLIMIT_AS, (limit, limit)))
                 self.assertIn(done.returncode, (0, 1))
 
+    def test_too_little_memory_is_told(self) -> None:
+        told = 0
+        for limit in range(2 << 20, 128 << 20, 64 << 10):  # the program, its libraries, and less than one block of log
+            done = run_tool("package-and-board.log",
+                            preexec_fn=lambda: resource.setrlimit(resource.RLIMIT_AS, (limit, limit)))
+            if done.returncode == 0:
+                break
+            if done.returncode == 2:
+                self.assertRegex(done.stderr, rb"^harl-updater-tool: there is not enough memory\. .*again\.\n$")
+                told += 1
+        self.assertEqual(done.returncode, 0)
+        self.assertGreater(told, 0)
+
+
+class Output(Base):
+    """What cannot be printed."""
+
+    def test_full_disk_is_told_whatever_was_asked(self) -> None:
+        log = str(GOLDEN / "package-and-board.log")
+        for arguments in (["--help"], ["log", log], ["log", "--json", log], ["log", "--follow", log],
+                          ["stick", str(self.folder)], ["stick", "--json", str(self.folder)]):
+            with self.subTest(arguments), open("/dev/full", "wb") as full:
+                done = subprocess.run([TOOL, *arguments], stdout=full, stderr=subprocess.PIPE, timeout=60, check=False)
+                self.assertEqual(done.returncode, 2)
+                self.assertRegex(done.stderr,
+                                 rb"^harl-updater-tool: the output cannot be written: No space left on device\. .*\n$")
+
 
 if __name__ == "__main__":
     TOOL = str(Path(sys.argv.pop()).resolve())

@@ -22,6 +22,7 @@ int run(int argc, char** argv)
     CLI::App app("Answers what a technician asks before and after an update. It never changes the updater.",
                  "harl-updater-tool");
     app.require_subcommand(1);
+    app.set_version_flag("--version", "harl-updater-tool " VERSION, "Print the program's name and version and exit");
 
     std::string stickPath = stickMountPoint;
     bool json = false;

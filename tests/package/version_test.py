@@ -23,6 +23,8 @@ class Version(unittest.TestCase):
         self.assertEqual(find("CHANGELOG.md", r"^## (\S+)"), banner)
         self.assertEqual(find("debian/changelog", r"^harl-updater \((\S+)\)"), banner)
         self.assertEqual(find("docs/man/harl-updater.8", r'^\.TH HARL-UPDATER 8 \S+ "harl-updater (\S+)"'), banner)
+        self.assertEqual(find("docs/man/harl-updater-tool.1", r'^\.TH HARL-UPDATER-TOOL 1 \S+ "harl-updater (\S+)"'),
+                         banner)
 
 
 if __name__ == "__main__":

@@ -37,9 +37,9 @@ expect "$(helped) $commands" ''
 for command in $commands; do
     expect "$(helped "$command")" "$command" --
     expect "$(helped "$command")" "$command" --json --
-    for option in $(helped "$command"); do
-        grep -q -- "${option//-/\\\\-}" docs/man/harl-updater-tool.1 || { echo "the manual page lacks $option" && wrong=1; }
-    done
+done
+for option in $(helped) $(for command in $commands; do helped "$command"; done); do
+    grep -q -- "${option//-/\\\\-}" docs/man/harl-updater-tool.1 || { echo "the manual page lacks $option" && wrong=1; }
 done
 
 expect stick s

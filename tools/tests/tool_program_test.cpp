@@ -70,6 +70,14 @@ TEST_F(ToolProgram, WrongUsageGivesTwoAndSaysWhatToDo)
     }
 }
 
+TEST_F(ToolProgram, VersionIsThatOfTheProject)
+{
+    const CommandResult result = tool({"--version"});
+    EXPECT_EQ(result.exitCode, 0);
+    EXPECT_EQ(result.output, "harl-updater-tool " VERSION "\n");
+    EXPECT_EQ(result.errors, "");
+}
+
 TEST_F(ToolProgram, HelpNamesThePlaceOfTheStickAndTheExitStatuses)
 {
     const CommandResult result = tool({"stick", "--help"});

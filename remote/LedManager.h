@@ -38,7 +38,10 @@ public:
     /// @name Steady colours
     /// @{
 
+    /// Lights `led` in `color`.
     static void turnOn(Led led, Color color);
+
+    /// turnOn() with COLOR_OFF.
     static void turnOff(Led led);
 
     /// Turns off every LED from LED_FIRST to LED_LAST, in this order.
@@ -53,7 +56,8 @@ public:
 
     /// Starts a thread that lights LED_REMOTE and LED_MAIN in blue in turn, a second each.
     ///
-    /// Call stopFlashRemoteAndMainInBlue() before starting again: a thread that still flashes is waited for, for good.
+    /// Call stopFlashRemoteAndMainInBlue() before starting again: a thread that still flashes is waited for, for good,
+    /// and a stop then waits as well.
     void startFlashRemoteAndMainInBlue();
 
     /// Asks the flashing thread to end. It may still finish its cycle and then turns both LEDs off.
@@ -74,10 +78,14 @@ public:
 
     /// Appends two steps of `duration` (ms, in units of 20, at most 5119) to the sequence of `led`: `color`, then dark.
     ///
-    /// Ends at the first command that fails, which may leave the sequence without its last steps.
+    /// Ends at the first command that fails, which may leave the sequence without its last steps: a longer duration
+    /// fails after the colour's step.
     static void setFlashingSequence(Led led, Color color, int duration);
 
+    /// Lets the controller play the sequence of `led`.
     static void startFlashingSequence(Led led);
+
+    /// Ends the sequence of `led`, which goes dark.
     static void stopFlashingSequence(Led led);
 
     /// @}

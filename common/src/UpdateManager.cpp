@@ -6,9 +6,8 @@
 #include <algorithm>
 #include <cstdio>
 #include <cstdlib>
+#include <sstream>
 #include <utility>
-
-#include <stdio_ext.h>
 
 // A missing callback must end the process in release builds too.
 #undef NDEBUG
@@ -83,6 +82,7 @@ void UpdateManager::update(std::vector<UpdateComponent> components, bool head)
         mWorkerThread->join();
     }
     delete mWorkerThread;
+    mWorkerThread = nullptr; // should the next thread not start
     mWorkerThread = new std::thread(updateMainHead, std::move(components));
 }
 
@@ -138,7 +138,7 @@ void UpdateManager::updateRemoteHead()
         instance()->mErrorCallback(ERROR_INSTALL_QUORB);
         return;
     }
-    // With an up-to-date package a board that cannot be checked is tolerated: a head without a board is no failure.
+    // With an up-to-date package a board that could not be checked is not reported.
     if (!packageUpdate && !boardUpdate) {
         instance()->mResultCallback(RESULT_NO_UPDATE);
         return;
@@ -202,7 +202,7 @@ void UpdateManager::initMainHead()
 
     if (checkTVUpdate(versionsFound)) {
         LOG() << "going to install TV";
-        // TeamViewer has no versions to read: the two texts only have to differ.
+        // TeamViewer has no versions to read: fixed texts.
         components.push_back({COMPONENT_TEAMVIEWER, "TV", "1", "2"});
     }
     if (!versionsFound) {
@@ -229,29 +229,30 @@ void UpdateManager::updateMainHead(std::vector<UpdateComponent> components)
     LOG();
     for (const UpdateComponent& component : components) {
         LOG() << "now call install MAIN udate" << component.kind;
-        bool installed = true; // a component of an unknown kind is passed over
-        Error error = ERROR_INSTALL_PACKAGE;
         switch (component.kind) {
         case COMPONENT_PACKAGE:
             LOG() << "now call install DH udate";
-            installed = installUpdate(command);
+            if (!installUpdate(command)) {
+                instance()->mErrorCallback(ERROR_INSTALL_PACKAGE);
+                return;
+            }
             break;
         case COMPONENT_QUORB:
             LOG() << "now call install QUORB udate";
-            installed = installQuorbUpdate();
-            error = ERROR_INSTALL_QUORB;
+            if (!installQuorbUpdate()) {
+                instance()->mErrorCallback(ERROR_INSTALL_QUORB);
+                return;
+            }
             break;
         case COMPONENT_TEAMVIEWER:
             LOG() << "now call install TV udate";
-            installed = installTVUpdate();
-            error = ERROR_INSTALL_TEAMVIEWER;
+            if (!installTVUpdate()) {
+                instance()->mErrorCallback(ERROR_INSTALL_TEAMVIEWER);
+                return;
+            }
             break;
-        default:
+        default: // a component of an unknown kind is passed over
             break;
-        }
-        if (!installed) {
-            instance()->mErrorCallback(error);
-            return;
         }
     }
     LOG() << "update maainhead finished";
@@ -495,6 +496,8 @@ void UpdateManager::stopUpdater()
     LOG() << status;
 }
 
+// Commands
+
 std::int32_t UpdateManager::runProcess(const std::string& command, std::string& output)
 {
     char buffer[1024];
@@ -507,10 +510,11 @@ std::int32_t UpdateManager::runProcess(const std::string& command, std::string& 
         return 0;
     }
     std::setvbuf(pipe, streamBuffer, _IOFBF, sizeof streamBuffer);
-    __fsetlocking(pipe, FSETLOCKING_BYCALLER); // no other thread reads it, and short lines are mostly locking
+    flockfile(pipe); // once, not for each line
     while (fgets(buffer, sizeof buffer, pipe) != nullptr) {
         output.append(buffer);
     }
+    funlockfile(pipe);
     // The wait status of a normal exit is the exit code times 256, wait(2).
     const std::int32_t code = pclose(pipe) / 256;
     LOG() << "Exit code:" << code;

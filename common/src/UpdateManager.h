@@ -14,12 +14,12 @@ class UpdateManager
 {
 public:
     enum Result : std::int32_t {
-        RESULT_NO_UPDATE = 0, ///< Nothing to install.
+        RESULT_NO_UPDATE = 0, ///< Nothing was installed; on the remote head also when the board could not be checked.
         RESULT_UPDATED = 1,   ///< Everything that had to be installed was.
     };
 
     enum Error : std::int32_t {
-        ERROR_CHECK_UPDATE = 0,       ///< A version check could not establish the versions.
+        ERROR_CHECK_UPDATE = 0,       ///< The versions, or whether TeamViewer is wanted, could not be established.
         ERROR_UPDATE_MIRRORS = 1,     ///< The mirror refresh failed.
         ERROR_INSTALL_PACKAGE = 2,    ///< The head's package could not be installed.
         ERROR_INSTALL_QUORB = 3,      ///< The Quorb board's files could not be uploaded.
@@ -79,7 +79,8 @@ public:
     /// Stops the instrument application.
     static void initRemoteHead();
 
-    /// Brings the head's package and the Quorb board up to date and reports one result or error.
+    /// Brings the head's package and the Quorb board up to date and reports one result or error. Removes the
+    /// first-boot marker once both are there and something was installed.
     static void updateRemoteHead();
 
     /// Leaves the outcome on the panel for 30 s, then gives the instrument back with startHARL().
@@ -89,7 +90,8 @@ public:
     /// @name Main-head procedure
     /// @{
 
-    /// Stops the application, checks all components and reports one list of updates, result or error. Installs nothing.
+    /// Stops the application, checks all components and reports one list of updates, result or error. Installs nothing,
+    /// but removes the first-boot marker once the checks are through.
     static void initMainHead();
 
     /// Installs `components` in their order and reports one result or error. An empty list counts as updated.
@@ -127,7 +129,8 @@ public:
     /// @return true when both were found and differ; there is no version ordering
     static bool checkQuorbUpdate(std::string& installed, std::string& candidate, bool& versionsFound);
 
-    /// Copies the upgrade archive and the install script from the stick to the board, in up to 20 attempts.
+    /// Copies the upgrade archive and the install script from the stick to the board, in up to 20 attempts. True when
+    /// one of them copied both.
     static bool uploadQuorbFiles();
 
     /// Uploads the board's files, runs the install script there and waits 13 minutes for the board.
@@ -161,14 +164,21 @@ public:
     static void stopUpdater();
 
     /// @}
+    /// @name Commands
+    /// @{
 
     /// Runs a complete shell command line and collects its standard output. Standard error is left alone.
     ///
     /// @param command  the command line for popen(3)
-    /// @param output   out: everything the command printed, unchanged
+    /// @param output   out: what the command printed, unchanged, but for what follows a NUL byte in a line
     /// @return the exit code; 0 as well when a signal ended the command, when it could not be started (`output` is then
     ///         empty) or when its status could not be had
     static std::int32_t runProcess(const std::string& command, std::string& output);
+
+    /// @}
+
+    UpdateManager(const UpdateManager&) = delete;
+    UpdateManager& operator=(const UpdateManager&) = delete;
 
 private:
     UpdateManager() = default;

@@ -3,7 +3,6 @@
 #include "findings.h"
 
 #include <algorithm>
-#include <cctype>
 
 namespace
 {
@@ -335,11 +334,8 @@ void addBesides(Run& run)
             break;
         case StepKind::CHECK_BOARD: {
             Problem tolerated = explainFailedStep(run, step);
-            tolerated.why += " With an up-to-date package this is tolerated: a head without a board is no failure. The "
-                             "board was neither checked nor updated.";
-            tolerated.remedy.front() =
-                static_cast<char>(std::tolower(static_cast<unsigned char>(tolerated.remedy.front())));
-            tolerated.remedy = "If this unit has a board: " + tolerated.remedy;
+            tolerated.why += " With an up-to-date package the run counts as nothing to update all the same. The board "
+                             "was neither checked nor updated.";
             run.besides.push_back(tolerated);
             break;
         }

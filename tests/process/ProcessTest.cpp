@@ -237,7 +237,7 @@ TEST(Pause, LastsAsLongAsAskedFor)
 {
     const double seconds = secondsOf([] { sleepSeconds(1); });
     EXPECT_GE(seconds, 1.0);
-    EXPECT_LT(seconds, 1.5);
+    EXPECT_LT(seconds, 5.0);
 }
 
 TEST(Pause, IsNotShortenedBySignals)
@@ -253,7 +253,7 @@ TEST(Pause, IsNotShortenedBySignals)
     setitimer(ITIMER_REAL, &often, nullptr);
     sigaction(SIGALRM, &before, nullptr);
     EXPECT_GE(seconds, 1.0);
-    EXPECT_LT(seconds, 1.5);
+    EXPECT_LT(seconds, 5.0);
 }
 
 TEST(Panel, MissingToolIsLoggedForEachLed)

@@ -233,7 +233,8 @@ TEST_F(Flashing, StopAndWaitWithoutAThreadReturnAtOnce)
     EXPECT_EQ(journal(), Lines{});
 }
 
-/// In a child process, which a blocked caller cannot outlive: starts again and checks that this does not return.
+/// In a child process, which blocked callers cannot outlive: starts again and checks that this does not return, and
+/// that a stop then waits for it.
 [[noreturn]] void startAgain(bool stopFirst)
 {
     static std::atomic<bool> returned{false};
@@ -248,6 +249,11 @@ TEST_F(Flashing, StopAndWaitWithoutAThreadReturnAtOnce)
         returned = true;
     }).detach();
     platform::waitFor([&cycles] { return cycles() >= 5; });
+    std::thread([] {
+        LedManager::instance()->stopFlashRemoteAndMainInBlue();
+        returned = true;
+    }).detach();
+    platform::waitFor([&cycles] { return cycles() >= 10; });
     std::_Exit(returned ? 1 : 0);
 }
 

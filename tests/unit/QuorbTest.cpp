@@ -79,6 +79,8 @@ TEST_F(CheckQuorbUpdate, OnlyTheFirstDirectoryCounts)
 {
     EXPECT_FALSE(check("Brimvale\t2.1.0\r\n", "quorb2.1.0\nquorb2.2.0\n"));
     EXPECT_EQ(candidate, "2.1.0");
+    EXPECT_FALSE(check("Brimvale\t2.1.0\r\n", "old\nquorb2.2.0\n")); // a name shorter than the prefix
+    EXPECT_EQ(candidate, "");
 }
 
 TEST_F(CheckQuorbUpdate, ListingWithoutLineFeedIsUsedWhole)

@@ -117,6 +117,25 @@ TEST_F(Feedback, FlashingSendsNothingOnceTheOutcomeIsBeingShown)
     }
 }
 
+TEST_F(Feedback, IsLoggedBeforeTheFlashingHasEnded)
+{
+    void (*const outcomes[])() = {
+        [] { RemoteUpdateManager::resultCallback(UpdateManager::RESULT_UPDATED); },
+        [] { RemoteUpdateManager::errorCallback(UpdateManager::ERROR_INSTALL_QUORB); },
+    };
+    for (const auto& outcome : outcomes) {
+        platform::reset();
+        platform::scriptSleep([](const timespec*, timespec*) {
+            platform::note("pause");
+            platform::waitFor([] { return !entries("log:").empty(); });
+            return 0;
+        });
+        LedManager::instance()->startFlashRemoteAndMainInBlue();
+        platform::waitFor([] { return !entries("pause").empty(); });
+        outcome();
+    }
+}
+
 TEST_F(Feedback, LedsAreLitOnlyAfterTheSoundHasEnded)
 {
     script("aplay /root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav", {{0, "", true, [] {
@@ -198,7 +217,13 @@ protected:
     void SetUp() override
     {
         platform::reset();
-        script("systemctl stop harl", {{0, "", true, [] { platform::delay(200); }}});
+        script("systemctl stop harl", {{0, "", true, untilTheCallerWaits}});
+    }
+
+    static void untilTheCallerWaits()
+    {
+        platform::waitFor([] { return !journalOf("static void RemoteUpdateManager::lockApp()").empty(); });
+        platform::delay(100); // from its record to the wait
     }
 
     /// Runs it. The journal is parted by threads: the caller's, the flashing thread's, and the update thread's.
@@ -271,6 +296,20 @@ TEST_F(WholeUpdate, CallerWaitsForTheUpdateThreadAndJoinsIt)
                                 return record.function == "static void RemoteUpdateManager::processUpdate()";
                             }),
               2);
+}
+
+TEST_F(WholeUpdate, IsLoggedBeforeAnyThreadStarts)
+{
+    const std::thread::id caller = std::this_thread::get_id();
+    platform::afterRecord([caller] {
+        if (std::this_thread::get_id() == caller && journal(caller).size() == 1) {
+            platform::delay(50); // another thread would have its say
+            EXPECT_EQ(journal(), Lines{"log:"});
+        }
+    });
+    script(mirrorsCommand, {exits(100)});
+    run();
+    EXPECT_EQ(platform::records().at(0).function, "void RemoteUpdateManager::update()");
 }
 
 TEST_F(WholeUpdate, RunsOpeningUpdateAndClosingInOrder)

@@ -1,9 +1,11 @@
 #include "UnitTest.h"
 
 #include <algorithm>
+#include <atomic>
 #include <csignal>
 #include <cstddef>
 #include <cstdlib>
+#include <iostream>
 
 namespace
 {
@@ -133,10 +135,12 @@ TEST_F(Manager, MainHeadChecksInstallsWhatItOfferedAndClosesOnWorkerThreads)
     scriptPackage("apt-cache policy solvik4-dh", "1.2.0", "1.3.0");
     scriptBoard("2.1.0", "2.1.0");
     script(teamViewerCheckCommand, {exits(0, std::string(teamViewerMarker) + "\n")});
-    script(stopHarl, {{0, "", true, [] { platform::delay(50); }}});
+    std::atomic<bool> goOn{false};
+    script(stopHarl, {{0, "", true, [&goOn] { platform::waitFor([&goOn] { return goOn.load(); }); }}});
 
     manager->init(false);
-    EXPECT_FALSE(noted("found:{0,Solvik IV,1.2.0,1.3.0}{2,TV,1,2}")) << "init() waited for its worker";
+    EXPECT_EQ(entries("found:"), Lines{}) << "init() waited for its worker";
+    goOn = true;
     platform::waitFor([] { return noted("found:{0,Solvik IV,1.2.0,1.3.0}{2,TV,1,2}"); });
     manager->update(offered, false);
     offered.clear(); // the worker has a list of its own
@@ -182,13 +186,15 @@ TEST_F(Manager, UpdateOfTheMainHeadWaitsForTheCheckAndReturnsBeforeTheInstallati
 {
     script(stopHarl, {{0, "", true, [] { platform::delay(100); }}});
     script(mirrorsCommand, {exits(100)});
-    script(teamViewerScriptCommand, {{0, "", true, [] { platform::delay(100); }}});
+    std::atomic<bool> goOn{false};
+    script(teamViewerScriptCommand, {{0, "", true, [&goOn] { platform::waitFor([&goOn] { return goOn.load(); }); }}});
     manager->init(false);
     const int before = platform::released(sizeof(std::thread));
     manager->update({{UpdateManager::COMPONENT_TEAMVIEWER, "TV", "1", "2"}}, false);
     EXPECT_EQ(platform::released(sizeof(std::thread)) - before, 1) << "the check's thread object";
     EXPECT_TRUE(noted("error:1")) << "update() did not wait for the check";
     EXPECT_FALSE(noted("result:1")) << "update() waited for the installation";
+    goOn = true;
     platform::waitFor([] { return noted("result:1"); });
 }
 
@@ -205,11 +211,13 @@ TEST_F(Manager, ClosingStepOfTheMainHeadDoesNotWaitForTheInstallation)
 
 TEST_F(Manager, InitAndDeinitOverwriteTheWorkerWithoutWaiting)
 {
-    script(mirrorsCommand, {{100 * 256, "", true, [] { platform::delay(50); }}});
+    std::atomic<bool> goOn{false};
+    script(mirrorsCommand, {{100 * 256, "", true, [&goOn] { platform::waitFor([&goOn] { return goOn.load(); }); }}});
     manager->init(false);
     manager->init(false);
     manager->deinit(false);
     EXPECT_EQ(entries("error:"), Lines{});
+    goOn = true;
     // Two checks with a status each, and a closing step with three.
     platform::waitFor([] { return entries("error:").size() == 2 && entries("log:0").size() == 5; });
 }
@@ -237,12 +245,14 @@ protected:
         UpdateManager::instance()->setCallbacks(GetParam() == 0 ? nullptr : noteResult,
                                                 GetParam() == 1 ? nullptr : noteError,
                                                 GetParam() == 2 ? nullptr : noteUpdateFound);
+        platform::afterRecord([] { std::cerr << "entered"; });
     }
 
-    /// glibc's diagnostic, assert(3), with the function as the compiler spells it, as a regular expression.
+    /// After the record of the entry glibc's diagnostic, assert(3), with the function as the compiler spells it, as a
+    /// regular expression.
     static std::string diagnostic(const std::string& function)
     {
-        std::string text = ": " + function + ": Assertion `validateCallbacks()' failed\\.";
+        std::string text = "entered.*: " + function + ": Assertion `validateCallbacks()' failed\\.";
         for (const char special : {'(', ')', '<', '>'}) {
             std::replace(text.begin(), text.end(), special, '.');
         }

@@ -6,8 +6,6 @@
 #include "unit_selftest.h"
 #include "unit_wave.h"
 
-#include <array>
-#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <ostream>
@@ -26,9 +24,8 @@ const auto boardLimit = 45s; // 2 s to connect, then ten unanswered keep-alives 
 const std::string darkPanel =
     "cannot light the panel (log: \"system returned false: i2cset ...\"). The update itself runs, "
     "but the operator sees neither its progress nor its outcome.";
-const std::string boardNotRead =
-    "logs \"Failed to checkUpdate\" and leaves the board as it is. The panel shows \"nothing to update\" when the "
-    "head's package is up to date, and a failed check when it has just been installed.";
+const std::string noSound =
+    "plays no sound (log: \"Failed to play a sound\"); the panel shows the outcome all the same.";
 
 /// The unit check: each operation adds to the report what it finds.
 class UnitCheck
@@ -46,10 +43,15 @@ public:
             add(Severity::UNCHECKED, "not-root", "This check does not run as root.",
                 "runs as root, with root's keys and rights.", "Run it as root.");
         }
+        mReport.addFact("head", "Head",
+                        (mUnit.isMainHead() ? "main head, package " : "remote head, package ") + shown(mUnit.package()),
+                        mUnit.isMainHead() ? "main" : "remote");
         checkServices();
         checkTools();
-        checkPanel();
-        checkSound();
+        if (!mUnit.isMainHead()) {
+            checkPanel();
+            checkSound();
+        }
         checkBoard();
         checkPackageManager(mUnit, mReport);
     }
@@ -87,36 +89,39 @@ private:
 
     void checkTools()
     {
-        static const std::array<std::pair<const char*, const char*>, 10> tools = {{
-            {"systemctl", "cannot stop and start the application (log: status 32512)."},
-            {"umount", "cannot release the stick (log: status 32512)."},
-            {"rm", "cannot remove the first-boot marker, although the log says \"removed\"."},
-            {"ls", "finds no version on the stick (log: \"Failed to check candidate QUORB version\") and leaves the "
-                   "board as it is."},
-            {"apt", "cannot refresh the mirrors (log: \"NOT OK 127\") and shows the fail pattern."},
-            {"apt-cache", "finds no versions (log: \"NWM_UM_CHECK_UPDATE_FAILED\") and shows the fail pattern."},
-            {"ssh", "cannot ask the board for its version (log: \"Exit code:127\") and leaves it as it is."},
-            {"scp", "cannot upload the board's files (log: \"Uploading failed. Trying again. \"): 20 attempts, then "
-                    "the fail pattern."},
-            {"i2cset", "cannot light the panel (log: \"system returned false: i2cset ...\"): the operator sees "
-                       "nothing."},
-            {"aplay", "plays no sound (log: \"Failed to play a sound\"); the panel shows the outcome all the same."},
-        }};
+        const std::string failure = mUnit.failure() + '.';
+        const std::string noVersion = mUnit.isMainHead() ? "installs nothing." : "leaves the board as it is.";
         mReport.addFact("search_path", "Search path", escaped(mUnit.searchPath()));
-        for (const auto& [name, effect] : tools) {
-            if (mUnit.program(name).empty()) {
-                add(std::strcmp(name, "aplay") == 0 ? Severity::WARNING : Severity::ERROR, "tool-missing",
-                    "The command " + shown(name) + " is not on the service's search path " + shown(mUnit.searchPath()) +
-                        '.',
-                    effect, "Install it, or set PATH in the service's unit file.");
-            }
+        findTool("systemctl", "cannot stop and start the application (log: status 32512).");
+        findTool("umount", "cannot release the stick (log: status 32512).");
+        findTool("rm", "cannot remove the first-boot marker, although the log says \"removed\".");
+        findTool("ls",
+                 "finds no version on the stick (log: \"Failed to check candidate QUORB version\") and " + noVersion);
+        findTool("apt", "cannot refresh the mirrors (log: \"NOT OK 127\") and " + failure);
+        findTool("apt-cache", "finds no versions (log: \"NWM_UM_CHECK_UPDATE_FAILED\") and " + failure);
+        findTool("ssh", "cannot ask the board for its version (log: \"Exit code:127\") and " + noVersion);
+        findTool("scp",
+                 "cannot upload the board's files (log: \"Uploading failed. Trying again. \"), gives up after 20 "
+                 "attempts and " +
+                     failure);
+    }
+
+    /// False, and reported, when the service's search path does not lead to the tool.
+    bool findTool(const char* name, const std::string& effect, Severity severity = Severity::ERROR)
+    {
+        if (!mUnit.program(name).empty()) {
+            return true;
         }
+        add(severity, "tool-missing",
+            "The command " + shown(name) + " is not on the service's search path " + shown(mUnit.searchPath()) + '.',
+            effect, "Install it, or set PATH in the service's unit file.");
+        return false;
     }
 
     void checkPanel()
     {
-        if (mUnit.program("i2cset").empty()) {
-            return; // reported with the tools
+        if (!findTool("i2cset", darkPanel)) {
+            return;
         }
         checkPanelAddress();
         if (!std::filesystem::exists(mUnit.path("/dev/i2c-0"))) {
@@ -163,6 +168,7 @@ private:
 
     void checkSound()
     {
+        findTool("aplay", noSound, Severity::WARNING);
         for (const char* sound : {passSound, failSound}) {
             const std::string fault = soundFault(mUnit.path(sound));
             if (!fault.empty()) {
@@ -174,8 +180,7 @@ private:
         std::ifstream devices(mUnit.path("/proc/asound/pcm")); // one line for each, snd(4) of the kernel
         const std::string text(std::istreambuf_iterator<char>(devices), {});
         if (!contains(text, "playback")) {
-            add(Severity::WARNING, "sound-device", "There is no sound device.",
-                "plays no sound (log: \"Failed to play a sound\"); the panel shows the outcome all the same.",
+            add(Severity::WARNING, "sound-device", "There is no sound device.", noSound,
                 "Check the sound driver: aplay -l");
         }
     }
@@ -204,21 +209,30 @@ private:
         }
         const bool refused = answer.exitCode == 255; // ssh(1): an error of its own
         if (refused && contains(answer.errors, "HOST IDENTIFICATION HAS CHANGED")) {
-            add(Severity::ERROR, "board-host-key", "The board's host key is not the one that is known.", boardNotRead,
+            add(Severity::ERROR, "board-host-key", "The board's host key is not the one that is known.", boardNotRead(),
                 "When the board was replaced: ssh-keygen -R 192.168.9.2, then log in once by hand: ssh 192.168.9.2");
         } else if (refused && contains(answer.errors, "Host key verification failed")) {
-            add(Severity::ERROR, "board-host-key", "The board's host key is not known.", boardNotRead,
+            add(Severity::ERROR, "board-host-key", "The board's host key is not known.", boardNotRead(),
                 "Log in once by hand and accept the key: ssh 192.168.9.2");
         } else if (refused && contains(answer.errors, "Permission denied")) {
-            add(Severity::ERROR, "board-login", "The board refuses a login without a password.", boardNotRead,
+            add(Severity::ERROR, "board-login", "The board refuses a login without a password.", boardNotRead(),
                 "Install root's public key on the board: ssh-copy-id 192.168.9.2");
         } else if (refused || answer.exitCode < 0) {
             add(Severity::ERROR, "board-unreachable",
-                "The board at 192.168.9.2 cannot be asked: " + complaint(answer) + '.', boardNotRead,
+                "The board at 192.168.9.2 cannot be asked: " + complaint(answer) + '.', boardNotRead(),
                 "Check the board's supply and link: ping 192.168.9.2. When it answers: ssh 192.168.9.2");
         } else {
             checkBoardVersion(answer);
         }
+    }
+
+    std::string boardNotRead() const
+    {
+        return mUnit.isMainHead()
+                   ? "logs \"Failed to checkUpdate\", installs nothing and " + mUnit.failure() + '.'
+                   : "logs \"Failed to checkUpdate\" and leaves the board as it is. The panel shows \"nothing to "
+                     "update\" when the head's package is up to date, and a failed check when it has just been "
+                     "installed.";
     }
 
     void checkBoardVersion(const CommandResult& answer)
@@ -229,7 +243,7 @@ private:
             add(Severity::ERROR, "board-version",
                 "The board's version file holds no line with \"Brimvale\", a tab and a version: " +
                     (answer.output.empty() ? complaint(answer) : shown(answer.output)) + '.',
-                boardNotRead, "Look at it: ssh 192.168.9.2 cat /root/App/AppExe/version.txt");
+                boardNotRead(), "Look at it: ssh 192.168.9.2 cat /root/App/AppExe/version.txt");
             return;
         }
         mReport.addFact("board_version", "Board's version", shown(version), escaped(version));

@@ -29,6 +29,7 @@ Unit::Unit(const UnitSite& site) : mSite(site)
     takeVariables(linesOf(run({"systemctl", "show-environment"}, quick).output));
     std::istringstream own(property("harl-updater", "Environment"));
     takeVariables({std::istream_iterator<std::string>(own), {}});
+    mMainHead = isInstalled("solvik4-dh") && !isInstalled("solvik4-rh");
 }
 
 CommandResult Unit::run(const std::vector<std::string>& arguments, std::chrono::milliseconds limit) const
@@ -105,6 +106,13 @@ void Unit::takeServices(const std::string& output)
             properties.clear();
         }
     }
+}
+
+/// True when anything but configuration files is there of the package, configured or not.
+bool Unit::isInstalled(const std::string& package) const
+{
+    const std::string state = run({"dpkg-query", "--show", "--showformat=${db:Status-Status}", package}, quick).output;
+    return !state.empty() && state != "not-installed" && state != "config-files";
 }
 
 std::vector<std::string> linesOf(const std::string& text)

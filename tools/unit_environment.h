@@ -16,7 +16,7 @@ inline constexpr auto quick = 10s; ///< limit for a command that only looks some
 class Unit
 {
 public:
-    /// Asks the service manager.
+    /// Asks the service manager, and the package manager which head it is.
     explicit Unit(const UnitSite& site);
 
     /// Runs `arguments` with the service's search path and locale.
@@ -35,6 +35,19 @@ public:
 
     bool isRoot() const { return mSite.isRoot; }
 
+    /// True for a main head: its package is installed and the remote head's is not. Its own program shows the outcome;
+    /// the panel and the sounds are the remote head's.
+    bool isMainHead() const { return mMainHead; }
+
+    /// The head's own package.
+    std::string package() const { return mMainHead ? "solvik4-dh" : "solvik4-rh"; }
+
+    /// What the updater does when it cannot go on, for a message.
+    std::string failure() const
+    {
+        return mMainHead ? "reports a failure to the main head's program" : "shows the fail pattern";
+    }
+
     /// False when the service manager cannot be asked.
     bool servicesKnown() const { return mServicesKnown; }
 
@@ -47,11 +60,13 @@ public:
 private:
     void takeVariables(const std::vector<std::string>& texts);
     void takeServices(const std::string& output);
+    bool isInstalled(const std::string& package) const;
 
     const UnitSite& mSite;
     std::map<std::string, std::string> mEnvironment;
     std::map<std::string, std::map<std::string, std::string>> mServices;
     bool mServicesKnown = false;
+    bool mMainHead = false;
 };
 
 // What the checks need to judge commands and files

@@ -3,7 +3,6 @@
 #include "descriptor.h"
 
 #include <algorithm>
-#include <array>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
@@ -22,13 +21,14 @@ const std::uint64_t littleSpace = 100'000'000; // bytes
 
 void checkLocks(const Unit& unit, Report& report)
 {
-    static const std::array<std::pair<const char*, const char*>, 4> locks = {{
+    const std::string waits = "waits with its installation until the other one has ended.";
+    const std::pair<const char*, std::string> locks[] = {
         {"/var/lib/apt/lists/lock",
-         "cannot refresh the mirrors (log: \"NO_INTERNET_ERROR_CODE\") and shows the fail pattern."},
-        {"/var/lib/dpkg/lock-frontend", "waits with its installation until the other one has ended."},
-        {"/var/lib/dpkg/lock", "waits with its installation until the other one has ended."},
-        {"/var/cache/apt/archives/lock", "cannot install the package and shows the fail pattern."},
-    }};
+         "cannot refresh the mirrors (log: \"NO_INTERNET_ERROR_CODE\") and " + unit.failure() + '.'},
+        {"/var/lib/dpkg/lock-frontend", waits},
+        {"/var/lib/dpkg/lock", waits},
+        {"/var/cache/apt/archives/lock", "cannot install the package and " + unit.failure() + '.'},
+    };
     for (const auto& [path, effect] : locks) {
         const Descriptor file(open(unit.path(path).c_str(), O_RDONLY | O_CLOEXEC));
         if (!file) {
@@ -97,7 +97,7 @@ void checkUnfinishedWork(const Unit& unit, Report& report)
 /// Checks both versions as the updater will see them, in the words that the service's locale gives.
 void checkPolicy(const Unit& unit, Report& report)
 {
-    const CommandResult policy = unit.run({"apt-cache", "policy", "solvik4-rh", "apt"}, quick);
+    const CommandResult policy = unit.run({"apt-cache", "policy", unit.package(), "apt"}, quick);
     if (!policy.started) {
         return; // reported with the tools
     }
@@ -110,16 +110,17 @@ void checkPolicy(const Unit& unit, Report& report)
         report.add({Severity::ERROR, "policy-words",
                     "apt-cache does not print \"Installed: \" and \"Candidate: \" under the service's locale " +
                         shown(locale) + '.',
-                    "finds no versions (log: \"NWM_UM_CHECK_UPDATE_FAILED\") and shows the fail pattern.",
+                    "finds no versions (log: \"NWM_UM_CHECK_UPDATE_FAILED\") and " + unit.failure() + '.',
                     "Set LC_ALL=C in the service's unit file."});
         return;
     }
-    const std::size_t own = text.find("solvik4-rh:\n");
+    const std::size_t own = text.find(unit.package() + ":\n");
     if (own == std::string::npos) {
         report.add({text.empty() ? Severity::UNCHECKED : Severity::WARNING, "package-unknown",
-                    "The package manager does not know the package \"solvik4-rh\" before its mirrors are refreshed.",
-                    "shows the fail pattern (log: \"NWM_UM_CHECK_UPDATE_FAILED\") unless the mirrors bring it.",
-                    "Check the sources: apt-cache policy solvik4-rh"});
+                    "The package manager does not know the package " + shown(unit.package()) +
+                        " before its mirrors are refreshed.",
+                    unit.failure() + " (log: \"NWM_UM_CHECK_UPDATE_FAILED\") unless the mirrors bring it.",
+                    "Check the sources: apt-cache policy solvik4-rh, on a main head solvik4-dh"});
         return;
     }
     const std::string block = text.substr(own, text.find("\napt:", own) - own);
@@ -129,10 +130,11 @@ void checkPolicy(const Unit& unit, Report& report)
     report.addFact("package_candidate", "Package offered", shown(candidate) + " as of the last refresh",
                    escaped(candidate));
     if (candidate == "(none)") {
-        report.add({Severity::WARNING, "package-not-offered", "No source offers the package \"solvik4-rh\".",
+        report.add({Severity::WARNING, "package-not-offered",
+                    "No source offers the package " + shown(unit.package()) + '.',
                     "compares \"(none)\" with the installed version like any other text unless the mirrors bring the "
                     "package: equal means nothing to update, different an installation that fails.",
-                    "Check the sources: apt-cache policy solvik4-rh"});
+                    "Check the sources: apt-cache policy " + unit.package()});
     }
 }
 
@@ -149,7 +151,7 @@ std::uint64_t numberField(const std::string& record, const std::string& name)
 
 void checkSpace(const Unit& unit, Report& report)
 {
-    const CommandResult record = unit.run({"apt-cache", "show", "--no-all-versions", "solvik4-rh"}, quick);
+    const CommandResult record = unit.run({"apt-cache", "show", "--no-all-versions", unit.package()}, quick);
     const std::uint64_t needed = numberField(record.output, "Size") + // bytes
                                  numberField(record.output, "Installed-Size") * 1024;
     struct statvfs system = {};
@@ -220,11 +222,11 @@ void checkMirrors(const Unit& unit, Report& report)
 {
     const CommandResult list = unit.run({"apt-get", "update", "--print-uris"}, quick);
     if (!list.succeeded()) {
-        report.add({list.started ? Severity::ERROR : Severity::UNCHECKED, "mirrors-unreadable",
-                    "The package manager cannot tell its sources: " + complaint(list) + '.',
-                    "cannot refresh the mirrors (log: \"NO_INTERNET_ERROR_CODE\" or \"NOT OK\") and shows the fail "
-                    "pattern.",
-                    "Mend the sources: apt-get update --print-uris"});
+        report.add(
+            {list.started ? Severity::ERROR : Severity::UNCHECKED, "mirrors-unreadable",
+             "The package manager cannot tell its sources: " + complaint(list) + '.',
+             "cannot refresh the mirrors (log: \"NO_INTERNET_ERROR_CODE\" or \"NOT OK\") and " + unit.failure() + '.',
+             "Mend the sources: apt-get update --print-uris"});
         return;
     }
     std::vector<std::string> indexes;
@@ -263,7 +265,7 @@ void checkFreeSpace(const struct statvfs& system, std::uint64_t needed, Report& 
     }
     if ((system.f_flag & ST_RDONLY) != 0) {
         report.add({Severity::ERROR, "disk-read-only", "The unit's disk is mounted read-only.",
-                    "cannot refresh the mirrors nor install anything; the fail pattern is shown.",
+                    "cannot refresh the mirrors nor install anything: the update fails.",
                     "Look for the reason in the kernel's log: dmesg"});
         return;
     }
@@ -272,7 +274,7 @@ void checkFreeSpace(const struct statvfs& system, std::uint64_t needed, Report& 
         report.add(
             {Severity::ERROR, "disk-full",
              noFiles ? "The unit's disk has no room for another file." : "The package needs more space than is free.",
-             "cannot install the package; the fail pattern is shown, and the package may be left "
+             "cannot install the package: the update fails, and the package may be left "
              "half-installed.",
              "Free some: apt-get clean"});
     } else if (available < littleSpace) {

@@ -89,6 +89,7 @@ TEST_F(UnitCheck, CompleteUnitIsFit)
     EXPECT_EQ(outcome.report["command"], "unit");
     EXPECT_EQ(outcome.report["fit"], true);
     const nlohmann::json facts = outcome.report["facts"];
+    EXPECT_EQ(facts["head"], "remote");
     EXPECT_EQ(facts["service_harl"], "active");
     EXPECT_EQ(facts["service_harl_updater"], "inactive");
     EXPECT_EQ(facts["board_version"], "2.1.0");
@@ -127,6 +128,71 @@ TEST_F(UnitCheck, WithoutRootsRightsTheAnswerIsOpen)
     const Outcome outcome = check(site);
     EXPECT_EQ(outcome.findings, Lines{"unchecked not-root"});
     EXPECT_EQ(outcome.status, 2);
+}
+
+// Heads
+
+TEST_F(UnitCheck, MainHeadIsJudgedByItsOwnPackage)
+{
+    unit.set("UPDATER_PROGRAM", "main");
+    const Outcome outcome = check();
+    EXPECT_EQ(outcome.findings, Lines());
+    EXPECT_EQ(outcome.status, 0);
+    const nlohmann::json facts = outcome.report["facts"];
+    EXPECT_EQ(facts["head"], "main");
+    EXPECT_EQ(facts["package_installed"], "1.2.0");
+    EXPECT_EQ(facts["package_candidate"], "1.3.0");
+    EXPECT_EQ(facts["needed_bytes"], 1'000'000 + 2048 * 1024);
+    unit.set("PACKAGE_OFFERED", "(none)");
+    EXPECT_EQ(what(), "No source offers the package \"solvik4-dh\".");
+}
+
+TEST_F(UnitCheck, MainHeadNeedsNeitherPanelNorSound)
+{
+    unit.set("UPDATER_PROGRAM", "main");
+    unit.removeTool("i2cset");
+    unit.removeTool("aplay");
+    unit.remove("dev/i2c-0");
+    unit.remove("root/RESOURCES");
+    unit.remove("proc/asound");
+    EXPECT_EQ(findings(), Lines());
+}
+
+TEST_F(UnitCheck, MainHeadInstallsNothingWithoutItsBoard)
+{
+    unit.set("UPDATER_PROGRAM", "main");
+    unit.set("BOARD_LINK", "down");
+    const nlohmann::json findings = check().report["findings"];
+    ASSERT_EQ(findings.size(), 1U);
+    EXPECT_EQ(findings[0]["check"], "board-unreachable");
+    EXPECT_EQ(findings[0]["effect"],
+              "logs \"Failed to checkUpdate\", installs nothing and reports a failure to the main head's program.");
+}
+
+TEST_F(UnitCheck, NoFindingOfAMainHeadSpeaksOfThePanel)
+{
+    unit.set("UPDATER_PROGRAM", "main");
+    for (const char* tool : {"ls", "apt", "apt-cache", "ssh", "scp"}) {
+        unit.removeTool(tool);
+    }
+    unit.replaceTool("apt-get", "exit 100");
+    const LockHolder lists(unit.folder.path("root/var/lib/apt/lists/lock"));
+    const LockHolder archives(unit.folder.path("root/var/cache/apt/archives/lock"));
+    const nlohmann::json findings = check().report["findings"];
+    EXPECT_EQ(findings.size(), 8U);
+    for (const auto& finding : findings) {
+        EXPECT_THAT(finding["effect"].get<std::string>(), Not(testing::ContainsRegex("pattern|panel"))) << finding;
+    }
+}
+
+TEST_F(UnitCheck, HeadWithBothPackagesOrWithConfigurationFilesOnlyIsARemoteHead)
+{
+    unit.replaceTool("dpkg-query", "printf installed");
+    EXPECT_EQ(fact("head"), "remote");
+    unit.replaceTool("dpkg-query", "[ \"$3\" = solvik4-dh ] && printf config-files");
+    EXPECT_EQ(fact("head"), "remote");
+    unit.replaceTool("dpkg-query", "[ \"$3\" = solvik4-dh ] && printf half-configured");
+    EXPECT_EQ(fact("head"), "main");
 }
 
 // Services

@@ -77,6 +77,7 @@ StandInUnit::StandInUnit()
                  {"PACKAGE_OFFERED", "1.3.0"},
                  {"MIRRORS_REFRESH", "works"},
                  {"TOOLS_KILLED", ""},
+                 {"UPDATER_PROGRAM", "remote"},
                  {"UNIT_ENVIRONMENT", ""},
                  {"UNIT_SERVICE_ENVIRONMENT", ""},
                  {"UNIT_UPDATER", "inactive"},

@@ -65,23 +65,41 @@ ssh() {
     printf '%s%s%s' "$before" "$BOARD_INSTALLED" "$after" | /bin/grep Brimvale
 }
 
+case $UPDATER_PROGRAM in
+main) package=solvik4-dh ;;
+*) package=solvik4-rh ;;
+esac
+
+known() { # PACKAGE
+    [ "$PACKAGE_KNOWN" = true ] && [ "$1" = "$package" ]
+}
+
+installed() { # PACKAGE
+    known "$1" && [ "$PACKAGE_INSTALLED" != "(none)" ]
+}
+
 dpkg_query() {
+    if [ $# -eq 3 ]; then # one package's state
+        installed "$3" || fail 1 "dpkg-query: no packages found matching $3"
+        printf 'installed'
+        return
+    fi
     printf 'ii \tapt\nii \tdpkg\n'
-    [ "$PACKAGE_KNOWN" = false ] || [ "$PACKAGE_INSTALLED" = "(none)" ] || printf 'ii \tsolvik4-rh\n'
+    ! installed "$package" || printf 'ii \t%s\n' "$package"
 }
 
 apt_cache() {
     case $1 in
     policy)
-        if [ "$PACKAGE_KNOWN" = true ]; then
-            printf 'solvik4-rh:\n  Installed: %s\n  Candidate: %s\n  Version table:\n' \
-                "$PACKAGE_INSTALLED" "$PACKAGE_OFFERED"
+        if known "$2"; then
+            printf '%s:\n  Installed: %s\n  Candidate: %s\n  Version table:\n' \
+                "$package" "$PACKAGE_INSTALLED" "$PACKAGE_OFFERED"
         fi
         printf 'apt:\n  Installed: 2.6.1\n  Candidate: 2.6.1\n  Version table:\n'
         ;;
     show)
-        [ "$PACKAGE_KNOWN" = true ] || fail 100 "E: No packages found"
-        printf 'Package: solvik4-rh\nVersion: %s\nInstalled-Size: 2048\nSize: 1000000\n' "$PACKAGE_OFFERED"
+        known "$3" || fail 100 "E: No packages found"
+        printf 'Package: %s\nVersion: %s\nInstalled-Size: 2048\nSize: 1000000\n' "$package" "$PACKAGE_OFFERED"
         ;;
     esac
 }

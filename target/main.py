@@ -23,7 +23,7 @@ from plan import Plan, PlanError, load, names
 from scenario import ScenarioError
 
 WORK = ROOT / "build/target"
-PACKAGED = ["CMakeLists.txt", "cmake", "common", "debian", "docs/man", "package", "remote"]  # what is in the package
+PACKAGED = ["CMakeLists.txt", "cmake", "common", "debian", "docs/man", "package", "remote", "tools"]
 SPACE = 2000  # MiB, for disks and results
 SPEED = 300  # how many times shorter the updater's waits are
 TOOL_LIMIT = 3000  # s, to build the package or the image

@@ -332,6 +332,17 @@ class Ends(ServiceTest):
         self.assertEqual(self.package_state(), "install ok installed 1.3.0")
         self.assertEqual(self.panel(), {"PASS": "pass"})
 
+    def test_stopped_while_an_installation_that_a_power_cut_left_behind_is_finished(self) -> None:
+        self.offer(SLOW_SCRIPT)
+        self.inside("dpkg", "--unpack", "/srv/repository/solvik4-rh_1.3.0.deb")
+        self.inside("systemctl", "start", "--no-block", "harl-updater")
+        self.wait_for_file("/run/package-installs")
+        self.inside("systemctl", "stop", "harl-updater")
+        self.assertTrue((self.unit.root() / "run/harl-after").exists(), "the script was broken off")
+        self.assertEqual(self.package_state(), "install ok installed 1.3.0")
+        self.assert_given_back()
+        self.assertEqual(self.panel(), {"FAIL": "fail"})
+
     def test_package_that_cannot_be_set_up_does_not_keep_the_updater(self) -> None:
         self.offer("exit 1")
         self.inside("dpkg", "--unpack", "/srv/repository/solvik4-rh_1.3.0.deb")

@@ -24,6 +24,8 @@ from scenario import ScenarioError
 
 WORK = ROOT / "build/target"
 PACKAGED = ["CMakeLists.txt", "cmake", "common", "debian", "docs/man", "package", "remote", "tools"]
+NEEDED = ["qemu-system-arm", "qemu-user-static", "mmdebstrap", "arch-test", "e2fsprogs", "dosfstools", "mtools", "kmod"]
+NEEDED += ["cpio", "openssh-client", "dpkg-dev", "g++-11-arm-linux-gnueabihf"]  # of Debian
 SPACE = 2000  # MiB, for disks and results
 SPEED = 300  # how many times shorter the updater's waits are
 TOOL_LIMIT = 3000  # s, to build the package or the image
@@ -54,8 +56,10 @@ def run_tool(command: list[str | Path], output: int | IO[str], errors: IO[str] |
 def updater_package(given: Path | None) -> Path:
     """The package to prove: the one that was given, or one built from the checked-out commit. Raises TargetError."""
     if given:
-        if not given.is_file():
-            raise TargetError(f"{given}: no such file; give a package of harl-updater for armhf")
+        fields = ["dpkg-deb", "--field", given, "Package", "Architecture"]
+        seen = subprocess.run(fields, stdout=subprocess.PIPE, stderr=subprocess.DEVNULL, text=True, check=False).stdout
+        if seen != "Package: harl-updater\nArchitecture: armhf\n":
+            raise TargetError(f"{given}: is not harl-updater for armhf; package/build armhf makes such a package")
         return given
     folder = ROOT / "build/package"
     sources = subprocess.check_output(["git", "ls-tree", "HEAD", *PACKAGED], cwd=ROOT, text=True)
@@ -149,6 +153,7 @@ def run(plans: list[Plan], package: Path | None, speed: float) -> int:
     if shutil.disk_usage(WORK).free < SPACE << 20:
         raise TargetError(f"{WORK} has less than {SPACE} MiB free: free some space")
     begin = time.monotonic()
+    subprocess.run([ROOT / "scripts/install-packages", *NEEDED], check=True)
     updater, image = updater_package(package), make_image()
     print(f"Package: {updater.name}", flush=True)
     shared = [plan for plan in plans if plan.settings["event"] != "power-cut"]

@@ -188,6 +188,8 @@ def main() -> int:
             return 0
         chosen = arguments.scenario or (["package-and-board"] if arguments.full_length else names())
         return run([load(name) for name in chosen], arguments.package, 1 if arguments.full_length else SPEED)
+    except BrokenPipeError:
+        os.dup2(os.open(os.devnull, os.O_WRONLY), sys.stdout.fileno())
     except (TargetError, PlanError, ScenarioError, MachineError) as error:
         print(f"target: {error}", file=sys.stderr)
     except FileNotFoundError as error:

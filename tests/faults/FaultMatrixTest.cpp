@@ -7,6 +7,7 @@
 #include "UnitTest.h"
 
 #include <algorithm>
+#include <iostream>
 #include <map>
 #include <set>
 #include <unistd.h>
@@ -211,22 +212,31 @@ void runMainHead(const Case& what)
     }
     EXPECT_TRUE(expected.message.empty() || last == expected.message) << last;
     manager->deinit(false);
-    platform::waitFor([] { return !entries("system:systemctl stop harl-updater").empty(); });
+    platform::waitFor([] { // the last command and the record of its status
+        return !entries("system:systemctl stop harl-updater").empty() && journal().back().compare(0, 4, "log:") == 0 &&
+               platform::records().back().flushed;
+    });
     EXPECT_EQ(callsIn(journal()), expected.calls);
     expectWholeRecords();
 }
 
-/// Runs the case and ends the process: with 0 when all held.
+/// Runs the case and ends the process: with 0 when all held, else with 1 and what did not on standard error.
 [[noreturn]] void runAlone(const Case& what)
 {
+    // In this process, a copy of the test's, the failures of earlier cases stand there already.
+    const testing::TestResult& result = *testing::UnitTest::GetInstance()->current_test_info()->result();
+    const int before = result.total_part_count();
     alarm(60);
     if (what.unit.mainHead) {
         runMainHead(what);
     } else {
         runRemoteHead(what);
     }
+    for (int part = before; part < result.total_part_count(); ++part) {
+        std::cerr << result.GetTestPartResult(part).message() << '\n';
+    }
     std::fflush(nullptr);
-    _exit(testing::Test::HasFailure() ? 1 : 0);
+    _exit(result.total_part_count() > before ? 1 : 0);
 }
 
 int casesRun = 0;

@@ -12,13 +12,13 @@
 #include <poll.h>
 #include <spawn.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <sys/wait.h>
 
 namespace
 {
 
 const std::size_t mostOutput = std::size_t{256} * 1024; // bytes
+const int pollTime = 10;                                // ms between two looks at whether a program has ended
 
 struct Pipe
 {
@@ -93,6 +93,13 @@ pid_t spawn(const std::string& program, const std::vector<std::string>& argument
     return error == 0 ? child : -1;
 }
 
+/// True once the child has ended; its status is still to be asked for.
+bool hasEnded(pid_t child)
+{
+    siginfo_t info = {};
+    return waitid(P_PID, static_cast<id_t>(child), &info, WEXITED | WNOHANG | WNOWAIT) == 0 && info.si_pid == child;
+}
+
 } // namespace
 
 CommandResult runCommand(const std::vector<std::string>& arguments, const std::vector<std::string>& environment,
@@ -114,23 +121,21 @@ CommandResult runCommand(const std::vector<std::string>& arguments, const std::v
     output.writeEnd = Descriptor();
     errors.writeEnd = Descriptor();
 
-    // A background child of the program may keep the pipes open: the program's own end is what counts.
-    const Descriptor end(static_cast<int>(syscall(SYS_pidfd_open, child, 0)));
-    std::array<pollfd, 3> watched = {
-        {{end.number(), POLLIN, 0}, {output.readEnd.number(), POLLIN, 0}, {errors.readEnd.number(), POLLIN, 0}}};
-    while ((watched[0].revents & POLLIN) == 0) {
-        const auto left =
-            std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
-        if (left.count() <= 0) {
+    // A background child of the program may keep the pipes open: the program's own end is what counts. It is looked
+    // for now and then, as not every kernel tells it to poll(2) (pidfd_open(2): since Linux 5.3).
+    std::array<pollfd, 2> watched = {{{output.readEnd.number(), POLLIN, 0}, {errors.readEnd.number(), POLLIN, 0}}};
+    while (!hasEnded(child)) {
+        if (std::chrono::steady_clock::now() >= deadline) {
             result.timedOut = true;
             break;
         }
-        poll(watched.data(), watched.size(), static_cast<int>(left.count()) + 1);
-        if (watched[1].revents != 0 && !drain(watched[1].fd, result.output)) {
-            watched[1].fd = -1;
+        const bool silent = watched[0].fd < 0 && watched[1].fd < 0; // about to end
+        poll(watched.data(), watched.size(), silent ? 1 : pollTime);
+        if (watched[0].revents != 0 && !drain(watched[0].fd, result.output)) {
+            watched[0].fd = -1;
         }
-        if (watched[2].revents != 0 && !drain(watched[2].fd, result.errors)) {
-            watched[2].fd = -1;
+        if (watched[1].revents != 0 && !drain(watched[1].fd, result.errors)) {
+            watched[1].fd = -1;
         }
     }
     if (result.timedOut) {

@@ -413,7 +413,7 @@ int runStick(const std::string& path, bool json, std::ostream& out, std::ostream
     const StickFolder stick(path);
     if (stick.error() != 0) {
         errors << "harl-updater-tool: " << shown(path) << " cannot be read: " << std::strerror(stick.error()) << ". "
-               << (stick.error() == ENOSYS ? "The kernel must be Linux 5.6 or later.\n"
+               << (stick.error() == EACCES ? "Run this check as root.\n"
                                            : "Name the folder that the stick is mounted at, the one that holds "
                                              "\"debs\".\n");
         return Report::STATUS_UNCHECKED;

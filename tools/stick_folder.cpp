@@ -8,15 +8,27 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <linux/magic.h>
-#include <linux/openat2.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <sys/vfs.h>
+
+namespace
+{
+
+const int mostLinks = 40; // on the way to a file, as the kernel has it: path_resolution(7)
+
+/// Where the symbolic link leads; empty for anything else.
+std::string targetOf(const Descriptor& node)
+{
+    std::array<char, 4096> target{};
+    const ssize_t length = readlinkat(node.number(), "", target.data(), target.size());
+    return {target.data(), static_cast<std::size_t>(std::max<ssize_t>(length, 0))};
+}
+
+} // namespace
 
 StickFolder::StickFolder(const std::string& path) : mRoot(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC))
 {
-    // The second one fails on a kernel before Linux 5.6, which cannot confine the reading to the stick.
-    if (!mRoot || !open(".", O_PATH)) {
+    if (!mRoot || !open(".", O_PATH)) { // the second one when it may be listed, but not entered
         mError = errno;
     }
 }
@@ -34,9 +46,7 @@ Node StickFolder::node(const std::string& path) const
     }
     result.present = true;
     if (S_ISLNK(status.st_mode)) {
-        std::array<char, 4096> target{};
-        const ssize_t length = readlinkat(itself.number(), "", target.data(), target.size());
-        result.target.assign(target.data(), static_cast<std::size_t>(std::max<ssize_t>(length, 0)));
+        result.target = targetOf(itself);
     }
     const Descriptor followed = open(path, O_PATH);
     if (!followed || fstat(followed.number(), &status) != 0) {
@@ -100,11 +110,46 @@ bool StickFolder::isMounted() const
            (here.st_dev != above.st_dev || here.st_ino == above.st_ino);
 }
 
-/// openat2(2) below the root; the kernel refuses with EXDEV whatever leads out.
+/// Opens the relative `path` step by step, so that no link and no ".." can lead above the root. openat2(2) would do the
+/// same, but only from Linux 5.6 on.
+///
+/// @return none with EXDEV when it would lead out of the stick
 Descriptor StickFolder::open(const std::string& path, int flags) const
 {
-    open_how how = {};
-    how.flags = static_cast<std::uint64_t>(flags | O_CLOEXEC);
-    how.resolve = RESOLVE_BENEATH | RESOLVE_NO_MAGICLINKS;
-    return Descriptor(static_cast<int>(syscall(SYS_openat2, mRoot.number(), path.c_str(), &how, sizeof how)));
+    std::vector<Descriptor> folders; // from the root to where the walk is
+    folders.emplace_back(openat(mRoot.number(), ".", O_PATH | O_DIRECTORY | O_CLOEXEC));
+    std::string rest = path;
+    int links = 0;
+    while (folders.back() && links <= mostLinks) {
+        const std::size_t slash = rest.find('/');
+        const bool last = slash == std::string::npos;
+        const std::string name = rest.substr(0, slash);
+        rest.erase(0, last ? slash : slash + 1);
+        if (name == ".." && folders.size() == 1) {
+            errno = EXDEV;
+            return Descriptor();
+        }
+        if (name == "..") {
+            folders.pop_back();
+        }
+        const bool stays = name.empty() || name == "." || name == "..";
+        const char* const step = stays ? "." : name.c_str();
+        const int here = folders.back().number();
+
+        const std::string target = targetOf(Descriptor(openat(here, step, O_PATH | O_NOFOLLOW | O_CLOEXEC)));
+        if (!target.empty() && (!last || (flags & O_NOFOLLOW) == 0)) {
+            if (target.front() == '/') {
+                errno = EXDEV;
+                return Descriptor();
+            }
+            rest.insert(0, last ? "" : "/").insert(0, target);
+            ++links;
+        } else if (last) {
+            return Descriptor(openat(here, step, flags | O_NOFOLLOW | O_CLOEXEC));
+        } else if (!stays) {
+            folders.emplace_back(openat(here, step, O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+        }
+    }
+    errno = links > mostLinks ? ELOOP : errno;
+    return Descriptor();
 }

@@ -393,6 +393,45 @@ TEST_F(Stick, LinksToNothingAndToThemselvesAreBroken)
     }
 }
 
+TEST_F(Stick, LinksAreFollowedAsTheKernelFollowsThem)
+{
+    const StickFolder folder(stick.path());
+    stick.put("a/b/file", "x");
+    for (const auto& [target, kind] : std::vector<std::pair<std::string, Node::Kind>>{
+             {"b/file", Node::FILE},
+             {"./b/.././/b/file", Node::FILE},
+             {"../a/b/file", Node::FILE},
+             {"..", Node::FOLDER},
+             {"b/", Node::FOLDER},
+             {"b/.", Node::FOLDER},
+             {"b/file/", Node::LEADS_NOWHERE},
+             {"b/file/.", Node::LEADS_NOWHERE},
+             {"b/file/../file", Node::LEADS_NOWHERE},
+             {"c/../b/file", Node::LEADS_NOWHERE},
+             {"../..", Node::LEADS_OUT},
+             {"../../" + stick.path().filename().string() + "/a/b/file", Node::LEADS_OUT},
+             {"/", Node::LEADS_OUT},
+             {stick.path("a/b/file"), Node::LEADS_OUT},
+         }) {
+        stick.makeLink("a/link", target);
+        EXPECT_EQ(folder.node("a/link").kind, kind) << target;
+        EXPECT_EQ(folder.node("a/link").target, target);
+        remove("a/link");
+    }
+    EXPECT_EQ(folder.node("a/b/file/x").kind, Node::MISSING);
+}
+
+TEST_F(Stick, FortyLinksInARowAreFollowed)
+{
+    const StickFolder folder(stick.path());
+    stick.put("0", "x");
+    for (int number = 1; number <= 41; ++number) {
+        stick.makeLink(std::to_string(number), std::to_string(number - 1));
+    }
+    EXPECT_EQ(folder.node("40").kind, Node::FILE);
+    EXPECT_EQ(folder.node("41").kind, Node::LEADS_NOWHERE);
+}
+
 TEST_F(Stick, HostileNamesBesideTheUpdatersOwnAreShownEscaped)
 {
     const std::string hostile = " a\n\x1b[2J\xff";
@@ -482,6 +521,18 @@ TEST_F(Stick, MissingOrOrdinaryFileInPlaceOfAStickIsUnreadable)
         EXPECT_THAT(errors.str(), HasSubstr(name));
         EXPECT_THAT(errors.str(), HasSubstr("Name the folder that the stick is mounted at"));
     }
+}
+
+TEST_F(Stick, FolderThatMayBeListedButNotEnteredIsUnreadable)
+{
+    chmod(stick.path("debs").c_str(), 0444);
+    const AsNobody nobody;
+    std::ostringstream out;
+    std::ostringstream errors;
+    EXPECT_EQ(runStick(stick.path("debs"), false, out, errors), 2);
+    EXPECT_EQ(out.str(), "");
+    EXPECT_THAT(errors.str(), testing::EndsWith("\" cannot be read: Permission denied. Run this check as root.\n"));
+    chmod(stick.path("debs").c_str(), 0755);
 }
 
 TEST_F(Stick, NothingOnTheStickIsChanged)

@@ -13,6 +13,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <fcntl.h>
+#include <filesystem>
 #include <fstream>
 #include <iostream>
 #include <stdexcept>
@@ -26,39 +27,45 @@ namespace
 
 const std::size_t mebibyte = 1024 * 1024;
 
-/// A file of `size` bytes in lines of `lineLength`, line end included; a length of 0 makes one line without an end.
+/// A file of `size` bytes in lines of `lineLength`, line end included; a length of 0 makes one line without an end. It
+/// has no name: it goes with the process, in whatever way that ends.
 class TextFile
 {
 public:
     TextFile(std::size_t size, std::size_t lineLength)
     {
-        const int file = mkstemp(mPath);
-        if (file < 0) {
+        std::string path = std::filesystem::temp_directory_path() / "harl-benchmark-XXXXXX";
+        mFile = mkostemp(path.data(), O_CLOEXEC);
+        if (mFile < 0) {
             throw std::runtime_error("no temporary file");
         }
+        unlink(path.c_str());
         std::string block(8 * mebibyte / 200 * 200, 'x');
         for (std::size_t end = lineLength; lineLength != 0 && end <= block.size(); end += lineLength) {
             block[end - 1] = '\n';
         }
         for (std::size_t left = size; left > 0;) {
-            const ssize_t written = write(file, block.data(), std::min(left, block.size()));
+            const ssize_t written = write(mFile, block.data(), std::min(left, block.size()));
             if (written <= 0) {
-                unlink(mPath);
+                close(mFile);
                 throw std::runtime_error("no room for a temporary file");
             }
             left -= static_cast<std::size_t>(written);
         }
-        close(file);
     }
-    ~TextFile() { unlink(mPath); }
+    ~TextFile() { close(mFile); }
     TextFile(const TextFile&) = delete;
     TextFile& operator=(const TextFile&) = delete;
 
     /// The command that prints the first `size` bytes.
-    std::string command(std::size_t size) const { return "head -c " + std::to_string(size) + " " + mPath; }
+    std::string command(std::size_t size) const
+    {
+        return "head -c " + std::to_string(size) + " /proc/" + std::to_string(getpid()) + "/fd/" +
+               std::to_string(mFile);
+    }
 
 private:
-    char mPath[32] = "/tmp/harl-benchmark-XXXXXX";
+    int mFile;
 };
 
 /// Sends standard output to a place where it costs nothing, for as long as the object lives.

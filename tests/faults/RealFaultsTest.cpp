@@ -81,8 +81,8 @@ private:
 
 RealRun::RealRun(const Case& what) : mCase(what)
 {
-    char name[] = "/tmp/faults-XXXXXX";
-    mFolder = mkdtemp(name);
+    std::string name = testing::TempDir() + "faults-XXXXXX";
+    mFolder = mkdtemp(name.data());
     fs::create_directory(mFolder / "bin");
     makeTools();
     start();

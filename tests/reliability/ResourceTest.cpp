@@ -25,10 +25,10 @@ TEST(Resources, TenThousandCommandsLeaveNoDescriptorAndNoProcess)
 {
     std::cout.rdbuf(nullptr);
     const std::string path = std::getenv("PATH");
-    char tools[] = "/tmp/resources-XXXXXX";
-    ASSERT_NE(mkdtemp(tools), nullptr);
+    std::string tools = testing::TempDir() + "resources-XXXXXX";
+    ASSERT_NE(mkdtemp(tools.data()), nullptr);
     fs::create_symlink("/bin/true", fs::path(tools) / "systemctl"); // the machine's own must not be reached
-    setenv("PATH", tools, 1);
+    setenv("PATH", tools.c_str(), 1);
     const std::ptrdiff_t before = openDescriptors();
     std::string output;
     for (int i = 0; i < 5000; ++i) {

@@ -176,7 +176,7 @@ def main() -> int:
     parser.add_argument("scenario", nargs="*", help="default: all")
     parser.add_argument("--list", action="store_true", help="show all scenarios")
     parser.add_argument(
-        "--full-length", action="store_true", help="keep every wait; 20 minutes for package-and-board, the default then"
+        "--full-length", action="store_true", help="keep every wait; an hour for package-and-board, the default then"
     )
     parser.add_argument("--package", type=Path, help="default: built by package/build armhf", metavar="FILE")
     arguments = parser.parse_args()

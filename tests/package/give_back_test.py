@@ -1,5 +1,6 @@
 """What runs after the service has ended, on stand-in tools; it looks for processes, in a namespace of its own here."""
 
+import re
 import shutil
 import subprocess
 import sys
@@ -144,6 +145,12 @@ class GiveBack(unittest.TestCase):
         self.give_back()
         self.assertEqual(self.panel(), {"FAIL": "fail"})
         self.assertEqual(self.calls()[-1], START)
+
+    def test_unit_file_names_the_runtime_directory_for_an_old_service_manager(self) -> None:
+        text = (ROOT / "package/service/harl-updater.service").read_text()
+        folder = re.findall(r"^RuntimeDirectory=(\S+)$", text, re.MULTILINE)
+        self.assertEqual(re.findall(r"^Environment=RUNTIME_DIRECTORY=/run/(\S+)$", text, re.MULTILINE), folder)
+        self.assertEqual(len(folder), 1)
 
 
 if __name__ == "__main__":

@@ -15,6 +15,8 @@ def build(*more: str) -> None:
 
     Ends the program when something fails.
     """
+    if not (BUILD / TARGETS[0]).exists():
+        print("bench: building the updater, for the first time in this checkout", file=sys.stderr)
     install = ["scripts/install-build-packages", *TOOLS]
     if subprocess.run(install, cwd=ROOT, stdout=sys.stderr, check=False).returncode != 0:
         sys.exit(1)

@@ -88,7 +88,8 @@ class LiveDisplay:
         rows = panel_rows(run.panel.shown(moment))
         if state:
             rows.append(
-                f"harl: {state.harl}   harl-updater: active   stick: {'mounted' if state.stick else 'not mounted'}   "
+                f"harl: {state.harl}   harl-updater: {state.updater}   "
+                f"stick: {'mounted' if state.stick else 'not mounted'}   "
                 f"board: {state.board or '(cannot be read)'}   package: {state.package}"
             )
         return [*rows, f"The updater {activity(run, moment)}"]

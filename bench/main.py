@@ -1,6 +1,7 @@
 """bench/run: runs one update of the real updater on a unit that a scenario describes, with its log and its panel."""
 
 import argparse
+import math
 import os
 import signal
 import subprocess
@@ -15,13 +16,11 @@ from live import LiveDisplay
 from record import page
 from session import KINDS, UnitMaker, run_on, temporary_folder
 from table import run_all
-from unit import UnitError
+from unit import PROGRAMS, UnitError
 
 
 def run(maker: UnitMaker, what: scenario.Scenario, record: Path | None) -> int:
     """Runs the scenario `what`, shows it and writes the page `record`. Returns the status of the command."""
-    if record and (record.is_dir() or not os.access(record.parent, os.W_OK)):
-        raise UnitError(f"--record: {record} cannot be written")
     with temporary_folder() as folder:
         unit = maker.make(what, folder)
         print(f"{what.name}: {what.summary}\nUnit: {unit.name}\n", flush=True)
@@ -35,12 +34,20 @@ def run(maker: UnitMaker, what: scenario.Scenario, record: Path | None) -> int:
     return 1 if summary.wrong else 0
 
 
+def writable(file: Path) -> bool:
+    """Whether `file` can be written, or made."""
+    if os.path.exists(file):
+        return not os.path.isdir(file) and os.access(file, os.W_OK)
+    return os.path.isdir(file.parent) and os.access(file.parent, os.W_OK)
+
+
 def arguments() -> argparse.Namespace:
     """The command line."""
     parser = argparse.ArgumentParser(prog="bench/run", description=__doc__)
-    parser.add_argument("scenario", nargs="?", default="package-and-board", help="default: %(default)s")
-    parser.add_argument("--list", action="store_true", help="show all scenarios")
-    parser.add_argument("--all", action="store_true", help="run all scenarios and show a table")
+    which = parser.add_mutually_exclusive_group()
+    which.add_argument("scenario", nargs="?", default="package-and-board", help="default: %(default)s")
+    which.add_argument("--list", action="store_true", help="show all scenarios")
+    which.add_argument("--all", action="store_true", help="run all scenarios and show a table")
     parser.add_argument(
         "--jobs", type=int, default=os.cpu_count(), metavar="N", help="with --all: N at a time (default: %(default)s)"
     )
@@ -66,10 +73,14 @@ def arguments() -> argparse.Namespace:
     parser.add_argument("--full-length", action="store_true", help="keep every wait: up to 14 minutes")
     parser.add_argument("--record", type=Path, metavar="FILE", help="write the run as an HTML page with its timeline")
     given = parser.parse_args()
-    if given.speed < 1:
-        parser.error("--speed: must be 1 or more")
+    if not 1 <= given.speed < math.inf:
+        parser.error("--speed: must be a number, 1 or more")
+    if given.build and not os.path.isfile(given.build / PROGRAMS["remote"]):
+        parser.error(f"--build: {given.build} holds no {PROGRAMS['remote']}: build it there or leave --build out")
     if given.record and given.all:
         parser.error("--record: takes one scenario, not --all")
+    if given.record and not writable(given.record):
+        parser.error(f"--record: {given.record} cannot be written")
     if given.jobs < 1:
         parser.error("--jobs: must be 1 or more")
     if given.full_length:
@@ -97,7 +108,10 @@ def main() -> int:
     except BrokenPipeError:
         os.dup2(os.open(os.devnull, os.O_WRONLY), sys.stdout.fileno())
         return 1
-    except (scenario.ScenarioError, UnitError, OSError, subprocess.SubprocessError) as error:
+    except scenario.ScenarioError as error:
+        print(f"bench: {error}", file=sys.stderr)
+        return 2
+    except (UnitError, OSError, subprocess.SubprocessError) as error:
         print(f"bench: {error}", file=sys.stderr)
         return 1
     except KeyboardInterrupt:

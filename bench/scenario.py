@@ -6,7 +6,10 @@ from dataclasses import dataclass
 from pathlib import Path
 from typing import Any
 
+from expected import expected_commands, expected_log
+
 FOLDER = Path(__file__).parent / "scenarios"
+TOOLS = ["systemctl", "umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp", "i2cset", "aplay"]
 
 # Section, key: what stands when a file says nothing, and what else it may say. A list is a choice; a type is any value
 # of that type.
@@ -66,11 +69,11 @@ EXPECT: dict[str, Any] = {
     # LED: colour at the end; LEDs that are not named are dark. any: whatever is lit has this colour.
     "panel": dict,
     "sound": ["", "pass", "fail"],  # the one sound that was played to its end
-    "commands": list,  # all but the panel's and the sound's, in order: names of COMMANDS, " x20" behind one repeats it
+    "commands": list,  # all but the panel's and the sound's, in order: names in expected.py, " x20" repeats one
     "waits": list,  # s, in order, those of the flashing thread left out
     # of the update's thread, a line each: the operation's name, a colon, the message. "(name ...)" stands for a block
-    # of compare.py, "(N more)" repeats the line above, "{name}" is a command of COMMANDS, "..." for any records,
-    # and at a line's end for any rest of it.
+    # of expected.py, "(N more)" repeats the line above, "{name}" is a command of expected.py, "..." stands for any
+    # records, and at a line's end for any rest of it.
     "log": str,
     "package": str,
     "board": str,
@@ -79,28 +82,15 @@ EXPECT: dict[str, Any] = {
     "harl": ["active", "inactive", "unknown"],
 }
 
-SSH_OPTIONS = "-o ServerAliveInterval=4 -o ServerAliveCountMax=10 -o ConnectTimeout=2 -o TCPKeepAlive=yes"
-BOARD_FILES = "/root/USB_MOUNT/debs/QUORB/armhf"
-
-# Short names, for the scenario files, of the command lines on the whole.
-COMMANDS = {
-    "stop-harl": "systemctl stop harl",
-    "start-harl": "systemctl start harl",
-    "stop-updater": "systemctl stop harl-updater",
-    "refresh-mirrors": "apt update",
-    "read-package": "apt-cache policy solvik4-rh",
-    "install-package": "apt --assume-yes install solvik4-rh",
-    "read-main-package": "apt-cache policy solvik4-dh",
-    "install-main-package": "apt --assume-yes install solvik4-dh",
-    "read-board": f"ssh  {SSH_OPTIONS} 192.168.9.2 \" cat /root/App/AppExe/version.txt | grep 'Brimvale'\"",
-    "list-stick": f"ls {BOARD_FILES}/",
-    "upload-board": f"scp  {SSH_OPTIONS} {BOARD_FILES}/*/OSUpgrade.zip 192.168.9.2:/root/"
-    f" && scp  {SSH_OPTIONS} {BOARD_FILES}/*/unzipUpgrade.sh 192.168.9.2:/",
-    "install-board": f'ssh  {SSH_OPTIONS} 192.168.9.2 "/unzipUpgrade.sh"',
-    "find-teamviewer": "ls /root/USB_MOUNT/debs/installTV",
-    "install-teamviewer": "/root/RESOURCES/teamviewer_updatescript.sh",
-    "remove-marker": "rm /root/RESOURCES/tavren1stboot",
-    "release-stick": "umount /root/USB_MOUNT/",
+# What an entry of each list may be.
+ENTRIES: dict[str, Any] = {
+    "stick.directories": str,
+    "tools.missing": TOOLS,
+    "tools.killed": TOOLS,
+    "updater.arguments": str,
+    "expect.status": int,
+    "expect.commands": str,
+    "expect.waits": int,
 }
 
 
@@ -167,6 +157,11 @@ def read(path: Path) -> Scenario:
                 raise fail(key, f"must be one of {', '.join(map(repr, allowed))}, not {value!r}")
         elif type(value) is not allowed:
             raise fail(key, f"must be of type {allowed.__name__}, not {value!r}")
+        elif "\0" in str(value):
+            raise fail(key, "must be without null characters")
+        elif allowed is list:
+            for entry in value:
+                check(key, entry, ENTRIES[key])
 
     for key in ("summary", "expect"):
         if key not in content:
@@ -186,6 +181,15 @@ def read(path: Path) -> Scenario:
                 raise fail(f"{section}.{key}", f"not known; the keys are {', '.join(UNIT[section])}")
             check(f"{section}.{key}", value, UNIT[section][key][1])
             unit[section][key] = value
+    package = unit["package"]
+    for key, file_names in (
+        ("stick.directories", unit["stick"]["directories"]),
+        ("package.installed", [package["installed"]]),
+        ("package.offered", [package["offered"]]),
+    ):
+        for name in file_names:
+            if "/" in name or name in ("", ".", ".."):
+                raise fail(key, f"must be fit for the name of a file, not {name!r}")
     for key in expect:
         if key not in EXPECT:
             raise fail(f"expect.{key}", f"not known; the keys are {', '.join(EXPECT)}")
@@ -193,6 +197,11 @@ def read(path: Path) -> Scenario:
         if key not in expect:
             raise fail(f"expect.{key}", "is missing")
         check(f"expect.{key}", expect[key], allowed)
+    for key, write_out in (("commands", expected_commands), ("log", expected_log)):
+        try:
+            write_out(expect[key])
+        except ValueError as error:
+            raise fail(f"expect.{key}", str(error)) from error
     return Scenario(path.stem, summary, only, unit, expect)
 
 

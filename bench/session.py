@@ -4,6 +4,7 @@ import contextlib
 import os
 import shutil
 import subprocess
+import sys
 import tempfile
 import time
 from collections.abc import Callable, Iterator
@@ -23,19 +24,7 @@ POLL = 0.02  # s
 LONGEST_RUN = 120  # s, besides the waits; a run that takes longer hangs
 SPACE = 20  # MB, that a unit may take in its temporary folder
 WAITS = 820  # s, of an update at full length
-# Reads until its owner has ended, then clears away what still runs and lies there.
-GUARD = """
-read -r _
-for _ in $(seq 200); do
-    read -r pid <"$0/unit.pid" && kill -s KILL -- "-$pid"
-    if read -r group <"$0/control-group"; then
-        find "$group" -depth -type d -exec rmdir {} +
-        [ ! -e "$group" ] || { sleep 0.05; continue; }
-    fi
-    rm -rf "$0" && exit
-    sleep 0.05
-done
-"""
+GUARD = Path(__file__).with_name("guard.py")
 
 
 @dataclass
@@ -62,7 +51,7 @@ def temporary_folder() -> Iterator[Path]:
     folder = tempfile.mkdtemp(prefix="bench-")
     try:
         guard = subprocess.Popen(
-            ["/bin/sh", "-c", GUARD, folder],
+            [sys.executable, "-I", "-S", GUARD, folder],
             stdin=subprocess.PIPE,
             stderr=subprocess.DEVNULL,
             start_new_session=True,

@@ -64,20 +64,13 @@ def obstacle() -> str:
 
 
 def make_control_group(folder: Path) -> Path:
-    """A control group for the head, named in the file `control-group` of the folder; see session.GUARD."""
+    """A control group for the head, named in the file `control-group` of the folder; see guard.py."""
     parent = _own_control_group()
     assert parent
     group = parent / f"{folder.parent.name}-{folder.name}"
     (folder / "control-group").write_text(f"{group}\n")
     group.mkdir()
     return group
-
-
-def remove_control_group(group: Path) -> None:
-    """Removes the group and those within it, once no process is left in them."""
-    for directory, _, _ in os.walk(group, topdown=False):
-        with contextlib.suppress(OSError):
-            os.rmdir(directory)
 
 
 def service_active(group: Path, name: str) -> bool:

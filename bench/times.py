@@ -94,12 +94,17 @@ def main() -> int:
     if given.runs < 1:
         parser.error("--runs: must be 1 or more")
     try:
+        for name in given.scenario:
+            scenario.load(name)
         build()
         load = os.getloadavg()[0]
         print(f"{os.cpu_count()} cores, load {load:.1f}; the updater's waits are {SPEED} times shorter")
         for name in given.scenario:
             print_times(name, given.runs)
-    except (scenario.ScenarioError, UnitError, OSError, subprocess.CalledProcessError) as error:
+    except scenario.ScenarioError as error:
+        print(f"bench: {error}", file=sys.stderr)
+        return 2
+    except (UnitError, OSError, subprocess.CalledProcessError) as error:
         print(f"bench: {error}", file=sys.stderr)
         return 1
     except KeyboardInterrupt:

@@ -17,6 +17,7 @@ class State:
     marker: bool  # the first-boot marker exists
     stick: bool  # the stick is mounted
     harl: str  # "active", "inactive" or "unknown"
+    updater: str = "inactive"  # its service: "active" or "inactive"
     sounds: list[str] = field(default_factory=list)  # base names of the sound files that were played to their end
 
 
@@ -25,7 +26,7 @@ class Files:
     """Where a unit writes what happens, each file appended to while the updater runs and read as it grows.
 
     `log`: the updater's standard output.
-    `calls`: what bench/tap.c, preloaded into the updater alone, writes: one line for each start and each end of a
+    `calls`: what bench/tap.cpp, preloaded into the updater alone, writes: one line for each start and each end of a
     `system`, a `popen`/`pclose` or a `nanosleep` of the updater. Its path is in BENCH_CALLS.
     `panel`: one line for each byte that reached the LED controller: seconds of CLOCK_BOOTTIME, a blank, two hex digits.
     """

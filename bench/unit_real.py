@@ -16,6 +16,7 @@ from pathlib import Path
 
 import sshd
 import systemd
+from guard import remove_control_group
 from scenario import Scenario, variables
 from unit import PROGRAMS, Files, State, UnitError, with_pid_file
 from unit_real_files import HERE, SOUND_LENGTH, SOUNDS, head_package, search_path, write_board, write_head, write_stick
@@ -110,6 +111,7 @@ class RealUnit:
             marker=(head / "root/RESOURCES/tavren1stboot").exists(),
             stick=stick in Path(f"/proc/{self._first_process()}/mountinfo").read_text(),
             harl=self._harl_state(),
+            updater="active" if self._updater_active() else "inactive",
             sounds=self._sounds_played(),
         )
 
@@ -124,7 +126,7 @@ class RealUnit:
         self._namespaces.wait()
         self._namespaces = None
         if self._control_group:
-            systemd.remove_control_group(self._control_group)
+            remove_control_group(str(self._control_group))
 
     def _add_programs(self) -> str:
         """Puts the programs on the head. Returns the command that runs the updater there."""
@@ -162,6 +164,11 @@ class RealUnit:
         if self._control_group:
             return "active" if systemd.service_active(self._control_group, "harl") else "inactive"
         return (self._root() / "head/run/harl").read_text().strip()
+
+    def _updater_active(self) -> bool:
+        if self._control_group:
+            return systemd.service_active(self._control_group, "harl-updater")
+        return self._settings["updater"]["stopped"] != "never" and not (self._out / "status").exists()
 
     def _check_alive(self) -> None:
         assert self._namespaces

@@ -11,9 +11,9 @@ from pathlib import Path
 from typing import Any
 
 from packages import package
+from scenario import TOOLS
 
 HERE = Path(__file__).parent / "unit_real"
-TOOLS = ["systemctl", "umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp", "i2cset", "aplay"]
 SOUNDS = {"SND_RESULT_PASS.wav": 880, "SND_RESULT_FAIL.wav": 220}  # Hz
 SOUND_LENGTH = 1.5  # s
 ARCHIVE_PAYLOAD = 200_000  # bytes; more than a full board has left

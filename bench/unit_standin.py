@@ -6,11 +6,10 @@ import signal
 import subprocess
 from pathlib import Path
 
-from scenario import Scenario, variables
+from scenario import TOOLS, Scenario, variables
 from unit import PROGRAMS, Files, State, with_pid_file
 
 HERE = Path(__file__).parent
-TOOLS = ["systemctl", "umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp", "i2cset", "aplay"]
 
 
 def sanitizers(program: Path) -> list[str]:
@@ -51,12 +50,14 @@ class StandInUnit:
     def state(self) -> State:
         """The unit as it is now."""
         known = self._settings["head"]["harl"] == "known"
+        is_service = self._settings["updater"]["stopped"] != "never"
         return State(
             package=self._read("package") if self._settings["package"]["known"] else "(none)",
             board=self._board_version(),
             marker=(self._folder / "head/RESOURCES/tavren1stboot").exists(),
             stick=(self._folder / "head/USB_MOUNT").is_symlink(),
             harl=self._read("harl") if known else "unknown",
+            updater="active" if is_service and self.ended() is None else "inactive",
             sounds=(self._folder / "sounds").read_text().split(),
         )
 

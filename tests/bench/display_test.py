@@ -53,7 +53,7 @@ class HalfUnit:
     """A unit that has a state and nothing else."""
 
     def state(self) -> State:
-        return State(package="1.2.0", board="", marker=True, stick=False, harl="unknown")
+        return State(package="1.2.0", board="", marker=True, stick=False, harl="unknown", updater="inactive")
 
 
 class Display(unittest.TestCase):
@@ -106,8 +106,8 @@ class Display(unittest.TestCase):
         with tempfile.TemporaryDirectory() as folder, contextlib.redirect_stdout(shown):
             nothing = Path(folder) / "none"
             LiveDisplay(HalfUnit()).show(Run(Files(nothing, nothing, nothing)), "")
-        services = "harl: unknown   harl-updater: active   stick: not mounted   board: (cannot be read)   package: 1.2"
-        self.assertIn(f"\n{services}.0\nThe updater between two commands\n", shown.getvalue())
+        services = "harl: unknown   harl-updater: inactive   stick: not mounted   board: (cannot be read)   package: 1"
+        self.assertIn(f"\n{services}.2.0\nThe updater between two commands\n", shown.getvalue())
 
     def test_dumb_terminal(self) -> None:
         self.assertNotIn("\x1b", on_terminal("up-to-date", TERM="dumb"))

@@ -14,6 +14,7 @@ from pathlib import Path
 ROOT = Path(__file__).parents[2]
 sys.path.insert(0, str(ROOT / "bench"))
 
+from session import GUARD
 from unit_real import forbidden
 
 KINDS = ["stand-in"] if forbidden() else ["real", "stand-in"]
@@ -117,6 +118,17 @@ class HostTest(unittest.TestCase):
                     bench.communicate()
                     self.assertEqual(bench.returncode, status)
                     self.check_untouched()
+
+    def test_guard_needs_no_process(self) -> None:
+        folder = Path(self.folder) / "bench"
+        folder.mkdir()
+        with subprocess.Popen(["sleep", "60"], start_new_session=True) as left:
+            (folder / "unit.pid").write_text(f"{left.pid}\n")
+            guard = [sys.executable, "-I", "-S", GUARD, folder]
+            # No program on its search path.
+            subprocess.run(guard, env={"PATH": self.folder}, stdin=subprocess.DEVNULL, check=True)
+            self.assertEqual(left.wait(), -signal.SIGKILL)
+        self.assertFalse(folder.exists())
 
     def test_after_a_signal_while_the_unit_is_made(self) -> None:
         for kind in KINDS:

@@ -17,6 +17,7 @@ sys.path.insert(0, str(Path(__file__).parents[2] / "bench"))
 import scenario
 from compare import differences
 from disturbed import SPEED, DisturbedUnit
+from expected import COMMANDS
 from observe import Run
 from session import Result, run_on, temporary_folder
 
@@ -120,7 +121,7 @@ class SurroundingsTest(unittest.TestCase):
         result = self.run_updater(self.unit(circumstances="ulimit -n 4"))
         commands = [call.text for call in result.run.commands()]
         names = ["stop-harl", "refresh-mirrors", "read-package", "release-stick", "start-harl", "stop-updater"]
-        self.assertEqual(commands, [scenario.COMMANDS[name] for name in names])
+        self.assertEqual(commands, [COMMANDS[name] for name in names])
         self.assertEqual(result.status, 0)
         last = [call.text for call in result.run.calls if call.text.startswith("i2cset")][-2:]
         self.assertEqual(last, [f"i2cset -y 0 0x07 {led} c ; i2cset -y 0 0x07 0x8 c" for led in ("0x12", "0x15")])

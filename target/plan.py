@@ -8,7 +8,7 @@ from pathlib import Path
 from typing import Any
 
 import scenario as bench
-from compare import expected_log
+from expected import expected_log
 
 FOLDER = Path(__file__).parent / "scenarios"
 

@@ -1,4 +1,4 @@
-"""Bad input of bench/run: one clear line, status 2 or 1, and nothing run."""
+"""Bad input of bench/run and of other commands: one clear line, status 2 or 1, and nothing run."""
 
 import os
 import re
@@ -182,6 +182,31 @@ class BadInput(unittest.TestCase):
         self.assertNotEqual(status, 0)
         self.assertIn("alsa-utils", message)
         self.assertNotIn("Unit:", shown)
+
+
+class OtherCommands(unittest.TestCase):
+    """Commands that would find nothing to run, or never end."""
+
+    def test_wrong_words(self) -> None:
+        numbers = [["x"], ["0"], ["-1"], [""], ["1", "2"], ["9999999999"]]
+        names = [["nonsense"]]
+        for command, wrong in (
+            ("tests/reliability/threads", numbers),
+            ("fuzz/run", numbers),
+            ("tools/tests/log-throughput", numbers),
+            ("benchmarks/processes", numbers[:-1]),
+            ("tests/reliability/interruption_real", names),
+            ("tools/tests/make-golden", names),
+            ("tools/tests/make-golden-checks", names),
+            ("tests/run-armhf", names),
+        ):
+            for words in wrong:
+                with self.subTest(command, words=words):
+                    done = subprocess.run(
+                        [ROOT / command, *words], capture_output=True, text=True, timeout=30, check=False
+                    )
+                    self.assertEqual((done.returncode, done.stdout), (2, ""), done.stderr)
+                    self.assertEqual(done.stderr.count("\n"), 1, done.stderr)
 
 
 if __name__ == "__main__":

@@ -1,5 +1,6 @@
 #include "log.h"
 
+#include "descriptor.h"
 #include "findings.h"
 #include "log_explain.h"
 #include "log_follow.h"
@@ -12,6 +13,7 @@
 
 #include <cerrno>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <fstream>
 #include <memory>
@@ -108,9 +110,18 @@ private:
 class NewFile
 {
 public:
-    explicit NewFile(const std::string& path)
-        : mPath(path), mPartPath(path + ".part"), mStream(mPartPath, std::ios::binary)
+    explicit NewFile(const std::string& path) : mPath(path), mPartPath(path + ".XXXXXX")
     {
+        const Descriptor part(mkstemp(mPartPath.data()));
+        if (part) {
+            const mode_t withheld = umask(0);
+            umask(withheld);
+            fchmod(part.number(), 0666 & ~withheld);
+            mStream.open(mPartPath, std::ios::binary);
+        } else {
+            mPartPath.clear();
+            mStream.setstate(std::ios::failbit);
+        }
     }
     ~NewFile()
     {
@@ -179,8 +190,34 @@ private:
     std::ostream& mOut;
 };
 
-std::string noRecordText(const LogParser& parser)
+/// Why the page must not take the place of what is at `path`, in words; empty when it may.
+std::string objectionTo(const std::string& path, const LogSource& source)
 {
+    struct stat page = {};
+    struct stat log = {};
+    if (lstat(path.c_str(), &page) != 0) {
+        return "";
+    }
+    if (!S_ISREG(page.st_mode)) {
+        return "not a plain file; name another one for the page";
+    }
+    const bool same = fstat(source.descriptor(), &log) == 0 && page.st_dev == log.st_dev && page.st_ino == log.st_ino;
+    return same ? "the log itself; name another file for the page" : "";
+}
+
+/// What journalctl(1) failed with, in words.
+std::string journalText(int code)
+{
+    return "journalctl ended with status " + std::to_string(code) +
+           ". Run it as root; journalctl --unit=harl-updater tells more.";
+}
+
+std::string noRecordText(const LogParser& parser, bool journal)
+{
+    if (journal && parser.bytes() == 0) {
+        return "nothing in it: the service has not run since the journal begins (often with the boot), or only root "
+               "may read it. Run it as root.";
+    }
     return "no record of the updater in " + counted(parser.lines(), "line") + ", " + byteCount(parser.bytes()) +
            ". A record begins with \"Updater | DD-MM-YYYY HH-MM-SS\".";
 }
@@ -190,6 +227,10 @@ int explainAll(LogSource& source, const LogOptions& options, std::ostream& out, 
     std::unique_ptr<NewFile> file;
     std::optional<HtmlPage> page;
     if (!options.htmlFile.empty()) {
+        if (const std::string objection = objectionTo(options.htmlFile, source); !objection.empty()) {
+            err << "harl-updater-tool: " << escaped(options.htmlFile) << ": " << objection << '\n';
+            return LOG_UNREADABLE;
+        }
         file = std::make_unique<NewFile>(options.htmlFile);
         if (!file->stream()) {
             err << "harl-updater-tool: " << escaped(options.htmlFile) << ": " << std::strerror(errno) << '\n';
@@ -217,10 +258,10 @@ int explainAll(LogSource& source, const LogOptions& options, std::ostream& out, 
 
     std::string error = reader.error();
     if (const int code = source.close(error.empty()); error.empty() && code != 0) {
-        error = "journalctl ended with status " + std::to_string(code);
+        error = journalText(code);
     }
     if (error.empty() && parser.records() == 0) {
-        error = noRecordText(parser);
+        error = noRecordText(parser, options.unit);
     }
     if (!error.empty()) {
         status = LOG_UNREADABLE;
@@ -316,9 +357,9 @@ int followLast(LogSource& source, const LogOptions& options, std::ostream& out, 
     builder.finish();
     const int code = source.close(!open && error.empty());
     if (error.empty() && code != 0) {
-        error = "journalctl ended with status " + std::to_string(code);
+        error = journalText(code);
     } else if (error.empty() && parser.records() == 0) {
-        error = noRecordText(parser);
+        error = noRecordText(parser, options.unit);
     }
     if (!error.empty()) {
         err << "harl-updater-tool: " << source.name() << ": " << error << '\n';

@@ -149,7 +149,13 @@ class BadInput(Base):
 
     def test_failing_journalctl(self) -> None:
         message = self.refused("--unit", env={"PATH": self.program("journalctl", "exit 3")})
-        self.assertIn("journalctl ended with status 3", message)
+        self.assertIn("journalctl ended with status 3. Run it as root", message)
+
+    def test_empty_journal(self) -> None:
+        for arguments in (["--unit"], ["--unit", "--follow"]):
+            message = self.refused(*arguments, env={"PATH": self.program("journalctl", "")})
+            self.assertIn("the service has not run since the journal begins", message)
+            self.assertIn("Run it as root", message)
 
     def test_wrong_usage(self) -> None:
         for arguments in (["--unit", "a.log"], ["--follow", "--html", "x"], ["--nonsense"], ["a", "b"]):
@@ -161,6 +167,32 @@ class BadInput(Base):
         self.refused("--html", str(page), text=b"no record\n")
         self.assertEqual(page.read_text(), "old")
         self.assertEqual([file.name for file in self.folder.iterdir()], ["page.html"])
+
+    def test_page_in_the_place_of_the_log_is_refused(self) -> None:
+        log = self.folder / "u.log"
+        text = (GOLDEN / "up-to-date.log").read_bytes()
+        log.write_bytes(text)
+        (self.folder / "same").hardlink_to(log)
+        (self.folder / "link").symlink_to(log)
+        for page in (log, self.folder / "same"):
+            self.assertIn("the log itself; name another file", self.refused("--html", str(page), str(log)))
+        with log.open("rb") as stream:
+            done = subprocess.run([TOOL, "log", "--html", str(log)], stdin=stream, capture_output=True, check=False)
+        self.assertEqual(done.returncode, 2)
+        for page in (self.folder / "link", self.folder):
+            self.assertIn("not a plain file; name another", self.refused("--html", str(page), str(log)))
+        self.assertEqual(log.read_bytes(), text)
+        self.assertEqual({file.name for file in self.folder.iterdir()}, {"u.log", "same", "link"})
+
+    def test_page_replaces_no_other_file(self) -> None:
+        page, part = self.folder / "page.html", self.folder / "page.html.part"
+        page.write_text("old")
+        part.write_text("mine")
+        self.assertEqual(run_tool("up-to-date.log", "--html", str(page), umask=0o027).returncode, 0)
+        self.assertTrue(page.read_text().startswith("<!DOCTYPE html>"))
+        self.assertEqual(page.stat().st_mode & 0o777, 0o640)
+        self.assertEqual(part.read_text(), "mine")
+        self.assertEqual({file.name for file in self.folder.iterdir()}, {page.name, part.name})
 
     def test_page_that_cannot_be_written(self) -> None:
         done = run_tool("up-to-date.log", "--html", str(self.folder / "none/page.html"))

@@ -32,7 +32,7 @@ int run(int argc, char** argv)
     stick->footer("Exit status: 0 fit for an update, 1 not fit, 2 wrong usage or not everything could be read.\n");
 
     UnitOptions unitOptions;
-    CLI::App* unit = app.add_subcommand("unit", "Tell whether this unit is fit for an update. Changes nothing.");
+    CLI::App* unit = app.add_subcommand("unit", "Tell whether this unit is fit for an update. Run it as root.");
     unit->add_flag("--panel", unitOptions.panel, "lamp test instead: all 14 LEDs in every colour");
     unit->add_flag("--sound", unitOptions.sound, "play both sounds instead");
     unit->add_flag("--json", unitOptions.json, "print one JSON object");
@@ -47,14 +47,16 @@ int run(int argc, char** argv)
     CLI::Option* follow = log->add_flag("--follow", logOptions.follow, "show the run that goes on, until it ends");
     log->add_flag("--json", logOptions.json, "print one JSON object; with --follow one for each change");
     log->add_option("--html", logOptions.htmlFile, "also write a page with each run's timeline")
-        ->type_name("FILE")
+        ->type_name("PAGE")
         ->excludes(follow);
     log->footer("Exit status: 0 the last run went well, 1 it failed or did not finish, 2 wrong usage or no log.\n");
 
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& error) {
-        return app.exit(error) == 0 ? 0 : Report::STATUS_UNCHECKED;
+        const bool unknown = error.get_name() == "RequiredError" && app.remaining_size() > 0; // no such subcommand
+        const int status = unknown ? app.exit(CLI::ExtrasError(app.remaining())) : app.exit(error);
+        return status == 0 ? 0 : Report::STATUS_UNCHECKED;
     }
     if (stick->parsed()) {
         return runStick(stickPath, json, std::cout, std::cerr);

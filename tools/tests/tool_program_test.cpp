@@ -70,6 +70,12 @@ TEST_F(ToolProgram, WrongUsageGivesTwoAndSaysWhatToDo)
     }
 }
 
+TEST_F(ToolProgram, UnknownSubcommandIsNamed)
+{
+    EXPECT_THAT(tool({"stik"}).errors, HasSubstr("not expected: stik\n"));
+    EXPECT_THAT(tool({}).errors, HasSubstr("A subcommand is required"));
+}
+
 TEST_F(ToolProgram, VersionIsThatOfTheProject)
 {
     const CommandResult result = tool({"--version"});

@@ -19,6 +19,7 @@ namespace
 
 const std::size_t mostOutput = std::size_t{256} * 1024; // bytes
 const int pollTime = 10;                                // ms between two looks at whether a program has ended
+const std::array<int, 3> endings = {SIGHUP, SIGINT, SIGTERM}; // from outside
 
 struct Pipe
 {
@@ -84,7 +85,10 @@ pid_t spawn(const std::string& program, const std::vector<std::string>& argument
     posix_spawn_file_actions_addopen(&actions, STDIN_FILENO, "/dev/null", O_RDONLY, 0);
     posix_spawn_file_actions_adddup2(&actions, output, STDOUT_FILENO);
     posix_spawn_file_actions_adddup2(&actions, errors, STDERR_FILENO);
-    posix_spawnattr_setflags(&attributes, POSIX_SPAWN_SETSID);
+    sigset_t none;
+    sigemptyset(&none);
+    posix_spawnattr_setsigmask(&attributes, &none);
+    posix_spawnattr_setflags(&attributes, POSIX_SPAWN_SETSID | POSIX_SPAWN_SETSIGMASK);
     pid_t child = -1;
     const int error = posix_spawn(&child, program.c_str(), &actions, &attributes, pointers(arguments).data(),
                                   pointers(environment).data());
@@ -102,6 +106,32 @@ bool hasEnded(pid_t child)
 
 } // namespace
 
+HeldSignals::HeldSignals() : mHeld(), mBefore()
+{
+    sigemptyset(&mHeld);
+    for (const int number : endings) {
+        struct sigaction action = {};
+        if (sigaction(number, nullptr, &action) == 0 && action.sa_handler != SIG_IGN) { // as nohup(1) leaves one
+            sigaddset(&mHeld, number);
+        }
+    }
+    sigprocmask(SIG_BLOCK, &mHeld, &mBefore);
+}
+
+HeldSignals::~HeldSignals()
+{
+    sigprocmask(SIG_SETMASK, &mBefore, nullptr);
+}
+
+bool HeldSignals::any() const
+{
+    sigset_t pending;
+    sigpending(&pending);
+    return std::any_of(endings.begin(), endings.end(), [&](int number) {
+        return sigismember(&mHeld, number) == 1 && sigismember(&pending, number) == 1;
+    });
+}
+
 CommandResult runCommand(const std::vector<std::string>& arguments, const std::vector<std::string>& environment,
                          std::chrono::milliseconds limit)
 {
@@ -112,6 +142,7 @@ CommandResult runCommand(const std::vector<std::string>& arguments, const std::v
     if (program.empty() || !output.readEnd || !errors.readEnd) {
         return result;
     }
+    const HeldSignals signals;
     const auto deadline = std::chrono::steady_clock::now() + limit;
     const pid_t child = spawn(program, arguments, environment, output.writeEnd.number(), errors.writeEnd.number());
     if (child < 0) {
@@ -125,7 +156,7 @@ CommandResult runCommand(const std::vector<std::string>& arguments, const std::v
     // for now and then, as not every kernel tells it to poll(2) (pidfd_open(2): since Linux 5.3).
     std::array<pollfd, 2> watched = {{{output.readEnd.number(), POLLIN, 0}, {errors.readEnd.number(), POLLIN, 0}}};
     while (!hasEnded(child)) {
-        if (std::chrono::steady_clock::now() >= deadline) {
+        if (std::chrono::steady_clock::now() >= deadline || signals.any()) {
             result.timedOut = true;
             break;
         }

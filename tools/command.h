@@ -1,6 +1,7 @@
 #pragma once
 
 #include <chrono>
+#include <csignal>
 #include <string>
 #include <vector>
 
@@ -16,8 +17,26 @@ struct CommandResult
     bool succeeded() const { return exitCode == 0; }
 };
 
+/// Holds back what ends this program from outside, Ctrl-C, a lost terminal or kill(1), for as long as it lives: what
+/// was begun can be cleared away first.
+class HeldSignals
+{
+public:
+    HeldSignals();
+    ~HeldSignals();
+    HeldSignals(const HeldSignals&) = delete;
+    HeldSignals& operator=(const HeldSignals&) = delete;
+
+    /// True when one of them is held back.
+    bool any() const;
+
+private:
+    sigset_t mHeld;
+    sigset_t mBefore;
+};
+
 /// Runs a program without a shell, as a service runs it: no terminal, no input. It and its children are killed at
-/// `limit`.
+/// `limit`, and when this program is to end.
 ///
 /// @param arguments    the program, looked for on the PATH of `environment` when it holds no slash, and its arguments
 /// @param environment  all of its environment, as NAME=value

@@ -6,6 +6,7 @@
 #include "unit_selftest.h"
 #include "unit_wave.h"
 
+#include <cerrno>
 #include <filesystem>
 #include <fstream>
 #include <ostream>
@@ -170,12 +171,7 @@ private:
     {
         findTool("aplay", noSound, Severity::WARNING);
         for (const char* sound : {passSound, failSound}) {
-            const std::string fault = soundFault(mUnit.path(sound));
-            if (!fault.empty()) {
-                add(Severity::WARNING, "sound-file", "The sound " + shown(sound) + " cannot be played: " + fault + '.',
-                    "plays nothing or a noise in its place; the panel shows the outcome all the same.",
-                    "Install the sound file again.");
-            }
+            checkSoundFile(sound);
         }
         std::ifstream devices(mUnit.path("/proc/asound/pcm")); // one line for each, snd(4) of the kernel
         const std::string text(std::istreambuf_iterator<char>(devices), {});
@@ -185,15 +181,31 @@ private:
         }
     }
 
-    static std::string soundFault(const std::string& path)
+    void checkSoundFile(const char* sound)
     {
-        std::error_code error;
-        const std::uintmax_t size = std::filesystem::file_size(path, error);
-        std::ifstream file(path, std::ios::binary);
+        const std::string effect = "plays nothing or a noise in its place; the panel shows the outcome all the same.";
+        std::ifstream file(mUnit.path(sound), std::ios::binary);
+        if (!file && errno != ENOENT) {
+            add(Severity::UNCHECKED, "sound-file",
+                "The sound " + shown(sound) + " cannot be read: " + errorText(errno) + '.', effect,
+                "Run this check as root.");
+            return;
+        }
+        const std::string fault = file ? soundFault(file) : "it is not there";
+        if (!fault.empty()) {
+            add(Severity::WARNING, "sound-file", "The sound " + shown(sound) + " cannot be played: " + fault + '.',
+                effect, "Install the sound file again.");
+        }
+    }
+
+    static std::string soundFault(std::ifstream& file)
+    {
         std::string start(std::size_t{64} * 1024, '\0');
         file.read(start.data(), static_cast<std::streamsize>(start.size()));
         start.resize(static_cast<std::size_t>(file.gcount()));
-        return error ? "it cannot be read: " + error.message() : waveFault(start, size);
+        file.clear();
+        file.seekg(0, std::ios::end);
+        return waveFault(start, static_cast<std::uint64_t>(file.tellg()));
     }
 
     void checkBoard()
@@ -208,7 +220,12 @@ private:
             return; // reported with the tools
         }
         const bool refused = answer.exitCode == 255; // ssh(1): an error of its own
-        if (refused && contains(answer.errors, "HOST IDENTIFICATION HAS CHANGED")) {
+        const bool forKeys =
+            contains(answer.errors, "Host key verification failed") || contains(answer.errors, "Permission denied");
+        if (refused && forKeys && !mUnit.isRoot()) {
+            add(Severity::UNCHECKED, "board-login", "The board refuses this user: " + complaint(answer) + '.',
+                boardNotRead(), "Run this check as root: root's keys count.");
+        } else if (refused && contains(answer.errors, "HOST IDENTIFICATION HAS CHANGED")) {
             add(Severity::ERROR, "board-host-key", "The board's host key is not the one that is known.", boardNotRead(),
                 "When the board was replaced: ssh-keygen -R 192.168.9.2, then log in once by hand: ssh 192.168.9.2");
         } else if (refused && contains(answer.errors, "Host key verification failed")) {
@@ -268,7 +285,8 @@ int runSelfTests(const UnitOptions& options, const Unit& unit, const UnitSite& s
         results[name] = {{tested, test.tested}, {"failed_commands", test.failedCommands}, {"reason", test.reason}};
         if (test.failedCommands > 0) {
             errors << "harl-updater-tool: " << counted(static_cast<std::uint64_t>(test.failedCommands), "command")
-                   << " of the " << name << " test failed: " << test.reason << '\n';
+                   << " of the " << name << " test failed: " << test.reason
+                   << ". To find out why, as root: harl-updater-tool unit\n";
             status = Report::STATUS_NOT_FIT;
         }
     };

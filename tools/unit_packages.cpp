@@ -187,6 +187,7 @@ void reportMirror(const std::string& address, const CommandResult& fetch, Report
 /// Fetches the sources' index files with the package manager's own fetcher, proxies and certificates.
 void fetchIndexes(const std::vector<std::string>& indexes, const Unit& unit, Report& report)
 {
+    const HeldSignals signals; // until the folder is gone
     std::string folder = unit.path("/tmp/harl-updater-tool-XXXXXX");
     if (mkdtemp(folder.data()) == nullptr) {
         report.add({Severity::UNCHECKED, "mirrors-unknown",

@@ -16,7 +16,8 @@ struct SelfTest
     std::string reason; ///< of the last failure, printable
 };
 
-/// Shows every LED of the panel in every colour, then darkens the panel. `out`, if any, gets what must be seen.
+/// Shows every LED of the panel in every colour up to the first that fails, then darkens the panel. `out`, if any, gets
+/// what must be seen.
 SelfTest testPanel(const Unit& unit, const UnitSite& site, std::ostream* out);
 
 /// Plays both sounds to their end. `out`, if any, gets what must be heard.

@@ -51,6 +51,13 @@ TEST(Command, InputIsEmptyAndThereIsNoTerminal)
     EXPECT_EQ(shell("cat; tty </dev/tty || echo none").output, "none\n");
 }
 
+TEST(Command, SignalThatIsIgnoredEndsNoCommand)
+{
+    const auto before = std::signal(SIGHUP, SIG_IGN);
+    EXPECT_EQ(shell("kill -HUP $PPID; sleep 0.1; echo out").output, "out\n");
+    std::signal(SIGHUP, before);
+}
+
 TEST(Command, MissingProgramIsNotStarted)
 {
     for (const std::string name : {"no-such-program", "/no/such/program", "/etc/passwd", "/"}) {

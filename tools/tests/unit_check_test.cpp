@@ -7,6 +7,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <csignal>
 #include <fstream>
 #include <sstream>
 
@@ -128,6 +129,37 @@ TEST_F(UnitCheck, WithoutRootsRightsTheAnswerIsOpen)
     const Outcome outcome = check(site);
     EXPECT_EQ(outcome.findings, Lines{"unchecked not-root"});
     EXPECT_EQ(outcome.status, 2);
+}
+
+TEST_F(UnitCheck, BoardThatRefusesAnotherUserThanRootIsUnchecked)
+{
+    UnitSite site = unit.site();
+    site.isRoot = false;
+    unit.set("BOARD_LOGIN", "key-refused");
+    EXPECT_EQ(check(site).findings, (Lines{"unchecked not-root", "unchecked board-login"}));
+    unit.set("BOARD_LOGIN", "host-key-changed");
+    EXPECT_EQ(check(site).findings, (Lines{"unchecked not-root", "unchecked board-login"}));
+    unit.set("BOARD_LINK", "down");
+    EXPECT_EQ(check(site).findings, (Lines{"unchecked not-root", "error board-unreachable"}));
+}
+
+TEST_F(UnitCheck, NothingIsLeftWhenASignalEndsIt)
+{
+    const fs::path fetcher = unit.folder.path("root/usr/lib/apt/apt-helper");
+    const std::string processFile = unit.folder.path("process");
+    fs::remove(fetcher); // a link
+    for (const int number : {SIGHUP, SIGINT, SIGTERM}) {
+        unit.folder.put("root/usr/lib/apt/apt-helper",
+                        "#!/bin/sh\necho $$ >" + processFile + "\nkill -" + std::to_string(number) +
+                            " $PPID\nexec sleep 60\n",
+                        0755);
+        EXPECT_EXIT((std::signal(number, SIG_DFL), check()), testing::KilledBySignal(number), "");
+        EXPECT_TRUE(fs::is_empty(unit.folder.path("root/tmp"))) << number;
+        pid_t process = 0;
+        std::ifstream(processFile) >> process;
+        EXPECT_GT(process, 0);
+        EXPECT_EQ(kill(process, 0), -1) << "The fetcher lives on.";
+    }
 }
 
 // Heads
@@ -315,6 +347,15 @@ TEST_F(UnitCheck, MissingAndBrokenSoundFilesAreWarnings)
     EXPECT_EQ(outcome.findings, (Lines{"warning sound-file", "warning sound-file"}));
     EXPECT_EQ(outcome.status, 0);
     EXPECT_THAT(outcome.report["findings"][1]["what"].get<std::string>(), HasSubstr("456 of 1000 bytes of sound"));
+}
+
+TEST_F(UnitCheck, SoundFileThatCannotBeReadIsUnchecked)
+{
+    unit.remove("root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav");
+    unit.folder.makeLink("root/root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav", "SND_RESULT_PASS.wav"); // a loop
+    const Outcome outcome = check();
+    EXPECT_EQ(outcome.findings, Lines{"unchecked sound-file"});
+    EXPECT_EQ(outcome.report["findings"][0]["remedy"], "Run this check as root.");
 }
 
 TEST_F(UnitCheck, MissingSoundDeviceIsAWarning)

@@ -56,7 +56,10 @@ TEST_F(UnitSelfTest, LampTestShowsEveryLedInEveryColourAndLeavesThePanelDark)
         }
     }
     EXPECT_EQ(calls(), expected);
-    EXPECT_THAT(out.str(), HasSubstr("All 14 LEDs must be blue now.\n"));
+    EXPECT_EQ(out.str(), "All 14 LEDs must be blue now.\n"
+                         "All 14 LEDs must be in the pass colour now.\n"
+                         "All 14 LEDs must be in the fail colour now.\n"
+                         "All 14 LEDs must be dark now.\n");
     EXPECT_EQ(errors.str(), "");
 }
 
@@ -64,7 +67,18 @@ TEST_F(UnitSelfTest, PanelThatDoesNotAnswerFailsTheLampTest)
 {
     unit.set("HEAD_PANEL", "absent");
     EXPECT_EQ(run(panel), 1);
-    EXPECT_THAT(errors.str(), HasSubstr("112 commands of the panel test failed: \"Error: Write failed\""));
+    EXPECT_EQ(out.str(), "");
+    EXPECT_EQ(errors.str(), "harl-updater-tool: 56 commands of the panel test failed: \"Error: Write failed\". "
+                            "To find out why, as root: harl-updater-tool unit\n");
+}
+
+TEST_F(UnitSelfTest, LampTestEndsWithTheFirstColourThatFailsAndLeavesThePanelDark)
+{
+    unit.replaceTool("i2cset", "printf 'i2cset %s\\n' \"$*\" >>\"${0%/*}/../calls\"; [ \"$4\" != 0x2 ]");
+    EXPECT_EQ(run(panel), 1);
+    EXPECT_EQ(out.str(), "All 14 LEDs must be blue now.\n");
+    EXPECT_THAT(calls(), testing::Not(testing::Contains("i2cset -y 0 0x07 0x8 c")));
+    EXPECT_EQ(calls().back(), "i2cset -y 0 0x07 0x0 c");
 }
 
 TEST_F(UnitSelfTest, SoundTestPlaysBothSounds)
@@ -79,6 +93,7 @@ TEST_F(UnitSelfTest, MissingSoundDeviceFailsTheSoundTest)
     unit.set("HEAD_SOUND", "absent");
     EXPECT_EQ(run(sound), 1);
     EXPECT_THAT(errors.str(), HasSubstr("2 commands of the sound test failed"));
+    EXPECT_THAT(errors.str(), HasSubstr("To find out why, as root: harl-updater-tool unit\n"));
 }
 
 TEST_F(UnitSelfTest, BothTestsGiveOneJsonObject)

@@ -17,8 +17,8 @@
 namespace
 {
 
-const std::size_t mostOutput = std::size_t{256} * 1024; // bytes
-const int pollTime = 10;                                // ms between two looks at whether a program has ended
+const std::size_t mostOutput = std::size_t{256} * 1024;       // bytes
+const int pollTime = 10;                                      // ms between two looks at whether a program has ended
 const std::array<int, 3> endings = {SIGHUP, SIGINT, SIGTERM}; // from outside
 
 struct Pipe

@@ -141,6 +141,17 @@ class Figures(unittest.TestCase):
             self.assertIn(told, OPERATOR)
         self.assertIn("silent for 13 minutes", TECHNICIAN)
 
+    def test_operator_waits_longer_than_the_updater(self) -> None:
+        waits = [int(seconds) for seconds in re.findall(r"sleepSeconds\((\d+)\)", ENGINE)]
+        dark = int(re.search(r"wait (\d+) minutes, then call", OPERATOR)[1])
+        self.assertIn("blue for more than an hour", OPERATOR)
+        self.assertIn(f"{dark} minutes with a dark panel and an hour with a blue one: at least two and four times",
+                      TECHNICIAN)
+        self.assertGreaterEqual(dark * 60, 2 * sum(waits))
+        self.assertGreaterEqual(3600, 4 * sum(waits))
+        self.assertIn("does not come back within two minutes after the outcome", OPERATOR)
+        self.assertGreaterEqual(120, 2 * (sum(waits) - max(waits)))
+
     def test_upload_attempts(self) -> None:
         attempts = re.search(r"const int attempts = (\d+);", ENGINE)[1]
         self.assertIn(f"{attempts} attempts failed", TECHNICIAN)

@@ -12,6 +12,7 @@
 #include "log_source.h"
 
 #include <cerrno>
+#include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -106,7 +107,18 @@ private:
     std::string mError;
 };
 
-/// A file that takes the place of another one of its name once it is whole.
+const char* unfinishedFile = nullptr; // for removeUnfinished() only
+
+/// Handles a signal that ends the program.
+void removeUnfinished(int number)
+{
+    unlink(unfinishedFile);
+    std::signal(number, SIG_DFL);
+    std::raise(number);
+}
+
+/// A file that takes the place of another one of its name once it is whole; one at a time. Nothing is left of it when
+/// the program is ended before.
 class NewFile
 {
 public:
@@ -118,6 +130,12 @@ public:
             umask(withheld);
             fchmod(part.number(), 0666 & ~withheld);
             mStream.open(mPartPath, std::ios::binary);
+            unfinishedFile = mPartPath.c_str();
+            for (const int number : {SIGHUP, SIGINT, SIGTERM}) {
+                if (std::signal(number, removeUnfinished) == SIG_IGN) { // as nohup(1) leaves one
+                    std::signal(number, SIG_IGN);
+                }
+            }
         } else {
             mPartPath.clear();
             mStream.setstate(std::ios::failbit);
@@ -128,6 +146,7 @@ public:
         if (!mKept) {
             std::remove(mPartPath.c_str());
         }
+        unfinishedFile = nullptr;
     }
     NewFile(const NewFile&) = delete;
     NewFile& operator=(const NewFile&) = delete;

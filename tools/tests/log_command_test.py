@@ -3,13 +3,17 @@
 Runs `harl-updater-tool log` as people do: what it prints, where it reads from, and what it says of bad input.
 """
 
+import fcntl
 import json
 import os
 import pty
 import resource
+import signal
+import struct
 import subprocess
 import sys
 import tempfile
+import termios
 import time
 import unittest
 from html.parser import HTMLParser
@@ -193,6 +197,26 @@ class BadInput(Base):
         self.assertEqual(page.stat().st_mode & 0o777, 0o640)
         self.assertEqual(part.read_text(), "mine")
         self.assertEqual({file.name for file in self.folder.iterdir()}, {page.name, part.name})
+
+    def test_nothing_is_left_of_a_page_when_a_signal_ends_it(self) -> None:
+        for number in (signal.SIGHUP, signal.SIGINT, signal.SIGTERM):
+            command = [TOOL, "log", "--html", str(self.folder / "page.html")]
+            with subprocess.Popen(command, stdin=subprocess.PIPE, stdout=subprocess.DEVNULL,
+                                  preexec_fn=lambda: signal.signal(number, signal.SIG_DFL)) as tool:
+                tool.stdin.write((GOLDEN / "up-to-date.log").read_bytes())
+                tool.stdin.flush()
+                self.await_read(tool)
+                self.assertEqual(len(list(self.folder.iterdir())), 1)
+                tool.send_signal(number)
+                self.assertEqual(tool.wait(30), -number)
+            self.assertEqual(list(self.folder.iterdir()), [])
+
+    def await_read(self, tool: subprocess.Popen) -> None:
+        """Waits until the tool has read what was written to it."""
+        deadline = time.monotonic() + 30
+        while struct.unpack("i", fcntl.ioctl(tool.stdin, termios.FIONREAD, bytes(4))) != (0,):
+            self.assertLess(time.monotonic(), deadline)
+            time.sleep(0.01)
 
     def test_page_that_cannot_be_written(self) -> None:
         done = run_tool("up-to-date.log", "--html", str(self.folder / "none/page.html"))

@@ -229,30 +229,29 @@ void UpdateManager::updateMainHead(std::vector<UpdateComponent> components)
     LOG();
     for (const UpdateComponent& component : components) {
         LOG() << "now call install MAIN udate" << component.kind;
+        bool installed = true; // a component of an unknown kind is passed over
+        Error error = ERROR_INSTALL_PACKAGE;
         switch (component.kind) {
         case COMPONENT_PACKAGE:
             LOG() << "now call install DH udate";
-            if (!installUpdate(command)) {
-                instance()->mErrorCallback(ERROR_INSTALL_PACKAGE);
-                return;
-            }
+            installed = installUpdate(command);
             break;
         case COMPONENT_QUORB:
             LOG() << "now call install QUORB udate";
-            if (!installQuorbUpdate()) {
-                instance()->mErrorCallback(ERROR_INSTALL_QUORB);
-                return;
-            }
+            installed = installQuorbUpdate();
+            error = ERROR_INSTALL_QUORB;
             break;
         case COMPONENT_TEAMVIEWER:
             LOG() << "now call install TV udate";
-            if (!installTVUpdate()) {
-                instance()->mErrorCallback(ERROR_INSTALL_TEAMVIEWER);
-                return;
-            }
+            installed = installTVUpdate();
+            error = ERROR_INSTALL_TEAMVIEWER;
             break;
-        default: // a component of an unknown kind is passed over
+        default:
             break;
+        }
+        if (!installed) {
+            instance()->mErrorCallback(error);
+            return;
         }
     }
     LOG() << "update maainhead finished";

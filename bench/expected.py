@@ -44,10 +44,7 @@ updateRemoteHead:
 deinit:
 deinitRemoteHead:
 deinitRemoteHead: Giving users 30 Secs to view Pass/Fail LED status before completing update
-startHARL:
-startHARL: {1}
-startHARL: {2}
-stopUpdater:
+(main-closing {1} {2})
 """,
     "mirrors-refreshed": """
 updateMirrors:

@@ -98,12 +98,13 @@ TEST_F(Feedback, OfferedListIsIgnored)
     EXPECT_EQ(journal(), Lines{});
 }
 
+void (*const outcomes[])() = {
+    [] { RemoteUpdateManager::resultCallback(UpdateManager::RESULT_NO_UPDATE); },
+    [] { RemoteUpdateManager::errorCallback(UpdateManager::ERROR_UPDATE_MIRRORS); },
+};
+
 TEST_F(Feedback, FlashingSendsNothingOnceTheOutcomeIsBeingShown)
 {
-    void (*const outcomes[])() = {
-        [] { RemoteUpdateManager::resultCallback(UpdateManager::RESULT_NO_UPDATE); },
-        [] { RemoteUpdateManager::errorCallback(UpdateManager::ERROR_UPDATE_MIRRORS); },
-    };
     for (const auto& outcome : outcomes) {
         platform::reset();
         LedManager::instance()->startFlashRemoteAndMainInBlue();
@@ -119,10 +120,6 @@ TEST_F(Feedback, FlashingSendsNothingOnceTheOutcomeIsBeingShown)
 
 TEST_F(Feedback, IsLoggedBeforeTheFlashingHasEnded)
 {
-    void (*const outcomes[])() = {
-        [] { RemoteUpdateManager::resultCallback(UpdateManager::RESULT_UPDATED); },
-        [] { RemoteUpdateManager::errorCallback(UpdateManager::ERROR_INSTALL_QUORB); },
-    };
     for (const auto& outcome : outcomes) {
         platform::reset();
         platform::scriptSleep([](const timespec*, timespec*) {

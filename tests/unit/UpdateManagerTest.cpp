@@ -41,6 +41,12 @@ const char stopHarl[] = "systemctl stop harl";
 const char stopUpdater[] = "systemctl stop harl-updater";
 const Lines entry = {"log:"};
 
+/// An answer of a command that does not end, with `code`, before `goOn` is true.
+platform::Answer heldUntil(const std::atomic<bool>& goOn, int code = 0)
+{
+    return {code * 256, "", true, [&goOn] { platform::waitFor([&goOn] { return goOn.load(); }); }};
+}
+
 TEST_F(Manager, IsOneObject)
 {
     EXPECT_EQ(UpdateManager::instance(), manager);
@@ -136,7 +142,7 @@ TEST_F(Manager, MainHeadChecksInstallsWhatItOfferedAndClosesOnWorkerThreads)
     scriptBoard("2.1.0", "2.1.0");
     script(teamViewerCheckCommand, {exits(0, std::string(teamViewerMarker) + "\n")});
     std::atomic<bool> goOn{false};
-    script(stopHarl, {{0, "", true, [&goOn] { platform::waitFor([&goOn] { return goOn.load(); }); }}});
+    script(stopHarl, {heldUntil(goOn)});
 
     manager->init(false);
     EXPECT_EQ(entries("found:"), Lines{}) << "init() waited for its worker";
@@ -187,7 +193,7 @@ TEST_F(Manager, UpdateOfTheMainHeadWaitsForTheCheckAndReturnsBeforeTheInstallati
     script(stopHarl, {{0, "", true, [] { platform::delay(100); }}});
     script(mirrorsCommand, {exits(100)});
     std::atomic<bool> goOn{false};
-    script(teamViewerScriptCommand, {{0, "", true, [&goOn] { platform::waitFor([&goOn] { return goOn.load(); }); }}});
+    script(teamViewerScriptCommand, {heldUntil(goOn)});
     manager->init(false);
     const int before = platform::released(sizeof(std::thread));
     manager->update({{UpdateManager::COMPONENT_TEAMVIEWER, "TV", "1", "2"}}, false);
@@ -212,7 +218,7 @@ TEST_F(Manager, ClosingStepOfTheMainHeadDoesNotWaitForTheInstallation)
 TEST_F(Manager, InitAndDeinitOverwriteTheWorkerWithoutWaiting)
 {
     std::atomic<bool> goOn{false};
-    script(mirrorsCommand, {{100 * 256, "", true, [&goOn] { platform::waitFor([&goOn] { return goOn.load(); }); }}});
+    script(mirrorsCommand, {heldUntil(goOn, 100)});
     manager->init(false);
     manager->init(false);
     manager->deinit(false);

@@ -19,11 +19,11 @@ fail() { # STATUS MESSAGE
     exit "$1"
 }
 
-# Ends the updater and all its children as the service manager does. Does not return.
+# Stops the updater as the service manager does: the updater alone gets a signal, and it has ended on return.
 stop_updater() {
     read -r updater <"$UNIT/unit.pid"
-    kill -s TERM -- "-$updater"
-    exit 0
+    kill -s TERM "$updater"
+    while kill -s 0 "$updater" 2>/dev/null; do /bin/sleep 0.02; done
 }
 
 board_answers() {
@@ -85,6 +85,7 @@ apt() {
         if [ "$UPDATER_STOPPED" = in-install ]; then
             /bin/sleep 0.3
             stop_updater
+            exec /bin/sleep 60 # the package's script goes on
         fi
         [ "$PACKAGE_KNOWN" = true ] || fail 100 "E: Unable to locate package $3"
         [ "$PACKAGE_INSTALL" != locked ] || /bin/sleep 0.5

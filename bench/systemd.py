@@ -30,6 +30,7 @@ After=systemd-journald.service harl.service
 ExecStart={{command}}
 StandardOutput=journal
 StandardError=append:/opt/bench/out/errors
+KillMode=process
 ExecStopPost=/bin/sh -c 'echo "{ENDED}$$EXIT_CODE $$EXIT_STATUS"'
 """
 # The service manager stops the updater while the package's own script runs, see packages.py.

@@ -38,10 +38,11 @@ COMMANDS = {
     "start-harl": ("systemctl", "start?harl"),
     "stop-updater": ("systemctl", "stop?harl-updater"),
 }
-# The updater alone: its command runs on to its end. The unit: nothing runs on.
+# The updater alone: its command runs on to its end. The unit: nothing runs on, the updater first, which must not go on
+# while its command is already gone.
 KILL = {
-    "updater": 'kill -s KILL -- "$updater"',
-    "unit": 'kill -s KILL -- "-$updater"',
+    "updater": 'kill -s KILL "$updater"',
+    "unit": 'kill -s KILL "$updater"; kill -s KILL -- "-$updater"',
 }
 # Where a second run comes too late for the first-boot marker: both are up to date, so that nothing is installed.
 MARKER_STAYS = {

@@ -1,9 +1,9 @@
 """Stand-in units that something happens to: the updater starts under other circumstances, a tool does more than it
 should, or the unit is used a second time."""
 
+import contextlib
 import os
 import shutil
-import time
 from pathlib import Path
 
 from compare import seen_log
@@ -54,14 +54,7 @@ exec {runner} /usr/bin/env LD_PRELOAD={wrapped}/bench/tap.so {wrapped}/updater {
     def ended(self) -> int | None:
         """None while the updater runs, or a command that it left behind, then its status."""
         status = super().ended()
-        if status is not None and self._updater:
-            for _ in range(50):
-                try:
-                    os.killpg(self._updater.pid, 0)
-                except ProcessLookupError:
-                    break
-                time.sleep(0.02)
-        return status
+        return None if status is not None and self._updater and group_lives(self._updater.pid) else status
 
     def restore_tools(self) -> None:
         """Takes every change of a tool back."""
@@ -82,6 +75,17 @@ exec {runner} /usr/bin/env LD_PRELOAD={wrapped}/bench/tap.so {wrapped}/updater {
             (self._folder / "bin" / tool).rename(self._folder / "real" / tool)
             (self._folder / "bin" / tool).write_text(text)
             (self._folder / "bin" / tool).chmod(0o755)
+
+
+def group_lives(group: int) -> bool:
+    """Whether a process of `group` still runs; one that has ended and that nobody asks for its status does not."""
+    for file in Path("/proc").glob("[0-9]*/stat"):
+        with contextlib.suppress(OSError):  # has just ended
+            # Behind the name in parentheses: state, parent, group; proc(5).
+            state, _, its_group = file.read_text(errors="replace").rpartition(")")[2].split()[:3]
+            if int(its_group) == group and state != "Z":
+                return True
+    return False
 
 
 def outcome(result: Result) -> dict[str, object]:

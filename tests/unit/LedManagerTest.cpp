@@ -268,8 +268,9 @@ TEST_F(Flashing, StartingAgainWithinTheLastPauseRevivesTheOldThread)
     NEEDS_A_FRESH_PROCESS();
     EXPECT_EXIT(
         {
+            static std::atomic<int> pauses{0};
             platform::scriptSleep([](const timespec*, timespec*) {
-                platform::delay(100);
+                platform::delay(++pauses == 1 ? 1000 : 10); // the first is long enough for a stop and a start
                 return 0;
             });
             startAgain(true);

@@ -1,4 +1,5 @@
 #include "RemoteUpdateManager.h"
+#include "AppLock.h"
 #include "LedManager.h"
 #include "UnitTest.h"
 
@@ -144,16 +145,31 @@ TEST_F(Feedback, LedsAreLitOnlyAfterTheSoundHasEnded)
     EXPECT_EQ(Lines(all.end() - 3, all.end()), (Lines{passSound, "sound ended", led("0x13", "0x2")}));
 }
 
-TEST_F(UnitTest, UnlockWakesTheThreadThatIsLocked)
+class ApplicationLock : public UnitTest
+{
+protected:
+    void SetUp() override
+    {
+        UnitTest::SetUp();
+        applicationLockWaited = false;
+    }
+
+    static void untilItIsWaitedFor()
+    {
+        platform::waitFor([] { return applicationLockWaited.load(); });
+    }
+};
+
+TEST_F(ApplicationLock, UnlockWakesTheThreadThatIsLocked)
 {
     std::atomic<bool> woken{false};
     std::thread waiting([&woken] {
         RemoteUpdateManager::lockApp();
         woken = true;
     });
-    platform::waitFor([] { return journal() == Lines{"log:"}; });
-    platform::delay(100); // from its first record to the wait
+    untilItIsWaitedFor();
     EXPECT_FALSE(woken);
+    EXPECT_EQ(journal(), Lines{"log:"});
     RemoteUpdateManager::unlockApp();
     waiting.join();
     EXPECT_EQ(journal(), (Lines{"log:", "log:", "log:"}));
@@ -162,7 +178,7 @@ TEST_F(UnitTest, UnlockWakesTheThreadThatIsLocked)
     EXPECT_EQ(platform::records().at(2).function, "static void RemoteUpdateManager::lockApp()");
 }
 
-TEST_F(UnitTest, UnlockWithoutAWaiterIsForgotten)
+TEST_F(ApplicationLock, UnlockWithoutAWaiterIsForgotten)
 {
     RemoteUpdateManager::unlockApp();
     std::atomic<bool> woken{false};
@@ -170,20 +186,18 @@ TEST_F(UnitTest, UnlockWithoutAWaiterIsForgotten)
         RemoteUpdateManager::lockApp();
         woken = true;
     });
-    platform::waitFor([] { return journal().size() == 2; });
-    platform::delay(100);
+    untilItIsWaitedFor();
     EXPECT_FALSE(woken);
     RemoteUpdateManager::unlockApp();
     waiting.join();
 }
 
-TEST_F(UnitTest, UnlockWaitsUntilTheWokenThreadHasLeftTheLock)
+TEST_F(ApplicationLock, UnlockWaitsUntilTheWokenThreadHasLeftTheLock)
 {
     std::atomic<bool> leave{false};
     std::thread waiting(RemoteUpdateManager::lockApp);
     const std::thread::id waiter = waiting.get_id();
-    platform::waitFor([] { return journal().size() == 1; });
-    platform::delay(100); // from its first record to the wait
+    untilItIsWaitedFor();
     platform::afterRecord([waiter, &leave] {
         if (std::this_thread::get_id() == waiter) { // its second record, written under the lock
             platform::note("woken");
@@ -208,19 +222,13 @@ TEST_F(UnitTest, UnlockWaitsUntilTheWokenThreadHasLeftTheLock)
 
 /// A whole update of the remote head. The application takes a moment to stop, as a real one does: the update must not
 /// be over before the main thread waits for it.
-class WholeUpdate : public UnitTest
+class WholeUpdate : public ApplicationLock
 {
 protected:
     void SetUp() override
     {
-        platform::reset();
-        script("systemctl stop harl", {{0, "", true, untilTheCallerWaits}});
-    }
-
-    static void untilTheCallerWaits()
-    {
-        platform::waitFor([] { return !journalOf("static void RemoteUpdateManager::lockApp()").empty(); });
-        platform::delay(100); // from its record to the wait
+        ApplicationLock::SetUp();
+        script("systemctl stop harl", {{0, "", true, untilItIsWaitedFor}});
     }
 
     /// Runs it. The journal is parted by threads: the caller's, the flashing thread's, and the update thread's.

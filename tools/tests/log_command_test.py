@@ -8,6 +8,7 @@ import json
 import os
 import pty
 import resource
+import select
 import signal
 import struct
 import subprocess
@@ -249,16 +250,25 @@ class Unit(Base):
 class Follow(Base):
     """A run that goes on."""
 
-    def follow(self, lines: list[bytes], *arguments: str, cut: int, output=subprocess.PIPE) -> tuple[int, bytes]:
-        """Follows a file that holds the first `cut` lines; the rest comes two seconds later."""
+    def follow(self, lines: list[bytes], *arguments: str, cut: int, terminal=(None, None)) -> tuple[int, bytes]:
+        """Follows a file that holds the first `cut` lines; the rest comes once something of them has been shown.
+
+        `terminal`, both sides of one, takes the output in place of a pipe.
+        """
         file = self.folder / "growing.log"
         file.write_bytes(b"".join(lines[:cut]))
-        with subprocess.Popen([TOOL, "log", str(file), "--follow", *arguments], stdout=output) as tool:
-            time.sleep(2)
+        ours, theirs = terminal
+        command = [TOOL, "log", str(file), "--follow", *arguments]
+        with subprocess.Popen(command, stdout=theirs or subprocess.PIPE) as tool:
+            self.await_output(ours or tool.stdout)
             with file.open("ab") as log:
                 log.write(b"".join(lines[cut:]))
             shown = self.output_of(tool)[0]
             return tool.returncode, shown
+
+    def await_output(self, output) -> None:
+        """Waits until the tool has shown something."""
+        self.assertTrue(select.select([output], [], [], 30)[0], "nothing is shown")
 
     def output_of(self, tool: subprocess.Popen) -> tuple[bytes, bytes]:
         """Waits for the tool's end; ends one that does not come to it."""
@@ -296,7 +306,7 @@ class Follow(Base):
         begin = time.strftime("%d-%m-%Y %H-%M-%S", time.localtime(time.time() - 390)).encode()
         lines = [b"Updater | " + begin + line[29:] if line.startswith(b"Updater | ") else line for line in lines]
         master, slave = pty.openpty()
-        self.follow(lines, cut=cut, output=slave)
+        self.follow(lines, cut=cut, terminal=(master, slave))
         os.close(slave)
         shown = os.read(master, 65536).decode()
         os.close(master)
@@ -321,7 +331,7 @@ class Follow(Base):
         file.write_bytes(b"".join(self.lines("stopped-in-install")))
         command = [TOOL, "log", str(file), "--follow"]
         with subprocess.Popen(command, stdout=subprocess.PIPE, stderr=subprocess.PIPE) as tool:
-            time.sleep(1)
+            self.await_output(tool.stdout)
             file.write_bytes(b"")
             errors = self.output_of(tool)[1]
             self.assertEqual(tool.returncode, 2)

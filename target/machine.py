@@ -63,10 +63,14 @@ def boot(
         return
     if machine.returncode != 0:
         raise MachineError(f"qemu-system-arm ended with {machine.returncode}: see {folder / 'errors'}")
-    with tarfile.open(output) as archive:
-        archive.extractall(folder, filter="data")
+    try:
+        with tarfile.open(output) as archive:
+            archive.extractall(folder, filter="data")
+        status = (folder / "status").read_text().strip()
+    except (tarfile.TarError, FileNotFoundError) as error:
+        raise MachineError(f"the guest left no results: see {console}") from error
     output.unlink()
-    if (folder / "status").read_text().strip() != "0":
+    if status != "0":
         raise MachineError(f"the guest's program failed: see {folder / 'guest.log'}")
 
 

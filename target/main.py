@@ -153,7 +153,8 @@ def run(plans: list[Plan], package: Path | None, speed: float) -> int:
     if shutil.disk_usage(WORK).free < SPACE << 20:
         raise TargetError(f"{WORK} has less than {SPACE} MiB free: free some space")
     begin = time.monotonic()
-    subprocess.run([ROOT / "scripts/install-packages", *NEEDED], check=True)
+    if subprocess.run([ROOT / "scripts/install-packages", *NEEDED], check=False).returncode != 0:
+        raise TargetError("packages are missing, see above")
     updater, image = updater_package(package), make_image()
     print(f"Package: {updater.name}", flush=True)
     shared = [plan for plan in plans if plan.settings["event"] != "power-cut"]
@@ -180,7 +181,8 @@ def main() -> int:
     )
     parser.add_argument("--package", type=Path, help="default: built by package/build armhf", metavar="FILE")
     arguments = parser.parse_args()
-    signal.signal(signal.SIGTERM, lambda *_: sys.exit(143))
+    for number in (signal.SIGTERM, signal.SIGHUP):
+        signal.signal(number, lambda received, _: sys.exit(128 + received))
     try:
         if arguments.list:
             for name in names():
@@ -192,8 +194,11 @@ def main() -> int:
         os.dup2(os.open(os.devnull, os.O_WRONLY), sys.stdout.fileno())
     except (TargetError, PlanError, ScenarioError, MachineError) as error:
         print(f"target: {error}", file=sys.stderr)
-    except FileNotFoundError as error:
-        print(f"target: {error.filename}: not found; target/run installs what is missing", file=sys.stderr)
+    except PermissionError as error:
+        hint = f"""if it stems from 'sudo target/run': sudo chown -R "$USER" {ROOT / 'build'}"""
+        print(f"target: {error.filename}: {error.strerror}; {hint}", file=sys.stderr)
+    except OSError as error:
+        print(f"target: {error.filename or WORK}: {error.strerror}", file=sys.stderr)
     except subprocess.CalledProcessError as error:
         print(f"target: {error.cmd[0]} failed: {(error.stderr or '').strip()}", file=sys.stderr)
     except KeyboardInterrupt:

@@ -32,6 +32,15 @@ def check_bus(plan: Plan, outcome: Outcome) -> list[str]:
     return []
 
 
+def check_main_thread(outcome: Outcome) -> list[str]:
+    """The records of the thread that waits for the update; the bench's comparison is of the others."""
+    records = outcome.result.run.records()
+    seen = [f"{record.operation}: {record.message}".strip() for record in records if record.thread == records[0].thread]
+    banner = f"main: TavrenUpdater version: {outcome.before['updater']}"
+    expected = [banner, "main: BEFORE UPDATE", "update:", "lockApp:"]
+    return [] if seen == expected else [f"log of the main thread: expected {expected}, not {seen}"]
+
+
 def lit(leds: dict[int, int]) -> dict[str, str]:
     """The LEDs that are lit, by name, with the names of their colours."""
     return {led_name(led): color_name(color) for led, color in leds.items() if color}
@@ -58,12 +67,19 @@ def check_sound(outcome: Outcome) -> list[str]:
 def check(plan: Plan, outcome: Outcome) -> list[str]:
     """One line for each difference; none when the run came out as `plan` says."""
     before, after = outcome.before, outcome.after
-    found = differences(plan.like, outcome.result) + check_bus(plan, outcome) + check_sound(outcome)
+    found = differences(plan.like, outcome.result) + check_main_thread(outcome)
+    found += check_bus(plan, outcome) + check_sound(outcome)
 
     def same(what: str, expected: object, seen: object) -> None:
         if expected != seen:
             found.append(f"{what}: expected {expected!r}, not {seen!r}")
 
+    unit = plan.like.unit
+    cut = plan.settings["event"] == "power-cut"
+    same("package before", unit["package"]["offered" if cut else "installed"], before["package"])
+    same("board before", unit["board"]["installed"], before["board"])
+    same("marker before", "yes" if unit["head"]["marker"] else "no", before["marker"])
+    same("stick before", "yes", before["stick"])
     same("journal identifiers", {IDENTIFIER}, outcome.identifiers)
     same("result of the unit", plan.expect["result"], after["Result"])
     same("package status", plan.expect["package_status"], after["package_status"])
@@ -74,7 +90,7 @@ def check(plan: Plan, outcome: Outcome) -> list[str]:
         same("package's maintainer script", ["began", "ended"], list(outcome.package_script))
         ended = outcome.package_script.get("ended", math.inf)
         same("harl was started after the package's maintainer script", True, int(after["harl_since"]) / 1e6 > ended)
-    if plan.settings["event"] == "power-cut":
+    if cut:
         same("harl after the boot", "active", before["harl"])
         same("package status after the boot", "half-configured", before["package_status"])
     return found

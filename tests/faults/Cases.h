@@ -20,13 +20,17 @@ struct Case
 const char panelStep[] = "panel";
 const char soundStep[] = "sound";
 
-/// Every LED command of a run.
-platform::Lines ledCommands();
+/// Every LED command of a run that comes to one of `reports`: those stand for all panels that there are.
+platform::Lines ledCommands(const std::vector<std::string>& reports = {"result 0", "result 1", "error 0", "error 2"});
 
 /// Every step on `unit`, panel and sound included, with every fault.
 std::vector<Injection> procedureInjections(const Unit& unit);
 
-/// The same as cases, of all units.
+/// Whether each of `injections` meets its step in a run on `unit`: a step may be passed over there, or another's fault
+/// may keep it from being run.
+bool allHappen(const Unit& unit, const std::vector<Injection>& injections);
+
+/// Those that meet their step, as cases of all units.
 std::vector<Case> faultsOfTheProcedure();
 
 /// These, a case without a fault for each unit, and every fault of each single LED command.

@@ -26,7 +26,7 @@ namespace fs = std::filesystem;
 
 const int atOnce = 8;      // runs; they mostly wait
 const int longestRun = 60; // s
-const int sampleDivisor = 4;
+const int sampleDivisor = 3;
 
 /// The arguments by which a tool knows the step, as a pattern of the shell.
 const std::map<std::string, std::string> patterns = {

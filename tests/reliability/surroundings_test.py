@@ -6,6 +6,7 @@ standard output that takes nothing. Where the updater does not come through, the
 
 import os
 import signal
+import subprocess
 import sys
 import threading
 import time
@@ -23,6 +24,7 @@ from session import Result, run_on, temporary_folder
 
 BUILD = Path()
 PLAIN_USER = 60000 + os.getpid() % 5000  # has no processes of its own, nor any of another run of this test
+AS_PLAIN_USER = ["/usr/bin/setpriv", f"--reuid={PLAIN_USER}", f"--regid={PLAIN_USER}", "--clear-groups"]
 
 
 class SurroundingsTest(unittest.TestCase):
@@ -37,6 +39,8 @@ class SurroundingsTest(unittest.TestCase):
     def run_updater(self, unit: DisturbedUnit) -> Result:
         """One run to its end."""
         return run_on(unit, lambda run, log: None, SPEED)
+
+    HELD = 'echo >"$UNIT/held"\nwhile [ -e "$UNIT/held" ]; do /bin/sleep 0.02; done\nreal "$@"'
 
     def unit(self, **circumstances: str) -> DisturbedUnit:
         """A unit with the package and the board to be updated."""
@@ -86,8 +90,7 @@ class SurroundingsTest(unittest.TestCase):
 
         # Every tool is held until its command has been met.
         for tool in ("systemctl", "apt", "apt-cache", "ssh", "ls", "scp", "rm", "umount"):
-            hold = 'echo >"$UNIT/held"\nwhile [ -e "$UNIT/held" ]; do /bin/sleep 0.02; done'
-            unit.change_tool(tool, f'{hold}\nreal "$@"')
+            unit.change_tool(tool, self.HELD)
         result = run_on(unit, stop_in_new_call, SPEED)
         self.assert_complete(result)
         self.assert_no_wait_was_shortened(result)
@@ -131,14 +134,11 @@ class SurroundingsTest(unittest.TestCase):
         last = [call.text for call in result.run.calls if call.text.startswith("i2cset")][-2:]
         self.assertEqual(last, [f"i2cset -y 0 0x07 {led} c ; i2cset -y 0 0x07 0x8 c" for led in ("0x12", "0x15")])
 
-    def limit_processes(self, limit: int) -> Result:
-        """A run as a user who may have `limit` processes and threads."""
+    def plain_users_unit(self, runner: str = "") -> DisturbedUnit:
+        """A unit whose updater runs, behind `runner`, as a user for whom limits count."""
         if os.geteuid() != 0:
             self.skipTest("needs root, to run as a user without other processes")
-        unit = self.unit(
-            runner=f"/usr/bin/prlimit --nproc={limit} "
-            f"/usr/bin/setpriv --reuid={PLAIN_USER} --regid={PLAIN_USER} --clear-groups",
-        )
+        unit = self.unit(runner=" ".join([runner, *AS_PLAIN_USER]))
         self.folder.chmod(0o777)
         make = unit._start_updater
 
@@ -149,16 +149,31 @@ class SurroundingsTest(unittest.TestCase):
             make()
 
         unit._start_updater = start_updater  # type: ignore[method-assign]
-        return self.run_updater(unit)
+        return unit
 
-    def test_without_processes_the_run_ends_with_no_command_done(self) -> None:
-        result = self.limit_processes(3)
+    def test_without_processes_the_run_ends_with_no_further_command_done(self) -> None:
+        unit = self.plain_users_unit()
+        unit.change_tool("systemctl", self.HELD)
+        held = self.folder / "held"
+
+        def take_processes_away(run: Run, _log: str) -> None:
+            if held.exists() and any(call.seconds == 1 for call in run.calls):  # both threads run
+                updater = (self.folder / "unit.pid").read_text().strip()
+                subprocess.run([*AS_PLAIN_USER, "/usr/bin/prlimit", f"--pid={updater}", "--nproc=1:1"], check=True)
+                held.unlink()
+
+        result = run_on(unit, take_processes_away, SPEED)
         self.assertEqual(result.status, 0)
         self.assertIn("AFTER UPDATE", result.run.log)
+        names = ["stop-harl", "refresh-mirrors", "read-package", "release-stick", "start-harl", "stop-updater"]
+        self.assertEqual([call.text for call in result.run.commands()], [COMMANDS[name] for name in names])
+        # popen(3) fails; system(3) says what a shell without the tool would say.
+        self.assertEqual([call.status for call in result.run.commands()], [0, -1, -1, *[127 * 256] * 3])
         self.assertEqual(result.state.package, "1.2.0")
+        self.assertEqual(result.state.harl, "inactive")
 
     def test_without_threads_the_updater_aborts_before_anything_is_changed(self) -> None:
-        result = self.limit_processes(1)
+        result = self.run_updater(self.plain_users_unit("/usr/bin/prlimit --nproc=1"))
         self.assertEqual(result.status, -signal.SIGABRT)
         self.assertEqual(result.run.commands(), [])
 

@@ -1,6 +1,7 @@
 """target/run: proves the updater's package on an emulated armhf unit: kernel, systemd, real tools, I2C bus, sound."""
 
 import argparse
+import fcntl
 import os
 import shutil
 import signal
@@ -152,6 +153,11 @@ def run(plans: list[Plan], package: Path | None, speed: float) -> int:
     WORK.mkdir(parents=True, exist_ok=True)
     if shutil.disk_usage(WORK).free < SPACE << 20:
         raise TargetError(f"{WORK} has less than {SPACE} MiB free: free some space")
+    lock = (WORK / "lock").open("w")
+    try:
+        fcntl.flock(lock, fcntl.LOCK_EX | fcntl.LOCK_NB)
+    except BlockingIOError as error:
+        raise TargetError(f"another target/run works in {WORK}: wait for it, or take another checkout") from error
     begin = time.monotonic()
     if subprocess.run([ROOT / "scripts/install-packages", *NEEDED], check=False).returncode != 0:
         raise TargetError("packages are missing, see above")

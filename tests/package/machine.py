@@ -21,10 +21,11 @@ class MachineError(Exception):
 
 
 class Machine:
-    """A running machine. `files` is what it has besides the host's /usr."""
+    """A running machine. `files` is what it has besides the /usr of the root file system `system`."""
 
-    def __init__(self, folder: Path) -> None:
+    def __init__(self, folder: Path, system: Path) -> None:
         self._folder = folder
+        self.system = system
         self.files = folder / "files"
         self.files.mkdir()
         (folder / "memory").mkdir()
@@ -35,7 +36,7 @@ class Machine:
         """Returns when systemd is up. Raises MachineError."""
         with (self._folder / "console").open("wb") as console:
             self._namespaces = subprocess.Popen(
-                [*NAMESPACES, Path(__file__).with_name("machine.sh"), self._folder],
+                [*NAMESPACES, Path(__file__).with_name("machine.sh"), self._folder, self.system],
                 stdin=subprocess.DEVNULL,
                 stdout=console,
                 stderr=console,
@@ -104,10 +105,10 @@ class Machine:
 
 
 @contextlib.contextmanager
-def machine() -> Iterator[Machine]:
-    """A machine that is not started yet, and goes with the block."""
+def machine(system: Path) -> Iterator[Machine]:
+    """A machine with the programs of `system` that is not started yet, and goes with the block."""
     with tempfile.TemporaryDirectory(prefix="machine-") as folder:
-        made = Machine(Path(folder))
+        made = Machine(Path(folder), system)
         try:
             yield made
         finally:

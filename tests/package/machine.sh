@@ -1,11 +1,12 @@
 #!/bin/sh
 # Starts systemd as the first process of a machine of its own: new namespaces, in which machine.py runs this as root.
 #
-# Usage: machine.sh FOLDER
-# FOLDER/files is what the machine has besides the host's /usr. What the machine writes stays in memory.
+# Usage: machine.sh FOLDER SYSTEM
+# FOLDER/files is what the machine has besides the /usr of the root file system SYSTEM. What it writes stays in memory.
 set -eu
 
 folder=$1
+system=$(realpath "$2")
 mount --make-rprivate /
 mount -t tmpfs tmpfs "$folder/memory"
 mkdir "$folder/memory/root" "$folder/memory/upper" "$folder/memory/work"
@@ -14,8 +15,8 @@ cd "$folder/memory/root"
 mkdir -p usr proc sys dev run tmp etc/systemd/system etc/apt var/log/journal root
 chmod 700 root
 for link in bin sbin lib lib64; do ln -s "usr/$link" "$link"; done
-mount -t overlay -o "lowerdir=/usr,upperdir=$folder/memory/upper,workdir=$folder/memory/work" overlay usr
-cp -rP /etc/ld.so.cache /etc/alternatives etc/
+mount -t overlay -o "lowerdir=$system/usr,upperdir=$folder/memory/upper,workdir=$folder/memory/work" overlay usr
+cp -rP "$system/etc/ld.so.cache" "$system/etc/alternatives" etc/
 printf 'root:x:0:0::/root:/bin/sh\n' >etc/passwd
 printf 'root:x:0:\nsystemd-journal:x:101:\ntty:x:5:\nutmp:x:43:\nadm:x:4:\n' >etc/group
 tr -d - </proc/sys/kernel/random/uuid >etc/machine-id

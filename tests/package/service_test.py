@@ -1,7 +1,8 @@
-"""Usage: service_test.py BUILD_FOLDER PACKAGE
+"""Usage: service_test.py BUILD_FOLDER PACKAGE SYSTEM [TEST...]
 
 Runs the service of the built PACKAGE (harl-updater or harl-updater-static, from build/package/) under real systemd, apt
-and dpkg and lets it end in every way. The board, the sound and the panel's bus are stand-ins.
+and dpkg of the root file system SYSTEM and lets it end in every way. The board, the sound and the panel's bus are
+stand-ins.
 """
 
 import os
@@ -59,8 +60,9 @@ FOLDERS = ["etc/apt/preferences.d", "opt", "root/RESOURCES/SOUNDS", "root/USB_MO
 FOLDERS += ["var/cache/apt/archives/partial", "var/lib/apt/lists/partial", "var/lib/dpkg/info", "var/lib/dpkg/updates"]
 
 
-def make_files(files: Path, package: Path, build: Path) -> None:
+def make_files(unit: Machine, package: Path, build: Path) -> None:
     """Writes what the machine has: tools, packages and the application."""
+    files = unit.files
     for name, text in TOOLS.items():
         write(files / "usr/local/sbin" / name, f"#!/bin/bash\n{text.strip()}\n", 0o755)
     write(files / "etc/systemd/system/harl.service", HARL)
@@ -73,7 +75,7 @@ def make_files(files: Path, package: Path, build: Path) -> None:
     write(files / "var/lib/dpkg/status", "")
     shutil.copy(package, files / "srv/updater.deb")
     shutil.copy(build / "bench/tap.so", files / "opt")
-    shutil.copy("/usr/bin/sleep", files / "opt/scp")
+    shutil.copy(unit.system / "usr/bin/sleep", files / "opt/scp")
 
 
 def write(path: Path, text: str, mode: int = 0o644) -> None:
@@ -388,19 +390,19 @@ def skip(why: str) -> None:
 
 
 if __name__ == "__main__":
-    build, package = Path(sys.argv[1]), sys.argv[2]
+    build, package, system = Path(sys.argv[1]), sys.argv[2], Path(sys.argv[3])
     architecture = subprocess.check_output(["dpkg", "--print-architecture"], text=True).strip()
     found = sorted((ROOT / "build/package").glob(f"{package}_*_{architecture}.deb"))
     if not found:
         skip("there is no package for this machine: package/build")
     if os.geteuid() != 0:
         skip("systemd as the first process of a machine of its own needs root")
-    with machine() as made:
-        make_files(made.files, found[-1], build)
+    with machine(system) as made:
+        make_files(made, found[-1], build)
         try:
             made.start()
         except MachineError as error:
             skip(f"this machine allows no machine of its own: {error}")
         ServiceTest.unit, ServiceTest.package = made, package
         install(made)
-        unittest.main(argv=[sys.argv[0], *sys.argv[3:]], verbosity=2)
+        unittest.main(argv=[sys.argv[0], *sys.argv[4:]], verbosity=2)

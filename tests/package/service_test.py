@@ -293,6 +293,7 @@ class Ends(ServiceTest):
         self.assertEqual(self.read("/var/log/sounds"), "SND_RESULT_PASS.wav\n")
 
     def test_crash_after_the_outcome_was_shown(self) -> None:
+        self.set_speed(3)  # time to meet it while the outcome is shown
         self.offer()
         self.start()
         wait_for("outcome", lambda: self.panel() == {"PASS": "pass"})
@@ -371,6 +372,7 @@ class Ends(ServiceTest):
         self.inside("dpkg", "--install", "--force-downgrade", "/srv/updater.deb")
 
     def test_removal_leaves_the_run_alone(self) -> None:
+        self.set_speed(3)  # time for the removal while the outcome is shown
         self.offer()
         self.start()
         wait_for("outcome", lambda: self.panel() == {"PASS": "pass"})

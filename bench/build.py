@@ -6,7 +6,6 @@ from pathlib import Path
 
 ROOT = Path(__file__).parent.parent
 BUILD = ROOT / "build/default"
-TOOLS = ["util-linux", "iproute2", "openssh-client", "i2c-tools", "alsa-utils", "dpkg-dev", "unzip"]
 TARGETS = ["harl-updater", "main-head-driver", "tap", "i2c_bus"]
 
 
@@ -17,8 +16,7 @@ def build(*more: str) -> None:
     """
     if not (BUILD / TARGETS[0]).exists():
         print("bench: building the updater, for the first time in this checkout", file=sys.stderr)
-    install = ["scripts/install-build-packages", *TOOLS]
-    if subprocess.run(install, cwd=ROOT, stdout=sys.stderr, check=False).returncode != 0:
+    if subprocess.run(["scripts/install-bench-packages"], cwd=ROOT, stdout=sys.stderr, check=False).returncode != 0:
         sys.exit(1)
     commands = [["cmake", "--build", "--preset", "default", "--target", *TARGETS, *more]]
     configured, presets = BUILD / "build.ninja", ROOT / "CMakePresets.json"

@@ -7,7 +7,6 @@
 #include "UnitTest.h"
 
 #include <algorithm>
-#include <iostream>
 #include <map>
 #include <set>
 #include <unistd.h>
@@ -230,23 +229,17 @@ void runMainHead(const Case& what)
     expectWholeRecords();
 }
 
-/// Runs the case and ends the process: with 0 when all held, else with 1 and what did not on standard error.
+/// Runs the case and ends the process.
 [[noreturn]] void runAlone(const Case& what)
 {
-    // In this process, a copy of the test's, the failures of earlier cases stand there already.
-    const testing::TestResult& result = *testing::UnitTest::GetInstance()->current_test_info()->result();
-    const int before = result.total_part_count();
+    const int before = resultsSoFar();
     alarm(60);
     if (what.unit.mainHead) {
         runMainHead(what);
     } else {
         runRemoteHead(what);
     }
-    for (int part = before; part < result.total_part_count(); ++part) {
-        std::cerr << result.GetTestPartResult(part).message() << '\n';
-    }
-    std::fflush(nullptr);
-    _exit(result.total_part_count() > before ? 1 : 0);
+    endCase(before);
 }
 
 int casesRun = 0;

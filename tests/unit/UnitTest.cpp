@@ -1,5 +1,9 @@
 #include "UnitTest.h"
 
+#include <cstdio>
+#include <iostream>
+#include <unistd.h>
+
 void UnitTest::SetUp()
 {
     platform::reset();
@@ -9,6 +13,22 @@ void UnitTest::registerCallbacks()
 {
     UpdateManager::instance()->setCallbacks(noteResult, noteError, noteUpdateFound);
     platform::reset();
+}
+
+int resultsSoFar()
+{
+    return testing::UnitTest::GetInstance()->current_test_info()->result()->total_part_count();
+}
+
+void endCase(int before)
+{
+    const int count = resultsSoFar();
+    for (int part = before; part < count; ++part) {
+        std::cerr << testing::UnitTest::GetInstance()->current_test_info()->result()->GetTestPartResult(part).message()
+                  << '\n';
+    }
+    std::fflush(nullptr);
+    _exit(count > before ? 1 : 0);
 }
 
 void noteResult(UpdateManager::Result result)

@@ -24,6 +24,13 @@ protected:
 #define NEEDS_A_FRESH_PROCESS() GTEST_FLAG_SET(death_test_style, "threadsafe")
 #endif
 
+/// How many results, failures among them, the running test has so far.
+int resultsSoFar();
+
+/// Ends the process of a death test, whose failures nobody prints: with 0 when there are none behind the first `before`
+/// results, which the test had already when it made the process; else with 1 and what failed on standard error.
+[[noreturn]] void endCase(int before);
+
 void noteResult(UpdateManager::Result result);
 void noteError(UpdateManager::Error error);
 void noteUpdateFound(std::vector<UpdateManager::UpdateComponent> components);

@@ -65,7 +65,13 @@ def updater_package(given: Path | None) -> Path:
     folder = ROOT / "build/package"
     sources = subprocess.check_output(["git", "ls-tree", "HEAD", *PACKAGED], cwd=ROOT, text=True)
     built = WORK / "package-sources"
-    if not built.exists() or built.read_text() != sources or not list(folder.glob("harl-updater_*_armhf.deb")):
+    packages = list(folder.glob("harl-updater_*_armhf.deb"))
+    # A package newer than the note comes from another call of package/build, perhaps from other sources.
+    if (
+        not (built.exists() and packages)
+        or built.read_text() != sources
+        or any(file.stat().st_mtime > built.stat().st_mtime for file in packages)
+    ):
         print("target: building the package", flush=True)
         log = WORK / "package.log"
         with log.open("w") as output:

@@ -19,7 +19,7 @@ GIVE_BACK = ROOT / "package/service/give-back"
 START = "systemctl --no-block start harl"
 TOOLS = {
     "systemctl": 'for tool in apt dpkg; do ! pgrep -x $tool >/dev/null || echo "beside $tool" >>"$UNIT/calls"; done',
-    "i2cset": 'exit "$I2CSET_STATUS"',
+    "i2cset": '[ -z "$I2CSET_STATUS" ] || exit "$I2CSET_STATUS"',
     "umount": '[ ! -e "$UNIT/busy" ] || { rm "$UNIT/busy"; exit 32; }; [ -e "$UNIT/stuck" ] || rm "$UNIT/mounted"',
     "mountpoint": '[ -e "$UNIT/mounted" ]',
     "sleep": "exec /usr/bin/sleep 0.05",
@@ -137,6 +137,17 @@ class GiveBack(unittest.TestCase):
     def test_absent_panel_does_not_keep_the_application(self) -> None:
         self.environment["I2CSET_STATUS"] = "1"
         self.give_back()
+        self.assertEqual(self.calls("umount", "systemctl"), ["umount /root/USB_MOUNT", START])
+
+    def test_hanging_panel_does_not_keep_the_application(self) -> None:
+        text = GIVE_BACK.read_text()
+        (self.unit / "give-back").write_text(text.replace("panel_wait=10 ", "panel_wait=1 "))
+        self.assertNotEqual((self.unit / "give-back").read_text(), text)
+        with (self.unit / "bin/i2cset").open("a") as tool:
+            tool.write("exec /usr/bin/sleep 100\n")
+        self.environment["I2CSET_STATUS"] = ""
+        self.give_back()
+        self.assertEqual(len(self.calls("i2cset")), 1)
         self.assertEqual(self.calls("umount", "systemctl"), ["umount /root/USB_MOUNT", START])
 
     def test_service_manager_that_tells_nothing(self) -> None:

@@ -149,7 +149,7 @@ void UpdateManager::updateRemoteHead()
         return;
     }
 
-    // A marker that is already gone counts as removed; only a shell that did not start is told apart.
+    // A marker that is already gone counts as removed; only a status that cannot be had is told apart.
     if (std::system(removeMarkerCommand) >= 0) {
         LOG() << "removed" << removeMarkerCommand;
     }

@@ -98,6 +98,11 @@ class GiveBack(unittest.TestCase):
         self.give_back()
         self.assertEqual(self.calls(), ["umount /root/USB_MOUNT", START])
 
+    def test_outcome_whose_last_byte_is_still_under_way_is_left_alone(self) -> None:
+        (self.unit / "bin/sleep").write_text('#!/bin/sh\n: >"$RUNTIME_DIRECTORY/outcome"\n')
+        self.assertEqual(self.give_back(), "")
+        self.assertEqual(self.calls("i2cset"), [])
+
     def test_package_tools_are_waited_for(self) -> None:
         for tool in ("apt", "dpkg"):
             said = self.give_back(f"./{tool} 2 &", at_work=(tool,))

@@ -292,6 +292,20 @@ class Ends(ServiceTest):
         self.assertEqual(self.panel(), {"PASS": "pass"})
         self.assertEqual(self.read("/var/log/sounds"), "SND_RESULT_PASS.wav\n")
 
+    def test_no_memory_for_the_threads(self) -> None:
+        limit = self.unit.root() / "etc/systemd/system/harl-updater.service.d/limit.conf"
+        write(limit, "[Service]\nLimitDATA=12M\n")  # the stack of the second thread, 8 MiB, does not fit any more
+        self.addCleanup(limit.unlink)
+        self.set_speed(SPEED)
+        self.offer()
+        self.inside("systemctl", "stop", "harl")
+        self.start()
+        self.wait_for_end()
+        self.assertEqual(self.ended_as()[2], "6")
+        self.assert_given_back()
+        self.assertEqual(self.panel(), {"FAIL": "fail"})
+        self.assertEqual(self.package_state(), "install ok installed 1.2.0")
+
     def test_crash_after_the_outcome_was_shown(self) -> None:
         self.set_speed(3)  # time to meet it while the outcome is shown
         self.offer()

@@ -79,10 +79,10 @@ exec {runner} /usr/bin/env LD_PRELOAD={wrapped}/bench/tap.so {wrapped}/updater {
 
 def group_lives(group: int) -> bool:
     """Whether a process of `group` still runs; one that has ended and that nobody asks for its status does not."""
-    for file in Path("/proc").glob("[0-9]*/stat"):
+    for process in Path("/proc").glob("[0-9]*"):
         with contextlib.suppress(OSError):  # has just ended
             # Behind the name in parentheses: state, parent, group; proc(5).
-            state, _, its_group = file.read_text(errors="replace").rpartition(")")[2].split()[:3]
+            state, _, its_group = (process / "stat").read_text(errors="replace").rpartition(")")[2].split()[:3]
             if int(its_group) == group and state != "Z":
                 return True
     return False

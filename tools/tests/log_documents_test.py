@@ -120,10 +120,11 @@ class Patterns(unittest.TestCase):
 
     def test_service_lights_what_is_told(self) -> None:
         script = (ROOT / "package/service/give-back").read_text()
-        lit = re.findall(r"^    i2cset -y 0 0x07 (0x\w+) c$", script, re.MULTILINE)  # behind the loop that darkens all
+        lit = re.findall(r"^    send (0x\w+) (0x\w+)$", script, re.MULTILINE)  # behind the loop that darkens all
         header = (ROOT / "remote/LedManager.h").read_text()
         codes = {name: int(value) for name, value in re.findall(r"\b((?:LED|COLOR)_\w+) = (\d+),", header)}
-        self.assertEqual([int(byte, 16) for byte in lit], [codes["LED_FAIL"], codes["COLOR_FAIL"]])
+        pairs = [(int(led, 16), int(color, 16)) for led, color in lit]
+        self.assertEqual(pairs, [(codes["LED_FAIL"], codes["COLOR_FAIL"])])
 
     def test_colour_codes(self) -> None:
         header = (ROOT / "remote/LedManager.h").read_text()

@@ -503,6 +503,7 @@ std::int32_t UpdateManager::runProcess(const std::string& command, std::string& 
     char streamBuffer[64 * 1024]; // as much as a pipe holds: fewer calls for long outputs
 
     output.clear();
+    output.reserve(sizeof streamBuffer); // growing from the first short line takes more copies
     LOG() << "Running command: " << command;
     FILE* pipe = popen(command.c_str(), "r");
     if (pipe == nullptr) {

@@ -13,11 +13,14 @@
 #include <semaphore.h>
 #include <string>
 #include <sys/resource.h>
+#include <sys/syscall.h>
+#include <unistd.h>
 
 namespace
 {
 
 std::ofstream* result = nullptr;
+pid_t self = 0;
 sem_t ending;
 
 double seconds(const timeval& time)
@@ -31,6 +34,7 @@ __attribute__((constructor)) void begin()
     result = new std::ofstream(path == nullptr ? "" : path);
     unsetenv("MEASURED");
     unsetenv("LD_PRELOAD");
+    self = getpid();
     sem_init(&ending, 0, 0);
 }
 
@@ -47,6 +51,16 @@ __attribute__((destructor)) void end()
 }
 
 } // namespace
+
+/// A shell ends by this, without the libraries' last words; so does a child of it that could run no program.
+extern "C" void _exit(int status)
+{
+    if (getpid() == self) {
+        end();
+    }
+    syscall(SYS_exit_group, status);
+    abort();
+}
 
 extern "C" int nanosleep(const timespec* asked, timespec*)
 {

@@ -21,6 +21,7 @@
 #include <ctime>
 #include <dlfcn.h>
 #include <fcntl.h>
+#include <mutex>
 #include <string>
 #include <unistd.h>
 
@@ -30,6 +31,7 @@ namespace
 const double clockWait = 2; // s, the shortest wait whose shortening moves the wall clock
 
 std::atomic<double> clockOffset{0};   // s, by which the updater's wall clock is ahead
+std::mutex writing;                   // one descriptor serves both threads of an updater that has no more left
 thread_local std::string pipeCommand; // the updater reads one command at a time on a thread
 
 __attribute__((constructor)) void leaveChildrenAlone()
@@ -60,6 +62,7 @@ void writeLine(const char* call, const char* phase, long value, const std::strin
     std::snprintf(head, sizeof head, "%lld.%06ld\t%d\t%s\t%s\t%ld\t", static_cast<long long>(now.tv_sec),
                   now.tv_nsec / 1000, gettid(), call, phase, value);
     const std::string line = head + text + '\n';
+    const std::lock_guard<std::mutex> lock(writing);
     const int file = path == nullptr ? -1 : open(path, O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0644);
     if (file < 0 || write(file, line.data(), line.size()) < 0) {
         std::perror("bench: BENCH_CALLS");

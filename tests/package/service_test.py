@@ -296,7 +296,7 @@ class Ends(ServiceTest):
         limit = self.unit.root() / "etc/systemd/system/harl-updater.service.d/limit.conf"
         write(limit, "[Service]\nLimitDATA=12M\n")  # the stack of the second thread, 8 MiB, does not fit any more
         self.addCleanup(limit.unlink)
-        self.set_speed(SPEED)
+        self.inside("systemctl", "daemon-reload")
         self.offer()
         self.inside("systemctl", "stop", "harl")
         self.start()

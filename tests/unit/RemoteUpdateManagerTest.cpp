@@ -99,20 +99,28 @@ TEST_F(Feedback, OfferedListIsIgnored)
     EXPECT_EQ(journal(), Lines{});
 }
 
-void (*const outcomes[])() = {
-    [] { RemoteUpdateManager::resultCallback(UpdateManager::RESULT_NO_UPDATE); },
-    [] { RemoteUpdateManager::errorCallback(UpdateManager::ERROR_UPDATE_MIRRORS); },
+struct Outcome
+{
+    void (*report)();
+    std::size_t leds; // that it lights
+};
+
+const Outcome outcomes[] = {
+    {[] { RemoteUpdateManager::resultCallback(UpdateManager::RESULT_NO_UPDATE); }, 2},
+    {[] { RemoteUpdateManager::resultCallback(UpdateManager::RESULT_UPDATED); }, 1},
+    {[] { RemoteUpdateManager::errorCallback(UpdateManager::ERROR_UPDATE_MIRRORS); }, 2},
+    {[] { RemoteUpdateManager::errorCallback(UpdateManager::ERROR_INSTALL_QUORB); }, 1},
 };
 
 TEST_F(Feedback, FlashingSendsNothingOnceTheOutcomeIsBeingShown)
 {
-    for (const auto& outcome : outcomes) {
+    for (const Outcome& outcome : outcomes) {
         platform::reset();
         LedManager::instance()->startFlashRemoteAndMainInBlue();
         platform::waitFor([] { return entries("sleep:").size() >= 3; });
-        outcome();
+        outcome.report();
         const Lines own = journal(std::this_thread::get_id());
-        ASSERT_EQ(own.size(), 1 + 14 + 1 + 2U);
+        ASSERT_EQ(own.size(), 1 + 14 + 1 + outcome.leds);
         Lines end = journal();
         end.erase(end.begin(), end.end() - static_cast<std::ptrdiff_t>(own.size()) + 1);
         EXPECT_EQ(end, Lines(own.begin() + 1, own.end())) << "another thread's command is among the outcome's";
@@ -121,7 +129,7 @@ TEST_F(Feedback, FlashingSendsNothingOnceTheOutcomeIsBeingShown)
 
 TEST_F(Feedback, IsLoggedBeforeTheFlashingHasEnded)
 {
-    for (const auto& outcome : outcomes) {
+    for (const Outcome& outcome : outcomes) {
         platform::reset();
         platform::scriptSleep([](const timespec*, timespec*) {
             platform::note("pause");
@@ -130,7 +138,7 @@ TEST_F(Feedback, IsLoggedBeforeTheFlashingHasEnded)
         });
         LedManager::instance()->startFlashRemoteAndMainInBlue();
         platform::waitFor([] { return !entries("pause").empty(); });
-        outcome();
+        outcome.report();
     }
 }
 

@@ -24,7 +24,7 @@ from plan import Plan, PlanError, load, names
 from scenario import ScenarioError
 
 WORK = ROOT / "build/target"
-PACKAGED = ["CMakeLists.txt", "cmake", "common", "debian", "docs/man", "package", "remote", "tools"]
+PACKAGED = ["CMakeLists.txt", "cmake", "common", "debian", "docs/man", "packaging", "remote", "service", "tools"]
 NEEDED = ["qemu-system-arm", "qemu-user-static", "mmdebstrap", "arch-test", "e2fsprogs", "dosfstools", "mtools", "kmod"]
 NEEDED += ["cpio", "openssh-client", "dpkg-dev", "g++-11-arm-linux-gnueabihf"]  # of Debian
 SPACE = 2000  # MiB, for disks and results
@@ -60,13 +60,13 @@ def updater_package(given: Path | None) -> Path:
         fields = ["dpkg-deb", "--field", given, "Package", "Architecture"]
         seen = subprocess.run(fields, stdout=subprocess.PIPE, stderr=subprocess.DEVNULL, text=True, check=False).stdout
         if seen != "Package: harl-updater\nArchitecture: armhf\n":
-            raise TargetError(f"{given}: is not harl-updater for armhf; package/build armhf makes such a package")
+            raise TargetError(f"{given}: is not harl-updater for armhf; packaging/build armhf makes such a package")
         return given
     folder = ROOT / "build/package"
     sources = subprocess.check_output(["git", "ls-tree", "HEAD", *PACKAGED], cwd=ROOT, text=True)
     built = WORK / "package-sources"
     packages = list(folder.glob("harl-updater_*_armhf.deb"))
-    # A package newer than the note comes from another call of package/build, perhaps from other sources.
+    # A package newer than the note comes from another call of packaging/build, perhaps from other sources.
     if (
         not (built.exists() and packages)
         or built.read_text() != sources
@@ -75,12 +75,12 @@ def updater_package(given: Path | None) -> Path:
         print("target: building the package", flush=True)
         log = WORK / "package.log"
         with log.open("w") as output:
-            if run_tool([ROOT / "package/build", "armhf"], output, output) is None:
-                raise TargetError(f"package/build armhf failed: see {log}")
+            if run_tool([ROOT / "packaging/build", "armhf"], output, output) is None:
+                raise TargetError(f"packaging/build armhf failed: see {log}")
         built.write_text(sources)
     packages = sorted(folder.glob("harl-updater_*_armhf.deb"), key=lambda file: file.stat().st_mtime)
     if not packages:
-        raise TargetError(f"{folder} holds no harl-updater_*_armhf.deb: package/build armhf makes it")
+        raise TargetError(f"{folder} holds no harl-updater_*_armhf.deb: packaging/build armhf makes it")
     return packages[-1]
 
 
@@ -191,7 +191,7 @@ def main() -> int:
     parser.add_argument(
         "--full-length", action="store_true", help="keep every wait; an hour for package-and-board, the default then"
     )
-    parser.add_argument("--package", type=Path, help="default: built by package/build armhf", metavar="FILE")
+    parser.add_argument("--package", type=Path, help="default: built by packaging/build armhf", metavar="FILE")
     arguments = parser.parse_args()
     for number in (signal.SIGTERM, signal.SIGHUP):
         signal.signal(number, lambda received, _: sys.exit(128 + received))

@@ -232,7 +232,7 @@ void RunBuilder::otherLine(std::uint64_t line, std::string_view program, std::st
         return; // the next run's
     }
     mRun->lastLine = line;
-    if (manager || startsWith(text, "give-back: ")) { // see package/service/give-back
+    if (manager || startsWith(text, "give-back: ")) { // see service/give-back
         mRun->serviceManager.add(text);
         mRun->failureShownByService = mRun->failureShownByService || contains(text, "before it showed an outcome");
         if (mRun->ended == RunEnd::NOT_SEEN && (mRun->failureShownByService || contains(text, "Main process exited"))) {

@@ -15,7 +15,7 @@ from panel import Panel, color_name, led_name
 
 SKIPPED = 77
 NAMESPACES = ["unshare", "--map-root-user", "--mount", "--pid", "--fork", "--kill-child", "--mount-proc"]
-GIVE_BACK = ROOT / "package/service/give-back"
+GIVE_BACK = ROOT / "service/give-back"
 START = "systemctl --no-block start harl"
 TOOLS = {
     "systemctl": 'for tool in apt dpkg; do ! pgrep -x $tool >/dev/null || echo "beside $tool" >>"$UNIT/calls"; done',
@@ -163,7 +163,7 @@ class GiveBack(unittest.TestCase):
         self.assertEqual(self.calls()[-1], START)
 
     def test_unit_file_names_the_runtime_directory_for_an_old_service_manager(self) -> None:
-        text = (ROOT / "package/service/harl-updater.service").read_text()
+        text = (ROOT / "service/harl-updater.service").read_text()
         folder = re.findall(r"^RuntimeDirectory=(\S+)$", text, re.MULTILINE)
         self.assertEqual(re.findall(r"^Environment=RUNTIME_DIRECTORY=/run/(\S+)$", text, re.MULTILINE), folder)
         self.assertEqual(len(folder), 1)

@@ -5,7 +5,7 @@ import tempfile
 import unittest
 from pathlib import Path
 
-I2CSET = Path(__file__).parents[2] / "package/service/i2cset"
+I2CSET = Path(__file__).parents[2] / "service/i2cset"
 # What both kinds say to an option that they do not know, before their usage text.
 UNKNOWN = 'echo "Error: Unsupported option \\"$1\\"!" >&2; echo "{usage}" >&2; exit 1'
 OLD = f"""#!/bin/sh

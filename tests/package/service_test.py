@@ -410,7 +410,7 @@ if __name__ == "__main__":
     architecture = subprocess.check_output(["dpkg", "--print-architecture"], text=True).strip()
     found = sorted((ROOT / "build/package").glob(f"{package}_*_{architecture}.deb"))
     if not found:
-        skip("there is no package for this machine: package/build")
+        skip("there is no package for this machine: packaging/build")
     if os.geteuid() != 0:
         skip("systemd as the first process of a machine of its own needs root")
     with machine(system) as made:

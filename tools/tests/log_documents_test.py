@@ -119,7 +119,7 @@ class Patterns(unittest.TestCase):
         self.assertEqual(len(reports), len(shown))
 
     def test_service_lights_what_is_told(self) -> None:
-        script = (ROOT / "package/service/give-back").read_text()
+        script = (ROOT / "service/give-back").read_text()
         lit = re.findall(r"^    send (0x\w+) (0x\w+)$", script, re.MULTILINE)  # behind the loop that darkens all
         header = (ROOT / "remote/LedManager.h").read_text()
         codes = {name: int(value) for name, value in re.findall(r"\b((?:LED|COLOR)_\w+) = (\d+),", header)}

@@ -3,7 +3,7 @@
 
 #include "Input.h"
 #include "Printable.h"
-#include "stick_archive.h"
+#include "stick/archive.h"
 
 #include <cstdio>
 #include <cstring>

@@ -6,11 +6,11 @@
 
 #include "Input.h"
 #include "Printable.h"
-#include "log_explain.h"
-#include "log_follow.h"
-#include "log_html.h"
-#include "log_json.h"
-#include "log_report.h"
+#include "log/explain.h"
+#include "log/follow.h"
+#include "log/html.h"
+#include "log/json.h"
+#include "log/report.h"
 
 #include <algorithm>
 #include <fstream>

@@ -98,7 +98,7 @@ def archive_seeds() -> dict[str, bytes]:
 
 def log_seeds() -> dict[str, bytes]:
     """The golden logs, in blocks of 65 bytes."""
-    golden = Path(__file__).parents[1] / "tools/tests/golden/log"
+    golden = Path(__file__).parents[1] / "tests/companion/golden/log"
     return {path.stem: b"@" + path.read_bytes() for path in golden.glob("*.log")}
 
 

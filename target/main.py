@@ -24,7 +24,7 @@ from plan import Plan, PlanError, load, names
 from scenario import ScenarioError
 
 WORK = ROOT / "build/target"
-PACKAGED = ["CMakeLists.txt", "cmake", "common", "debian", "docs/man", "packaging", "remote", "service", "tools"]
+PACKAGED = ["CMakeLists.txt", "cmake", "common", "debian", "companion", "docs/man", "packaging", "remote", "service"]
 NEEDED = ["qemu-system-arm", "qemu-user-static", "mmdebstrap", "arch-test", "e2fsprogs", "dosfstools", "mtools", "kmod"]
 NEEDED += ["cpio", "openssh-client", "dpkg-dev", "g++-11-arm-linux-gnueabihf"]  # of Debian
 SPACE = 2000  # MiB, for disks and results

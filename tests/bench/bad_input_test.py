@@ -193,11 +193,11 @@ class OtherCommands(unittest.TestCase):
         for command, wrong in (
             ("tests/reliability/threads", numbers),
             ("fuzz/run", numbers),
-            ("tools/tests/log-throughput", numbers),
+            ("tests/companion/log/throughput", numbers),
             ("benchmarks/processes", numbers[:-1]),
             ("tests/reliability/interruption_real", names),
-            ("tools/tests/make-golden", names),
-            ("tools/tests/make-golden-checks", names),
+            ("tests/companion/log/make-golden", names),
+            ("tests/companion/make-golden-checks", names),
             ("tests/run-armhf", names),
         ):
             for words in wrong:

@@ -1,0 +1,238 @@
+#include "log/follow.h"
+
+#include "log/explain.h"
+#include "log/json.h"
+#include "log/report.h"
+
+#include <algorithm>
+#include <ctime>
+#include <ostream>
+
+#include <nlohmann/json.hpp>
+
+namespace
+{
+
+const std::int64_t longSilence = 1800; // s; more than twice the longest wait
+const std::size_t barLength = 30;      // columns
+
+bool isOver(const Run& run)
+{
+    return run.ended != RunEnd::NOT_SEEN;
+}
+
+std::string barText(std::int64_t elapsed, std::int64_t expected)
+{
+    const double share =
+        expected <= 0 ? 1 : std::clamp(static_cast<double>(elapsed) / static_cast<double>(expected), 0.0, 1.0);
+    const auto filled = static_cast<std::size_t>(share * static_cast<double>(barLength));
+    return '[' + std::string(filled, '#') + std::string(barLength - filled, '-') + ']';
+}
+
+std::string attemptText(const Step& step)
+{
+    if (step.kind != StepKind::UPLOAD_BOARD || step.failedAttempts == 0) {
+        return "";
+    }
+    return ", attempt " + std::to_string(std::min(step.failedAttempts + 1, 20)) + " of 20";
+}
+
+/// "3 min 2 s of 13 min 0 s", "5 s, no fixed length"
+std::string elapsedText(std::int64_t elapsed, const std::optional<std::int64_t>& expected)
+{
+    const std::string text = durationText(std::max<std::int64_t>(elapsed, 0));
+    if (elapsed > longSilence) {
+        return text + " without a record: the run has probably ended early";
+    }
+    return text + (expected ? " of " + durationText(*expected) : ", no fixed length");
+}
+
+/// True when the next step comes only if the check that goes on finds an update.
+bool nextDependsOnCheck(const Run& run)
+{
+    const Step& step = run.steps.back();
+    return !step.end && !run.mainHead && (step.kind == StepKind::CHECK_PACKAGE || step.kind == StepKind::CHECK_BOARD);
+}
+
+std::string nextText(const Run& run)
+{
+    const std::optional<StepKind> next = nextStep(run);
+    if (!next) {
+        return "";
+    }
+    return std::string("; then: ") + stepTitle(*next) + (nextDependsOnCheck(run) ? ", if they differ" : "");
+}
+
+} // namespace
+
+void ExpectedTimes::learn(const Run& run)
+{
+    for (const Step& step : run.steps) {
+        if (step.end && *step.end >= step.start) {
+            mLast.at(static_cast<std::size_t>(step.kind)) = *step.end - step.start;
+        }
+    }
+}
+
+std::optional<std::int64_t> ExpectedTimes::of(StepKind kind) const
+{
+    switch (kind) {
+    case StepKind::WAIT_FOR_BOARD:
+        return 780;
+    case StepKind::SHOW_TO_OPERATOR:
+        return 30;
+    case StepKind::GIVE_BACK:
+        return 10;
+    default:
+        return mLast.at(static_cast<std::size_t>(kind));
+    }
+}
+
+std::optional<StepKind> nextStep(const Run& run)
+{
+    if (run.steps.empty()) {
+        return StepKind::STOP_APPLICATION;
+    }
+    const Step& step = run.steps.back();
+    const bool failed = step.result == StepResult::FAILED;
+    switch (step.kind) {
+    case StepKind::START:
+        return StepKind::STOP_APPLICATION;
+    case StepKind::STOP_APPLICATION:
+        return StepKind::REFRESH_MIRRORS;
+    case StepKind::REFRESH_MIRRORS:
+        return failed ? StepKind::SHOW_OUTCOME : StepKind::CHECK_PACKAGE;
+    case StepKind::CHECK_PACKAGE:
+        if (failed) {
+            return StepKind::SHOW_OUTCOME;
+        }
+        return !run.mainHead && (run.package.differ || !step.end) ? StepKind::INSTALL_PACKAGE : StepKind::CHECK_BOARD;
+    case StepKind::INSTALL_PACKAGE:
+        return failed ? StepKind::SHOW_OUTCOME : StepKind::CHECK_BOARD;
+    case StepKind::CHECK_BOARD:
+        if (run.mainHead) {
+            return StepKind::CHECK_TEAMVIEWER;
+        }
+        if (run.board.differ || !step.end) {
+            return StepKind::UPLOAD_BOARD;
+        }
+        return run.package.differ && !failed ? StepKind::REMOVE_MARKER : StepKind::SHOW_OUTCOME;
+    case StepKind::UPLOAD_BOARD:
+        return failed ? StepKind::SHOW_OUTCOME : StepKind::RUN_BOARD_SCRIPT;
+    case StepKind::RUN_BOARD_SCRIPT:
+        return StepKind::WAIT_FOR_BOARD;
+    case StepKind::WAIT_FOR_BOARD:
+    case StepKind::CHECK_TEAMVIEWER:
+        return StepKind::REMOVE_MARKER;
+    case StepKind::REMOVE_MARKER:
+    case StepKind::INSTALL_TEAMVIEWER:
+        return StepKind::SHOW_OUTCOME;
+    case StepKind::SHOW_OUTCOME:
+        return StepKind::SHOW_TO_OPERATOR;
+    case StepKind::SHOW_TO_OPERATOR:
+        return StepKind::GIVE_BACK;
+    case StepKind::GIVE_BACK:
+        return StepKind::STOP_UPDATER;
+    case StepKind::STOP_UPDATER:
+        return std::nullopt;
+    }
+    return std::nullopt;
+}
+
+void Follower::show(const Run* run, std::int64_t now)
+{
+    const bool running = run != nullptr && !isOver(*run) && !run->steps.empty();
+    const std::uint64_t number = run == nullptr ? 0 : run->number;
+    const std::uint64_t firstNumber = mFirstNumber.value_or(number);
+    mFirstNumber = firstNumber;
+    mEnded = mEnded || ((mRunning || number > firstNumber) && run != nullptr && isOver(*run));
+    mRunning = mRunning || running;
+
+    std::string state = "none";
+    if (run != nullptr && !run->steps.empty()) {
+        const Step& step = run->steps.back();
+        state = std::to_string(run->number) + ' ' + std::to_string(run->steps.size()) + ' ' +
+                std::to_string(step.failedAttempts) + ' ' + std::to_string(static_cast<int>(step.result)) + ' ' +
+                std::to_string(static_cast<int>(run->ended));
+    }
+    if (state != mShown) {
+        mShown = state;
+        showChange(run, now);
+    }
+    if (running && mTerminal && !mJson) {
+        showBar(*run, now);
+    }
+    mOut.flush();
+}
+
+void Follower::showChange(const Run* run, std::int64_t now)
+{
+    const bool known = run != nullptr && !run->steps.empty();
+    const bool over = known && isOver(*run);
+    const char* state = over && mEnded ? "ended" : known && !over ? "running" : "waiting";
+    if (mJson) {
+        nlohmann::ordered_json object = {{"state", state}, {"time", isoText(now)}};
+        if (known) {
+            const Step& step = run->steps.back();
+            const std::optional<std::int64_t> expected = mExpected.of(step.kind);
+            const std::optional<StepKind> next = nextStep(*run);
+            object["run"] = run->number;
+            object["step"] = stepName(step.kind);
+            object["title"] = stepTitle(step.kind);
+            object["since"] = isoText(step.start);
+            object["elapsed_s"] = std::max<std::int64_t>((step.end ? *step.end : now) - step.start, 0);
+            object["expected_s"] = expected ? nlohmann::ordered_json(*expected) : nlohmann::ordered_json();
+            object["result"] = step.end ? resultText(step) : "";
+            object["failed_attempts"] = step.failedAttempts;
+            object["next"] = next ? nlohmann::ordered_json(stepName(*next)) : nlohmann::ordered_json();
+            object["next_if_versions_differ"] = nextDependsOnCheck(*run);
+            object["outcome"] = outcomeName(run->outcome);
+        }
+        mOut << object.dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace) << '\n';
+        return;
+    }
+    if (mBar) {
+        mOut << "\r\x1b[K"; // back to the line's start, and clear it
+        mBar = false;
+    }
+    if (!known) {
+        mOut << "No update is going on. Waiting for one.\n";
+        return;
+    }
+    if (over) {
+        const OperatorView view = operatorView(*run);
+        mOut << (mEnded ? "Ended at " : "No update is going on. The last one ended at ")
+             << (mEnded ? clockText(run->end) : dateText(run->end)) << ": " << view.meaning << " (" << view.seen << ")."
+             << (mEnded ? "\n" : " Waiting for the next.\n");
+        return;
+    }
+    const Step& step = run->steps.back();
+    mOut << clockText(step.start) << "  " << stepTitle(step.kind) << attemptText(step);
+    if (step.end) {
+        mOut << ": " << resultText(step);
+    } else if (const std::optional<std::int64_t> expected = mExpected.of(step.kind)) {
+        mOut << ", " << durationText(*expected) << " expected";
+    }
+    mOut << nextText(*run) << '\n';
+}
+
+void Follower::showBar(const Run& run, std::int64_t now)
+{
+    const Step& step = run.steps.back();
+    const std::int64_t elapsed = now - step.start;
+    const std::optional<std::int64_t> expected = mExpected.of(step.kind);
+    mOut << "\r\x1b[K  ";
+    if (expected) {
+        mOut << barText(elapsed, *expected) << ' ';
+    }
+    mOut << elapsedText(elapsed, expected);
+    mBar = true;
+}
+
+std::int64_t localNow()
+{
+    const std::time_t now = std::time(nullptr);
+    std::tm local = {};
+    localtime_r(&now, &local);
+    return timegm(&local);
+}

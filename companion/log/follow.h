@@ -1,0 +1,63 @@
+#pragma once
+
+#include "log/run.h"
+
+#include <array>
+#include <cstdint>
+#include <iosfwd>
+#include <optional>
+#include <string>
+
+/// How long each step takes: the updater's own waits, else as long as it took last time in the same log.
+class ExpectedTimes
+{
+public:
+    void learn(const Run& run);
+
+    /// In seconds; empty when nothing is known.
+    std::optional<std::int64_t> of(StepKind kind) const;
+
+private:
+    std::array<std::optional<std::int64_t>, stepKinds> mLast;
+};
+
+/// The step that comes after the one that goes on; empty after the last. While versions are compared: the installation
+/// that comes if they differ.
+std::optional<StepKind> nextStep(const Run& run);
+
+/// Shows the run that goes on while its log grows: a line for each change, on a terminal with a progress bar below it,
+/// or one JSON object for each change.
+class Follower
+{
+public:
+    Follower(bool json, bool terminal, std::ostream& out) : mJson(json), mTerminal(terminal), mOut(out) {}
+
+    /// A run has come to its end in the log.
+    void runComplete(const Run& run) { mExpected.learn(run); }
+
+    /// Shows what has changed since the last call, and how the step gets on.
+    ///
+    /// @param run  the last one of the log, or null
+    /// @param now  as ParsedRecord::time
+    void show(const Run* run, std::int64_t now);
+
+    /// True once a run has ended that was not over at the first call of show().
+    bool ended() const { return mEnded; }
+
+private:
+    void showChange(const Run* run, std::int64_t now);
+    void showBar(const Run& run, std::int64_t now);
+
+    bool mJson;
+    bool mTerminal;
+    std::ostream& mOut;
+    ExpectedTimes mExpected;
+    std::string mShown;                        // what a change is told by
+    std::optional<std::uint64_t> mFirstNumber; // of the run at the first call of show()
+    bool mRunning = false;
+    bool mEnded = false;
+    bool mBar = false; // a bar stands on the last line
+};
+
+/// The clock's time as ParsedRecord::time.
+std::int64_t localNow();

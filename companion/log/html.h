@@ -1,0 +1,23 @@
+#pragma once
+
+#include "log/run.h"
+
+#include <iosfwd>
+#include <string>
+
+/// Writes runs, explained before, as one page that needs nothing from outside: for each run what happened, why and what
+/// to do, and its timeline of threads, commands, waits and LED pattern.
+class HtmlPage
+{
+public:
+    HtmlPage(const std::string& source, std::ostream& out);
+
+    void writeRun(const Run& run);
+
+    /// Ends the page. Without it, the page is not whole.
+    void finish();
+
+private:
+    std::string mSource;
+    std::ostream& mOut;
+};

@@ -1,0 +1,89 @@
+#include "log/source.h"
+
+#include "command.h"
+#include "findings.h"
+
+#include <array>
+#include <cerrno>
+#include <csignal>
+#include <cstdlib>
+#include <cstring>
+
+#include <fcntl.h>
+#include <spawn.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+
+std::string LogSource::openFile(const std::string& path)
+{
+    const bool standardInput = path == "-";
+    mName = standardInput ? "standard input" : escaped(path);
+    mDescriptor = Descriptor(standardInput ? dup(STDIN_FILENO) : open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    if (!mDescriptor) {
+        return std::strerror(errno);
+    }
+    struct stat status = {};
+    if (fstat(mDescriptor.number(), &status) == 0 && S_ISDIR(status.st_mode)) {
+        return "a folder; name a file in it";
+    }
+    return "";
+}
+
+std::string LogSource::openJournal(bool follow)
+{
+    mName = "the journal of harl-updater";
+    const char* searchPath = std::getenv("PATH");
+    const std::string program = findProgram("journalctl", searchPath == nullptr ? "/usr/bin:/bin" : searchPath);
+    if (program.empty()) {
+        return "journalctl is not on the search path. On a machine without it, give the log as a file.";
+    }
+    std::array<int, 2> ends = {-1, -1};
+    if (pipe2(ends.data(), O_CLOEXEC) != 0) {
+        return std::strerror(errno);
+    }
+    mDescriptor = Descriptor(ends[0]);
+    const Descriptor writeEnd(ends[1]);
+
+    // All entries, with their times and programs; --all keeps tabs as they are.
+    std::array<const char*, 9> arguments = {
+        "journalctl", "--unit=harl-updater", "--output=short-iso", "--all", "--quiet", "--no-pager", nullptr, nullptr,
+        nullptr};
+    if (follow) {
+        arguments[6] = "--follow";
+        arguments[7] = "--no-tail";
+    }
+    posix_spawn_file_actions_t actions;
+    posix_spawn_file_actions_init(&actions);
+    posix_spawn_file_actions_adddup2(&actions, writeEnd.number(), STDOUT_FILENO);
+    const int error = posix_spawn(&mJournal, program.c_str(), &actions, nullptr,
+                                  const_cast<char* const*>(arguments.data()), // not changed, posix_spawn(3)
+                                  environ);
+    posix_spawn_file_actions_destroy(&actions);
+    if (error != 0) {
+        mJournal = -1;
+        return "journalctl cannot be run: " + std::string(std::strerror(error));
+    }
+    return "";
+}
+
+bool LogSource::isRegularFile() const
+{
+    struct stat status = {};
+    return fstat(mDescriptor.number(), &status) == 0 && S_ISREG(status.st_mode);
+}
+
+int LogSource::close(bool allRead)
+{
+    mDescriptor = Descriptor();
+    if (mJournal < 0) {
+        return 0;
+    }
+    int status = 0;
+    if (!allRead) {
+        kill(mJournal, SIGTERM);
+    }
+    while (waitpid(mJournal, &status, 0) < 0 && errno == EINTR) {
+    }
+    mJournal = -1;
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 0;
+}

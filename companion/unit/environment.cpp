@@ -1,0 +1,171 @@
+#include "unit/environment.h"
+
+#include "findings.h"
+
+#include <filesystem>
+#include <fstream>
+#include <iterator>
+#include <sstream>
+#include <system_error>
+
+namespace
+{
+
+std::string assignment(const std::string& name, const std::string& value)
+{
+    return name + '=' + value;
+}
+
+} // namespace
+
+Unit::Unit(const UnitSite& site) : mSite(site)
+{
+    mEnvironment["PATH"] = site.searchPath;
+    const CommandResult services =
+        run({"systemctl", "show", "--property=Id,LoadState,ActiveState,Environment", "harl", "harl-updater"}, quick);
+    mServicesKnown = services.succeeded();
+    takeServices(services.output);
+    // A service has the manager's variables and, over them, its own.
+    takeVariables(linesOf(run({"systemctl", "show-environment"}, quick).output));
+    std::istringstream own(property("harl-updater", "Environment"));
+    takeVariables({std::istream_iterator<std::string>(own), {}});
+    mMainHead = isInstalled("solvik4-dh") && !isInstalled("solvik4-rh");
+}
+
+CommandResult Unit::run(const std::vector<std::string>& arguments, std::chrono::milliseconds limit) const
+{
+    std::vector<std::string> environment = {"RES_OPTIONS=timeout:1 attempts:2"}; // resolv.conf(5)
+    for (const auto& [name, value] : mEnvironment) {
+        environment.push_back(assignment(name, value));
+    }
+    return runCommand(arguments, environment, limit);
+}
+
+std::string Unit::locale() const
+{
+    std::string result;
+    for (const auto& [name, value] : mEnvironment) {
+        if (name != "PATH") {
+            result += result.empty() ? "" : " ";
+            result += assignment(name, value);
+        }
+    }
+    return result;
+}
+
+std::string Unit::property(const std::string& service, const std::string& name) const
+{
+    const auto properties = mServices.find(service + ".service");
+    if (properties == mServices.end()) {
+        return "";
+    }
+    const auto value = properties->second.find(name);
+    return value == properties->second.end() ? "" : value->second;
+}
+
+bool Unit::updaterRuns() const
+{
+    const std::string state = property("harl-updater", "ActiveState");
+    if (!state.empty() && state != "inactive" && state != "failed") {
+        return true;
+    }
+    std::error_code error;
+    for (const auto& process : std::filesystem::directory_iterator(path("/proc"), error)) {
+        std::ifstream file(process.path() / "comm");
+        std::string name;
+        if (std::getline(file, name) && name == "harl-updater") {
+            return true;
+        }
+    }
+    return false;
+}
+
+/// Takes over the search path and the locale from NAME=value texts.
+void Unit::takeVariables(const std::vector<std::string>& texts)
+{
+    for (const std::string& text : texts) {
+        const std::size_t equals = text.find('=');
+        const std::string name = text.substr(0, equals);
+        if (equals != std::string::npos &&
+            (name == "PATH" || name == "LANG" || name == "LANGUAGE" || name.rfind("LC_", 0) == 0)) {
+            mEnvironment[name] = text.substr(equals + 1);
+        }
+    }
+}
+
+/// Takes the services' properties: a NAME=value line each, with an empty line between two services.
+void Unit::takeServices(const std::string& output)
+{
+    std::map<std::string, std::string> properties;
+    for (const std::string& line : linesOf(output + "\n\n")) {
+        const std::size_t equals = line.find('=');
+        if (equals != std::string::npos) {
+            properties[line.substr(0, equals)] = line.substr(equals + 1);
+        } else if (!properties.empty()) {
+            mServices[properties["Id"]] = properties;
+            properties.clear();
+        }
+    }
+}
+
+/// True when anything but configuration files is there of the package, configured or not.
+bool Unit::isInstalled(const std::string& package) const
+{
+    const std::string state = run({"dpkg-query", "--show", "--showformat=${db:Status-Status}", package}, quick).output;
+    return !state.empty() && state != "not-installed" && state != "config-files";
+}
+
+std::vector<std::string> linesOf(const std::string& text)
+{
+    std::vector<std::string> lines;
+    std::istringstream stream(text);
+    std::string line;
+    while (std::getline(stream, line)) {
+        lines.push_back(line);
+    }
+    return lines;
+}
+
+bool contains(const std::string& text, const std::string& part)
+{
+    return text.find(part) != std::string::npos;
+}
+
+std::string valueAfter(const std::string& text, const std::string& key)
+{
+    std::string value;
+    for (const std::string& line : linesOf(text)) {
+        const std::size_t position = line.find(key);
+        if (position != std::string::npos) {
+            value = line.substr(position + key.size());
+        }
+    }
+    return value;
+}
+
+std::string errorText(int error)
+{
+    return std::generic_category().message(error);
+}
+
+std::string complaint(const CommandResult& result)
+{
+    if (!result.started) {
+        return "the command could not be started";
+    }
+    if (result.timedOut) {
+        return "the command did not end in time";
+    }
+    std::string last;
+    std::string error; // i2cset(8) explains its usage behind it
+    for (const std::string& line : linesOf(result.errors)) {
+        const std::string text = line.substr(0, line.find('\r')); // ssh(1) ends its lines so
+        last = text.empty() ? last : text;
+        error = text.rfind("Error: ", 0) == 0 ? text : error;
+    }
+    if (!last.empty()) {
+        return shown(error.empty() ? last : error);
+    }
+    return result.exitCode < 0 ? "a signal ended the command"
+                               : "the command ended with status " + std::to_string(result.exitCode);
+}

@@ -1,0 +1,86 @@
+#pragma once
+
+#include "command.h"
+#include "unit/unit.h"
+
+#include <chrono>
+#include <map>
+#include <string>
+#include <vector>
+
+using namespace std::chrono_literals;
+
+inline constexpr auto quick = 10s; ///< limit for a command that only looks something up
+
+/// A unit as the updater's service finds it: its services, and the environment that the service's commands get.
+class Unit
+{
+public:
+    /// Asks the service manager, and the package manager which head it is.
+    explicit Unit(const UnitSite& site);
+
+    /// Runs `arguments` with the service's search path and locale.
+    CommandResult run(const std::vector<std::string>& arguments, std::chrono::milliseconds limit) const;
+
+    /// The program that the service's search path leads to; empty when there is none.
+    std::string program(const std::string& name) const { return findProgram(name, searchPath()); }
+
+    std::string searchPath() const { return mEnvironment.at("PATH"); }
+
+    /// The service's variables for the locale, for a message.
+    std::string locale() const;
+
+    /// Where the unit's file `absolute` is to be read.
+    std::string path(const std::string& absolute) const { return mSite.root + absolute; }
+
+    bool isRoot() const { return mSite.isRoot; }
+
+    /// True for a main head: its package is installed and the remote head's is not. Its own program shows the outcome;
+    /// the panel and the sounds are the remote head's.
+    bool isMainHead() const { return mMainHead; }
+
+    /// The head's own package.
+    std::string package() const { return mMainHead ? "solvik4-dh" : "solvik4-rh"; }
+
+    /// What the updater does when it cannot go on, for a message.
+    std::string failure() const
+    {
+        return mMainHead ? "reports a failure to the main head's program" : "shows the fail pattern";
+    }
+
+    /// False when the service manager cannot be asked.
+    bool servicesKnown() const { return mServicesKnown; }
+
+    /// A property of a service, systemctl(1), such as "ActiveState"; empty when it is not known.
+    std::string property(const std::string& service, const std::string& name) const;
+
+    /// True when the updater runs, as its service or started by hand.
+    bool updaterRuns() const;
+
+private:
+    void takeVariables(const std::vector<std::string>& texts);
+    void takeServices(const std::string& output);
+    bool isInstalled(const std::string& package) const;
+
+    const UnitSite& mSite;
+    std::map<std::string, std::string> mEnvironment;
+    std::map<std::string, std::map<std::string, std::string>> mServices;
+    bool mServicesKnown = false;
+    bool mMainHead = false;
+};
+
+// What the checks need to judge commands and files
+
+/// The lines of `text`, without their ends.
+std::vector<std::string> linesOf(const std::string& text);
+
+bool contains(const std::string& text, const std::string& part);
+
+/// What follows `key` in the last line of `text` that holds it, as the updater reads its versions; empty without one.
+std::string valueAfter(const std::string& text, const std::string& key);
+
+/// The text for an errno.
+std::string errorText(int error);
+
+/// What a command said of its failure, for a message.
+std::string complaint(const CommandResult& result);

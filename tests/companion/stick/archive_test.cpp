@@ -1,0 +1,266 @@
+#include "stick/archive.h"
+
+#include "finding_lines.h"
+#include "little_endian.h"
+#include "stick/zip_file.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <cstring>
+
+using testing::HasSubstr;
+
+namespace
+{
+
+/// A medium that can be read up to `readable`.
+ArchiveSource sourceOf(const std::string& archive, std::size_t readable)
+{
+    return {archive.size(), [&archive, readable](std::uint64_t offset, char* buffer, std::size_t length) {
+                const auto from = static_cast<std::size_t>(offset);
+                const std::size_t count = std::min(length, readable > from ? readable - from : 0);
+                std::memcpy(buffer, archive.data() + from, count);
+                return count;
+            }};
+}
+
+Report check(const std::string& archive, std::uint64_t mostUnpacked = 1'000'000'000, std::size_t readable = SIZE_MAX)
+{
+    Report report("stick", "An archive");
+    checkArchive(sourceOf(archive, readable), "\"OSUpgrade.zip\"", report, mostUnpacked);
+    return report;
+}
+
+/// Bytes that do not pack, as a file of the board might hold.
+std::string noise(std::size_t size)
+{
+    std::string bytes;
+    for (std::uint32_t state = 1; bytes.size() < size; state = state * 1664525 + 1013904223) {
+        bytes += static_cast<char>(state >> 24U);
+    }
+    return bytes;
+}
+
+} // namespace
+
+TEST(StickArchive, IntactArchiveIsFitWhateverItsMethods)
+{
+    const std::string big = noise(300'000);
+    const std::string archive = zipArchive({{"folder/", "", 0},
+                                            {"folder/a", big},
+                                            {"folder/b", big, 0},
+                                            {"zeros", std::string(500'000, '\0')},
+                                            {"empty", ""}});
+    const Report report = check(archive);
+    EXPECT_EQ(findingsOf(report), Lines());
+    EXPECT_EQ(factOf(report, "archive_bytes"), std::to_string(archive.size()));
+    EXPECT_EQ(factOf(report, "archive_entries"), "5");
+    EXPECT_EQ(factOf(report, "archive_declared_bytes"), "1100000");
+    EXPECT_EQ(factOf(report, "archive_unpacked_bytes"), "1100000");
+    EXPECT_EQ(factOf(report, "board_bytes"), std::to_string(archive.size() + 1'100'000));
+}
+
+TEST(StickArchive, AnythingElseIsNoZip)
+{
+    for (const std::string& bytes : {std::string("x"), noise(100'000), std::string(100'000, '\0')}) {
+        const Report report = check(bytes);
+        EXPECT_EQ(findingsOf(report), Lines{"error archive-not-zip"});
+        EXPECT_THAT(whatOf(report, "archive-not-zip"), HasSubstr("is no zip archive"));
+    }
+}
+
+TEST(StickArchive, CopyThatIsCutOffIsIncomplete)
+{
+    const std::string archive = zipArchive({{"a", noise(100'000)}});
+    const Report report = check(archive.substr(0, 60'000));
+    EXPECT_EQ(findingsOf(report), Lines{"error archive-not-zip"});
+    EXPECT_THAT(whatOf(report, "archive-not-zip"), HasSubstr("the copy is incomplete"));
+}
+
+TEST(StickArchive, ArchiveWithoutEntriesIsEmpty)
+{
+    EXPECT_EQ(findingsOf(check(zipArchive({}))), Lines{"error archive-empty"});
+    EXPECT_EQ(findingsOf(check("in front of the archive" + zipArchive({}))), Lines{"error archive-empty"});
+}
+
+TEST(StickArchive, WrongChecksumIsNamedWithItsEntryAndOffset)
+{
+    const Report report = check(zipArchive({{"good", "good"}, {"bad", "bad", 0, 0, 0x12345678}}));
+    EXPECT_EQ(findingsOf(report), Lines{"error archive-damaged"});
+    EXPECT_THAT(whatOf(report, "archive-damaged"),
+                HasSubstr("the entry \"bad\" at offset 73 has the checksum 822b39fb instead of 12345678"));
+}
+
+TEST(StickArchive, EveryFlippedBitOfTheDataIsFound)
+{
+    const std::string intact = zipArchive({{"a", noise(200)}});
+    const std::size_t data = 30 + 1; // the entry's record and its name
+    for (std::size_t offset = data; offset < data + 200; ++offset) {
+        std::string archive = intact;
+        archive[offset] = static_cast<char>(archive[offset] ^ 4);
+        EXPECT_EQ(findingsOf(check(archive)), Lines{"error archive-damaged"}) << offset;
+    }
+}
+
+TEST(StickArchive, DamagedEntriesAreCounted)
+{
+    const Report report = check(zipArchive({{"a", "a", 0, 0, 1}, {"b", "b", 0, 0, 1}, {"c", "c", 0, 0, 1}}));
+    EXPECT_THAT(whatOf(report, "archive-damaged"), HasSubstr("and 2 further entries"));
+}
+
+TEST(StickArchive, EntryThatHoldsLessThanItDeclaresIsDamaged)
+{
+    const Report report = check(zipArchive({{"a", "abc", 8, 0, {}, {}, 4}}));
+    EXPECT_THAT(whatOf(report, "archive-damaged"), HasSubstr("declares 4 bytes but holds 3 bytes"));
+}
+
+TEST(StickArchive, DataBehindItsEndMarkIsDamaged)
+{
+    const std::string packed = deflated("abc") + "more";
+    std::string archive = zipArchive({{"a", packed, 0}});
+    // The method and the checksum of what is packed, in both records.
+    const std::string intact = zipArchive({{"a", "abc"}});
+    const auto patch = [&](std::size_t to, std::size_t from, std::size_t length) {
+        archive.replace(to, length, intact, from, length);
+    };
+    const std::size_t directory = 31 + packed.size();
+    const std::size_t intactDirectory = 31 + deflated("abc").size();
+    for (const auto& [to, from] : {std::pair<std::size_t, std::size_t>{8, 8}, {directory + 10, intactDirectory + 10}}) {
+        patch(to, from, 2);
+        patch(to + 6, from + 6, 4);
+        patch(to + 14, from + 14, 4);
+    }
+    const Report report = check(archive);
+    EXPECT_THAT(whatOf(report, "archive-damaged"), HasSubstr("has damaged data"));
+}
+
+TEST(StickArchive, DamagedHeaderOfAnEntryIsFound)
+{
+    std::string archive = zipArchive({{"a", "abc"}});
+    archive[0] = 'X';
+    EXPECT_THAT(whatOf(check(archive), "archive-damaged"), HasSubstr("has a damaged header"));
+}
+
+TEST(StickArchive, DamagedDirectoryIsFound)
+{
+    std::string archive = zipArchive({{"a", "abc"}, {"b", "abc"}});
+    archive[archive.rfind("PK\x01\x02")] = 'X';
+    const Report report = check(archive);
+    EXPECT_EQ(findingsOf(report), Lines{"error archive-damaged"});
+    EXPECT_THAT(whatOf(report, "archive-damaged"), HasSubstr("its directory is damaged"));
+}
+
+TEST(StickArchive, EncryptedOrUnknownEntriesAreNotTested)
+{
+    EXPECT_EQ(findingsOf(check(zipArchive({{"a", "abc", 8, 1}}))), Lines{"unchecked archive-untested"});
+    const Report report = check(zipArchive({{"a", "abc", 14}}));
+    EXPECT_EQ(report.status(), Report::STATUS_UNCHECKED);
+    EXPECT_THAT(whatOf(report, "archive-untested"), HasSubstr("is packed by method 14"));
+}
+
+TEST(StickArchive, EntriesThatLeaveTheFolderAreFound)
+{
+    for (const std::string name : {"/etc/passwd", "../up", "a/../../up", "..", "a\\..\\up", "C:\\up", "\\up"}) {
+        EXPECT_EQ(findingsOf(check(zipArchive({{name, "x"}}))), Lines{"error archive-entry-path"}) << name;
+    }
+    for (const std::string name : {"a..b", "a/..b/c", "a/b..", "..."}) {
+        EXPECT_EQ(findingsOf(check(zipArchive({{name, "x"}}))), Lines()) << name;
+    }
+}
+
+TEST(StickArchive, NameOfAnEntryIsShownEscaped)
+{
+    const Report report = check(zipArchive({{"/\x1b[2J\n\xff", "x"}}));
+    EXPECT_THAT(whatOf(report, "archive-entry-path"), HasSubstr("\"/\\x1b[2J\\n\\xff\""));
+}
+
+TEST(StickArchive, UnreadableMediumIsNamedWithTheOffset)
+{
+    const std::string archive = zipArchive({{"a", noise(3'000'000)}});
+    for (const std::size_t readable : {std::size_t{0}, std::size_t{1'500'000}, archive.size() - 1}) {
+        // The directory at the end is read first.
+        Report report("stick", "An archive");
+        const ArchiveSource source = {
+            archive.size(), [&](std::uint64_t offset, char* buffer, std::size_t length) -> std::size_t {
+                const bool end = offset > 2'000'000 && readable == 1'500'000;
+                return sourceOf(archive, end ? SIZE_MAX : readable).read(offset, buffer, length);
+            }};
+        checkArchive(source, "\"OSUpgrade.zip\"", report);
+        EXPECT_EQ(findingsOf(report), Lines{"error archive-unreadable"}) << readable;
+        if (readable == 1'500'000) {
+            EXPECT_THAT(whatOf(report, "archive-unreadable"), HasSubstr("at offset 1500000:"));
+        }
+    }
+}
+
+TEST(StickArchive, BombThatDeclaresItsSizeIsNotUnpacked)
+{
+    const Report report =
+        check(zipArchive({{"a", "x", 8, 0, {}, {}, 0xFFFFFFF0}, {"b", "x", 8, 0, {}, {}, 0xFFFFFFF0}}));
+    EXPECT_EQ(findingsOf(report), Lines{"error archive-bomb"});
+    EXPECT_EQ(factOf(report, "archive_unpacked_bytes"), "");
+}
+
+TEST(StickArchive, BombThatDeclaresLittleIsStoppedAtTheLimit)
+{
+    const std::string zeros(50'000'000, '\0');
+    const Report report = check(zipArchive({{"a", zeros, 8, 0, {}, {}, 10}}), 1'000'000);
+    EXPECT_EQ(findingsOf(report), Lines{"error archive-bomb"});
+    EXPECT_THAT(whatOf(report, "archive-bomb"), HasSubstr("the test ended there"));
+    EXPECT_LT(std::stoull(factOf(report, "archive_unpacked_bytes")), 1'200'000U);
+}
+
+TEST(StickArchive, EntriesThatShareTheirDataAreABomb)
+{
+    const Report report = check(zipArchive({{"a", "abc", 0, 0, {}, 3'000'000}, {"b", "abc", 0, 0, {}, 3'000'000}}));
+    EXPECT_EQ(findingsOf(report), Lines{"error archive-bomb"});
+}
+
+TEST(StickArchive, TooManyEntriesAreABomb)
+{
+    // The directory repeats one record, whose entry need not exist.
+    std::string archive = zipArchive({{"a", ""}});
+    const std::size_t start = archive.find("PK\x01\x02");
+    const std::size_t end = archive.find("PK\x05\x06");
+    const std::string record = archive.substr(start, end - start);
+    std::string directory;
+    for (int count = 0; count < 100'001; ++count) {
+        directory += record;
+    }
+    // The number of entries and the size need the 64-bit end record, APPNOTE.TXT 4.3.14.
+    const std::uint64_t endRecord = start + directory.size();
+    archive = archive.substr(0, start) + directory + "PK\x06\x06" + littleEndian(44, 8) + littleEndian(45, 2) +
+              littleEndian(45, 2) + littleEndian(0, 8) + littleEndian(100'001, 8) + littleEndian(100'001, 8) +
+              littleEndian(directory.size(), 8) + littleEndian(start, 8) + "PK\x06\x07" + littleEndian(0, 4) +
+              littleEndian(endRecord, 8) + littleEndian(1, 4) + "PK\x05\x06" + littleEndian(0, 4) +
+              littleEndian(0xFFFF, 2) + littleEndian(0xFFFF, 2) + littleEndian(0xFFFFFFFF, 4) +
+              littleEndian(0xFFFFFFFF, 4) + littleEndian(0, 2);
+    const Report report = check(archive);
+    EXPECT_EQ(findingsOf(report), Lines{"error archive-bomb"});
+    EXPECT_THAT(whatOf(report, "archive-bomb"), HasSubstr("more than 100,000 entries"));
+}
+
+TEST(StickArchive, MoreThanFourGigabytesAreNotTested)
+{
+    Report report("stick", "An archive");
+    bool wasRead = false;
+    const ArchiveSource source = {(4ULL << 30U) + 1, [&](std::uint64_t, char*, std::size_t) -> std::size_t {
+                                      wasRead = true;
+                                      return 0;
+                                  }};
+    checkArchive(source, "\"OSUpgrade.zip\"", report);
+    EXPECT_EQ(findingsOf(report), Lines{"error archive-too-large"});
+    EXPECT_FALSE(wasRead);
+}
+
+TEST(StickArchive, ContentsOfAHundredTimesTheSizeAreAWarning)
+{
+    EXPECT_EQ(findingsOf(check(zipArchive({{"a", std::string(101'000'000, '\0')}}))), Lines{"warning archive-ratio"});
+}
+
+TEST(StickArchive, MuchInFrontOfTheArchiveIsAWarning)
+{
+    EXPECT_EQ(findingsOf(check(std::string(101'000'000, '\0') + zipArchive({{"a", "abc"}}))),
+              Lines{"warning archive-padding"});
+}

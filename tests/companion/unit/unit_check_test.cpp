@@ -1,0 +1,603 @@
+#include "unit/unit.h"
+
+#include "finding_lines.h"
+#include "unit/packages.h"
+#include "unit/standin.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <csignal>
+#include <fstream>
+#include <sstream>
+
+#include <sys/stat.h>
+
+namespace fs = std::filesystem;
+using testing::Contains;
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::Not;
+
+namespace
+{
+
+/// What a run of the check gave.
+struct Outcome
+{
+    int status;
+    nlohmann::json report;
+    Lines findings;
+    std::string errors;
+};
+
+class UnitCheck : public testing::Test
+{
+protected:
+    static Outcome check(const UnitSite& site)
+    {
+        std::ostringstream out;
+        std::ostringstream errors;
+        Outcome outcome = {runUnit({true, false, false}, site, out, errors), nlohmann::json::parse(out.str()), {}, ""};
+        outcome.errors = errors.str();
+        for (const auto& finding : outcome.report["findings"]) {
+            outcome.findings.push_back(finding["severity"].get<std::string>() + ' ' +
+                                       finding["check"].get<std::string>());
+        }
+        return outcome;
+    }
+
+    Outcome check() const { return check(unit.site()); }
+    Lines findings() const { return check().findings; }
+
+    /// The text of the one finding.
+    std::string what() const
+    {
+        const nlohmann::json found = check().report["findings"];
+        return found.size() == 1 ? found[0]["what"].get<std::string>() : found.dump();
+    }
+
+    nlohmann::json fact(const std::string& name) const { return check().report["facts"][name]; }
+
+    StandInUnit unit;
+};
+
+struct statvfs diskWith(std::uint64_t freeBytes)
+{
+    struct statvfs system = {};
+    system.f_frsize = 1;
+    system.f_bavail = freeBytes;
+    system.f_files = 10;
+    system.f_favail = 5;
+    return system;
+}
+
+Lines checkDisk(const struct statvfs& system, std::uint64_t needed)
+{
+    Report report("unit", "The unit");
+    checkFreeSpace(system, needed, report);
+    return findingsOf(report);
+}
+
+} // namespace
+
+TEST_F(UnitCheck, CompleteUnitIsFit)
+{
+    const Outcome outcome = check();
+    EXPECT_EQ(outcome.findings, Lines());
+    EXPECT_EQ(outcome.status, 0);
+    EXPECT_EQ(outcome.errors, "");
+    EXPECT_EQ(outcome.report["command"], "unit");
+    EXPECT_EQ(outcome.report["fit"], true);
+    const nlohmann::json facts = outcome.report["facts"];
+    EXPECT_EQ(facts["head"], "remote");
+    EXPECT_EQ(facts["service_harl"], "active");
+    EXPECT_EQ(facts["service_harl_updater"], "inactive");
+    EXPECT_EQ(facts["board_version"], "2.1.0");
+    EXPECT_EQ(facts["package_installed"], "1.2.0");
+    EXPECT_EQ(facts["package_candidate"], "1.3.0");
+    EXPECT_EQ(facts["needed_bytes"], 1'000'000 + 2048 * 1024);
+    EXPECT_EQ(facts["mirrors"], 1);
+}
+
+TEST_F(UnitCheck, ChangesNothing)
+{
+    check();
+    for (const std::string& call : unit.calls()) {
+        EXPECT_THAT(call, testing::AnyOf("systemctl show-environment", testing::StartsWith("systemctl show "),
+                                         "i2cset -y 0 0x07 0x100 c", testing::StartsWith("i2cdetect "),
+                                         testing::StartsWith("ssh "), testing::StartsWith("dpkg-query --show "),
+                                         testing::StartsWith("apt-cache "), "apt-get update --print-uris",
+                                         testing::StartsWith("apt-helper ")));
+    }
+    EXPECT_TRUE(fs::is_empty(unit.folder.path("root/tmp")));
+}
+
+TEST_F(UnitCheck, TextNamesTheVerdict)
+{
+    std::ostringstream out;
+    std::ostringstream errors;
+    EXPECT_EQ(runUnit({}, unit.site(), out, errors), 0);
+    EXPECT_THAT(out.str(), HasSubstr("\nBoard's version:       \"2.1.0\"\n"));
+    EXPECT_THAT(out.str(), HasSubstr("\nThe unit is fit for an update.\n"));
+}
+
+TEST_F(UnitCheck, WithoutRootsRightsTheAnswerIsOpen)
+{
+    UnitSite site = unit.site();
+    site.isRoot = false;
+    const Outcome outcome = check(site);
+    EXPECT_EQ(outcome.findings, Lines{"unchecked not-root"});
+    EXPECT_EQ(outcome.status, 2);
+}
+
+TEST_F(UnitCheck, BoardThatRefusesAnotherUserThanRootIsUnchecked)
+{
+    UnitSite site = unit.site();
+    site.isRoot = false;
+    unit.set("BOARD_LOGIN", "key-refused");
+    EXPECT_EQ(check(site).findings, (Lines{"unchecked not-root", "unchecked board-login"}));
+    unit.set("BOARD_LOGIN", "host-key-changed");
+    EXPECT_EQ(check(site).findings, (Lines{"unchecked not-root", "unchecked board-login"}));
+    unit.set("BOARD_LINK", "down");
+    EXPECT_EQ(check(site).findings, (Lines{"unchecked not-root", "error board-unreachable"}));
+}
+
+TEST_F(UnitCheck, NothingIsLeftWhenASignalEndsIt)
+{
+    const fs::path fetcher = unit.folder.path("root/usr/lib/apt/apt-helper");
+    const std::string processFile = unit.folder.path("process");
+    fs::remove(fetcher); // a link
+    for (const int number : {SIGHUP, SIGINT, SIGTERM}) {
+        unit.folder.put("root/usr/lib/apt/apt-helper",
+                        "#!/bin/sh\necho $$ >" + processFile + "\nkill -" + std::to_string(number) +
+                            " $PPID\nexec sleep 60\n",
+                        0755);
+        EXPECT_EXIT((std::signal(number, SIG_DFL), check()), testing::KilledBySignal(number), "");
+        EXPECT_TRUE(fs::is_empty(unit.folder.path("root/tmp"))) << number;
+        pid_t process = 0;
+        std::ifstream(processFile) >> process;
+        EXPECT_GT(process, 0);
+        EXPECT_EQ(kill(process, 0), -1) << "The fetcher lives on.";
+    }
+}
+
+// Heads
+
+TEST_F(UnitCheck, MainHeadIsJudgedByItsOwnPackage)
+{
+    unit.set("UPDATER_PROGRAM", "main");
+    const Outcome outcome = check();
+    EXPECT_EQ(outcome.findings, Lines());
+    EXPECT_EQ(outcome.status, 0);
+    const nlohmann::json facts = outcome.report["facts"];
+    EXPECT_EQ(facts["head"], "main");
+    EXPECT_EQ(facts["package_installed"], "1.2.0");
+    EXPECT_EQ(facts["package_candidate"], "1.3.0");
+    EXPECT_EQ(facts["needed_bytes"], 1'000'000 + 2048 * 1024);
+    unit.set("PACKAGE_OFFERED", "(none)");
+    EXPECT_EQ(what(), "No source offers the package \"solvik4-dh\".");
+}
+
+TEST_F(UnitCheck, MainHeadNeedsNeitherPanelNorSound)
+{
+    unit.set("UPDATER_PROGRAM", "main");
+    unit.removeTool("i2cset");
+    unit.removeTool("aplay");
+    unit.remove("dev/i2c-0");
+    unit.remove("root/RESOURCES");
+    unit.remove("proc/asound");
+    EXPECT_EQ(findings(), Lines());
+}
+
+TEST_F(UnitCheck, MainHeadInstallsNothingWithoutItsBoard)
+{
+    unit.set("UPDATER_PROGRAM", "main");
+    unit.set("BOARD_LINK", "down");
+    const nlohmann::json findings = check().report["findings"];
+    ASSERT_EQ(findings.size(), 1U);
+    EXPECT_EQ(findings[0]["check"], "board-unreachable");
+    EXPECT_EQ(findings[0]["effect"],
+              "logs \"Failed to checkUpdate\", installs nothing and reports a failure to the main head's program.");
+}
+
+TEST_F(UnitCheck, NoFindingOfAMainHeadSpeaksOfThePanel)
+{
+    unit.set("UPDATER_PROGRAM", "main");
+    for (const char* tool : {"ls", "apt", "apt-cache", "ssh", "scp"}) {
+        unit.removeTool(tool);
+    }
+    unit.replaceTool("apt-get", "exit 100");
+    const LockHolder lists(unit.folder.path("root/var/lib/apt/lists/lock"));
+    const LockHolder archives(unit.folder.path("root/var/cache/apt/archives/lock"));
+    const nlohmann::json findings = check().report["findings"];
+    EXPECT_EQ(findings.size(), 8U);
+    for (const auto& finding : findings) {
+        EXPECT_THAT(finding["effect"].get<std::string>(), Not(testing::ContainsRegex("pattern|panel"))) << finding;
+    }
+}
+
+TEST_F(UnitCheck, HeadWithBothPackagesOrWithConfigurationFilesOnlyIsARemoteHead)
+{
+    unit.replaceTool("dpkg-query", "printf installed");
+    EXPECT_EQ(fact("head"), "remote");
+    unit.replaceTool("dpkg-query", "[ \"$3\" = solvik4-dh ] && printf config-files");
+    EXPECT_EQ(fact("head"), "remote");
+    unit.replaceTool("dpkg-query", "[ \"$3\" = solvik4-dh ] && printf half-configured");
+    EXPECT_EQ(fact("head"), "main");
+}
+
+// Services
+
+TEST_F(UnitCheck, ServiceManagerThatCannotBeAskedIsUnchecked)
+{
+    unit.replaceTool("systemctl", "echo 'System has not been booted with systemd as init system' >&2; exit 1");
+    EXPECT_EQ(findings(), Lines{"unchecked services-unknown"});
+}
+
+TEST_F(UnitCheck, UnknownServicesAreErrors)
+{
+    unit.set("HEAD_HARL", "unknown");
+    unit.set("UNIT_UPDATER_LOADED", "masked");
+    const Outcome outcome = check();
+    EXPECT_EQ(outcome.findings, (Lines{"error service-not-loaded", "error service-not-loaded"}));
+    EXPECT_EQ(outcome.status, 1);
+    EXPECT_EQ(outcome.report["findings"][1]["what"], "The service \"harl-updater\" cannot be used: \"masked\".");
+}
+
+TEST_F(UnitCheck, RunningServiceOfTheUpdaterIsAWarningAndItsPanelIsLeftAlone)
+{
+    unit.set("UNIT_UPDATER", "activating");
+    EXPECT_EQ(findings(), Lines{"warning updater-runs"});
+    EXPECT_THAT(unit.calls(), Not(Contains(testing::StartsWith("i2cdetect"))));
+}
+
+TEST_F(UnitCheck, UpdaterStartedByHandIsFoundToo)
+{
+    unit.put("proc/17/comm", "harl-updater\n");
+    EXPECT_EQ(findings(), Lines{"warning updater-runs"});
+    unit.put("proc/17/comm", "harl-updater-to\n"); // this tool
+    EXPECT_EQ(findings(), Lines());
+}
+
+// Tools and the service's environment
+
+TEST_F(UnitCheck, EveryMissingToolIsNamed)
+{
+    for (const std::string tool : {"umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp", "i2cset"}) {
+        StandInUnit other;
+        other.removeTool(tool);
+        const Outcome outcome = check(other.site());
+        EXPECT_EQ(outcome.findings, Lines{"error tool-missing"}) << tool;
+        EXPECT_THAT(outcome.report["findings"][0]["what"].get<std::string>(),
+                    HasSubstr("The command \"" + tool + "\" is not on the service's search path"));
+    }
+    unit.removeTool("aplay");
+    EXPECT_EQ(findings(), Lines{"warning tool-missing"});
+}
+
+TEST_F(UnitCheck, WithoutServiceManagerItsToolIsMissing)
+{
+    unit.removeTool("systemctl");
+    EXPECT_EQ(findings(), (Lines{"unchecked services-unknown", "error tool-missing"}));
+}
+
+TEST_F(UnitCheck, FileThatCannotBeRunIsNoTool)
+{
+    unit.removeTool("scp");
+    unit.folder.put("bin/scp", "#!/bin/sh\n", 0644);
+    unit.removeTool("rm");
+    unit.folder.makeFolder("bin/rm");
+    EXPECT_EQ(findings(), (Lines{"error tool-missing", "error tool-missing"}));
+}
+
+TEST_F(UnitCheck, SearchPathOfTheServiceCounts)
+{
+    unit.set("UNIT_ENVIRONMENT", "PATH=/nowhere\nLANG=C.UTF-8");
+    unit.set("UNIT_SERVICE_ENVIRONMENT", "LANGUAGE=de PATH=" + unit.folder.path("bin").string());
+    EXPECT_EQ(findings(), Lines());
+    EXPECT_EQ(fact("search_path"), unit.folder.path("bin").string());
+    EXPECT_EQ(fact("locale"), "LANG=C.UTF-8 LANGUAGE=de");
+}
+
+// Panel and sound
+
+TEST_F(UnitCheck, ToolThatRefusesThePanelsAddressIsAnError)
+{
+    unit.replaceTool("i2cset", "echo 'Error: Chip address out of range (0x08-0x77)!' >&2; echo Usage: >&2; exit 1");
+    EXPECT_EQ(findings(), Lines{"error panel-address-refused"});
+    EXPECT_THAT(what(), HasSubstr("address 0x07: \"Error: Chip address out of range (0x08-0x77)!\"."));
+}
+
+TEST_F(UnitCheck, ToolWithAnotherAnswerToThePanelsAddressIsUnchecked)
+{
+    unit.replaceTool("i2cset", "echo 'BusyBox' >&2; exit 1");
+    EXPECT_EQ(findings(), Lines{"unchecked panel-address-unknown"});
+}
+
+TEST_F(UnitCheck, MissingBusIsAnError)
+{
+    unit.remove("dev/i2c-0");
+    EXPECT_EQ(findings(), Lines{"error panel-bus-missing"});
+}
+
+TEST_F(UnitCheck, PanelThatDoesNotAnswerIsAnError)
+{
+    unit.set("HEAD_PANEL", "absent");
+    EXPECT_EQ(findings(), Lines{"error panel-silent"});
+}
+
+TEST_F(UnitCheck, PanelTakenByADriverIsAnError)
+{
+    unit.replaceTool("i2cdetect", "echo '00:                      UU'");
+    EXPECT_EQ(findings(), Lines{"error panel-busy"});
+}
+
+TEST_F(UnitCheck, BusThatCannotBeAskedIsUnchecked)
+{
+    unit.replaceTool("i2cdetect", "echo 'Error: Could not open file' >&2; exit 1");
+    EXPECT_EQ(findings(), Lines{"unchecked panel-unknown"});
+}
+
+TEST_F(UnitCheck, MissingAndBrokenSoundFilesAreWarnings)
+{
+    unit.remove("root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav");
+    unit.put("root/RESOURCES/SOUNDS/SND_RESULT_FAIL.wav", waveFile(1000).substr(0, 500));
+    const Outcome outcome = check();
+    EXPECT_EQ(outcome.findings, (Lines{"warning sound-file", "warning sound-file"}));
+    EXPECT_EQ(outcome.status, 0);
+    EXPECT_THAT(outcome.report["findings"][1]["what"].get<std::string>(), HasSubstr("456 of 1000 bytes of sound"));
+}
+
+TEST_F(UnitCheck, SoundFileThatCannotBeReadIsUnchecked)
+{
+    unit.remove("root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav");
+    unit.folder.makeLink("root/root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav", "SND_RESULT_PASS.wav"); // a loop
+    const Outcome outcome = check();
+    EXPECT_EQ(outcome.findings, Lines{"unchecked sound-file"});
+    EXPECT_EQ(outcome.report["findings"][0]["remedy"], "Run this check as root.");
+}
+
+TEST_F(UnitCheck, MissingSoundDeviceIsAWarning)
+{
+    unit.put("proc/asound/pcm", "00-00: Microphone : Microphone : capture 1\n");
+    EXPECT_EQ(findings(), Lines{"warning sound-device"});
+}
+
+// The board
+
+TEST_F(UnitCheck, BoardIsAskedAsTheUpdaterDoesButNobodyIsAskedForAnything)
+{
+    check();
+    EXPECT_THAT(unit.calls(),
+                Contains("ssh -o BatchMode=yes -o StrictHostKeyChecking=yes -o UpdateHostKeys=no -o "
+                         "ServerAliveInterval=4 -o ServerAliveCountMax=10 -o ConnectTimeout=2 -o TCPKeepAlive=yes "
+                         "192.168.9.2  cat /root/App/AppExe/version.txt | grep 'Brimvale'"));
+}
+
+TEST_F(UnitCheck, BoardThatDoesNotAnswerIsUnreachable)
+{
+    unit.set("BOARD_LINK", "down");
+    EXPECT_EQ(findings(), Lines{"error board-unreachable"});
+}
+
+TEST_F(UnitCheck, LoginEndedByASignalIsUnreachable)
+{
+    unit.set("TOOLS_KILLED", "ssh");
+    EXPECT_EQ(findings(), Lines{"error board-unreachable"});
+    EXPECT_EQ(what(), "The board at 192.168.9.2 cannot be asked: a signal ended the command.");
+}
+
+TEST_F(UnitCheck, RefusedKeyIsALoginError)
+{
+    unit.set("BOARD_LOGIN", "key-refused");
+    EXPECT_EQ(findings(), Lines{"error board-login"});
+}
+
+TEST_F(UnitCheck, ChangedAndUnknownHostKeysAreToldApart)
+{
+    unit.set("BOARD_LOGIN", "host-key-changed");
+    EXPECT_EQ(findings(), Lines{"error board-host-key"});
+    EXPECT_EQ(what(), "The board's host key is not the one that is known.");
+    unit.replaceTool("ssh", "echo 'Host key verification failed.' >&2; exit 255");
+    EXPECT_EQ(what(), "The board's host key is not known.");
+}
+
+TEST_F(UnitCheck, MissingVersionFileIsAnError)
+{
+    unit.set("BOARD_VERSION_FILE", "");
+    EXPECT_EQ(findings(), Lines{"error board-version"});
+}
+
+TEST_F(UnitCheck, VersionFileThatCannotBeReadIsNoRefusedLogin)
+{
+    unit.replaceTool("ssh", "echo 'cat: /root/App/AppExe/version.txt: Permission denied' >&2; exit 1");
+    EXPECT_EQ(findings(), Lines{"error board-version"});
+}
+
+TEST_F(UnitCheck, VersionLineIsReadAsTheUpdaterReadsIt)
+{
+    unit.set("BOARD_VERSION_FILE", "Brimvale 2.0\r\n");
+    EXPECT_EQ(findings(), Lines{"error board-version"});
+    unit.set("BOARD_VERSION_FILE", "Brimvale\t\r\n");
+    EXPECT_EQ(findings(), Lines{"error board-version"});
+    unit.set("BOARD_VERSION_FILE", "Brimvale\t1.0\r\nold Brimvale\t{version}\rrest\n");
+    EXPECT_EQ(findings(), Lines());
+    EXPECT_EQ(fact("board_version"), "2.1.0");
+}
+
+TEST_F(UnitCheck, HostileAnswerOfTheBoardIsShownEscaped)
+{
+    unit.set("BOARD_INSTALLED", "2.1\x1b[2J\xff");
+    EXPECT_EQ(fact("board_version"), "2.1\\x1b[2J\\xff");
+}
+
+// The package manager
+
+TEST_F(UnitCheck, LockOfAnotherPackageToolIsAnErrorThatNamesTheProcess)
+{
+    for (const std::string lock :
+         {"var/lib/apt/lists/lock", "var/lib/dpkg/lock-frontend", "var/lib/dpkg/lock", "var/cache/apt/archives/lock"}) {
+        const LockHolder holder(unit.folder.path("root/" + lock));
+        EXPECT_EQ(findings(), Lines{"error package-lock"}) << lock;
+        EXPECT_THAT(what(), HasSubstr("Process " + std::to_string(holder.process()) +
+                                      " holds the package manager's "
+                                      "lock \"/" +
+                                      lock + '"'));
+    }
+    EXPECT_EQ(findings(), Lines());
+}
+
+TEST_F(UnitCheck, LockFileThatCannotBeReadIsUnchecked)
+{
+    unit.remove("var/lib/dpkg/lock");
+    unit.folder.makeLink("root/var/lib/dpkg/lock", "lock");
+    EXPECT_EQ(findings(), Lines{"unchecked package-lock"});
+}
+
+TEST_F(UnitCheck, MissingLockFileIsFree)
+{
+    unit.remove("var/lib/dpkg/lock");
+    EXPECT_EQ(findings(), Lines());
+}
+
+TEST_F(UnitCheck, PackageDatabaseThatCannotBeReadIsUnchecked)
+{
+    unit.removeTool("dpkg-query");
+    EXPECT_EQ(findings(), Lines{"unchecked packages-unknown"});
+}
+
+TEST_F(UnitCheck, UnfinishedPackagesAreErrors)
+{
+    unit.replaceTool("dpkg-query", R"(printf 'ii \tapt\nrc \told\nun \tnone\niF \tsolvik4-rh\niU \tlib\nitR\tbad\n')");
+    EXPECT_EQ(findings(), Lines{"error package-half-configured"});
+    EXPECT_EQ(what(), "The package manager has unfinished work: \"solvik4-rh\", \"lib\", \"bad\".");
+}
+
+TEST_F(UnitCheck, InterruptedRunOfThePackageManagerIsAnError)
+{
+    unit.put("var/lib/dpkg/updates/tmp.i", "");
+    EXPECT_EQ(findings(), Lines());
+    unit.put("var/lib/dpkg/updates/0001", "");
+    EXPECT_EQ(what(), "The package manager has unfinished work: an interrupted run.");
+    unit.replaceTool("dpkg-query", R"(printf 'iF \tsolvik4-rh\n')");
+    EXPECT_EQ(what(), "The package manager has unfinished work: \"solvik4-rh\" and an interrupted run.");
+}
+
+TEST_F(UnitCheck, LocaleThatTranslatesThePackageToolIsAnError)
+{
+    unit.set("UNIT_ENVIRONMENT", "LANG=de_DE.UTF-8");
+    unit.replaceTool("apt-cache", "[ \"$LANG\" = de_DE.UTF-8 ] || exit 1\n"
+                                  "printf 'apt:\\n  Installiert:           2.6.1\\n  Installationskandidat: 2.6.1\\n'");
+    EXPECT_EQ(findings(), Lines{"error policy-words"});
+    EXPECT_THAT(what(), HasSubstr("locale \"LANG=de_DE.UTF-8\""));
+}
+
+TEST_F(UnitCheck, UnknownPackageIsAWarning)
+{
+    unit.set("PACKAGE_KNOWN", "false");
+    EXPECT_EQ(findings(), Lines{"warning package-unknown"});
+}
+
+TEST_F(UnitCheck, PackageToolWithoutAnswerLeavesThePackageUnchecked)
+{
+    unit.replaceTool("apt-cache", "");
+    EXPECT_EQ(findings(), Lines{"unchecked package-unknown"});
+}
+
+TEST_F(UnitCheck, PackageWithoutASourceIsAWarning)
+{
+    unit.set("PACKAGE_OFFERED", "(none)");
+    EXPECT_EQ(findings(), Lines{"warning package-not-offered"});
+}
+
+TEST_F(UnitCheck, FreeSpaceThatCannotBeReadIsUnchecked)
+{
+    UnitSite site = unit.site();
+    site.root = unit.folder.path("nowhere");
+    EXPECT_THAT(check(site).findings, Contains("unchecked space-unknown"));
+}
+
+TEST(UnitDisk, SpaceForThePackageIsEnough)
+{
+    EXPECT_EQ(checkDisk(diskWith(200'000'000), 150'000'000), Lines());
+}
+
+TEST(UnitDisk, LessSpaceThanThePackageNeedsIsFull)
+{
+    EXPECT_EQ(checkDisk(diskWith(200'000'000), 200'000'001), Lines{"error disk-full"});
+}
+
+TEST(UnitDisk, NoRoomForAFileIsFull)
+{
+    struct statvfs system = diskWith(200'000'000);
+    system.f_favail = 0;
+    EXPECT_EQ(checkDisk(system, 0), Lines{"error disk-full"});
+    system.f_files = 0; // files are not counted
+    EXPECT_EQ(checkDisk(system, 0), Lines());
+}
+
+TEST(UnitDisk, LittleSpaceIsAWarning)
+{
+    EXPECT_EQ(checkDisk(diskWith(99'999'999), 0), Lines{"warning disk-almost-full"});
+}
+
+TEST(UnitDisk, DiskThatIsReadOnlyIsAnError)
+{
+    struct statvfs system = diskWith(200'000'000);
+    system.f_flag = ST_RDONLY;
+    EXPECT_EQ(checkDisk(system, 0), Lines{"error disk-read-only"});
+}
+
+// Mirrors
+
+TEST_F(UnitCheck, MirrorsAreFetchedWithTheUpdatersTimeOut)
+{
+    check();
+    EXPECT_THAT(unit.calls(),
+                Contains(testing::AllOf(HasSubstr("Acquire::http::Timeout=2 -o Acquire::https::Timeout=2 download-file "
+                                                  "http://mirror.invalid/dists/stable/InRelease "),
+                                        HasSubstr("Acquire::Retries=0"))));
+}
+
+TEST_F(UnitCheck, SilentMirrorIsAnErrorThatExplainsTheExitStatus)
+{
+    unit.set("MIRRORS_REFRESH", "unreachable");
+    const Outcome outcome = check();
+    EXPECT_EQ(outcome.findings, Lines{"error mirror-silent"});
+    EXPECT_THAT(outcome.report["findings"][0]["what"].get<std::string>(),
+                HasSubstr("does not answer: \"Could not resolve 'mirror.invalid'\""));
+    EXPECT_THAT(outcome.report["findings"][0]["effect"].get<std::string>(), HasSubstr("\"apt update\" ends with 0"));
+}
+
+TEST_F(UnitCheck, MirrorWithoutTheIndexIsAWarning)
+{
+    unit.folder.put("root/usr/lib/apt/helper",
+                    "#!/bin/sh\necho 'E: Failed to fetch http://mirror.invalid/dists/stable/InRelease  404  Not Found "
+                    "[IP: 192.0.2.1 80]' >&2\nexit 100\n",
+                    0755);
+    fs::rename(unit.folder.path("root/usr/lib/apt/helper"), unit.folder.path("root/usr/lib/apt/apt-helper"));
+    EXPECT_EQ(findings(), Lines{"warning mirror-index"});
+}
+
+TEST_F(UnitCheck, UnitWithoutSourcesIsAnError)
+{
+    unit.replaceTool("apt-get", "");
+    EXPECT_EQ(findings(), Lines{"error mirrors-none"});
+}
+
+TEST_F(UnitCheck, SourcesThatCannotBeReadAreAnError)
+{
+    unit.replaceTool("apt-get", "echo 'E: Malformed entry 1 in list file' >&2; exit 100");
+    EXPECT_EQ(findings(), Lines{"error mirrors-unreadable"});
+    unit.removeTool("apt-get");
+    EXPECT_EQ(findings(), Lines{"unchecked mirrors-unreadable"});
+}
+
+TEST_F(UnitCheck, WithoutFetcherOrTemporaryFolderTheMirrorsAreUnchecked)
+{
+    unit.remove("usr/lib/apt/apt-helper");
+    EXPECT_EQ(findings(), Lines{"unchecked mirrors-unknown"});
+    unit.remove("tmp");
+    EXPECT_EQ(findings(), Lines{"unchecked mirrors-unknown"});
+}

@@ -194,7 +194,7 @@ class OtherCommands(unittest.TestCase):
             ("tests/reliability/threads", numbers),
             ("fuzz/run", numbers),
             ("tests/companion/log/throughput", numbers),
-            ("benchmarks/processes", numbers[:-1]),
+            ("performance/processes", numbers[:-1]),
             ("tests/reliability/interruption_real", names),
             ("tests/companion/log/make-golden", names),
             ("tests/companion/make-golden-checks", names),

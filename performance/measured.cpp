@@ -1,4 +1,4 @@
-/// Preloaded into the updater, or a program that it is compared with, by benchmarks/processes, and into none of their
+/// Preloaded into the updater, or a program that it is compared with, by performance/processes, and into none of their
 /// children. Takes the waits out, and at the end writes what the process itself cost to the file named by MEASURED:
 /// its CPU time without its children's (s), and its peak of memory (KiB).
 ///

@@ -2,10 +2,10 @@
 
 import re
 
-from expected import expected_commands, expected_log
-from observe import Run, now
-from scenario import Scenario
-from session import Result
+from bench.expected import expected_commands, expected_log
+from bench.observation import Run, now
+from bench.runner import Result
+from bench.scenario import Scenario
 
 
 def seen_log(run: Run) -> list[str]:

@@ -4,10 +4,10 @@ import os
 import sys
 from dataclasses import dataclass
 
-from observe import Run, now
-from panel import color_name, led_name
-from scenario import Scenario
-from session import Result
+from bench.observation import Run, now
+from bench.panel import color_name, led_name
+from bench.runner import Result
+from bench.scenario import Scenario
 
 ANSI = {"off": "2", "blue": "1;34", "pass": "1;32", "fail": "1;31"}
 OTHER_COLOR = "1;35"

@@ -1,12 +1,13 @@
 """Scenario files: what a unit is like before an update, and what must come out. docs/bench.md tells how to add one."""
 
 import re
-import tomllib
 from dataclasses import dataclass
 from pathlib import Path
 from typing import Any
 
-from expected import expected_commands, expected_log
+import tomllib
+
+from bench.expected import expected_commands, expected_log
 
 FOLDER = Path(__file__).parent / "scenarios"
 TOOLS = ["systemctl", "umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp", "i2cset", "aplay"]

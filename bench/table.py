@@ -6,10 +6,10 @@ import time
 from concurrent.futures import ThreadPoolExecutor, as_completed
 from dataclasses import dataclass
 
-from compare import differences
-from scenario import Scenario
-from session import NotServed, UnitMaker, run_on, temporary_folder
-from unit import UnitError
+from bench.compare import differences
+from bench.runner import NotServed, UnitMaker, run_on, temporary_folder
+from bench.scenario import Scenario
+from bench.unit import UnitError
 
 
 @dataclass

@@ -10,11 +10,11 @@ import subprocess
 import sys
 import time
 
-import scenario
-from build import BUILD, build
-from compare import differences
-from session import UnitMaker, run_on, temporary_folder
-from unit import UnitError
+from bench import scenario
+from bench.build import BUILD, build
+from bench.compare import differences
+from bench.runner import UnitMaker, run_on, temporary_folder
+from bench.unit import UnitError
 
 SPEED = 300
 GOALS = {"up-to-date": 3.0, "package-and-board": 8.0}  # s

@@ -26,8 +26,8 @@ class Files:
     """Where a unit writes what happens, each file appended to while the updater runs and read as it grows.
 
     `log`: the updater's standard output.
-    `calls`: what bench/tap.cpp, preloaded into the updater alone, writes: one line for each start and each end of a
-    `system`, a `popen`/`pclose` or a `nanosleep` of the updater. Its path is in BENCH_CALLS.
+    `calls`: what bench/call_recorder.cpp, preloaded into the updater alone, writes: one line for each start and end
+    of a `system`, a `popen`/`pclose` or a `nanosleep` of the updater. Its path is in BENCH_CALLS.
     `panel`: one line for each byte that reached the LED controller: seconds of CLOCK_BOOTTIME, a blank, two hex digits.
     """
 

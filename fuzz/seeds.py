@@ -9,9 +9,7 @@ import sys
 import zipfile
 from pathlib import Path
 
-sys.path.insert(0, str(Path(__file__).parents[1] / "bench"))
-
-import scenario
+from bench import scenario
 
 MARKER = "/root/USB_MOUNT/debs/installTV\n"
 

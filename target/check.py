@@ -3,11 +3,11 @@
 import math
 import re
 
-from compare import differences
-from observe import Call
-from outcome import Outcome
-from panel import Panel, color_name, led_name
-from plan import Plan
+from bench.compare import differences
+from bench.observation import Call
+from bench.panel import Panel, color_name, led_name
+from target.outcome import Outcome
+from target.plan import Plan
 
 IDENTIFIER = "harl-updater"
 

@@ -8,7 +8,7 @@ import subprocess
 import tarfile
 from pathlib import Path
 
-from plan import Plan
+from target.plan import Plan
 
 ROOT = Path(__file__).parent.parent
 RATE = 8000  # Hz, of both sounds; the loopback card takes it unchanged
@@ -158,7 +158,7 @@ def write_head(folder: Path, image: Path) -> None:
 def build_recorder(library: Path) -> None:
     """Builds the bench's recorder of commands and waits for the unit."""
     compiler = ["arm-linux-gnueabihf-g++-11", "-std=c++17", "-O2", "-shared", "-fPIC"]
-    run(*compiler, "-o", library, ROOT / "bench/tap.cpp", "-ldl")
+    run(*compiler, "-o", library, ROOT / "bench/call_recorder.cpp", "-ldl")
 
 
 def write_input(
@@ -169,7 +169,7 @@ def write_input(
     folder.mkdir()
     write_head(folder / "root", image)
     write_stick(folder / "stick.img", folder / "stick")
-    build_recorder(folder / "tap.so")
+    build_recorder(folder / "call_recorder.so")
     shutil.copy(Path(__file__).parent / "guest/main", folder / "main")
     shutil.copy(updater, folder / "harl-updater.deb")
     (folder / "names").write_text("".join(f"{plan.name}\n" for plan in plans))

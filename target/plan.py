@@ -2,13 +2,14 @@
 
 import copy
 import re
-import tomllib
 from dataclasses import dataclass
 from pathlib import Path
 from typing import Any
 
-import scenario as bench
-from expected import expected_log
+import tomllib
+
+from bench import scenario as bench
+from bench.expected import expected_log
 
 FOLDER = Path(__file__).parent / "scenarios"
 

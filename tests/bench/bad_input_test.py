@@ -8,10 +8,10 @@ import tempfile
 import unittest
 from pathlib import Path
 
-ROOT = Path(__file__).parents[2]
-sys.path.insert(0, str(ROOT / "bench"))
+from bench.expected import BLOCKS, COMMANDS
 
-from expected import BLOCKS, COMMANDS
+ROOT = Path(__file__).parents[2]
+
 
 GOOD = (ROOT / "bench/scenarios/up-to-date.toml").read_text()
 
@@ -28,7 +28,7 @@ class BadInput(unittest.TestCase):
         (self.build / "harl-updater").touch()
 
     def bench(self, *arguments: str | Path, **variables: str) -> tuple[int, str, str]:
-        command = [sys.executable, "-B", ROOT / "bench/main.py", *arguments]
+        command = [sys.executable, "-B", "-m", "bench", *arguments]
         done = subprocess.run(command, env=os.environ | variables, capture_output=True, text=True, check=False)
         return done.returncode, done.stdout, done.stderr
 
@@ -158,7 +158,7 @@ class BadInput(unittest.TestCase):
         self.assertEqual((status, message.count("\n")), (1, 1))
 
     def test_too_little_space(self) -> None:
-        bench = f"{sys.executable} -B {ROOT}/bench/main.py --build {self.build} --unit stand-in up-to-date"
+        bench = f"{sys.executable} -B -m bench --build {self.build} --unit stand-in up-to-date"
         small = self.folder / "small"
         small.mkdir()
         script = f"mount -t tmpfs -o size=3m small {small} || exit 77; TMPDIR={small} exec {bench}"

@@ -13,19 +13,19 @@ import tempfile
 import unittest
 from pathlib import Path
 
-ROOT = Path(__file__).parents[2]
-sys.path.insert(0, str(ROOT / "bench"))
+from bench.observation import Run
+from bench.terminal import LiveDisplay
+from bench.unit import Files, State
 
-from live import LiveDisplay
-from observe import Run
-from unit import Files, State
+ROOT = Path(__file__).parents[2]
+
 
 BUILD = ROOT / "build/default"
 COLOR = re.compile(r"\x1b\[[0-9;]*m")
 
 
 def command(*arguments: str) -> list[str]:
-    return [sys.executable, "-B", f"{ROOT}/bench/main.py", "--build", str(BUILD), "--unit", "stand-in", *arguments]
+    return [sys.executable, "-B", "-m", "bench", "--build", str(BUILD), "--unit", "stand-in", *arguments]
 
 
 def on_terminal(scenario: str, **variables: str) -> str:

@@ -11,15 +11,15 @@ import time
 import unittest
 from pathlib import Path
 
-ROOT = Path(__file__).parents[2]
-sys.path.insert(0, str(ROOT / "bench"))
+from bench.real.unit import forbidden
+from bench.runner import CLEANUP
 
-from session import GUARD
-from unit_real import forbidden
+ROOT = Path(__file__).parents[2]
+
 
 KINDS = ["stand-in"] if forbidden() else ["real", "stand-in"]
 BUILD = ROOT / "build/default"
-COMMAND = [sys.executable, "-B", ROOT / "bench/main.py"]
+COMMAND = [sys.executable, "-B", "-m", "bench"]
 INSTRUMENT = ["/root/USB_MOUNT", "/root/RESOURCES", "/unzipUpgrade.sh", "/opt/bench", "/run/harl"]
 LONGEST_CLEARING = 60  # s
 
@@ -124,7 +124,7 @@ class HostTest(unittest.TestCase):
         folder.mkdir()
         with subprocess.Popen(["sleep", "60"], start_new_session=True) as left:
             (folder / "unit.pid").write_text(f"{left.pid}\n")
-            guard = [sys.executable, "-I", "-S", GUARD, folder]
+            guard = [sys.executable, "-I", "-S", CLEANUP, folder]
             # No program on its search path.
             subprocess.run(guard, env={"PATH": self.folder}, stdin=subprocess.DEVNULL, check=True)
             self.assertEqual(left.wait(), -signal.SIGKILL)

@@ -11,14 +11,14 @@ import unittest
 from html.parser import HTMLParser
 from pathlib import Path
 
+from bench import page as record
+from bench.observation import Run
+from bench.panel import STEP_TIME
+from bench.unit import Files
+
 ROOT = Path(__file__).parents[2]
 BUILD = ROOT / "build/default"
-sys.path.insert(0, str(ROOT / "bench"))
 
-import record
-from observe import Run
-from panel import STEP_TIME
-from unit import Files
 
 BLUE, PASS = record.FILLS["blue"], record.FILLS["pass"]
 
@@ -54,7 +54,7 @@ def written(scenario: str, folder: str) -> str:
     """The page of a run of `scenario` on stand-ins."""
     file = Path(folder) / "page.html"
     arguments = ["--build", BUILD, "--unit", "stand-in", "--speed", "2000", "--record", file, scenario]
-    command = [sys.executable, "-B", ROOT / "bench/main.py", *arguments]
+    command = [sys.executable, "-B", "-m", "bench", *arguments]
     done = subprocess.run(command, env=os.environ | {"TMPDIR": folder}, capture_output=True, text=True, check=False)
     assert file.exists(), done.stdout + done.stderr
     assert f"\nPage: {file}\n" in done.stdout

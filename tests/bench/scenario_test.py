@@ -6,13 +6,11 @@ Runs the scenario on a unit of the kind UNIT and compares what comes out with wh
 import sys
 from pathlib import Path
 
-sys.path.insert(0, str(Path(__file__).parents[2] / "bench"))
-
-import scenario
-from compare import differences
-from session import NotServed, UnitMaker, run_on, temporary_folder
-from systemd import obstacle
-from unit_real import forbidden
+from bench import scenario
+from bench.compare import differences
+from bench.real.systemd import obstacle
+from bench.real.unit import forbidden
+from bench.runner import NotServed, UnitMaker, run_on, temporary_folder
 
 SPEED = 2000  # times shorter waits, each 0.2 s at least
 SKIPPED = 77

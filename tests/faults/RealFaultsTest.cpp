@@ -178,7 +178,7 @@ void RealRun::start()
     setpgid(0, 0);
     const std::string path = "PATH=" + (mFolder / "bin").string();
     const std::string calls = "BENCH_CALLS=" + (mFolder / "calls").string();
-    const char* environment[] = {path.c_str(), calls.c_str(), "BENCH_SPEED=2000", "LD_PRELOAD=" TAP, nullptr};
+    const char* environment[] = {path.c_str(), calls.c_str(), "BENCH_SPEED=2000", "LD_PRELOAD=" CALL_RECORDER, nullptr};
     const int log = open((mFolder / "log").c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
     dup2(open("/dev/null", O_RDWR), STDIN_FILENO);
     dup2(STDIN_FILENO, STDERR_FILENO);

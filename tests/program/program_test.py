@@ -7,14 +7,12 @@ import sys
 import unittest
 from pathlib import Path
 
-sys.path.insert(0, str(Path(__file__).parents[2] / "bench"))
-
-import scenario
-from compare import differences
-from observe import RECORD, Call
-from panel import FIRST_LED, LAST_LED
-from session import Result, run_on, temporary_folder
-from unit_standin import StandInUnit
+from bench import scenario
+from bench.compare import differences
+from bench.observation import RECORD, Call
+from bench.panel import FIRST_LED, LAST_LED
+from bench.runner import Result, run_on, temporary_folder
+from bench.standin.unit import StandInUnit
 
 SPEED = 2000  # times shorter waits, each 0.2 s at least
 

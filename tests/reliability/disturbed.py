@@ -6,10 +6,10 @@ import os
 import shutil
 from pathlib import Path
 
-from compare import seen_log
-from scenario import Scenario
-from session import Result
-from unit_standin import StandInUnit
+from bench.compare import seen_log
+from bench.runner import Result
+from bench.scenario import Scenario
+from bench.standin.unit import StandInUnit
 
 SPEED = 2000  # times shorter waits, each 0.2 s at least
 
@@ -25,11 +25,11 @@ class DisturbedUnit(StandInUnit):
                  runner: str = "") -> None:
         wrapped = folder / "build"
         (wrapped / "bench").mkdir(parents=True)
-        shutil.copy(build / "bench/tap.so", wrapped / "bench")
+        shutil.copy(build / "bench/call_recorder.so", wrapped / "bench")
         shutil.copy(build / "harl-updater", wrapped / "updater")
         script = f"""#!/bin/sh
 {circumstances}
-exec {runner} /usr/bin/env LD_PRELOAD={wrapped}/bench/tap.so {wrapped}/updater {redirection}
+exec {runner} /usr/bin/env LD_PRELOAD={wrapped}/bench/call_recorder.so {wrapped}/updater {redirection}
 """
         (wrapped / "harl-updater").write_text(script)
         (wrapped / "harl-updater").chmod(0o755)

@@ -13,12 +13,10 @@ from dataclasses import dataclass
 from functools import cache
 from pathlib import Path
 
-sys.path.insert(0, str(Path(__file__).parents[2] / "bench"))
-
-import scenario
-from disturbed import SPEED, DisturbedUnit, outcome
-from session import run_on, temporary_folder
-from unit import State
+from bench import scenario
+from bench.runner import run_on, temporary_folder
+from bench.unit import State
+from tests.reliability.disturbed import SPEED, DisturbedUnit, outcome
 
 BUILD = Path()
 AT_ONCE = 4

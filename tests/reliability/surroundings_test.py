@@ -13,14 +13,12 @@ import time
 import unittest
 from pathlib import Path
 
-sys.path.insert(0, str(Path(__file__).parents[2] / "bench"))
-
-import scenario
-from compare import differences
-from disturbed import SPEED, DisturbedUnit
-from expected import COMMANDS
-from observe import Run
-from session import Result, run_on, temporary_folder
+from bench import scenario
+from bench.compare import differences
+from bench.expected import COMMANDS
+from bench.observation import Run
+from bench.runner import Result, run_on, temporary_folder
+from tests.reliability.disturbed import SPEED, DisturbedUnit
 
 BUILD = Path()
 PLAIN_USER = 60000 + os.getpid() % 5000  # has no processes of its own, nor any of another run of this test

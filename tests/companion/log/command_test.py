@@ -20,13 +20,11 @@ import unittest
 from html.parser import HTMLParser
 from pathlib import Path
 
+from bench import scenario
+
 ROOT = Path(__file__).resolve().parents[3]
-GOLDEN = Path(__file__).resolve().parent / "golden/log"
+GOLDEN = ROOT / "tests/companion/golden/log"
 TOOL = ""
-
-sys.path.insert(0, str(ROOT / "bench"))
-
-import scenario  # noqa: E402
 
 
 def run_tool(*arguments: str, text: bytes = b"", **options) -> subprocess.CompletedProcess:

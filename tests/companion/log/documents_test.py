@@ -12,7 +12,7 @@ import unittest
 from pathlib import Path
 
 ROOT = Path(__file__).resolve().parents[3]
-GOLDEN = Path(__file__).resolve().parent / "golden/log"
+GOLDEN = ROOT / "tests/companion/golden/log"
 OPERATOR = (ROOT / "docs/operator.md").read_text()
 TECHNICIAN = (ROOT / "docs/technician.md").read_text()
 FEEDBACK = (ROOT / "remote/RemoteUpdateManager.cpp").read_text()
@@ -210,7 +210,8 @@ class Names(unittest.TestCase):
             self.assertTrue(all(row), row)
 
     def test_names_elsewhere_are_in_that_table_or_a_check_of_stick_or_unit(self) -> None:
-        checks = "".join(file.read_text() for file in (ROOT / "companion").glob("**/*.cpp") if file.parent.name != "log")
+        sources = (ROOT / "companion").glob("**/*.cpp")
+        checks = "".join(file.read_text() for file in sources if file.parent.name != "log")
         elsewhere = set(re.findall(r"`\[?([a-z]+(?:-[a-z]+)+)\]?`", TECHNICIAN)) - set(self.remedies) - {
             "harl-updater-tool", "apt-cache", "ssh-copy-id"}
         self.assertGreater(len(elsewhere), 3)

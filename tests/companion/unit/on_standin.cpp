@@ -1,5 +1,5 @@
 // Usage: unit-on-standin [NAME=VALUE...]
-// Runs the check of `harl-updater-tool unit` on a stand-in unit with these settings of unit_standins.sh.
+// Runs the check of `harl-updater-tool unit` on a stand-in unit with these settings of standins.sh.
 
 #include "unit/unit.h"
 

@@ -23,14 +23,14 @@ private:
     pid_t mProcess;
 };
 
-/// A unit that is fit for an update, in a temporary folder: the tools of unit_standins.sh and a few files. Everything
+/// A unit that is fit for an update, in a temporary folder: the tools of standins.sh and a few files. Everything
 /// that the check reads is there; nothing of this machine is.
 class StandInUnit
 {
 public:
     StandInUnit();
 
-    /// Changes a setting of unit_standins.sh. The bench's settings HEAD_SOUND, TOOLS_MISSING and PACKAGE_INSTALL=locked
+    /// Changes a setting of standins.sh. The bench's settings HEAD_SOUND, TOOLS_MISSING and PACKAGE_INSTALL=locked
     /// also change files.
     void set(const std::string& name, const std::string& value);
 

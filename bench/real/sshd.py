@@ -8,7 +8,7 @@ import tempfile
 from dataclasses import dataclass
 from pathlib import Path
 
-from unit import UnitError
+from bench.unit import UnitError
 
 PACKAGES = ["openssh-server", "openssh-sftp-server", "libwrap0"]  # an installed openssh-server would start a server
 

@@ -1,8 +1,8 @@
 #!/bin/sh
-# The real unit, in namespaces of its own: unit_real.py runs this as their first process, and everything ends with it.
+# The real unit, in namespaces of its own: unit.py runs this as their first process, and everything ends with it.
 #
 # Usage: unit.sh FOLDER
-# FOLDER holds what unit_real.py has prepared: `head`, `board` and `stick` with the files of each, `variables` with the
+# FOLDER holds what unit.py has prepared: `head`, `board` and `stick` with the files of each, `variables` with the
 # scenario, and `out` for what the unit writes. The roots lie in a tmpfs that only these namespaces see.
 set -eu
 
@@ -11,7 +11,7 @@ folder=$1
 here=$(dirname "$0")
 head=$folder/unit/head
 board=$folder/unit/board
-# shellcheck disable=SC1091 # made by unit_real.py
+# shellcheck disable=SC1091 # made by unit.py
 . "$folder/variables"
 
 fail() {
@@ -179,6 +179,6 @@ if [ -n "$BENCH_CONTROL_GROUP" ]; then
 else
     mkfifo "$folder/out/again"
     run_updater
-    # unit_real.py still looks at the unit, then ends it. A line in `again` asks for one more run on the unit as it is.
+    # unit.py still looks at the unit, then ends it. A line in `again` asks for one more run on the unit as it is.
     while read -r _ <"$folder/out/again"; do run_updater; done
 fi

@@ -14,12 +14,11 @@ import time
 import wave
 from pathlib import Path
 
-import sshd
-import systemd
-from guard import remove_control_group
-from scenario import Scenario, variables
-from unit import PROGRAMS, Files, State, UnitError, with_pid_file
-from unit_real_files import HERE, SOUND_LENGTH, SOUNDS, head_package, search_path, write_board, write_head, write_stick
+from bench.cleanup import remove_control_group
+from bench.real import sshd, systemd
+from bench.real.files import HERE, SOUND_LENGTH, SOUNDS, head_package, search_path, write_board, write_head, write_stick
+from bench.scenario import Scenario, variables
+from bench.unit import PROGRAMS, Files, State, UnitError, with_pid_file
 
 NAMESPACES = ["unshare", "--mount", "--net", "--ipc", "--uts", "--pid", "--fork", "--kill-child", "--mount-proc"]
 ONE_USER = "--map-root-user"  # needs no right of root's; systemd does
@@ -131,13 +130,14 @@ class RealUnit:
     def _add_programs(self) -> str:
         """Puts the programs on the head. Returns the command that runs the updater there."""
         program = PROGRAMS[self._settings["updater"]["program"]]
-        for file in (program, "bench/tap.so", "bench/i2c_bus.so"):
+        for file in (program, "bench/call_recorder.so", "bench/i2c_bus.so"):
             shutil.copy(self._build / file, self._folder / "head/opt/bench")
         words = ["/usr/bin/env", "-i"]
         if self._settings["updater"]["children"] == "ignored":
             words.append("--ignore-signal=CHLD")
-        words += ["HOME=/root", "LANG=C.UTF-8", f"PATH={search_path(self._settings)}", "LD_PRELOAD=/opt/bench/tap.so"]
-        words += ["BENCH_CALLS=/opt/bench/out/calls", f"BENCH_SPEED={self._speed}"]
+        words += ["HOME=/root", "LANG=C.UTF-8", f"PATH={search_path(self._settings)}"]
+        words += ["LD_PRELOAD=/opt/bench/call_recorder.so", "BENCH_CALLS=/opt/bench/out/calls"]
+        words.append(f"BENCH_SPEED={self._speed}")
         if self._settings["head"]["panel"] == "present":
             words.append("BENCH_PANEL=/opt/bench/out/panel")
         return " ".join([*words, f"/opt/bench/{program.name}", *self._settings["updater"]["arguments"]])

@@ -5,8 +5,8 @@ import time
 from dataclasses import dataclass, field
 from pathlib import Path
 
-from panel import Panel
-from unit import Files
+from bench.panel import Panel
+from bench.unit import Files
 
 # First line of a record: time, thread, source position, function. The message is all up to the next first line.
 RECORD = re.compile(

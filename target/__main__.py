@@ -11,17 +11,17 @@ import time
 from pathlib import Path
 from typing import IO
 
+from bench.panel import Panel
+from bench.scenario import ScenarioError
+from target.check import check, check_cut
+from target.inputs import write_input
+from target.machine import MachineError, boot
+from target.outcome import Outcome, read, read_bus
+from target.plan import Plan, PlanError, load, names
+
 HERE = Path(__file__).parent
 ROOT = HERE.parent
-sys.path.insert(1, str(ROOT / "bench"))  # its scenarios, its panel and its comparison serve here too
 
-from check import check, check_cut
-from inputs import write_input
-from machine import MachineError, boot
-from outcome import Outcome, read, read_bus
-from panel import Panel
-from plan import Plan, PlanError, load, names
-from scenario import ScenarioError
 
 WORK = ROOT / "build/target"
 PACKAGED = ["CMakeLists.txt", "cmake", "common", "debian", "companion", "docs/man", "packaging", "remote", "service"]

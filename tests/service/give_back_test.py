@@ -8,10 +8,10 @@ import tempfile
 import unittest
 from pathlib import Path
 
-ROOT = Path(__file__).parents[2]
-sys.path.insert(0, str(ROOT / "bench"))
+from bench.panel import Panel, color_name, led_name
 
-from panel import Panel, color_name, led_name
+ROOT = Path(__file__).parents[2]
+
 
 SKIPPED = 77
 NAMESPACES = ["unshare", "--map-root-user", "--mount", "--pid", "--fork", "--kill-child", "--mount-proc"]

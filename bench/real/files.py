@@ -10,10 +10,10 @@ import zipfile
 from pathlib import Path
 from typing import Any
 
-from packages import package
-from scenario import TOOLS
+from bench.real.packages import package
+from bench.scenario import TOOLS
 
-HERE = Path(__file__).parent / "unit_real"
+HERE = Path(__file__).parent
 SOUNDS = {"SND_RESULT_PASS.wav": 880, "SND_RESULT_FAIL.wav": 220}  # Hz
 SOUND_LENGTH = 1.5  # s
 ARCHIVE_PAYLOAD = 200_000  # bytes; more than a full board has left

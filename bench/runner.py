@@ -11,12 +11,12 @@ from collections.abc import Callable, Iterator
 from dataclasses import dataclass
 from pathlib import Path
 
-import systemd
-from observe import Run, now
-from scenario import Scenario
-from unit import State, Unit, UnitError
-from unit_real import RealUnit, forbidden
-from unit_standin import StandInUnit
+from bench.observation import Run, now
+from bench.real import systemd
+from bench.real.unit import RealUnit, forbidden
+from bench.scenario import Scenario
+from bench.standin.unit import StandInUnit
+from bench.unit import State, Unit, UnitError
 
 # best: real where this machine allows it. real: with systemd where this machine allows that.
 KINDS = ["best", "real", "real-without-systemd", "stand-in"]
@@ -24,7 +24,7 @@ POLL = 0.02  # s
 LONGEST_RUN = 120  # s, besides the waits; a run that takes longer hangs
 SPACE = 20  # MB, that a unit may take in its temporary folder
 WAITS = 820  # s, of an update at full length
-GUARD = Path(__file__).with_name("guard.py")
+CLEANUP = Path(__file__).with_name("cleanup.py")
 
 
 @dataclass
@@ -51,7 +51,7 @@ def temporary_folder() -> Iterator[Path]:
     folder = tempfile.mkdtemp(prefix="bench-")
     try:
         guard = subprocess.Popen(
-            [sys.executable, "-I", "-S", GUARD, folder],
+            [sys.executable, "-I", "-S", CLEANUP, folder],
             stdin=subprocess.PIPE,
             stderr=subprocess.DEVNULL,
             start_new_session=True,

@@ -1,4 +1,4 @@
-"""The stand-in unit: the updater runs on this machine, with a search path that holds only the tools of standins.sh."""
+"""The stand-in unit: the updater runs on this machine, with a search path that holds only the tools of tools.sh."""
 
 import os
 import re
@@ -6,8 +6,8 @@ import signal
 import subprocess
 from pathlib import Path
 
-from scenario import TOOLS, Scenario, variables
-from unit import PROGRAMS, Files, State, with_pid_file
+from bench.scenario import TOOLS, Scenario, variables
+from bench.unit import PROGRAMS, Files, State, with_pid_file
 
 HERE = Path(__file__).parent
 
@@ -93,7 +93,7 @@ class StandInUnit:
         tools.mkdir()
         for tool in TOOLS:
             if tool not in self._settings["tools"]["missing"]:
-                (tools / tool).symlink_to(HERE / "standins.sh")
+                (tools / tool).symlink_to(HERE / "tools.sh")
 
     def _make_board(self) -> None:
         board = self._settings["board"]
@@ -137,7 +137,7 @@ class StandInUnit:
         if self._settings["updater"]["children"] == "ignored":
             env.append("--ignore-signal=CHLD")
         program = self._build / PROGRAMS[self._settings["updater"]["program"]]
-        env.append("LD_PRELOAD=" + ":".join([*sanitizers(program), str(self._build / "bench/tap.so")]))
+        env.append("LD_PRELOAD=" + ":".join([*sanitizers(program), str(self._build / "bench/call_recorder.so")]))
         with self.files.log.open("wb") as log, (self._folder / "errors").open("wb") as errors:
             self._updater = subprocess.Popen(
                 with_pid_file(self._folder, [*env, program, *self._settings["updater"]["arguments"]]),

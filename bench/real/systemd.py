@@ -1,6 +1,6 @@
 """The real unit's systemd: first process of the head, with the updater and the instrument's application as services.
 
-It needs root and a control group; elsewhere unit_real/head/systemctl stands in for it.
+It needs root and a control group; elsewhere real/head/systemctl stands in for it.
 """
 
 import contextlib
@@ -8,7 +8,7 @@ import os
 import subprocess
 from pathlib import Path
 
-from unit_real_files import Settings, write
+from bench.real.files import Settings, write
 
 PROGRAM = Path("/lib/systemd/systemd")
 ENDED = "bench: the updater has ended: "  # the journal's line behind the updater's last one
@@ -65,7 +65,7 @@ def obstacle() -> str:
 
 
 def make_control_group(folder: Path) -> Path:
-    """A control group for the head, named in the file `control-group` of the folder; see guard.py."""
+    """A control group for the head, named in the file `control-group` of the folder; see cleanup.py."""
     parent = _own_control_group()
     assert parent
     group = parent / f"{folder.parent.name}-{folder.name}"

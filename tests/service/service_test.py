@@ -14,12 +14,12 @@ import unittest
 from collections.abc import Callable
 from pathlib import Path
 
-ROOT = Path(__file__).parents[2]
-sys.path.insert(0, str(ROOT / "bench"))
+from bench.machine.machine import Machine, MachineError, machine
+from bench.observation import RECORD
+from bench.panel import Panel, color_name, led_name
 
-from machine import Machine, MachineError, machine
-from observe import RECORD
-from panel import Panel, color_name, led_name
+ROOT = Path(__file__).parents[2]
+
 
 SKIPPED = 77
 SPEED = 10  # times shorter waits of the updater
@@ -74,7 +74,7 @@ def make_files(unit: Machine, package: Path, build: Path) -> None:
         (files / folder).mkdir(parents=True)
     write(files / "var/lib/dpkg/status", "")
     shutil.copy(package, files / "srv/updater.deb")
-    shutil.copy(build / "bench/tap.so", files / "opt")
+    shutil.copy(build / "bench/call_recorder.so", files / "opt")
     shutil.copy(unit.system / "usr/bin/sleep", files / "opt/scp")
 
 
@@ -141,7 +141,8 @@ class ServiceTest(unittest.TestCase):
 
     def set_speed(self, speed: int) -> None:
         """Shortens the updater's waits, not those of its children."""
-        text = f"[Service]\nEnvironment=LD_PRELOAD=/opt/tap.so BENCH_SPEED={speed} BENCH_CALLS=/var/log/calls\n"
+        variables = f"LD_PRELOAD=/opt/call_recorder.so BENCH_SPEED={speed} BENCH_CALLS=/var/log/calls"
+        text = f"[Service]\nEnvironment={variables}\n"
         folder = self.unit.root() / "etc/systemd/system/harl-updater.service.d"
         if self.package.endswith("-static"):  # which no library can be loaded into
             text = ""

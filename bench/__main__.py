@@ -8,15 +8,15 @@ import subprocess
 import sys
 from pathlib import Path
 
-import scenario
-from build import BUILD, build
-from compare import differences
-from display import PlainDisplay, Summary, print_summary, terminal
-from live import LiveDisplay
-from record import page
-from session import KINDS, UnitMaker, run_on, temporary_folder
-from table import run_all
-from unit import PROGRAMS, UnitError
+from bench import scenario
+from bench.build import BUILD, build
+from bench.compare import differences
+from bench.display import PlainDisplay, Summary, print_summary, terminal
+from bench.page import page
+from bench.runner import KINDS, UnitMaker, run_on, temporary_folder
+from bench.table import run_all
+from bench.terminal import LiveDisplay
+from bench.unit import PROGRAMS, UnitError
 
 
 def run(maker: UnitMaker, what: scenario.Scenario, record: Path | None) -> int:

@@ -4,10 +4,10 @@ import contextlib
 import sys
 import time
 
-from display import paint
-from observe import Run, now
-from panel import color_name, led_name
-from unit import State, Unit, UnitError
+from bench.display import paint
+from bench.observation import Run, now
+from bench.panel import color_name, led_name
+from bench.unit import State, Unit, UnitError
 
 REDRAW = 0.1  # s
 LOOK = 0.3  # s, between two looks at the unit's lasting things

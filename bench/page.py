@@ -6,9 +6,9 @@ from html import escape
 from itertools import pairwise
 from string import Template
 
-from display import Summary
-from observe import Call, Run, now
-from panel import STEP_UNIT, Panel, color_name, led_name
+from bench.display import Summary
+from bench.observation import Call, Run, now
+from bench.panel import STEP_UNIT, Panel, color_name, led_name
 
 WIDTH = 1200  # of the timeline; all lengths are in the drawing's own unit
 LEFT = 90  # of the time axis; before it stand the names of the LEDs

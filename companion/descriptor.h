@@ -12,7 +12,7 @@ public:
     ~Descriptor()
     {
         if (mNumber >= 0) {
-            close(mNumber);
+            ::close(mNumber);
         }
     }
     Descriptor(Descriptor&& other) noexcept : mNumber(std::exchange(other.mNumber, -1)) {}

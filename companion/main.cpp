@@ -1,7 +1,8 @@
 #include "findings.h"
-#include "log/log.h"
-#include "stick/stick.h"
-#include "unit/unit.h"
+#include "log/log_command.h"
+#include "procedure.h"
+#include "stick/stick_check.h"
+#include "unit/unit_check.h"
 
 #include <cerrno>
 #include <cstdio>
@@ -43,7 +44,7 @@ int run(int argc, char** argv)
     CLI::App* log = app.add_subcommand("log", "Explain the updater's log: what happened, why, and what to do now.");
     CLI::Option* file =
         log->add_option("FILE", logOptions.file, "the log; - for standard input")->capture_default_str();
-    log->add_flag("--unit", logOptions.unit, "read the journal of the service harl-updater")->excludes(file);
+    log->add_flag("--journal", logOptions.journal, "read the journal of the service harl-updater")->excludes(file);
     CLI::Option* follow = log->add_flag("--follow", logOptions.follow, "show the run that goes on, until it ends");
     log->add_flag("--json", logOptions.json, "print one JSON object; with --follow one for each change");
     log->add_option("--html", logOptions.htmlFile, "also write a page with each run's timeline")

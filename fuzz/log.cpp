@@ -10,7 +10,7 @@
 #include "log/follow.h"
 #include "log/html.h"
 #include "log/json.h"
-#include "log/report.h"
+#include "log/text.h"
 
 #include <algorithm>
 #include <fstream>

@@ -1,6 +1,7 @@
 #include "log/explain.h"
 
 #include "findings.h"
+#include "procedure.h"
 
 #include <algorithm>
 
@@ -73,12 +74,6 @@ const Hint* hintFor(const Step& step)
     return found == std::end(hints) ? nullptr : found;
 }
 
-/// Name of the package that `run` is about.
-std::string packageOf(const Run& run)
-{
-    return run.mainHead ? "solvik4-dh" : "solvik4-rh";
-}
-
 Problem problem(const Run& run, const Step& step, const char* name, std::string why, std::string remedy)
 {
     return {name, static_cast<std::size_t>(&step - run.steps.data()), std::move(why), std::move(remedy)};
@@ -105,14 +100,14 @@ Problem explainPackageCheck(const Run& run, const Step& step)
 {
     if (step.code && *step.code != 0) {
         return problem(run, step, "package-query-failed",
-                       "The package tool could not be asked for the versions of " + packageOf(run) + ".",
-                       "On the unit run: apt-cache policy " + packageOf(run) +
+                       "The package tool could not be asked for the versions of " + packageOf(run.mainHead) + ".",
+                       "On the unit run: apt-cache policy " + packageOf(run.mainHead) +
                            ", mend what it names, then run the update again.");
     }
     return problem(run, step, "package-unknown",
                    "The package tool named no installed or no candidate version: no package source of this unit holds "
                    "the package, its words are in another language than English, or the tool was killed.",
-                   "On the unit run: apt-cache policy " + packageOf(run) +
+                   "On the unit run: apt-cache policy " + packageOf(run.mainHead) +
                        ". It must show \"Installed:\" and \"Candidate:\"; if not, "
                        "correct the package sources or the service's language, then run the update again.");
 }
@@ -127,7 +122,7 @@ Problem explainPackageInstall(const Run& run, const Step& step)
                    "The package tool could not install the package: it could not be fetched, a script of it failed, or "
                    "it had a question that nobody could answer. It may be left half-configured, and the next update "
                    "would then take it for installed.",
-                   "On the unit run: dpkg --configure -a, then apt install " + packageOf(run) +
+                   "On the unit run: dpkg --configure -a, then apt install " + packageOf(run.mainHead) +
                        ", and mend what they name. Only then "
                        "run the update again.");
 }
@@ -299,7 +294,7 @@ void addFailure(Run& run)
         run.failure = step == nullptr
                           ? problem(run, run.steps.back(), "unknown",
                                     "An error was shown, but the records that tell which are missing.",
-                                    "Get the whole log (harl-updater-tool log --unit), or run the update again.")
+                                    "Get the whole log (harl-updater-tool log --journal), or run the update again.")
                           : explainFailedStep(run, *step);
     } else if ((run.ended == RunEnd::NOT_SEEN || run.ended == RunEnd::EARLY) &&
                !(run.mainHead && run.outcome != Outcome::NONE)) {
@@ -418,7 +413,7 @@ void addUntold(Run& run)
         untold(
             "Whether the package is really installed: exit code 0 also stands for a command that was killed or could "
             "not be started. On the unit: dpkg -s " +
-            packageOf(run) + ".");
+            packageOf(run.mainHead) + ".");
     }
     const Step* upload = run.find(StepKind::UPLOAD_BOARD);
     if (upload != nullptr && upload->failedAttempts > 0) {
@@ -433,7 +428,7 @@ void addUntold(Run& run)
     }
     if (run.failure && run.failure->name != "unfinished" && run.otherLines == 0) {
         untold("What the tools themselves said: this log has none of their lines. The service's journal has "
-               "(harl-updater-tool log --unit).");
+               "(harl-updater-tool log --journal).");
     }
     if (run.outcome != Outcome::NONE && !run.mainHead && !run.statusesLost) {
         untold("Whether the LEDs lit and the sound was heard: only commands that fail are logged.");

@@ -2,7 +2,8 @@
 
 #include "log/explain.h"
 #include "log/json.h"
-#include "log/report.h"
+#include "log/text.h"
+#include "procedure.h"
 
 #include <algorithm>
 #include <ctime>
@@ -34,7 +35,8 @@ std::string attemptText(const Step& step)
     if (step.kind != StepKind::UPLOAD_BOARD || step.failedAttempts == 0) {
         return "";
     }
-    return ", attempt " + std::to_string(std::min(step.failedAttempts + 1, 20)) + " of 20";
+    return ", attempt " + std::to_string(std::min(step.failedAttempts + 1, uploadAttempts)) + " of " +
+           std::to_string(uploadAttempts);
 }
 
 /// "3 min 2 s of 13 min 0 s", "5 s, no fixed length"
@@ -78,11 +80,11 @@ std::optional<std::int64_t> ExpectedTimes::of(StepKind kind) const
 {
     switch (kind) {
     case StepKind::WAIT_FOR_BOARD:
-        return 780;
+        return boardWait;
     case StepKind::SHOW_TO_OPERATOR:
-        return 30;
+        return outcomeWait;
     case StepKind::GIVE_BACK:
-        return 10;
+        return giveBackWait;
     default:
         return mLast.at(static_cast<std::size_t>(kind));
     }

@@ -2,7 +2,7 @@
 
 #include "findings.h"
 #include "log/explain.h"
-#include "log/report.h"
+#include "log/text.h"
 
 #include <algorithm>
 #include <array>

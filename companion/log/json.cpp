@@ -1,7 +1,7 @@
 #include "log/json.h"
 
 #include "log/explain.h"
-#include "log/report.h"
+#include "log/text.h"
 
 namespace
 {

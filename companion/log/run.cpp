@@ -2,6 +2,7 @@
 
 #include "findings.h"
 #include "log/status.h"
+#include "procedure.h"
 
 #include <algorithm>
 #include <array>
@@ -331,7 +332,7 @@ void RunBuilder::takeService(const ParsedRecord& record)
     }
     if (record.message.empty()) {
         beginStep(StepKind::GIVE_BACK, record);
-        beginAction(record, "umount /root/USB_MOUNT/");
+        beginAction(record, "umount " + std::string(stickMountPoint) + '/');
         return;
     }
     Step* step = openStep(StepKind::GIVE_BACK);
@@ -350,7 +351,7 @@ void RunBuilder::takeService(const ParsedRecord& record)
         beginAction(record, "systemctl start harl");
         return;
     }
-    beginAction(record, "wait 10 s");
+    beginWait(record, giveBackWait);
 }
 
 void RunBuilder::takeCheck(const ParsedRecord& record)
@@ -433,11 +434,11 @@ void RunBuilder::takeBoard(const ParsedRecord& record)
         } else if (step != nullptr && startsWith(message, "Uploading failed")) {
             ++step->failedAttempts;
             endAction(record, "failed");
-            if (step->failedAttempts < 20) {
+            if (step->failedAttempts < uploadAttempts) {
                 beginAction(record, "scp: OSUpgrade.zip and unzipUpgrade.sh");
             }
         } else if (startsWith(message, "Failed to upload QUORB")) {
-            fail(record, "20 attempts failed");
+            fail(record, std::to_string(uploadAttempts) + " attempts failed");
         }
         return;
     }
@@ -445,9 +446,9 @@ void RunBuilder::takeBoard(const ParsedRecord& record)
         if (const Step* step = openStep(StepKind::UPLOAD_BOARD); step != nullptr) {
             endAction(record, "exit 0");
             endStep(record, StepResult::DONE,
-                    step->failedAttempts == 0
-                        ? "done"
-                        : "done at attempt " + std::to_string(step->failedAttempts + 1) + " of 20");
+                    step->failedAttempts == 0 ? "done"
+                                              : "done at attempt " + std::to_string(step->failedAttempts + 1) + " of " +
+                                                    std::to_string(uploadAttempts));
         }
         beginStep(StepKind::RUN_BOARD_SCRIPT, record);
         beginAction(record, "ssh: /unzipUpgrade.sh");
@@ -462,7 +463,7 @@ void RunBuilder::takeBoard(const ParsedRecord& record)
         }
     } else if (startsWith(message, "Starts sleeping")) {
         beginStep(StepKind::WAIT_FOR_BOARD, record);
-        beginAction(record, "wait 780 s");
+        beginWait(record, boardWait);
     } else if (startsWith(message, "Sleeping for 13mins ended")) {
         endAction(record, "");
         endStep(record, StepResult::DONE, "done");
@@ -515,7 +516,7 @@ void RunBuilder::takeProcedure(const ParsedRecord& record)
     } else if (record.operation == "deinitRemoteHead") {
         if (startsWith(message, "Giving users 30 Secs")) {
             beginStep(StepKind::SHOW_TO_OPERATOR, record);
-            beginAction(record, "wait 30 s");
+            beginWait(record, outcomeWait);
         }
     } else if (message == "Update mirrors failed:") {
         mVerdict = Outcome::MIRRORS_FAILED;
@@ -676,6 +677,11 @@ void RunBuilder::beginAction(const ParsedRecord& record, std::string_view text)
     action.text = kept(withoutOptions(text));
     action.start = record.time;
     mRun->steps.back().actions.push_back(std::move(action));
+}
+
+void RunBuilder::beginWait(const ParsedRecord& record, std::int64_t seconds)
+{
+    beginAction(record, "wait " + std::to_string(seconds) + " s");
 }
 
 void RunBuilder::endAction(const ParsedRecord& record, std::string status)

@@ -212,6 +212,7 @@ private:
     void endStep(const ParsedRecord& record, StepResult result, std::string detail);
     void fail(const ParsedRecord& record, std::string detail);
     void beginAction(const ParsedRecord& record, std::string_view text);
+    void beginWait(const ParsedRecord& record, std::int64_t seconds);
     void endAction(const ParsedRecord& record, std::string status);
     void noteRawStatus(long status);
     Step* openStep(StepKind kind);

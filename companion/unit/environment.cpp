@@ -7,9 +7,14 @@
 #include <iterator>
 #include <sstream>
 #include <system_error>
+#include <thread>
+
+#include <unistd.h>
 
 namespace
 {
+
+const char defaultSearchPath[] = "/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin"; // systemd.exec(5)
 
 std::string assignment(const std::string& name, const std::string& value)
 {
@@ -17,6 +22,12 @@ std::string assignment(const std::string& name, const std::string& value)
 }
 
 } // namespace
+
+UnitSite thisUnit()
+{
+    return {"", defaultSearchPath, geteuid() == 0,
+            [](int seconds) { std::this_thread::sleep_for(std::chrono::seconds(seconds)); }};
+}
 
 Unit::Unit(const UnitSite& site) : mSite(site)
 {
@@ -29,7 +40,7 @@ Unit::Unit(const UnitSite& site) : mSite(site)
     takeVariables(linesOf(run({"systemctl", "show-environment"}, quick).output));
     std::istringstream own(property("harl-updater", "Environment"));
     takeVariables({std::istream_iterator<std::string>(own), {}});
-    mMainHead = isInstalled("solvik4-dh") && !isInstalled("solvik4-rh");
+    mMainHead = isInstalled(packageOf(true)) && !isInstalled(packageOf(false));
 }
 
 CommandResult Unit::run(const std::vector<std::string>& arguments, std::chrono::milliseconds limit) const

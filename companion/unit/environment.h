@@ -1,9 +1,10 @@
 #pragma once
 
 #include "command.h"
-#include "unit/unit.h"
+#include "procedure.h"
 
 #include <chrono>
+#include <functional>
 #include <map>
 #include <string>
 #include <vector>
@@ -11,6 +12,18 @@
 using namespace std::chrono_literals;
 
 inline constexpr auto quick = 10s; ///< limit for a command that only looks something up
+
+/// Where a unit is: the machine itself, or a prepared tree and tools of a test.
+struct UnitSite
+{
+    std::string root;       ///< Goes in front of every absolute path that is read; empty for the machine itself.
+    std::string searchPath; ///< The services' PATH where the service manager does not tell it.
+    bool isRoot = true;     ///< The check has root's rights.
+    std::function<void(int seconds)> pause; ///< Waits while a lamp colour is shown.
+};
+
+/// The unit that the program runs on.
+UnitSite thisUnit();
 
 /// A unit as the updater's service finds it: its services, and the environment that the service's commands get.
 class Unit
@@ -40,7 +53,7 @@ public:
     bool isMainHead() const { return mMainHead; }
 
     /// The head's own package.
-    std::string package() const { return mMainHead ? "solvik4-dh" : "solvik4-rh"; }
+    std::string package() const { return packageOf(mMainHead); }
 
     /// What the updater does when it cannot go on, for a message.
     std::string failure() const

@@ -147,21 +147,21 @@ class BadInput(Base):
         self.assertIn("no record", json.loads(done.stdout)["error"])
 
     def test_missing_journalctl(self) -> None:
-        message = self.refused("--unit", env={"PATH": str(self.folder)})
+        message = self.refused("--journal", env={"PATH": str(self.folder)})
         self.assertIn("journalctl is not on the search path", message)
 
     def test_failing_journalctl(self) -> None:
-        message = self.refused("--unit", env={"PATH": self.program("journalctl", "exit 3")})
+        message = self.refused("--journal", env={"PATH": self.program("journalctl", "exit 3")})
         self.assertIn("journalctl ended with status 3. Run it as root", message)
 
     def test_empty_journal(self) -> None:
-        for arguments in (["--unit"], ["--unit", "--follow"]):
+        for arguments in (["--journal"], ["--journal", "--follow"]):
             message = self.refused(*arguments, env={"PATH": self.program("journalctl", "")})
             self.assertIn("the service has not run since the journal begins", message)
             self.assertIn("Run it as root", message)
 
     def test_wrong_usage(self) -> None:
-        for arguments in (["--unit", "a.log"], ["--follow", "--html", "x"], ["--nonsense"], ["a", "b"]):
+        for arguments in (["--journal", "a.log"], ["--follow", "--html", "x"], ["--nonsense"], ["a", "b"]):
             self.assertEqual(run_tool(*arguments).returncode, 2, arguments)
 
     def test_page_is_kept_when_the_log_is_bad(self) -> None:
@@ -229,7 +229,7 @@ class Unit(Base):
     def test_journal_is_explained(self) -> None:
         script = f'echo "$@" >"{self.folder}/arguments"; /bin/cat "{GOLDEN}/up-to-date.log"\n'
         folder = self.program("journalctl", script)
-        done = run_tool("--unit", env={"PATH": folder})
+        done = run_tool("--journal", env={"PATH": folder})
         self.assertEqual(done.returncode, 0)
         self.assertIn(b"Run 1 of the journal of harl-updater, lines 1 to ", done.stdout)
         self.assertIn("--unit=harl-updater", (self.folder / "arguments").read_text())
@@ -240,7 +240,7 @@ class Unit(Base):
         (self.folder / "b").write_text("".join(log[60:]))
         script = f'/bin/cat "{self.folder}/a"; /bin/sleep 1; /bin/cat "{self.folder}/b"; exec /bin/sleep 100\n'
         folder = self.program("journalctl", script)
-        done = run_tool("--unit", "--follow", env={"PATH": folder})
+        done = run_tool("--journal", "--follow", env={"PATH": folder})
         self.assertEqual(done.returncode, 0)
         self.assertTrue(done.stdout.decode().splitlines()[-1].startswith("Ended at "), done.stdout)
 

@@ -44,7 +44,7 @@ done
 
 expect stick s
 expect '' stick --panel
-expect --follow log --unit --f
+expect --follow log --journal --f
 expect '--html' log --ht
 expect '' nonsense --
 

@@ -1,4 +1,4 @@
-#include "stick/stick.h"
+#include "stick/stick_check.h"
 
 #include "finding_lines.h"
 #include "test_folder.h"

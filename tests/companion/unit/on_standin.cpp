@@ -1,7 +1,7 @@
 // Usage: unit-on-standin [NAME=VALUE...]
 // Runs the check of `harl-updater-tool unit` on a stand-in unit with these settings of standins.sh.
 
-#include "unit/unit.h"
+#include "unit/unit_check.h"
 
 #include "unit/standin.h"
 

@@ -1,4 +1,4 @@
-#include "unit/unit.h"
+#include "unit/unit_check.h"
 
 #include "finding_lines.h"
 #include "unit/standin.h"

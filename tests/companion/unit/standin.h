@@ -1,7 +1,7 @@
 #pragma once
 
 #include "test_folder.h"
-#include "unit/unit.h"
+#include "unit/unit_check.h"
 
 #include <map>
 #include <memory>

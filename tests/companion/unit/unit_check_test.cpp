@@ -1,4 +1,4 @@
-#include "unit/unit.h"
+#include "unit/unit_check.h"
 
 #include "finding_lines.h"
 #include "unit/packages.h"
@@ -9,13 +9,14 @@
 
 #include <csignal>
 #include <fstream>
+#include <functional>
 #include <sstream>
 
 #include <sys/stat.h>
 
 namespace fs = std::filesystem;
 using testing::Contains;
-using testing::ElementsAre;
+using testing::ElementsAreArray;
 using testing::HasSubstr;
 using testing::Not;
 
@@ -23,7 +24,7 @@ namespace
 {
 
 /// What a run of the check gave.
-struct Outcome
+struct CheckResult
 {
     int status;
     nlohmann::json report;
@@ -34,20 +35,21 @@ struct Outcome
 class UnitCheck : public testing::Test
 {
 protected:
-    static Outcome check(const UnitSite& site)
+    static CheckResult check(const UnitSite& site)
     {
         std::ostringstream out;
         std::ostringstream errors;
-        Outcome outcome = {runUnit({true, false, false}, site, out, errors), nlohmann::json::parse(out.str()), {}, ""};
-        outcome.errors = errors.str();
-        for (const auto& finding : outcome.report["findings"]) {
-            outcome.findings.push_back(finding["severity"].get<std::string>() + ' ' +
-                                       finding["check"].get<std::string>());
+        CheckResult result = {
+            runUnit({true, false, false}, site, out, errors), nlohmann::json::parse(out.str()), {}, ""};
+        result.errors = errors.str();
+        for (const auto& finding : result.report["findings"]) {
+            result.findings.push_back(finding["severity"].get<std::string>() + ' ' +
+                                      finding["check"].get<std::string>());
         }
-        return outcome;
+        return result;
     }
 
-    Outcome check() const { return check(unit.site()); }
+    CheckResult check() const { return check(unit.site()); }
     Lines findings() const { return check().findings; }
 
     /// The text of the one finding.
@@ -81,15 +83,102 @@ Lines checkDisk(const struct statvfs& system, std::uint64_t needed)
 
 } // namespace
 
+struct Fault
+{
+    const char* name;
+    std::function<void(StandInUnit& unit)> make;
+    Lines findings;
+};
+
+/// What one change of a unit that is fit makes of the check's findings.
+class UnitCheckOfFault : public UnitCheck, public testing::WithParamInterface<Fault>
+{
+};
+
+TEST_P(UnitCheckOfFault, IsFound)
+{
+    GetParam().make(unit);
+    EXPECT_THAT(findings(), ElementsAreArray(GetParam().findings));
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Each, UnitCheckOfFault,
+    testing::Values(
+        Fault{"ServiceManagerThatCannotBeAskedIsUnchecked",
+              [](StandInUnit& unit) {
+                  unit.replaceTool("systemctl",
+                                   "echo 'System has not been booted with systemd as init system' >&2; exit 1");
+              },
+              Lines{"unchecked services-unknown"}},
+        Fault{"ToolWithAnotherAnswerToThePanelsAddressIsUnchecked",
+              [](StandInUnit& unit) { unit.replaceTool("i2cset", "echo 'BusyBox' >&2; exit 1"); },
+              Lines{"unchecked panel-address-unknown"}},
+        Fault{"MissingBusIsAnError", [](StandInUnit& unit) { unit.remove("dev/i2c-0"); },
+              Lines{"error panel-bus-missing"}},
+        Fault{"PanelThatDoesNotAnswerIsAnError", [](StandInUnit& unit) { unit.set("HEAD_PANEL", "absent"); },
+              Lines{"error panel-silent"}},
+        Fault{"PanelTakenByADriverIsAnError",
+              [](StandInUnit& unit) { unit.replaceTool("i2cdetect", "echo '00:                      UU'"); },
+              Lines{"error panel-busy"}},
+        Fault{"BusThatCannotBeAskedIsUnchecked",
+              [](StandInUnit& unit) { unit.replaceTool("i2cdetect", "echo 'Error: Could not open file' >&2; exit 1"); },
+              Lines{"unchecked panel-unknown"}},
+        Fault{"MissingSoundDeviceIsAWarning",
+              [](StandInUnit& unit) { unit.put("proc/asound/pcm", "00-00: Microphone : Microphone : capture 1\n"); },
+              Lines{"warning sound-device"}},
+        Fault{"BoardThatDoesNotAnswerIsUnreachable", [](StandInUnit& unit) { unit.set("BOARD_LINK", "down"); },
+              Lines{"error board-unreachable"}},
+        Fault{"RefusedKeyIsALoginError", [](StandInUnit& unit) { unit.set("BOARD_LOGIN", "key-refused"); },
+              Lines{"error board-login"}},
+        Fault{"MissingVersionFileIsAnError", [](StandInUnit& unit) { unit.set("BOARD_VERSION_FILE", ""); },
+              Lines{"error board-version"}},
+        Fault{"VersionFileThatCannotBeReadIsNoRefusedLogin",
+              [](StandInUnit& unit) {
+                  unit.replaceTool("ssh", "echo 'cat: /root/App/AppExe/version.txt: Permission denied' >&2; exit 1");
+              },
+              Lines{"error board-version"}},
+        Fault{"LockFileThatCannotBeReadIsUnchecked",
+              [](StandInUnit& unit) {
+                  unit.remove("var/lib/dpkg/lock");
+                  unit.folder.makeLink("root/var/lib/dpkg/lock", "lock");
+              },
+              Lines{"unchecked package-lock"}},
+        Fault{"MissingLockFileIsFree", [](StandInUnit& unit) { unit.remove("var/lib/dpkg/lock"); }, Lines()},
+        Fault{"PackageDatabaseThatCannotBeReadIsUnchecked", [](StandInUnit& unit) { unit.removeTool("dpkg-query"); },
+              Lines{"unchecked packages-unknown"}},
+        Fault{"UnknownPackageIsAWarning", [](StandInUnit& unit) { unit.set("PACKAGE_KNOWN", "false"); },
+              Lines{"warning package-unknown"}},
+        Fault{"PackageToolWithoutAnswerLeavesThePackageUnchecked",
+              [](StandInUnit& unit) { unit.replaceTool("apt-cache", ""); }, Lines{"unchecked package-unknown"}},
+        Fault{"PackageWithoutASourceIsAWarning", [](StandInUnit& unit) { unit.set("PACKAGE_OFFERED", "(none)"); },
+              Lines{"warning package-not-offered"}},
+        Fault{"UnitWithoutSourcesIsAnError", [](StandInUnit& unit) { unit.replaceTool("apt-get", ""); },
+              Lines{"error mirrors-none"}},
+        Fault{
+            "MirrorWithoutTheIndexIsAWarning",
+            [](StandInUnit& unit) {
+                unit.folder.put(
+                    "root/usr/lib/apt/helper",
+                    "#!/bin/sh\necho 'E: Failed to fetch http://mirror.invalid/dists/stable/InRelease  404  Not Found "
+                    "[IP: 192.0.2.1 80]' >&2\nexit 100\n",
+                    0755);
+                fs::rename(unit.folder.path("root/usr/lib/apt/helper"),
+                           unit.folder.path("root/usr/lib/apt/apt-helper"));
+            },
+            Lines{"warning mirror-index"}},
+        Fault{"WithoutServiceManagerItsToolIsMissing", [](StandInUnit& unit) { unit.removeTool("systemctl"); },
+              Lines{"unchecked services-unknown", "error tool-missing"}}),
+    [](const auto& test) { return test.param.name; });
+
 TEST_F(UnitCheck, CompleteUnitIsFit)
 {
-    const Outcome outcome = check();
-    EXPECT_EQ(outcome.findings, Lines());
-    EXPECT_EQ(outcome.status, 0);
-    EXPECT_EQ(outcome.errors, "");
-    EXPECT_EQ(outcome.report["command"], "unit");
-    EXPECT_EQ(outcome.report["fit"], true);
-    const nlohmann::json facts = outcome.report["facts"];
+    const CheckResult result = check();
+    EXPECT_EQ(result.findings, Lines());
+    EXPECT_EQ(result.status, 0);
+    EXPECT_EQ(result.errors, "");
+    EXPECT_EQ(result.report["command"], "unit");
+    EXPECT_EQ(result.report["fit"], true);
+    const nlohmann::json facts = result.report["facts"];
     EXPECT_EQ(facts["head"], "remote");
     EXPECT_EQ(facts["service_harl"], "active");
     EXPECT_EQ(facts["service_harl_updater"], "inactive");
@@ -126,9 +215,9 @@ TEST_F(UnitCheck, WithoutRootsRightsTheAnswerIsOpen)
 {
     UnitSite site = unit.site();
     site.isRoot = false;
-    const Outcome outcome = check(site);
-    EXPECT_EQ(outcome.findings, Lines{"unchecked not-root"});
-    EXPECT_EQ(outcome.status, 2);
+    const CheckResult result = check(site);
+    EXPECT_EQ(result.findings, Lines{"unchecked not-root"});
+    EXPECT_EQ(result.status, 2);
 }
 
 TEST_F(UnitCheck, BoardThatRefusesAnotherUserThanRootIsUnchecked)
@@ -167,10 +256,10 @@ TEST_F(UnitCheck, NothingIsLeftWhenASignalEndsIt)
 TEST_F(UnitCheck, MainHeadIsJudgedByItsOwnPackage)
 {
     unit.set("UPDATER_PROGRAM", "main");
-    const Outcome outcome = check();
-    EXPECT_EQ(outcome.findings, Lines());
-    EXPECT_EQ(outcome.status, 0);
-    const nlohmann::json facts = outcome.report["facts"];
+    const CheckResult result = check();
+    EXPECT_EQ(result.findings, Lines());
+    EXPECT_EQ(result.status, 0);
+    const nlohmann::json facts = result.report["facts"];
     EXPECT_EQ(facts["head"], "main");
     EXPECT_EQ(facts["package_installed"], "1.2.0");
     EXPECT_EQ(facts["package_candidate"], "1.3.0");
@@ -229,20 +318,14 @@ TEST_F(UnitCheck, HeadWithBothPackagesOrWithConfigurationFilesOnlyIsARemoteHead)
 
 // Services
 
-TEST_F(UnitCheck, ServiceManagerThatCannotBeAskedIsUnchecked)
-{
-    unit.replaceTool("systemctl", "echo 'System has not been booted with systemd as init system' >&2; exit 1");
-    EXPECT_EQ(findings(), Lines{"unchecked services-unknown"});
-}
-
 TEST_F(UnitCheck, UnknownServicesAreErrors)
 {
     unit.set("HEAD_HARL", "unknown");
     unit.set("UNIT_UPDATER_LOADED", "masked");
-    const Outcome outcome = check();
-    EXPECT_EQ(outcome.findings, (Lines{"error service-not-loaded", "error service-not-loaded"}));
-    EXPECT_EQ(outcome.status, 1);
-    EXPECT_EQ(outcome.report["findings"][1]["what"], "The service \"harl-updater\" cannot be used: \"masked\".");
+    const CheckResult result = check();
+    EXPECT_EQ(result.findings, (Lines{"error service-not-loaded", "error service-not-loaded"}));
+    EXPECT_EQ(result.status, 1);
+    EXPECT_EQ(result.report["findings"][1]["what"], "The service \"harl-updater\" cannot be used: \"masked\".");
 }
 
 TEST_F(UnitCheck, RunningServiceOfTheUpdaterIsAWarningAndItsPanelIsLeftAlone)
@@ -267,19 +350,13 @@ TEST_F(UnitCheck, EveryMissingToolIsNamed)
     for (const std::string tool : {"umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp", "i2cset"}) {
         StandInUnit other;
         other.removeTool(tool);
-        const Outcome outcome = check(other.site());
-        EXPECT_EQ(outcome.findings, Lines{"error tool-missing"}) << tool;
-        EXPECT_THAT(outcome.report["findings"][0]["what"].get<std::string>(),
+        const CheckResult result = check(other.site());
+        EXPECT_EQ(result.findings, Lines{"error tool-missing"}) << tool;
+        EXPECT_THAT(result.report["findings"][0]["what"].get<std::string>(),
                     HasSubstr("The command \"" + tool + "\" is not on the service's search path"));
     }
     unit.removeTool("aplay");
     EXPECT_EQ(findings(), Lines{"warning tool-missing"});
-}
-
-TEST_F(UnitCheck, WithoutServiceManagerItsToolIsMissing)
-{
-    unit.removeTool("systemctl");
-    EXPECT_EQ(findings(), (Lines{"unchecked services-unknown", "error tool-missing"}));
 }
 
 TEST_F(UnitCheck, FileThatCannotBeRunIsNoTool)
@@ -309,59 +386,23 @@ TEST_F(UnitCheck, ToolThatRefusesThePanelsAddressIsAnError)
     EXPECT_THAT(what(), HasSubstr("address 0x07: \"Error: Chip address out of range (0x08-0x77)!\"."));
 }
 
-TEST_F(UnitCheck, ToolWithAnotherAnswerToThePanelsAddressIsUnchecked)
-{
-    unit.replaceTool("i2cset", "echo 'BusyBox' >&2; exit 1");
-    EXPECT_EQ(findings(), Lines{"unchecked panel-address-unknown"});
-}
-
-TEST_F(UnitCheck, MissingBusIsAnError)
-{
-    unit.remove("dev/i2c-0");
-    EXPECT_EQ(findings(), Lines{"error panel-bus-missing"});
-}
-
-TEST_F(UnitCheck, PanelThatDoesNotAnswerIsAnError)
-{
-    unit.set("HEAD_PANEL", "absent");
-    EXPECT_EQ(findings(), Lines{"error panel-silent"});
-}
-
-TEST_F(UnitCheck, PanelTakenByADriverIsAnError)
-{
-    unit.replaceTool("i2cdetect", "echo '00:                      UU'");
-    EXPECT_EQ(findings(), Lines{"error panel-busy"});
-}
-
-TEST_F(UnitCheck, BusThatCannotBeAskedIsUnchecked)
-{
-    unit.replaceTool("i2cdetect", "echo 'Error: Could not open file' >&2; exit 1");
-    EXPECT_EQ(findings(), Lines{"unchecked panel-unknown"});
-}
-
 TEST_F(UnitCheck, MissingAndBrokenSoundFilesAreWarnings)
 {
     unit.remove("root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav");
     unit.put("root/RESOURCES/SOUNDS/SND_RESULT_FAIL.wav", waveFile(1000).substr(0, 500));
-    const Outcome outcome = check();
-    EXPECT_EQ(outcome.findings, (Lines{"warning sound-file", "warning sound-file"}));
-    EXPECT_EQ(outcome.status, 0);
-    EXPECT_THAT(outcome.report["findings"][1]["what"].get<std::string>(), HasSubstr("456 of 1000 bytes of sound"));
+    const CheckResult result = check();
+    EXPECT_EQ(result.findings, (Lines{"warning sound-file", "warning sound-file"}));
+    EXPECT_EQ(result.status, 0);
+    EXPECT_THAT(result.report["findings"][1]["what"].get<std::string>(), HasSubstr("456 of 1000 bytes of sound"));
 }
 
 TEST_F(UnitCheck, SoundFileThatCannotBeReadIsUnchecked)
 {
     unit.remove("root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav");
     unit.folder.makeLink("root/root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav", "SND_RESULT_PASS.wav"); // a loop
-    const Outcome outcome = check();
-    EXPECT_EQ(outcome.findings, Lines{"unchecked sound-file"});
-    EXPECT_EQ(outcome.report["findings"][0]["remedy"], "Run this check as root.");
-}
-
-TEST_F(UnitCheck, MissingSoundDeviceIsAWarning)
-{
-    unit.put("proc/asound/pcm", "00-00: Microphone : Microphone : capture 1\n");
-    EXPECT_EQ(findings(), Lines{"warning sound-device"});
+    const CheckResult result = check();
+    EXPECT_EQ(result.findings, Lines{"unchecked sound-file"});
+    EXPECT_EQ(result.report["findings"][0]["remedy"], "Run this check as root.");
 }
 
 // The board
@@ -375,23 +416,11 @@ TEST_F(UnitCheck, BoardIsAskedAsTheUpdaterDoesButNobodyIsAskedForAnything)
                          "192.168.9.2  cat /root/App/AppExe/version.txt | grep 'Brimvale'"));
 }
 
-TEST_F(UnitCheck, BoardThatDoesNotAnswerIsUnreachable)
-{
-    unit.set("BOARD_LINK", "down");
-    EXPECT_EQ(findings(), Lines{"error board-unreachable"});
-}
-
 TEST_F(UnitCheck, LoginEndedByASignalIsUnreachable)
 {
     unit.set("TOOLS_KILLED", "ssh");
     EXPECT_EQ(findings(), Lines{"error board-unreachable"});
     EXPECT_EQ(what(), "The board at 192.168.9.2 cannot be asked: a signal ended the command.");
-}
-
-TEST_F(UnitCheck, RefusedKeyIsALoginError)
-{
-    unit.set("BOARD_LOGIN", "key-refused");
-    EXPECT_EQ(findings(), Lines{"error board-login"});
 }
 
 TEST_F(UnitCheck, ChangedAndUnknownHostKeysAreToldApart)
@@ -401,18 +430,6 @@ TEST_F(UnitCheck, ChangedAndUnknownHostKeysAreToldApart)
     EXPECT_EQ(what(), "The board's host key is not the one that is known.");
     unit.replaceTool("ssh", "echo 'Host key verification failed.' >&2; exit 255");
     EXPECT_EQ(what(), "The board's host key is not known.");
-}
-
-TEST_F(UnitCheck, MissingVersionFileIsAnError)
-{
-    unit.set("BOARD_VERSION_FILE", "");
-    EXPECT_EQ(findings(), Lines{"error board-version"});
-}
-
-TEST_F(UnitCheck, VersionFileThatCannotBeReadIsNoRefusedLogin)
-{
-    unit.replaceTool("ssh", "echo 'cat: /root/App/AppExe/version.txt: Permission denied' >&2; exit 1");
-    EXPECT_EQ(findings(), Lines{"error board-version"});
 }
 
 TEST_F(UnitCheck, VersionLineIsReadAsTheUpdaterReadsIt)
@@ -448,25 +465,6 @@ TEST_F(UnitCheck, LockOfAnotherPackageToolIsAnErrorThatNamesTheProcess)
     EXPECT_EQ(findings(), Lines());
 }
 
-TEST_F(UnitCheck, LockFileThatCannotBeReadIsUnchecked)
-{
-    unit.remove("var/lib/dpkg/lock");
-    unit.folder.makeLink("root/var/lib/dpkg/lock", "lock");
-    EXPECT_EQ(findings(), Lines{"unchecked package-lock"});
-}
-
-TEST_F(UnitCheck, MissingLockFileIsFree)
-{
-    unit.remove("var/lib/dpkg/lock");
-    EXPECT_EQ(findings(), Lines());
-}
-
-TEST_F(UnitCheck, PackageDatabaseThatCannotBeReadIsUnchecked)
-{
-    unit.removeTool("dpkg-query");
-    EXPECT_EQ(findings(), Lines{"unchecked packages-unknown"});
-}
-
 TEST_F(UnitCheck, UnfinishedPackagesAreErrors)
 {
     unit.replaceTool("dpkg-query", R"(printf 'ii \tapt\nrc \told\nun \tnone\niF \tsolvik4-rh\niU \tlib\nitR\tbad\n')");
@@ -491,24 +489,6 @@ TEST_F(UnitCheck, LocaleThatTranslatesThePackageToolIsAnError)
                                   "printf 'apt:\\n  Installiert:           2.6.1\\n  Installationskandidat: 2.6.1\\n'");
     EXPECT_EQ(findings(), Lines{"error policy-words"});
     EXPECT_THAT(what(), HasSubstr("locale \"LANG=de_DE.UTF-8\""));
-}
-
-TEST_F(UnitCheck, UnknownPackageIsAWarning)
-{
-    unit.set("PACKAGE_KNOWN", "false");
-    EXPECT_EQ(findings(), Lines{"warning package-unknown"});
-}
-
-TEST_F(UnitCheck, PackageToolWithoutAnswerLeavesThePackageUnchecked)
-{
-    unit.replaceTool("apt-cache", "");
-    EXPECT_EQ(findings(), Lines{"unchecked package-unknown"});
-}
-
-TEST_F(UnitCheck, PackageWithoutASourceIsAWarning)
-{
-    unit.set("PACKAGE_OFFERED", "(none)");
-    EXPECT_EQ(findings(), Lines{"warning package-not-offered"});
 }
 
 TEST_F(UnitCheck, FreeSpaceThatCannotBeReadIsUnchecked)
@@ -563,27 +543,11 @@ TEST_F(UnitCheck, MirrorsAreFetchedWithTheUpdatersTimeOut)
 TEST_F(UnitCheck, SilentMirrorIsAnErrorThatExplainsTheExitStatus)
 {
     unit.set("MIRRORS_REFRESH", "unreachable");
-    const Outcome outcome = check();
-    EXPECT_EQ(outcome.findings, Lines{"error mirror-silent"});
-    EXPECT_THAT(outcome.report["findings"][0]["what"].get<std::string>(),
+    const CheckResult result = check();
+    EXPECT_EQ(result.findings, Lines{"error mirror-silent"});
+    EXPECT_THAT(result.report["findings"][0]["what"].get<std::string>(),
                 HasSubstr("does not answer: \"Could not resolve 'mirror.invalid'\""));
-    EXPECT_THAT(outcome.report["findings"][0]["effect"].get<std::string>(), HasSubstr("\"apt update\" ends with 0"));
-}
-
-TEST_F(UnitCheck, MirrorWithoutTheIndexIsAWarning)
-{
-    unit.folder.put("root/usr/lib/apt/helper",
-                    "#!/bin/sh\necho 'E: Failed to fetch http://mirror.invalid/dists/stable/InRelease  404  Not Found "
-                    "[IP: 192.0.2.1 80]' >&2\nexit 100\n",
-                    0755);
-    fs::rename(unit.folder.path("root/usr/lib/apt/helper"), unit.folder.path("root/usr/lib/apt/apt-helper"));
-    EXPECT_EQ(findings(), Lines{"warning mirror-index"});
-}
-
-TEST_F(UnitCheck, UnitWithoutSourcesIsAnError)
-{
-    unit.replaceTool("apt-get", "");
-    EXPECT_EQ(findings(), Lines{"error mirrors-none"});
+    EXPECT_THAT(result.report["findings"][0]["effect"].get<std::string>(), HasSubstr("\"apt update\" ends with 0"));
 }
 
 TEST_F(UnitCheck, SourcesThatCannotBeReadAreAnError)

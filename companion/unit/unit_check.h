@@ -1,8 +1,8 @@
 #pragma once
 
-#include <functional>
+#include "unit/environment.h"
+
 #include <iosfwd>
-#include <string>
 
 /// What runUnit() is to do.
 struct UnitOptions
@@ -11,18 +11,6 @@ struct UnitOptions
     bool panel = false; ///< Test the lamps instead of checking.
     bool sound = false; ///< Play both sounds instead of checking.
 };
-
-/// Where a unit is: the machine itself, or a prepared tree and tools of a test.
-struct UnitSite
-{
-    std::string root;       ///< Goes in front of every absolute path that is read; empty for the machine itself.
-    std::string searchPath; ///< The services' PATH where the service manager does not tell it.
-    bool isRoot = true;     ///< The check has root's rights.
-    std::function<void(int seconds)> pause; ///< Waits while a lamp colour is shown.
-};
-
-/// The unit that the program runs on.
-UnitSite thisUnit();
 
 /// Checks whether the unit is fit for an update, and prints the report to `out`.
 ///

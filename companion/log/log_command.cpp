@@ -1,4 +1,4 @@
-#include "log/log.h"
+#include "log/log_command.h"
 
 #include "descriptor.h"
 #include "findings.h"
@@ -7,9 +7,9 @@
 #include "log/html.h"
 #include "log/json.h"
 #include "log/parser.h"
-#include "log/report.h"
 #include "log/run.h"
 #include "log/source.h"
+#include "log/text.h"
 
 #include <cerrno>
 #include <csignal>
@@ -280,7 +280,7 @@ int explainAll(LogSource& source, const LogOptions& options, std::ostream& out, 
         error = journalText(code);
     }
     if (error.empty() && parser.records() == 0) {
-        error = noRecordText(parser, options.unit);
+        error = noRecordText(parser, options.journal);
     }
     if (!error.empty()) {
         status = LOG_UNREADABLE;
@@ -378,7 +378,7 @@ int followLast(LogSource& source, const LogOptions& options, std::ostream& out, 
     if (error.empty() && code != 0) {
         error = journalText(code);
     } else if (error.empty() && parser.records() == 0) {
-        error = noRecordText(parser, options.unit);
+        error = noRecordText(parser, options.journal);
     }
     if (!error.empty()) {
         err << "harl-updater-tool: " << source.name() << ": " << error << '\n';
@@ -392,7 +392,7 @@ int followLast(LogSource& source, const LogOptions& options, std::ostream& out, 
 int runLog(const LogOptions& options, std::ostream& out, std::ostream& err)
 {
     LogSource source;
-    const std::string wrong = options.unit ? source.openJournal(options.follow) : source.openFile(options.file);
+    const std::string wrong = options.journal ? source.openJournal(options.follow) : source.openFile(options.file);
     if (!wrong.empty()) {
         err << "harl-updater-tool: " << source.name() << ": " << wrong << '\n';
         return LOG_UNREADABLE;

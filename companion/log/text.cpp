@@ -1,4 +1,4 @@
-#include "log/report.h"
+#include "log/text.h"
 
 #include "findings.h"
 #include "log/explain.h"
@@ -16,7 +16,7 @@ const std::size_t width = 100; // columns
 
 std::string formattedTime(std::int64_t time, const char* format)
 {
-    const auto seconds = static_cast<std::time_t>(time); // 32 bits on the unit
+    const auto seconds = static_cast<std::time_t>(time);
     std::tm parts = {};
     gmtime_r(&seconds, &parts); // the log's local time is kept as if it were UTC
     std::array<char, 64> buffer{};

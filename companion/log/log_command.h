@@ -6,7 +6,7 @@
 struct LogOptions
 {
     std::string file = "-"; ///< "-": standard input
-    bool unit = false;      ///< the service's journal instead of a file
+    bool journal = false;   ///< the service's journal instead of a file
     bool follow = false;    ///< show the run that goes on instead of explaining those that were
     bool json = false;      ///< for programs: one object; with `follow` one for each change
     bool terminal = false;  ///< the output is one

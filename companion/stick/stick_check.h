@@ -6,9 +6,6 @@
 #include <iosfwd>
 #include <string>
 
-/// Where the unit mounts the stick.
-inline constexpr char stickMountPoint[] = "/root/USB_MOUNT";
-
 /// Checks the stick at `path` for what the updater will do with it, and prints the report to `out`.
 ///
 /// Reads only, runs nothing and opens no file outside the stick: a symbolic link that leads out of it is reported

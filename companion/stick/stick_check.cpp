@@ -1,5 +1,6 @@
-#include "stick/stick.h"
+#include "stick/stick_check.h"
 
+#include "procedure.h"
 #include "stick/archive.h"
 #include "stick/script.h"
 
@@ -15,9 +16,6 @@
 namespace
 {
 
-const std::size_t prefixLength = 5; // bytes of the version folder's name, in front of the version
-
-const char boardFolder[] = "debs/QUORB/armhf";
 const char archiveName[] = "OSUpgrade.zip";
 const char scriptName[] = "unzipUpgrade.sh";
 const char markerFolder[] = "debs";
@@ -432,7 +430,7 @@ void checkStick(const StickFolder& stick, bool onUnit, Report& report)
 std::string checkVersionName(const std::string& name, Report& report)
 {
     const std::string line = name.substr(0, name.find('\n'));
-    std::string version = line.size() > prefixLength ? line.substr(prefixLength) : "";
+    std::string version = line.size() > versionPrefixLength ? line.substr(versionPrefixLength) : "";
     if (version.empty()) {
         report.add({Severity::ERROR, "version-missing",
                     shown(line) + " is too short: five bytes are the prefix, and behind them is no version.",
@@ -455,10 +453,10 @@ std::string checkVersionName(const std::string& name, Report& report)
              "installs again at every run, 13 minutes each.",
              "Compare the folder's name with the maker's, blanks at its end included."});
     }
-    const char lastOfPrefix = line[prefixLength - 1];
+    const char lastOfPrefix = line[versionPrefixLength - 1];
     if (!isDigit(version.front()) || isDigit(lastOfPrefix) || lastOfPrefix == '.') {
         report.add({Severity::WARNING, "version-start",
-                    "The prefix would be " + shown(line.substr(0, prefixLength)) + " and the version " +
+                    "The prefix would be " + shown(line.substr(0, versionPrefixLength)) + " and the version " +
                         shown(version) + ": the prefix seems to have more or fewer than five bytes.",
                     "drops the first five bytes whatever they are and compares the rest with the board's version. It "
                     "installs at every run, 13 minutes each, when the two never become equal.",

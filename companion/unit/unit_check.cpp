@@ -1,4 +1,4 @@
-#include "unit/unit.h"
+#include "unit/unit_check.h"
 
 #include "findings.h"
 #include "unit/environment.h"
@@ -11,15 +11,11 @@
 #include <fstream>
 #include <ostream>
 #include <system_error>
-#include <thread>
 #include <utility>
-
-#include <unistd.h>
 
 namespace
 {
 
-const char defaultSearchPath[] = "/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin"; // systemd.exec(5)
 const auto boardLimit = 45s; // 2 s to connect, then ten unanswered keep-alives of 4 s
 
 const std::string darkPanel =
@@ -214,7 +210,7 @@ private:
         const CommandResult answer =
             mUnit.run({"ssh", "-o", "BatchMode=yes", "-o", "StrictHostKeyChecking=yes", "-o", "UpdateHostKeys=no", "-o",
                        "ServerAliveInterval=4", "-o", "ServerAliveCountMax=10", "-o", "ConnectTimeout=2", "-o",
-                       "TCPKeepAlive=yes", "192.168.9.2", " cat /root/App/AppExe/version.txt | grep 'Brimvale'"},
+                       "TCPKeepAlive=yes", boardAddress, boardVersionCommand},
                       boardLimit);
         if (!answer.started) {
             return; // reported with the tools
@@ -254,7 +250,7 @@ private:
 
     void checkBoardVersion(const CommandResult& answer)
     {
-        const std::string value = valueAfter(answer.output, "Brimvale\t");
+        const std::string value = valueAfter(answer.output, boardVersionKey);
         const std::string version = value.substr(0, value.find('\r'));
         if (!answer.succeeded() || version.empty()) {
             add(Severity::ERROR, "board-version",
@@ -304,12 +300,6 @@ int runSelfTests(const UnitOptions& options, const Unit& unit, const UnitSite& s
 }
 
 } // namespace
-
-UnitSite thisUnit()
-{
-    return {"", defaultSearchPath, geteuid() == 0,
-            [](int seconds) { std::this_thread::sleep_for(std::chrono::seconds(seconds)); }};
-}
 
 int runUnit(const UnitOptions& options, const UnitSite& site, std::ostream& out, std::ostream& errors)
 {

@@ -2,9 +2,9 @@
 /// Each is a letter, a path, and behind the byte 0x1F its content: d a folder, f a file, x one with its run bit, z an
 /// intact archive, l a symbolic link to its content, p a pipe.
 
-#include "stick/stick_check.h"
 #include "Input.h"
 #include "Printable.h"
+#include "stick/stick_check.h"
 #include "stick/zip_file.h"
 
 #include <algorithm>

@@ -9,7 +9,6 @@
 #include <iostream>
 #include <map>
 #include <mutex>
-#include <regex>
 #include <streambuf>
 
 namespace platform
@@ -55,20 +54,10 @@ std::function<int(const timespec*, timespec*)> sleepScript;
 std::function<void()> recordHook;
 LogBuffer& logBuffer = *new LogBuffer; // lives on: std::cout is flushed once more at exit
 
-const std::string separator = "\n\t\t\t";
-
-bool isRecord(const std::string& text)
+std::string messageOf(const std::string& text)
 {
-    return text.find(separator) == text.find('\n') && text.find(separator) != std::string::npos && text.back() == '\n';
-}
-
-std::string messageOf(const std::string& record)
-{
-    if (!isRecord(record)) {
-        return "not a record: " + record;
-    }
-    const std::string::size_type begin = record.find(separator) + separator.size();
-    return record.substr(begin, record.size() - begin - 1);
+    const std::optional<Record> record = parseRecord(text);
+    return record ? record->message : "not a record: " + text;
 }
 
 void enter(const std::string& text)
@@ -204,19 +193,16 @@ Lines entries(const std::string& prefix)
 
 std::vector<Record> records()
 {
-    static const std::regex form("Updater \\| ([0-9]{2}-[0-9]{2}-[0-9]{4} [0-9]{2}-[0-9]{2}-[0-9]{2})\t"
-                                 "([0-9]+)\t([^\t/:]+):([0-9]+)\t([^\t\n]+)");
     const std::lock_guard<std::mutex> lock(mutex);
     std::vector<Record> result;
     for (const LogBuffer::Text& text : logBuffer.mTexts) {
-        const std::string head = text.text.substr(0, text.text.find('\n'));
-        std::smatch match;
-        if (!std::regex_match(head, match, form) || !isRecord(text.text)) {
+        std::optional<Record> record = parseRecord(text.text);
+        if (!record) {
             ADD_FAILURE() << "not one well-formed record: " << text.text;
             continue;
         }
-        result.push_back(
-            {match[1], match[2], match[3], match[4], match[5], messageOf(text.text), text.flushed, text.text});
+        record->flushed = text.flushed;
+        result.push_back(*std::move(record));
     }
     return result;
 }

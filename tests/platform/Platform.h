@@ -1,5 +1,7 @@
 #pragma once
 
+#include "Record.h"
+
 #include <cstddef>
 #include <cstdint>
 #include <functional>
@@ -29,19 +31,6 @@ struct Answer
 
 /// An answer of a command that exits normally with `code`.
 Answer exits(int code, const std::string& output = "");
-
-/// One log record, taken apart.
-struct Record
-{
-    std::string time;
-    std::string thread;
-    std::string file;
-    std::string line;
-    std::string function;
-    std::string message;
-    bool flushed = false;
-    std::string text; ///< the whole record as it was written
-};
 
 /// Forgets the journal, the answers, the pauses and the hook, and takes over std::cout.
 void reset();

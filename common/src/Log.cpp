@@ -5,6 +5,8 @@
 #include <ctime>
 #include <iomanip>
 #include <iostream>
+#include <locale>
+#include <string>
 #include <thread>
 
 namespace
@@ -26,6 +28,7 @@ LogRecord::LogRecord(const char* file, int line, const char* function)
     const std::time_t now = std::time(nullptr);
     std::tm local = {};
     localtime_r(&now, &local);
+    mText.imbue(std::locale::classic()); // a program's global locale may group the digits of numbers
     mText << "Updater | " << std::put_time(&local, "%d-%m-%Y %H-%M-%S") << '\t' << std::this_thread::get_id() << '\t'
           << baseName(file) << ':' << line << '\t' << function << "\n\t\t\t";
 }
@@ -33,5 +36,8 @@ LogRecord::LogRecord(const char* file, int line, const char* function)
 LogRecord::~LogRecord()
 {
     mText << '\n';
-    std::cout << mText.str() << std::flush;
+    const std::string text = mText.str();
+    // A stream of its own on std::cout's buffer: std::cout would keep the error of one failed write, and drop every
+    // later record.
+    std::ostream(std::cout.rdbuf()).write(text.data(), static_cast<std::streamsize>(text.size())).flush();
 }

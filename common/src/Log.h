@@ -6,7 +6,8 @@
 ///
 /// A record spans two lines: time, thread, source position and function on the first, the message on the second.
 /// It is assembled first and handed over in one flushed write, so that neither another thread's record nor a child
-/// process's output can tear it; into a pipe up to 4096 bytes, pipe(7).
+/// process's output can tear it; into a pipe up to 4096 bytes, pipe(7). Numbers are written in the classic locale. A
+/// record that cannot be written is lost; later ones are written again.
 class LogRecord
 {
 public:

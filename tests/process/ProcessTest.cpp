@@ -1,13 +1,17 @@
 #include "LedManager.h"
 #include "Log.h"
+#include "Record.h"
 #include "Sleep.h"
 #include "UpdateManager.h"
 
 #include <gtest/gtest.h>
 
+#include <array>
 #include <chrono>
 #include <csignal>
 #include <cstdlib>
+#include <fcntl.h>
+#include <locale>
 #include <pthread.h>
 #include <string>
 #include <sys/resource.h>
@@ -22,25 +26,43 @@
 namespace
 {
 
+using Messages = std::vector<std::string>;
+
+/// The message of `text`; fails the test when it is not exactly one record.
+std::string messageOf(const std::string& text)
+{
+    const std::optional<platform::Record> record = platform::parseRecord(text);
+    EXPECT_TRUE(record) << text;
+    return record ? record->message : "";
+}
+
+/// Sends standard output to `descriptor` for the time of a test.
+class Redirection
+{
+public:
+    explicit Redirection(int descriptor) { EXPECT_EQ(dup2(descriptor, STDOUT_FILENO), STDOUT_FILENO); }
+    ~Redirection()
+    {
+        dup2(mStdout, STDOUT_FILENO);
+        close(mStdout);
+    }
+    Redirection(const Redirection&) = delete;
+    Redirection& operator=(const Redirection&) = delete;
+
+private:
+    const int mStdout = dup(STDOUT_FILENO);
+};
+
 /// Takes over standard output for the time of a test, and keeps what each write(2) hands over as one text.
 class Output
 {
 public:
-    Output()
-    {
-        // This kind of socket keeps the bounds of each write.
-        EXPECT_EQ(socketpair(AF_UNIX, SOCK_SEQPACKET, 0, mSockets), 0);
-        EXPECT_EQ(dup2(mSockets[0], STDOUT_FILENO), STDOUT_FILENO);
-    }
-
+    Output() : mSockets(makeSockets()), mRedirection(mSockets[0]) {}
     ~Output()
     {
-        dup2(mStdout, STDOUT_FILENO);
-        close(mStdout);
         close(mSockets[0]);
         close(mSockets[1]);
     }
-
     Output(const Output&) = delete;
     Output& operator=(const Output&) = delete;
 
@@ -56,22 +78,26 @@ public:
     }
 
     /// The messages of the records; fails the test when a write was not exactly one record.
-    std::vector<std::string> messages() const
+    Messages messages() const
     {
-        std::vector<std::string> result;
+        Messages result;
         for (const std::string& text : writes()) {
-            const std::string::size_type end = text.find("\n\t\t\t");
-            EXPECT_EQ(text.compare(0, 10, "Updater | "), 0) << text;
-            EXPECT_EQ(text.find('\n'), end) << text;
-            EXPECT_EQ(text.back(), '\n') << text;
-            result.push_back(text.substr(end + 4, text.size() - end - 5));
+            result.push_back(messageOf(text));
         }
         return result;
     }
 
 private:
-    int mStdout = dup(STDOUT_FILENO);
-    int mSockets[2] = {-1, -1};
+    static std::array<int, 2> makeSockets()
+    {
+        std::array<int, 2> sockets = {-1, -1};
+        // This kind of socket keeps the bounds of each write.
+        EXPECT_EQ(socketpair(AF_UNIX, SOCK_SEQPACKET, 0, sockets.data()), 0);
+        return sockets;
+    }
+
+    const std::array<int, 2> mSockets;
+    const Redirection mRedirection;
 };
 
 class Runner : public testing::Test
@@ -82,8 +108,6 @@ protected:
     Output log;
     std::string output = "from an earlier run";
 };
-
-using Messages = std::vector<std::string>;
 
 TEST_F(Runner, SilentCommandGivesZero)
 {
@@ -224,6 +248,59 @@ TEST_F(Runner, RecordsOfManyThreadsStayWhole)
         thread.join();
     }
     EXPECT_EQ(records, 8U * 25U);
+}
+
+TEST(Log, WritesAgainAfterARecordThatCouldNotBeWritten)
+{
+    int pipe[2] = {-1, -1};
+    ASSERT_EQ(pipe2(pipe, O_NONBLOCK), 0);
+    char buffer[4096] = {};
+    {
+        const Redirection redirection(pipe[1]);
+        while (write(pipe[1], buffer, sizeof buffer) > 0) {
+        }
+        LOG() << "finds the pipe full";
+        while (read(pipe[0], buffer, sizeof buffer) > 0) {
+        }
+        LOG() << "finds room";
+    }
+    const ssize_t size = read(pipe[0], buffer, sizeof buffer);
+    close(pipe[0]);
+    close(pipe[1]);
+    ASSERT_GT(size, 0);
+    EXPECT_EQ(messageOf(std::string(buffer, static_cast<std::size_t>(size))), "finds room");
+}
+
+/// Groups digits: 32512 becomes "32.512".
+class Grouping : public std::numpunct<char>
+{
+    char do_thousands_sep() const override { return '.'; }
+    std::string do_grouping() const override { return "\3"; }
+};
+
+/// The message of a record that is written while the global locale groups digits. The thread, too, is a number: with
+/// points in it there would be no record to take apart.
+std::string messageWithGrouping()
+{
+    const Output output;
+    const std::locale before = std::locale::global(std::locale(std::locale(), new Grouping));
+    LOG() << 32512;
+    std::locale::global(before);
+    return output.messages().at(0);
+}
+
+TEST(Log, WritesNumbersInTheClassicLocale)
+{
+    EXPECT_EQ(messageWithGrouping(), "32512");
+}
+
+TEST(Log, WritesNumbersInTheClassicLocaleAlsoWhenAnotherIsSetLater)
+{
+    {
+        const Output output;
+        LOG() << "first";
+    }
+    EXPECT_EQ(messageWithGrouping(), "32512");
 }
 
 double secondsOf(void (*action)())

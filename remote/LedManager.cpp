@@ -87,9 +87,9 @@ void LedManager::waitForFlashingEnd()
 
 void LedManager::flashingThreadFunction()
 {
-    instance();
-    bool remotePhase = mFlashingEnabled;
-    bool flashing = remotePhase;
+    instance();                       // the panel exists from here on, also where this body is called directly
+    bool flashing = mFlashingEnabled; // false when a stop came before this thread's first look
+    bool remotePhase = true;
     while (flashing) {
         turnOffAll();
         turnOn(remotePhase ? LED_REMOTE : LED_MAIN, COLOR_BLUE);

@@ -47,7 +47,8 @@ public:
     /// Turns off every LED from LED_FIRST to LED_LAST, in this order.
     static void turnOffAll();
 
-    /// Turns on every LED from LED_FIRST to LED_LAST, in this order.
+    /// Turns on every LED from LED_FIRST to LED_LAST, in this order. Part of the panel's interface for both heads'
+    /// programs; the remote head's update only turns them off.
     static void turnOnAll(Color color);
 
     /// @}
@@ -71,6 +72,7 @@ public:
 
     /// @}
     /// @name Sequences that the controller plays by itself
+    /// Part of the panel's interface for both heads' programs; the remote head's update does without them.
     /// @{
 
     /// Clears the sequence of `led`.

@@ -111,7 +111,8 @@ void UpdateManager::updateRemoteHead()
     static const std::string updateCommand = "apt --assume-yes install solvik4-rh";
     std::string installed;
     std::string candidate;
-    bool versionsFound = false;
+    bool packageVersionsFound = false;
+    bool boardVersionsFound = false;
 
     LOG();
     if (!updateMirrors()) {
@@ -120,8 +121,8 @@ void UpdateManager::updateRemoteHead()
         return;
     }
 
-    const bool packageUpdate = checkUpdate(true, command, installed, candidate, versionsFound);
-    if (!versionsFound) {
+    const bool packageUpdate = checkUpdate(true, command, installed, candidate, packageVersionsFound);
+    if (!packageVersionsFound) {
         LOG() << "Failed to checkUpdate";
         instance()->mErrorCallback(ERROR_CHECK_UPDATE);
         return;
@@ -132,7 +133,7 @@ void UpdateManager::updateRemoteHead()
         return;
     }
 
-    const bool boardUpdate = checkQuorbUpdate(installed, candidate, versionsFound);
+    const bool boardUpdate = checkQuorbUpdate(installed, candidate, boardVersionsFound);
     if (boardUpdate && !installQuorbUpdate()) {
         LOG() << "update QUORB failed";
         instance()->mErrorCallback(ERROR_INSTALL_QUORB);
@@ -143,7 +144,7 @@ void UpdateManager::updateRemoteHead()
         instance()->mResultCallback(RESULT_NO_UPDATE);
         return;
     }
-    if (!versionsFound) {
+    if (!boardVersionsFound) {
         LOG() << "Failed to checkUpdate";
         instance()->mErrorCallback(ERROR_CHECK_UPDATE);
         return;
@@ -172,6 +173,7 @@ void UpdateManager::initMainHead()
     std::string installed;
     std::string candidate;
     bool versionsFound = false;
+    bool teamViewerKnown = false;
     std::vector<UpdateComponent> components;
 
     LOG();
@@ -200,12 +202,12 @@ void UpdateManager::initMainHead()
         return;
     }
 
-    if (checkTVUpdate(versionsFound)) {
+    if (checkTVUpdate(teamViewerKnown)) {
         LOG() << "going to install TV";
         // TeamViewer has no versions to read: fixed texts.
         components.push_back({COMPONENT_TEAMVIEWER, "TV", "1", "2"});
     }
-    if (!versionsFound) {
+    if (!teamViewerKnown) {
         LOG() << "Failed to checkUpdate";
         instance()->mErrorCallback(ERROR_CHECK_UPDATE);
         return;

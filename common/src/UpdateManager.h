@@ -138,7 +138,8 @@ public:
     /// @return true when the files reached the board; the script's own status is only logged
     static bool installQuorbUpdate();
 
-    /// Placeholder for a check of the board after its installation; always true.
+    /// Placeholder for a check of the board after its installation; always true. Part of the engine's interface for
+    /// both heads' programs; neither procedure calls it.
     bool verifyQuorb();
 
     /// Looks for the marker on the stick that requests a TeamViewer installation.

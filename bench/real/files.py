@@ -10,10 +10,11 @@ import zipfile
 from pathlib import Path
 from typing import Any
 
-from bench.real.packages import package
+from bench.makers.packages import package
 from bench.scenario import TOOLS
 
 HERE = Path(__file__).parent
+MAKERS = HERE.parent / "makers"
 SOUNDS = {"SND_RESULT_PASS.wav": 880, "SND_RESULT_FAIL.wav": 220}  # Hz
 SOUND_LENGTH = 1.5  # s
 ARCHIVE_PAYLOAD = 200_000  # bytes; more than a full board has left
@@ -137,13 +138,12 @@ def _write_tools(folder: Path, settings: Settings, has_systemd: bool) -> None:
     """What stands in front of the real tools, and with a tool missing, a search path without it."""
     wrappers = folder / "bin"
     shutil.copytree(HERE / "head", wrappers)
-    (wrappers / "killed").unlink()
-    if has_systemd:
-        (wrappers / "systemctl").unlink()
+    if not has_systemd:
+        shutil.copy(MAKERS / "tools/systemctl", wrappers)
     if settings["stick"]["teamviewer"] != "unreadable":
         (wrappers / "ls").unlink()
     for tool in settings["tools"]["killed"]:
-        shutil.copy(HERE / "head/killed", wrappers / tool)
+        shutil.copy(MAKERS / "tools/killed", wrappers / tool)
     (folder / "out").mkdir()
     (folder / "board").mkdir()
     if settings["tools"]["missing"]:

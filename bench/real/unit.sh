@@ -154,7 +154,7 @@ run_systemd() {
     # The control group is joined first: it becomes the root of those that systemd sees.
     (
         sh -c 'echo $PPID' >"$BENCH_CONTROL_GROUP/cgroup.procs"
-        exec unshare --cgroup --pid --ipc --fork --kill-child "$here/systemd.sh" "$head"
+        exec unshare --cgroup --pid --ipc --fork --kill-child "$here/../makers/systemd.sh" "$head"
     ) </dev/null >"$folder/out/systemd" 2>&1 &
     systemd=$!
     echo >"$folder/out/started"

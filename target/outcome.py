@@ -5,10 +5,10 @@ import re
 from dataclasses import dataclass
 from pathlib import Path
 
+from bench.makers.sounds import SOUNDS, samples
 from bench.observation import Run
 from bench.runner import Result
 from bench.unit import Files, State
-from target.inputs import SOUNDS, samples
 
 # A line of QEMU's log: an event of the board's I2C bus (hw/i2c/trace-events).
 EVENT = re.compile(r"i2c_(?P<kind>send|recv) \w+\(addr:0x07\) data:0x(?P<byte>\w\w)")

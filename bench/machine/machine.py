@@ -9,9 +9,12 @@ import time
 from collections.abc import Iterator
 from pathlib import Path
 
+from bench.cleanup import remove_control_group
+from bench.real.systemd import make_control_group, obstacle
+
 # The machine goes with the process that made it, however that ends.
 NAMESPACES = ["setpriv", "--pdeathsig", "KILL", "unshare", "--mount", "--net", "--ipc", "--uts", "--pid", "--fork"]
-NAMESPACES += ["--kill-child"]
+NAMESPACES += ["--kill-child", "--mount-proc"]
 LONGEST_START = 60  # s
 LONGEST_COMMAND = 120  # s
 
@@ -30,13 +33,16 @@ class Machine:
         self.files.mkdir()
         (folder / "memory").mkdir()
         self._namespaces: subprocess.Popen[bytes] | None = None
-        self._first = 0
+        self._control_group: Path | None = None
 
     def start(self) -> None:
         """Returns when systemd is up. Raises MachineError."""
+        if reason := obstacle():
+            raise MachineError(reason)
+        self._control_group = make_control_group(self._folder)
         with (self._folder / "console").open("wb") as console:
             self._namespaces = subprocess.Popen(
-                [*NAMESPACES, Path(__file__).with_name("machine.sh"), self._folder, self.system],
+                [*NAMESPACES, Path(__file__).with_name("machine.sh"), self._folder, self.system, self._control_group],
                 stdin=subprocess.DEVNULL,
                 stdout=console,
                 stderr=console,
@@ -57,7 +63,11 @@ class Machine:
             os.kill(self._first_process(), signal.SIGKILL)
         self._namespaces.kill()
         self._namespaces.wait()
-        self._remove_control_groups()
+        for _ in range(100):  # a group stays busy until its last process is gone
+            remove_control_group(str(self._control_group))
+            if not self._control_group or not self._control_group.exists():
+                return
+            time.sleep(0.05)
 
     def run(self, *command: str) -> str:
         """What the command prints inside; fails with its errors when its status is not 0."""
@@ -73,16 +83,6 @@ class Machine:
     def root(self) -> Path:
         """The machine's root, seen from outside."""
         return Path(f"/proc/{self._first_process()}/root")
-
-    def _remove_control_groups(self) -> None:
-        groups = Path("/sys/fs/cgroup")
-        for top in [*groups.glob(self._folder.name), *groups.glob(f"*/{self._folder.name}")]:
-            for _ in range(100):  # a group stays busy until its last process is gone
-                remove = ["find", top, "-depth", "-type", "d", "-exec", "rmdir", "{}", "+"]
-                subprocess.run(remove, capture_output=True, check=False)
-                if not top.exists():
-                    break
-                time.sleep(0.05)
 
     def _inside(self, *command: str) -> subprocess.CompletedProcess[str]:
         try:

@@ -1,23 +1,20 @@
 """What lies on the real unit before an update: the files of the head, the board and the stick."""
 
-import math
 import os
 import shutil
-import struct
 import subprocess
-import wave
-import zipfile
 from pathlib import Path
 from typing import Any
 
-from bench.makers.packages import package
+from bench.makers import sticks
+from bench.makers.board import write_version
+from bench.makers.files import write
+from bench.makers.packages import DATABASE, SOURCES, kept_package
+from bench.makers.sounds import write_sounds
 from bench.scenario import TOOLS
 
 HERE = Path(__file__).parent
 MAKERS = HERE.parent / "makers"
-SOUNDS = {"SND_RESULT_PASS.wav": 880, "SND_RESULT_FAIL.wav": 220}  # Hz
-SOUND_LENGTH = 1.5  # s
-ARCHIVE_PAYLOAD = 200_000  # bytes; more than a full board has left
 
 Settings = dict[str, dict[str, Any]]
 
@@ -38,9 +35,7 @@ def write_head(folder: Path, settings: Settings, kept: Path, has_systemd: bool) 
     write(folder / "etc/dpkg/dpkg.cfg.d/bench", "force-unsafe-io\n")
     _write_packages(folder, settings, kept)
     (folder / "root/USB_MOUNT").mkdir(parents=True)
-    (folder / "root/RESOURCES/SOUNDS").mkdir(parents=True)
-    for name, pitch in SOUNDS.items():
-        write_sound(folder / "root/RESOURCES/SOUNDS" / name, pitch)
+    write_sounds(folder)
     if settings["head"]["marker"]:
         write(folder / "root/RESOURCES/tavren1stboot", "")
     if settings["head"]["teamviewer_script"] != "absent":
@@ -56,10 +51,7 @@ def write_head(folder: Path, settings: Settings, kept: Path, has_systemd: bool) 
 def write_board(folder: Path, settings: Settings, head: Path) -> None:
     """The board's files: the version file, its sshd's configuration, and the keys on both sides."""
     board = settings["board"]
-    version_file = folder / "root/App/AppExe/version.txt"
-    version_file.parent.mkdir(parents=True)
-    if board["version_file"]:
-        version_file.write_text(board["version_file"].replace("{version}", board["installed"]), newline="")
+    write_version(folder, board["installed"], board["version_file"])
     configuration = (
         "ListenAddress 192.168.9.2\n"
         "HostKey /etc/ssh/host_key\n"
@@ -80,55 +72,31 @@ def write_board(folder: Path, settings: Settings, head: Path) -> None:
 
 def write_stick(folder: Path, settings: Settings) -> None:
     """The stick's files: for each version a zip archive and a script that unpacks it; the marker for TeamViewer."""
-    versions = folder / "debs/QUORB/armhf"
-    versions.mkdir(parents=True)
     script = (HERE / "stick" / f"{settings['board']['script']}.sh").read_text()
-    for directory in settings["stick"]["directories"]:
-        write(versions / directory / "unzipUpgrade.sh", script, 0o755)
-        with zipfile.ZipFile(versions / directory / "OSUpgrade.zip", "w") as archive:
-            archive.writestr("version.txt", f"Name\tQuorb\r\nBrimvale\t{directory[5:]}\r\n")
-            archive.writestr("firmware.bin", os.urandom(ARCHIVE_PAYLOAD))
-    if settings["stick"]["teamviewer"] in ("file", "unreadable"):
-        write(folder / "debs/installTV", "")
-    elif settings["stick"]["teamviewer"] == "directory":
-        (folder / "debs/installTV").mkdir()
-
-
-def write(path: Path, text: str, mode: int = 0o644) -> None:
-    """Writes a file and the folders above it."""
-    path.parent.mkdir(parents=True, exist_ok=True)
-    path.write_text(text)
-    path.chmod(mode)
-
-
-def write_sound(path: Path, pitch: int) -> None:
-    """A WAV file with a tone of `pitch` (Hz)."""
-    rate = 8000
-    samples = [int(12000 * math.sin(2 * math.pi * pitch * at / rate)) for at in range(int(rate * SOUND_LENGTH))]
-    with wave.open(str(path), "wb") as sound:
-        sound.setnchannels(1)
-        sound.setsampwidth(2)
-        sound.setframerate(rate)
-        sound.writeframes(struct.pack(f"<{len(samples)}h", *samples))
+    stick = settings["stick"]
+    sticks.write_stick(folder, stick["directories"], script, teamviewer=stick["teamviewer"])
 
 
 def _write_packages(folder: Path, settings: Settings, kept: Path) -> None:
     """The repository with the package that is offered, and the .deb of the one that is installed at first."""
     name, wanted = head_package(settings), settings["package"]
+    for path in DATABASE:
+        (folder / path).mkdir(parents=True)
+    write(folder / "var/lib/dpkg/status", "")
     scripts = "interrupted" if settings["updater"]["stopped"] == "in-install" else wanted["install"]
     (folder / "srv/installed").mkdir(parents=True)
     if wanted["known"]:
-        shutil.copytree(package(name, wanted["offered"], scripts, kept), folder / "srv/repository")
+        shutil.copytree(kept_package(name, wanted["offered"], scripts, kept), folder / "srv/repository")
         if wanted["installed"] != "(none)":
-            for file in package(name, wanted["installed"], "works", kept).glob("*.deb"):
+            for file in kept_package(name, wanted["installed"], "works", kept).glob("*.deb"):
                 shutil.copy(file, folder / "srv/installed")
     else:
-        shutil.copytree(package("other", "1.0", "works", kept), folder / "srv/repository")
+        shutil.copytree(kept_package("other", "1.0", "works", kept), folder / "srv/repository")
     if wanted["install"] == "locked":
-        [file] = package("other", "1.0", "holds-lock", kept).glob("*.deb")
+        [file] = kept_package("other", "1.0", "holds-lock", kept).glob("*.deb")
         shutil.copy(file, folder / "srv/other.deb")
     where = "repository" if settings["mirrors"]["refresh"] == "works" else "gone"
-    write(folder / "etc/apt/sources.list", f"deb [trusted=yes] file:/srv/{where} ./\n")
+    write(folder / "etc/apt/sources.list", SOURCES.format(folder=where))
     # For apt an older package is no update, unless the unit's own preferences say so.
     write(folder / "etc/apt/preferences", 'Package: *\nPin: origin ""\nPin-Priority: 1001\n')
     write(folder / "etc/apt/apt.conf.d/60downgrade", 'APT::Get::allow-downgrades "true";\n')

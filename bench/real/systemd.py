@@ -1,6 +1,6 @@
 """The real unit's systemd: first process of the head, with the updater and the instrument's application as services.
 
-It needs root and a control group; elsewhere real/head/systemctl stands in for it.
+It needs root and a control group; elsewhere makers/tools/systemctl stands in for it.
 """
 
 import contextlib
@@ -8,7 +8,8 @@ import os
 import subprocess
 from pathlib import Path
 
-from bench.real.files import Settings, write
+from bench.makers.files import write
+from bench.real.files import Settings
 
 PROGRAM = Path("/lib/systemd/systemd")
 ENDED = "bench: the updater has ended: "  # the journal's line behind the updater's last one
@@ -33,7 +34,7 @@ StandardError=append:/opt/bench/out/errors
 KillMode=process
 ExecStopPost=/bin/sh -c 'echo "{ENDED}$$EXIT_CODE $$EXIT_STATUS"'
 """
-# The service manager stops the updater while the package's own script runs, see packages.py.
+# The service manager stops the updater while the package's own script runs, see makers/packages.py.
 STOP_WHEN = """[Unit]
 DefaultDependencies=no
 [Path]
@@ -101,7 +102,6 @@ def write_services(folder: Path, settings: Settings, command: str) -> None:
         wanted.append("stop-in-install.path")
     write(units / "bench.target", TARGET.format(services=" ".join(wanted)))
     write(folder / "etc/systemd/journald.conf", JOURNAL)
-    write(folder / "etc/machine-id", f"{os.urandom(16).hex()}\n")
 
 
 class Journal:

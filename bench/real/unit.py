@@ -11,12 +11,13 @@ import shutil
 import signal
 import subprocess
 import time
-import wave
 from pathlib import Path
 
 from bench.cleanup import remove_control_group
+from bench.makers import board as board_files
+from bench.makers import sounds
 from bench.real import sshd, systemd
-from bench.real.files import HERE, SOUND_LENGTH, SOUNDS, head_package, search_path, write_board, write_head, write_stick
+from bench.real.files import HERE, head_package, search_path, write_board, write_head, write_stick
 from bench.scenario import Scenario, variables
 from bench.unit import PROGRAMS, Files, State, UnitError, with_pid_file
 
@@ -106,7 +107,7 @@ class RealUnit:
         stick = f"{self._folder}/unit/head/root/USB_MOUNT "
         return State(
             package=self._package_version(head / "var/lib/dpkg/status"),
-            board=_board_version(board / "root/App/AppExe/version.txt"),
+            board=board_files.read_version(board),
             marker=(head / "root/RESOURCES/tavren1stboot").exists(),
             stick=stick in Path(f"/proc/{self._first_process()}/mountinfo").read_text(),
             harl=self._harl_state(),
@@ -151,7 +152,7 @@ class RealUnit:
             "BENCH_PACKAGE": head_package(self._settings),
             "BENCH_SERVICE": systemd.updater_service(self._settings),
             "BENCH_SFTP_SERVER": server.sftp_server,
-            "BENCH_SOUND_LENGTH": f"{SOUND_LENGTH / self._speed:.3f}",
+            "BENCH_SOUND_LENGTH": f"{sounds.SECONDS / self._speed:.3f}",
             "BENCH_SSHD": server.sshd,
         }
         text = "".join(f"{name}={shlex.quote(value)}\n" for name, value in values.items())
@@ -199,16 +200,9 @@ class RealUnit:
         """The sounds whose samples reached the sound device, all of them and nothing but silence behind them."""
         found = []
         for played in sorted(self._out.glob("played-*.raw"), key=lambda path: path.stat().st_mtime):
-            samples = played.read_bytes()
-            for name in SOUNDS:
-                with wave.open(str(self._folder / "head/root/RESOURCES/SOUNDS" / name)) as sound:
-                    frames = sound.readframes(sound.getnframes())
-                if samples.startswith(frames) and not samples[len(frames) :].strip(b"\0"):
+            heard = played.read_bytes()
+            for name in sounds.SOUNDS:
+                samples = sounds.samples(name)
+                if heard.startswith(samples) and not heard[len(samples) :].strip(b"\0"):
                     found.append(name)
         return found
-
-
-def _board_version(file: Path) -> str:
-    lines = file.read_text().splitlines() if file.exists() else []
-    versions = [line.split("\t", 1)[1] for line in lines if line.startswith("Brimvale\t")]
-    return versions[-1] if versions else ""

@@ -9,51 +9,21 @@ set -eu
 PATH=$PATH:/usr/sbin:/sbin # a plain user's goes without
 folder=$1
 here=$(dirname "$0")
+makers=$here/../makers
 head=$folder/unit/head
 board=$folder/unit/board
 # shellcheck disable=SC1091 # made by unit.py
 . "$folder/variables"
+# shellcheck source=bench/makers/root.sh
+. "$makers/root.sh"
 
 fail() {
     echo "$*" >&2
     exit 1
 }
 
-# A root of its own: the host's /usr read-only, devices and everything else private.
-make_root() { # ROOT USER_ID
-    mkdir -p "$1"
-    mount --bind "$1" "$1"
-    cd "$1"
-    mkdir -p usr proc dev run tmp etc root opt srv var/log
-    chmod 1777 tmp
-    for link in bin sbin lib lib64; do ln -s "usr/$link" "$link"; done
-    mount --rbind /usr usr
-    mount -o remount,bind,ro usr
-    mount --bind /proc proc
-    mount -t tmpfs -o mode=755 dev dev
-    mkdir dev/pts dev/shm
-    for device in null zero full random urandom tty; do
-        : >"dev/$device"
-        mount --bind "/dev/$device" "dev/$device"
-    done
-    ln -s /proc/self/fd dev/fd
-    mount -t devpts -o newinstance,ptmxmode=666 devpts dev/pts
-    ln -s pts/ptmx dev/ptmx
-    cp -rP /etc/ld.so.cache /etc/alternatives etc/
-    if [ -e /etc/localtime ]; then cp -L /etc/localtime etc/localtime; fi
-    printf 'root:x:%s:%s::/root:/bin/sh\n' "$2" "$2" >etc/passwd
-    printf 'root:x:%s:\n' "$2" >etc/group
-    cd /
-}
-
-add_files() { # ROOT FILES
-    cp -r "$2/." "$1"
-    chmod 700 "$1/root" "$1/root/.ssh"
-    chmod 600 "$1"/root/.ssh/*
-}
-
 start_board() {
-    make_root "$board" 1000
+    make_root "$board" / 1000
     if [ "$BOARD_DISK" = full ]; then mount -t tmpfs -o size=64k disk "$board/root"; fi
     add_files "$board" "$folder/board"
     mkfifo "$board/run/requests" "$board/run/answers"
@@ -91,9 +61,6 @@ wait_for_board() {
 # A package database with the older package in it, made by dpkg itself.
 install_package() {
     cd "$head"
-    mkdir -p etc/apt/preferences.d var/lib/dpkg/info var/lib/dpkg/updates var/lib/apt/lists/partial \
-        var/cache/apt/archives/partial var/log/apt
-    : >var/lib/dpkg/status
     for package in srv/installed/*.deb; do
         [ -e "$package" ] || continue
         in_head dpkg --install "/$package" >"$folder/out/dpkg" 2>&1 || fail "$(cat "$folder/out/dpkg")"
@@ -135,7 +102,7 @@ run_updater() {
     # shellcheck disable=SC2086 # words by intention
     setsid chroot "$head" $BENCH_COMMAND </dev/null >"$folder/out/log" 2>"$folder/out/errors" &
     updater=$!
-    echo $updater >"$head/run/updater.pid"
+    echo $updater >"$head/run/unit.pid"
     echo >"$folder/out/started"
     status=0
     wait $updater || status=$?
@@ -145,17 +112,9 @@ run_updater() {
 
 # Runs systemd as the first process of the head's own process namespace, with the updater as one of its services.
 run_systemd() {
-    mount -t tmpfs -o mode=755 run "$head/run"
     start_events
-    umount "$head/proc"
-    mkdir "$head/sys"
-    mount -t sysfs -o ro sysfs "$head/sys"
-    : >"$head/dev/console"
-    # The control group is joined first: it becomes the root of those that systemd sees.
-    (
-        sh -c 'echo $PPID' >"$BENCH_CONTROL_GROUP/cgroup.procs"
-        exec unshare --cgroup --pid --ipc --fork --kill-child "$here/../makers/systemd.sh" "$head"
-    ) </dev/null >"$folder/out/systemd" 2>&1 &
+    (become_systemd "$BENCH_CONTROL_GROUP" "$head" bench.target --pid --ipc --fork --kill-child) \
+        </dev/null >"$folder/out/systemd" 2>&1 &
     systemd=$!
     echo >"$folder/out/started"
     # journalctl fails until the journal has its first entry.
@@ -167,7 +126,7 @@ run_systemd() {
 
 mount -t tmpfs unit "$folder/unit"
 start_board
-make_root "$head" 0
+make_root "$head" / 0
 add_files "$head" "$folder/head"
 mount --bind "$folder/out" "$head/opt/bench/out"
 mount --bind "$board/run" "$head/opt/bench/board"

@@ -2,7 +2,7 @@
 # The tools of the stand-in unit. Its search path holds a link to this file for each of them, and nothing else.
 #
 # UNIT is the folder that holds the unit's state; the scenario comes in one variable for each of its keys, such as
-# BOARD_LINK. The tools change the state as the real ones would: a second run would find what this one left.
+# BOARD_LINK, and BENCH_TOOLS is the folder of the tools that are the same on every unit. The tools change the state as the real ones would: a second run would find what this one left.
 # shellcheck disable=SC2154 # the scenario's variables
 set -u
 
@@ -19,13 +19,6 @@ fail() { # STATUS MESSAGE
     exit "$1"
 }
 
-# Stops the updater as the service manager does: the updater alone gets a signal, and it has ended on return.
-stop_updater() {
-    read -r updater <"$UNIT/unit.pid"
-    kill -s TERM "$updater"
-    while kill -s 0 "$updater" 2>/dev/null; do /bin/sleep 0.02; done
-}
-
 board_answers() {
     case $BOARD_LINK in
     down | hangs) fail 255 "ssh: connect to host 192.168.9.2 port 22: Connection timed out" ;;
@@ -34,19 +27,6 @@ board_answers() {
     case $BOARD_LOGIN in
     key-refused) fail 255 "root@192.168.9.2: Permission denied (publickey)." ;;
     host-key-changed) fail 255 "Host key verification failed." ;;
-    esac
-}
-
-systemctl() {
-    case "$*" in
-    "stop harl-updater")
-        [ "$UPDATER_STOPPED" = never ] || stop_updater
-        ;;
-    "stop harl" | "start harl")
-        [ "$HEAD_HARL" = known ] || fail 5 "Failed to $1 harl.service: Unit harl.service not loaded."
-        [ "$1" = start ] && echo active >"$UNIT/harl"
-        [ "$1" = start ] || echo inactive >"$UNIT/harl"
-        ;;
     esac
 }
 
@@ -84,7 +64,7 @@ apt() {
     "--assume-yes install "*)
         if [ "$UPDATER_STOPPED" = in-install ]; then
             /bin/sleep 0.3
-            stop_updater
+            "$BENCH_TOOLS/systemctl" stop harl-updater
             exec /bin/sleep 60 # the package's script goes on
         fi
         [ "$PACKAGE_KNOWN" = true ] || fail 100 "E: Unable to locate package $3"
@@ -173,13 +153,11 @@ aplay() {
 
 case " $TOOLS_KILLED " in
 *" $tool "*)
-    # The shell that ran the tool, unless it became the tool, dies with it: that is what the updater gets to see.
-    read -r parent </proc/$PPID/comm
-    [ "$parent" != sh ] || kill -KILL "$PPID"
-    kill -KILL $$
+    exec "$BENCH_TOOLS/killed"
     ;;
 esac
 case $tool in
 apt-cache) apt_cache "$@" ;;
+systemctl) exec "$BENCH_TOOLS/systemctl" "$@" ;;
 *) "$tool" "$@" ;;
 esac

@@ -6,10 +6,15 @@ import signal
 import subprocess
 from pathlib import Path
 
+from bench.makers import board, sticks
+from bench.makers.sounds import FOLDER as SOUND_FOLDER
+from bench.makers.sounds import SOUNDS
 from bench.scenario import TOOLS, Scenario, variables
 from bench.unit import PROGRAMS, Files, State, with_pid_file
 
 HERE = Path(__file__).parent
+TOOLS_FOLDER = HERE.parent / "makers/tools"
+UNPACK = f"/bin/cp root/OSUpgrade.zip {board.VERSION_FILE}\n"  # where there is no unzip
 
 
 def sanitizers(program: Path) -> list[str]:
@@ -53,7 +58,7 @@ class StandInUnit:
         is_service = self._settings["updater"]["stopped"] != "never"
         return State(
             package=self._read("package") if self._settings["package"]["known"] else "(none)",
-            board=self._board_version(),
+            board=board.read_version(self._folder / "board"),
             marker=(self._folder / "head/RESOURCES/tavren1stboot").exists(),
             stick=(self._folder / "head/USB_MOUNT").is_symlink(),
             harl=self._read("harl") if known else "unknown",
@@ -74,18 +79,12 @@ class StandInUnit:
     def _read(self, name: str) -> str:
         return (self._folder / name).read_text().strip()
 
-    def _board_version(self) -> str:
-        file = self._folder / "board/root/App/AppExe/version.txt"
-        lines = file.read_text().splitlines() if file.exists() else []
-        versions = [line.split("\t", 1)[1] for line in lines if line.startswith("Brimvale\t")]
-        return versions[-1] if versions else ""
-
     def _make_head(self) -> None:
         (self._folder / "package").write_text(self._settings["package"]["installed"] + "\n")
         (self._folder / "harl").write_text("active\n")
-        sounds = self._folder / "head/RESOURCES/SOUNDS"
+        sounds = self._folder / SOUND_FOLDER.replace("root", "head", 1)
         sounds.mkdir(parents=True)
-        for name in ("SND_RESULT_PASS.wav", "SND_RESULT_FAIL.wav"):
+        for name in SOUNDS:
             (sounds / name).touch()
         if self._settings["head"]["marker"]:
             (self._folder / "head/RESOURCES/tavren1stboot").touch()
@@ -96,40 +95,25 @@ class StandInUnit:
                 (tools / tool).symlink_to(HERE / "tools.sh")
 
     def _make_board(self) -> None:
-        board = self._settings["board"]
-        folder = self._folder / "board/root/App/AppExe"
-        folder.mkdir(parents=True)
-        if board["version_file"]:
-            text = board["version_file"].replace("{version}", board["installed"])
-            (folder / "version.txt").write_text(text, newline="")
+        settings = self._settings["board"]
+        board.write_version(self._folder / "board", settings["installed"], settings["version_file"])
 
     def _make_stick(self) -> None:
         stick = self._settings["stick"]
-        (self._folder / "head/USB_MOUNT").mkdir()
         if not stick["inserted"]:
+            (self._folder / "head/USB_MOUNT").mkdir()
             return
-        versions = self._folder / "stick/debs/QUORB/armhf"
-        versions.mkdir(parents=True)
-        for directory in stick["directories"]:
-            (versions / directory).mkdir()
-            # The stand-in archive is the new version file itself.
-            content = f"Name\tQuorb\r\nBrimvale\t{directory[5:]}\r\n"
-            (versions / directory / "OSUpgrade.zip").write_text(content, newline="")
-            unpack = "/bin/cp root/OSUpgrade.zip root/App/AppExe/version.txt\n"
-            script = "exit 3\n" if self._settings["board"]["script"] == "fails" else unpack
-            (versions / directory / "unzipUpgrade.sh").write_text(script)
-        teamviewer = self._folder / "stick/debs/installTV"
-        if stick["teamviewer"] == "file":
-            teamviewer.touch()
-        elif stick["teamviewer"] == "directory":
-            teamviewer.mkdir()
-        (self._folder / "head/USB_MOUNT").rmdir()
+        script = "exit 3\n" if self._settings["board"]["script"] == "fails" else UNPACK
+        sticks.write_stick(
+            self._folder / "stick", stick["directories"], script, sticks.version_file_archive, stick["teamviewer"]
+        )
         (self._folder / "head/USB_MOUNT").symlink_to(self._folder / "stick")
 
     def _start_updater(self) -> None:
         environment = {
             "PATH": str(self._folder / "bin"),
             "UNIT": str(self._folder),
+            "BENCH_TOOLS": str(TOOLS_FOLDER),
             "BENCH_CALLS": str(self.files.calls),
             "BENCH_SPEED": str(self._speed),
         } | variables(self._settings)

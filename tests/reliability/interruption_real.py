@@ -36,9 +36,9 @@ AT_ONCE = 3
 POINTS = COMMANDS | {"unpack": ("dpkg", "*--unpack*"), "configure": ("dpkg", "*--configure*")}
 # Everything on the head has this root; the board and the bench have others.
 KILLS = {
-    "updater": 'read -r updater </run/updater.pid; kill -s KILL "$updater"',
+    "updater": 'read -r updater </run/unit.pid; kill -s KILL "$updater"',
     # The updater first: it must not go on while its command is already gone.
-    "unit": """read -r updater </run/updater.pid
+    "unit": """read -r updater </run/unit.pid
 kill -s KILL "$updater"
 for process in /proc/[0-9]*; do
     [ "$(/usr/bin/readlink "$process/root")" = / ] && [ "${process#/proc/}" != $$ ] && kill -s KILL "${process#/proc/}"

@@ -15,6 +15,9 @@ from collections.abc import Callable
 from pathlib import Path
 
 from bench.machine.machine import Machine, MachineError, machine
+from bench.makers.files import write, write_script
+from bench.makers.packages import DATABASE, SOURCES, Package, build, raise_version, write_index
+from bench.makers.sticks import VERSIONS, version_file_archive, write_stick
 from bench.observation import RECORD
 from bench.panel import Panel, color_name, led_name
 
@@ -22,6 +25,7 @@ ROOT = Path(__file__).parents[2]
 
 
 SKIPPED = 77
+STICK = "/root/USB_MOUNT"
 SPEED = 10  # times shorter waits of the updater
 TOOLS = {
     # As i2c-tools 4.3: the panel's address only with -a. The panel keeps what it is sent.
@@ -37,7 +41,7 @@ case $* in
 esac
 """,
     # Reads from the stick for as long as it takes.
-    "scp": "exec 3</root/USB_MOUNT/debs/QUORB/armhf/quorb2.2.0/OSUpgrade.zip; touch /run/uploads; exec /opt/scp 60",
+    "scp": f"exec 3<{STICK}/{VERSIONS}/quorb2.2.0/OSUpgrade.zip; touch /run/uploads; exec /opt/scp 60",
 }
 SLOW_SCRIPT = """
 touch /run/package-installs
@@ -45,65 +49,36 @@ sleep 10
 echo "a script that goes on talking"
 systemctl is-active harl >/run/harl-after || true
 """
-CONTROL = """Package: {name}
-Version: {version}
-Architecture: all
-Maintainer: Test <test@localhost>
-Description: test
-{fields}
-"""
 # Ordered after the updater: its start must not wait for a service that waits for it.
 HARL = "[Unit]\nAfter=harl-updater.service\n[Service]\nExecStart=/bin/sleep infinity\n"
 
-
-FOLDERS = ["etc/apt/preferences.d", "opt", "root/RESOURCES/SOUNDS", "root/USB_MOUNT", "srv/repository", "var/log/apt"]
-FOLDERS += ["var/cache/apt/archives/partial", "var/lib/apt/lists/partial", "var/lib/dpkg/info", "var/lib/dpkg/updates"]
+FOLDERS = [*DATABASE, "opt", "root/RESOURCES/SOUNDS", "root/USB_MOUNT", "srv/repository"]
 
 
-def make_files(unit: Machine, package: Path, build: Path) -> None:
+def make_files(unit: Machine, package: Path, programs: Path) -> None:
     """Writes what the machine has: tools, packages and the application."""
     files = unit.files
     for name, text in TOOLS.items():
-        write(files / "usr/local/sbin" / name, f"#!/bin/bash\n{text.strip()}\n", 0o755)
+        write_script(files / "usr/local/sbin" / name, text)
     write(files / "etc/systemd/system/harl.service", HARL)
-    write(files / "etc/apt/sources.list", "deb [trusted=yes] file:/srv/repository ./\n")
+    write(files / "etc/apt/sources.list", SOURCES.format(folder="repository"))
     write(files / "etc/apt/apt.conf.d/50test", 'APT::Sandbox::User "root";\n')
     (files / "etc/systemd/system/dbus.socket").symlink_to("/dev/null")  # apt would wait for a login manager behind it
     write(files / "srv/board", "2.2.0\n")
     for folder in FOLDERS:
-        (files / folder).mkdir(parents=True)
+        (files / folder).mkdir(parents=True, exist_ok=True)
     write(files / "var/lib/dpkg/status", "")
     shutil.copy(package, files / "srv/updater.deb")
-    shutil.copy(build / "bench/call_recorder.so", files / "opt")
+    shutil.copy(programs / "bench/call_recorder.so", files / "opt")
     shutil.copy(unit.system / "usr/bin/sleep", files / "opt/scp")
-
-
-def write(path: Path, text: str, mode: int = 0o644) -> None:
-    """Writes a file, with the folders above it."""
-    path.parent.mkdir(parents=True, exist_ok=True)
-    path.write_text(text)
-    path.chmod(mode)
-
-
-def make_package(
-    unit: Machine, folder: str, name: str, version: str, script: str = "", fields: str = "", when: str = "postinst"
-) -> str:
-    """Builds a package inside the machine, with a maintainer script of these lines; its path."""
-    tree = unit.root() / "srv/tree"
-    write(tree / "DEBIAN/control", CONTROL.format(name=name, version=version, fields=fields).strip() + "\n")
-    write(tree / "DEBIAN" / when, f"#!/bin/sh\nset -e\n{script}\n", 0o755)
-    path = f"{folder}/{name}_{version}.deb"
-    unit.run("dpkg-deb", "--build", "/srv/tree", path)
-    unit.run("rm", "-r", "/srv/tree")
-    return path
 
 
 def install(unit: Machine) -> None:
     """Installs the package under test, and a package that stands for all that it depends on."""
     depends = unit.run("dpkg-deb", "--field", "/srv/updater.deb", "Depends")
     names = ", ".join(f"{item.split()[0]} (= 9999)" for item in depends.split(","))
-    tools = make_package(unit, "/srv", "tools", "1.0", fields=f"Provides: {names}")
-    unit.run("dpkg", "--install", tools, "/srv/updater.deb")
+    tools = build(Package("tools", "1.0", {"Provides": names}), unit.root() / "srv")
+    unit.run("dpkg", "--install", f"/srv/{tools.name}", "/srv/updater.deb")
 
 
 def wait_for(what: str, condition: Callable[[], bool], seconds: float = 60) -> None:
@@ -127,11 +102,11 @@ class ServiceTest(unittest.TestCase):
         self.inside("sh", "-c", "rm -f /run/package-installs /run/uploads /run/harl-* /var/log/panel /var/log/sounds")
         self.inside("touch", "/root/RESOURCES/tavren1stboot", "/var/log/panel", "/var/log/sounds")
         self.inside("sh", "-c", "mount -t tmpfs stick /root/USB_MOUNT")
-        self.inside("mkdir", "-p", "/root/USB_MOUNT/debs/QUORB/armhf/quorb2.2.0")
-        self.inside("touch", "/root/USB_MOUNT/debs/QUORB/armhf/quorb2.2.0/OSUpgrade.zip")
+        write_stick(self.unit.root() / STICK.lstrip("/"), ["quorb2.2.0"], "", version_file_archive)
         self.inside("sh", "-c", "echo 2.2.0 >/srv/board; rm -rf /srv/repository/*")
         self.inside("dpkg", "--purge", "solvik4-rh", "solvik4-data")
-        self.inside("dpkg", "--install", make_package(self.unit, "/srv", "solvik4-rh", "1.2.0"))
+        self.inside("dpkg", "--install", f"/srv/{build(Package('solvik4-rh', '1.2.0'), self.unit.root() / 'srv').name}")
+        self.repository = self.unit.root() / "srv/repository"
         self.set_speed(SPEED)
         self.inside("systemctl", "start", "harl")
 
@@ -149,10 +124,11 @@ class ServiceTest(unittest.TestCase):
         write(folder / "test.conf", text)
         self.inside("systemctl", "daemon-reload")
 
-    def offer(self, script: str = "", fields: str = "") -> None:
-        """Offers solvik4-rh 1.3.0."""
-        make_package(self.unit, "/srv/repository", "solvik4-rh", "1.3.0", script, fields)
-        self.inside("sh", "-c", "cd /srv/repository && dpkg-scanpackages --multiversion . >Packages")
+    def offer(self, script: str = "", depends: str = "") -> None:
+        """Offers solvik4-rh 1.3.0, with a maintainer script of these lines, beside what the repository already has."""
+        fields = {"Depends": depends} if depends else {}
+        build(Package("solvik4-rh", "1.3.0", fields, {"postinst": script}), self.repository)
+        write_index(self.repository)
 
     def start(self) -> None:
         """Starts the service."""
@@ -242,8 +218,8 @@ class Ends(ServiceTest):
 
     def test_killed_during_the_installation(self) -> None:
         # With the first of two packages not yet unpacked, most of the work is still to be done.
-        make_package(self.unit, "/srv/repository", "solvik4-data", "1.3.0", SLOW_SCRIPT, when="preinst")
-        self.offer("echo configured", "Depends: solvik4-data")
+        build(Package("solvik4-data", "1.3.0", scripts={"preinst": SLOW_SCRIPT}), self.repository)
+        self.offer("echo configured", "solvik4-data")
         self.start()
         self.wait_for_file("/run/package-installs")
         self.kill("KILL")
@@ -328,7 +304,7 @@ class Ends(ServiceTest):
 
     def test_installation_that_a_power_cut_left_behind_is_finished(self) -> None:
         self.offer("touch /run/package-installs")
-        self.inside("dpkg", "--unpack", "/srv/repository/solvik4-rh_1.3.0.deb")
+        self.inside("dpkg", "--unpack", "/srv/repository/solvik4-rh_1.3.0_all.deb")
         self.start()
         self.wait_for_end()
         self.assertTrue((self.unit.root() / "run/package-installs").exists())
@@ -352,7 +328,7 @@ class Ends(ServiceTest):
 
     def test_stopped_while_an_installation_that_a_power_cut_left_behind_is_finished(self) -> None:
         self.offer(SLOW_SCRIPT)
-        self.inside("dpkg", "--unpack", "/srv/repository/solvik4-rh_1.3.0.deb")
+        self.inside("dpkg", "--unpack", "/srv/repository/solvik4-rh_1.3.0_all.deb")
         self.inside("systemctl", "start", "--no-block", "harl-updater")
         self.wait_for_file("/run/package-installs")
         self.inside("systemctl", "stop", "harl-updater")
@@ -363,18 +339,16 @@ class Ends(ServiceTest):
 
     def test_package_that_cannot_be_set_up_does_not_keep_the_updater(self) -> None:
         self.offer("exit 1")
-        self.inside("dpkg", "--unpack", "/srv/repository/solvik4-rh_1.3.0.deb")
+        self.inside("dpkg", "--unpack", "/srv/repository/solvik4-rh_1.3.0_all.deb")
         self.start()
         self.wait_for_end()
         self.assertEqual(self.ended_as(), ("success", "2", "15"))
         self.assert_given_back()
 
     def test_upgrade_of_the_updater_in_its_own_run(self) -> None:
-        self.inside("dpkg-deb", "--raw-extract", "/srv/updater.deb", "/srv/newer")
-        self.inside("sed", "-i", "s/^Version: .*/Version: 9.0.0/", "/srv/newer/DEBIAN/control")
-        self.inside("sh", "-c", "echo '# newer' >>/srv/newer/lib/systemd/system/harl-updater.service")
-        self.inside("dpkg-deb", "--build", "/srv/newer", "/srv/repository/updater_9.0.0.deb")
-        self.offer("systemctl daemon-reload\ntouch /run/package-installs\n", f"Depends: {self.package} (>= 9.0.0)")
+        service = "lib/systemd/system/harl-updater.service"
+        raise_version(self.unit.root() / "srv/updater.deb", "9.0.0", self.repository, {service: "# newer\n"})
+        self.offer("systemctl daemon-reload\ntouch /run/package-installs\n", f"{self.package} (>= 9.0.0)")
         self.start()
         self.wait_for_file("/run/package-installs")
         self.assertEqual(int(self.show("MainPID")), self.main)
@@ -407,7 +381,7 @@ def skip(why: str) -> None:
 
 
 if __name__ == "__main__":
-    build, package, system = Path(sys.argv[1]), sys.argv[2], Path(sys.argv[3])
+    programs, package, system = Path(sys.argv[1]), sys.argv[2], Path(sys.argv[3])
     architecture = subprocess.check_output(["dpkg", "--print-architecture"], text=True).strip()
     found = sorted((ROOT / "build/package").glob(f"{package}_*_{architecture}.deb"))
     if not found:
@@ -415,7 +389,7 @@ if __name__ == "__main__":
     if os.geteuid() != 0:
         skip("systemd as the first process of a machine of its own needs root")
     with machine(system) as made:
-        make_files(made, found[-1], build)
+        make_files(made, found[-1], programs)
         try:
             made.start()
         except MachineError as error:

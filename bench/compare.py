@@ -53,26 +53,26 @@ def differences(scenario: Scenario, result: Result) -> list[str]:
         if expected != seen:
             found.append(f"{what}: expected {expected!r}, not {seen!r}")
 
-    if status not in expect["status"]:
-        found.append(f"status: expected one of {expect['status']}, not {status}")
+    if status not in expect.status:
+        found.append(f"status: expected one of {expect.status}, not {status}")
     commands = [call.text for call in run.commands()]
-    expected = expected_commands(expect["commands"])
+    expected = expected_commands(expect.commands)
     for index, (line, seen) in enumerate(zip(expected, commands), 1):
         same(f"command {index}", line, seen)
     same("number of commands", len(expected), len(commands))
-    same("waits", expect["waits"], [call.seconds for call in run.waits()])
-    logs = [expected_log(expect["log"]), seen_log(run)]
+    same("waits", expect.waits, [call.seconds for call in run.waits()])
+    logs = [expected_log(expect.log), seen_log(run)]
     if not result.log_is_exact:
         logs = [[re.sub(r"(\s|\\r)+$", "", line) for line in log] for log in logs]
     if difference := log_difference(*logs):
         found.append(difference)
     pattern = run.panel.pattern(now())
-    if "any" in expect["panel"]:  # ended while it flashed
-        pattern = {"any": color for color in pattern.values()} or expect["panel"]
-    same("panel", expect["panel"], pattern)
+    if "any" in expect.panel:  # ended while it flashed
+        pattern = {"any": color for color in pattern.values()} or expect.panel
+    same("panel", expect.panel, pattern)
     same("panel faults", [], run.panel.faults)
-    sound = {"": [], "pass": ["SND_RESULT_PASS.wav"], "fail": ["SND_RESULT_FAIL.wav"]}[expect["sound"]]
+    sound = {"": [], "pass": ["SND_RESULT_PASS.wav"], "fail": ["SND_RESULT_FAIL.wav"]}[expect.sound]
     same("sound", sound, state.sounds)
     for key in ("package", "board", "marker", "stick", "harl"):
-        same(key, expect[key], getattr(state, key))
+        same(key, getattr(expect, key), getattr(state, key))
     return found

@@ -77,14 +77,14 @@ class Summary:
 
     def rows(self) -> list[tuple[str, str]]:
         """Names and values."""
-        result, state, before = self.result, self.result.state, self.scenario.unit
+        result, state, before = self.result, self.result.state, self.scenario.setup
         status = f"ended by signal {-result.status}" if result.status < 0 else f"exit status {result.status}"
         return [
             ("Outcome", self.outcome),
             ("Panel", panel_line(result.run.panel.shown(now()))),
             ("Sound", ", ".join(state.sounds) or "none"),
-            ("Package", f"{before['package']['installed']} -> {state.package}"),
-            ("Board", f"{before['board']['installed']} -> {state.board or '(cannot be read)'}"),
+            ("Package", f"{before.package.installed} -> {state.package}"),
+            ("Board", f"{before.board.installed} -> {state.board or '(cannot be read)'}"),
             ("First-boot marker", "there" if state.marker else "gone"),
             ("Stick", "mounted" if state.stick else "released"),
             ("harl", state.harl),

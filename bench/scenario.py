@@ -1,98 +1,134 @@
-"""Scenario files: what a unit is like before an update, and what must come out. docs/bench.md tells how to add one."""
+"""Scenario files: what a unit is like before an update, and what must come out. docs/bench.md explains how to add one.
+
+The dataclasses are the sections of a file: their fields are its keys, with defaults and allowed values.
+"""
 
 import re
-from dataclasses import dataclass
+from dataclasses import dataclass, field, fields
 from pathlib import Path
-from typing import Any
+from typing import Any, Literal, get_args, get_type_hints
 
 import tomllib
 
 from bench.expected import expected_commands, expected_log
+from bench.fields import FieldError, check, fill
+from bench.makers.board import TEXT as VERSION_FILE
 
 FOLDER = Path(__file__).parent / "scenarios"
-TOOLS = ["systemctl", "umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp", "i2cset", "aplay"]
 
-# Section, key: what stands when a file says nothing, and what else it may say. A list is a choice; a type is any value
-# of that type.
-UNIT: dict[str, dict[str, tuple[Any, Any]]] = {
-    "package": {
-        "installed": ("1.2.0", str),  # "(none)": known but not installed
-        "offered": ("1.3.0", str),  # by the repository; equal to installed, newer or older
-        "known": (True, bool),  # False: no repository and no installation knows the package
-        # fails: its maintainer script exits 1. asks: it has a question and nobody answers.
-        # locked: another package tool holds the database for some seconds.
-        "install": ("works", ["works", "fails", "asks", "locked"]),
-    },
-    "mirrors": {
-        "refresh": ("works", ["works", "unreachable"]),  # unreachable: apt exits 100
-    },
-    "board": {
-        "installed": ("2.1.0", str),
-        # text of /root/App/AppExe/version.txt; "{version}" stands for `installed`. "" means that there is no file.
-        "version_file": ("Name\tQuorb\r\nBrimvale\t{version}\r\n", str),
-        # lost: gone after the version was read, before the first upload. dies: gone in the middle of the upload.
-        "link": ("up", ["up", "down", "hangs", "slow", "lost", "dies"]),
-        "login": ("accepted", ["accepted", "key-refused", "host-key-changed"]),
-        "disk": ("free", ["free", "full"]),  # full: the archive does not fit
-        "uploads_lost": (0, int),  # that many upload attempts fail before one succeeds
-        # hangs-up: it ends the connection. never-returns: ended by the scenario some real seconds later.
-        "script": ("works", ["works", "fails", "hangs-up", "never-returns"]),
-    },
-    "stick": {
-        "inserted": (True, bool),
-        "directories": (["quorb2.2.0"], list),  # version directories under debs/QUORB/armhf
-        # debs/installTV. unreadable: ls exits with a code that no file system brings about.
-        "teamviewer": ("absent", ["absent", "file", "directory", "unreadable"]),
-        "pulled_out": ("never", ["never", "before-upload"]),
-    },
-    "head": {
-        "marker": (True, bool),  # /root/RESOURCES/tavren1stboot
-        "harl": ("known", ["known", "unknown"]),  # to the service manager
-        "panel": ("present", ["present", "absent"]),  # the LED controller on its bus
-        "sound": ("present", ["present", "absent"]),  # the sound device
-        "teamviewer_script": ("works", ["works", "fails", "absent"]),
-    },
-    "tools": {
-        "missing": ([], list),  # not on the search path
-        "killed": ([], list),  # a signal ends them, with the shell that ran them
-    },
-    "updater": {
-        "program": ("remote", ["remote", "main"]),  # main: the main-head driver
-        "arguments": ([], list),
-        "children": ("waited-for", ["waited-for", "ignored"]),  # ignored: started with SIGCHLD ignored
-        # by the service manager. at-its-end: by its own last command. in-install: while the package is being installed.
-        "stopped": ("at-its-end", ["never", "at-its-end", "in-install"]),
-    },
-}
+Tool = Literal["systemctl", "umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp", "i2cset", "aplay"]
+TOOLS: tuple[Tool, ...] = get_args(Tool)
 
-EXPECT: dict[str, Any] = {
-    "status": list,  # exit codes, or minus signal numbers, that the updater may end with
+
+@dataclass
+class Package:
+    """The head's own package."""
+
+    installed: str = "1.2.0"  # "(none)": known but not installed
+    offered: str = "1.3.0"  # by the repository; equal to installed, newer or older
+    known: bool = True  # False: no repository and no installation knows the package
+    # fails: its maintainer script exits 1. asks: it has a question and nobody answers.
+    # locked: another package tool holds the database for some seconds.
+    install: Literal["works", "fails", "asks", "locked"] = "works"
+    downgrades: bool = False  # apt is told to replace a newer version by an older one
+
+
+@dataclass
+class Mirrors:
+    """The package mirrors."""
+
+    refresh: Literal["works", "unreachable"] = "works"  # unreachable: apt exits 100
+
+
+@dataclass
+class Board:
+    """The coprocessor board and the link to it."""
+
+    installed: str = "2.1.0"
+    # text of /root/App/AppExe/version.txt; "{version}" is replaced by `installed`. "" means that there is no file.
+    version_file: str = VERSION_FILE
+    # lost: gone after the version was read, before the first upload. dies: gone in the middle of the upload.
+    link: Literal["up", "down", "hangs", "slow", "lost", "dies"] = "up"
+    login: Literal["accepted", "key-refused", "host-key-changed"] = "accepted"
+    disk: Literal["free", "full"] = "free"  # full: the archive does not fit
+    uploads_lost: int = 0  # that many upload attempts fail before one succeeds
+    # hangs-up: it ends the connection. never-returns: ended by the scenario some real seconds later.
+    script: Literal["works", "fails", "hangs-up", "never-returns"] = "works"
+
+
+@dataclass
+class Stick:
+    """The USB stick."""
+
+    inserted: bool = True
+    directories: list[str] = field(default_factory=lambda: ["quorb2.2.0"])  # version directories under debs/QUORB/armhf
+    # debs/installTV. unreadable: ls exits with a code that no file system brings about.
+    teamviewer: Literal["absent", "file", "directory", "unreadable"] = "absent"
+    pulled_out: Literal["never", "before-upload"] = "never"
+
+
+@dataclass
+class Head:
+    """The head."""
+
+    marker: bool = True  # /root/RESOURCES/tavren1stboot
+    harl: Literal["known", "unknown"] = "known"  # to the service manager
+    panel: Literal["present", "absent"] = "present"  # the LED controller on its bus
+    sound: Literal["present", "absent"] = "present"  # the sound device
+    teamviewer_script: Literal["works", "fails", "absent"] = "works"
+
+
+@dataclass
+class Tools:
+    """The tools that the updater runs."""
+
+    missing: list[Tool] = field(default_factory=list)  # not on the search path
+    killed: list[Tool] = field(default_factory=list)  # a signal ends them, with the shell that ran them
+
+
+@dataclass
+class Updater:
+    """The updater and what happens to it."""
+
+    program: Literal["remote", "main"] = "remote"  # main: the main-head driver
+    arguments: list[str] = field(default_factory=list)
+    children: Literal["waited-for", "ignored"] = "waited-for"  # ignored: started with SIGCHLD ignored
+    # by the service manager. at-its-end: by its own last command. in-install: while the package is being installed.
+    stopped: Literal["never", "at-its-end", "in-install"] = "at-its-end"
+
+
+@dataclass
+class Setup:
+    """What a unit is like before an update."""
+
+    package: Package = field(default_factory=Package)
+    mirrors: Mirrors = field(default_factory=Mirrors)
+    board: Board = field(default_factory=Board)
+    stick: Stick = field(default_factory=Stick)
+    head: Head = field(default_factory=Head)
+    tools: Tools = field(default_factory=Tools)
+    updater: Updater = field(default_factory=Updater)
+
+
+@dataclass
+class Expect:
+    """What must come out."""
+
+    status: list[int]  # exit codes, or minus signal numbers, that the updater may end with
     # LED: colour at the end; LEDs that are not named are dark. any: whatever is lit has this colour.
-    "panel": dict,
-    "sound": ["", "pass", "fail"],  # the one sound that was played to its end
-    "commands": list,  # all but the panel's and the sound's, in order: names in expected.py, " x20" repeats one
-    "waits": list,  # s, in order, those of the flashing thread left out
-    # of the update's thread, a line each: the operation's name, a colon, the message. "(name ...)" stands for a block
-    # of expected.py, "(N more)" repeats the line above, "{name}" is a command of expected.py, "..." stands for any
-    # records, and at a line's end for any rest of it.
-    "log": str,
-    "package": str,
-    "board": str,
-    "marker": bool,
-    "stick": bool,
-    "harl": ["active", "inactive", "unknown"],
-}
-
-# What an entry of each list may be.
-ENTRIES: dict[str, Any] = {
-    "stick.directories": str,
-    "tools.missing": TOOLS,
-    "tools.killed": TOOLS,
-    "updater.arguments": str,
-    "expect.status": int,
-    "expect.commands": str,
-    "expect.waits": int,
-}
+    panel: dict[str, str]
+    sound: Literal["", "pass", "fail"]  # the one sound that was played to its end
+    commands: list[str]  # all but the panel's and the sound's, in order: names in expected.py, " x20" repeats one
+    waits: list[int]  # s, in order, without those of the flashing thread
+    # of the update's thread, a line each: the operation's name, a colon, the message. "(name ...)" is a block of
+    # expected.py, "(N more)" repeats the line above, "{name}" is a command of expected.py, "..." matches any records,
+    # and at a line's end any rest of it.
+    log: str
+    package: str
+    board: str
+    marker: bool
+    stick: bool
+    harl: Literal["active", "inactive", "unknown"]
 
 
 class ScenarioError(Exception):
@@ -101,22 +137,22 @@ class ScenarioError(Exception):
 
 @dataclass
 class Scenario:
-    """One scenario: `unit[section][key]` is complete, with the defaults of UNIT; `expect` holds what the file says."""
+    """One scenario."""
 
     name: str
     summary: str
-    only: str  # "real" or "stand-in": the one kind of unit that can serve it; "" both
-    unit: dict[str, dict[str, Any]]
-    expect: dict[str, Any]
+    only: Literal["", "real", "stand-in"]  # the one kind of unit that can serve it; "" both
+    setup: Setup
+    expect: Expect
 
 
-def variables(unit: dict[str, dict[str, Any]]) -> dict[str, str]:
-    """The unit of a scenario as variables for shell scripts, such as BOARD_LINK; lists as words."""
+def variables(setup: Setup) -> dict[str, str]:
+    """The setup as variables for shell scripts, such as BOARD_LINK; lists as words."""
     found = {}
-    for section, values in unit.items():
-        for key, value in values.items():
+    for section in fields(setup):
+        for key, value in vars(getattr(setup, section.name)).items():
             text = " ".join(value) if isinstance(value, list) else str(value)
-            found[f"{section}_{key}".upper()] = text.lower() if isinstance(value, bool) else text
+            found[f"{section.name}_{key}".upper()] = text.lower() if isinstance(value, bool) else text
     return found
 
 
@@ -149,61 +185,51 @@ def read(path: Path) -> Scenario:
         line = int(place[1]) if place and place[1] else len(text.splitlines())
         raise ScenarioError(f"{path}:{line}: {str(error)[: place.start()] if place else error}") from error
 
-    def fail(key: str, reason: str) -> ScenarioError:
-        return ScenarioError(f"{path}:{_line_of(text, key)}: {key}: {reason}")
+    try:
+        return _scenario(path.stem, content)
+    except FieldError as error:
+        raise ScenarioError(f"{path}:{_line_of(text, error.key)}: {error}") from error
 
-    def check(key: str, value: Any, allowed: Any) -> None:
-        if isinstance(allowed, list):
-            if value not in allowed:
-                raise fail(key, f"must be one of {', '.join(map(repr, allowed))}, not {value!r}")
-        elif type(value) is not allowed:
-            raise fail(key, f"must be of type {allowed.__name__}, not {value!r}")
-        elif "\0" in str(value):
-            raise fail(key, "must be without null characters")
-        elif allowed is list:
-            for entry in value:
-                check(key, entry, ENTRIES[key])
 
+def _scenario(name: str, content: dict[str, Any]) -> Scenario:
+    """The scenario of a file with this content. Raises FieldError."""
     for key in ("summary", "expect"):
         if key not in content:
-            raise fail(key, "is missing")
-    summary, expect = content.pop("summary"), content.pop("expect")
-    check("summary", summary, str)
-    check("expect", expect, dict)
-    only = content.pop("only", "")
-    check("only", only, ["", "real", "stand-in"])
-    unit = {section: {key: default for key, (default, _) in keys.items()} for section, keys in UNIT.items()}
+            raise FieldError(key, "is missing")
+    types = get_type_hints(Scenario)
+    summary, only, expect = content.pop("summary"), content.pop("only", ""), content.pop("expect")
+    for key, value, allowed in (("summary", summary, str), ("expect", expect, dict), ("only", only, types["only"])):
+        check(key, value, allowed)
+    sections = get_type_hints(Setup)
+    setup = Setup()
     for section, values in content.items():
-        if section not in UNIT:
-            raise fail(section, f"not known; the sections are {', '.join(UNIT)} and expect")
+        if section not in sections:
+            raise FieldError(section, f"not known; the sections are {', '.join(sections)} and expect")
         check(section, values, dict)
-        for key, value in values.items():
-            if key not in UNIT[section]:
-                raise fail(f"{section}.{key}", f"not known; the keys are {', '.join(UNIT[section])}")
-            check(f"{section}.{key}", value, UNIT[section][key][1])
-            unit[section][key] = value
-    package = unit["package"]
+        setattr(setup, section, fill(sections[section], f"{section}.", values))
     for key, file_names in (
-        ("stick.directories", unit["stick"]["directories"]),
-        ("package.installed", [package["installed"]]),
-        ("package.offered", [package["offered"]]),
+        ("stick.directories", setup.stick.directories),
+        ("package.installed", [setup.package.installed]),
+        ("package.offered", [setup.package.offered]),
     ):
-        for name in file_names:
-            if "/" in name or name in ("", ".", ".."):
-                raise fail(key, f"must be fit for the name of a file, not {name!r}")
-    for key in expect:
-        if key not in EXPECT:
-            raise fail(f"expect.{key}", f"not known; the keys are {', '.join(EXPECT)}")
-    for key, allowed in EXPECT.items():
-        if key not in expect:
-            raise fail(f"expect.{key}", "is missing")
-        check(f"expect.{key}", expect[key], allowed)
-    for key, write_out in (("commands", expected_commands), ("log", expected_log)):
-        try:
-            write_out(expect[key])
-        except ValueError as error:
-            raise fail(f"expect.{key}", str(error)) from error
-    return Scenario(path.stem, summary, only, unit, expect)
+        for file_name in file_names:
+            if "/" in file_name or file_name in ("", ".", ".."):
+                raise FieldError(key, f"must be fit for the name of a file, not {file_name!r}")
+    return Scenario(name, summary, only, setup, expectations(expect))
+
+
+def expectations(values: dict[str, Any]) -> Expect:
+    """What must come out, from the section of a file. Raises FieldError."""
+    expect = fill(Expect, "expect.", values)
+    try:
+        expected_commands(expect.commands)
+    except ValueError as error:
+        raise FieldError("expect.commands", str(error)) from error
+    try:
+        expected_log(expect.log)
+    except ValueError as error:
+        raise FieldError("expect.log", str(error)) from error
+    return expect
 
 
 def _line_of(text: str, name: str) -> int:

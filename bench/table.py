@@ -52,7 +52,7 @@ def run_all(maker: UnitMaker, scenarios: list[Scenario], at_once: int) -> bool:
     begin = time.monotonic()
     wrong = 0
     # The longest first: none of them is left to run alone at the end.
-    order = sorted(scenarios, key=lambda what: what.unit["board"]["link"] not in ("dies", "lost"))
+    order = sorted(scenarios, key=lambda what: what.setup.board.link not in ("dies", "lost"))
     print(f"{'scenario':38} {'unit':8} {'time':>7}  result")
     with ThreadPoolExecutor(at_once) as workers:
         try:

@@ -10,16 +10,18 @@ import zipfile
 from pathlib import Path
 
 from bench import scenario
+from bench.makers.board import version_text
+from bench.scenario import Setup
 
 MARKER = "/root/USB_MOUNT/debs/installTV\n"
 
 
-def package_seed(unit: dict[str, dict[str, object]]) -> str:
+def package_seed(setup: Setup) -> str:
     """A query's status and output."""
-    package = unit["package"]
-    if not package["known"]:
+    package = setup.package
+    if not package.known:
         return "0"
-    installed, offered = package["installed"], package["offered"]
+    installed, offered = package.installed, package.offered
     return (
         f"0solvik4-rh:\n  Installed: {installed}\n  Candidate: {offered}\n  Version table:\n"
         f"     {offered} 500\n        500 file:/srv/repository ./ Packages\n *** {installed} 100\n"
@@ -27,21 +29,19 @@ def package_seed(unit: dict[str, dict[str, object]]) -> str:
     )
 
 
-def board_seed(unit: dict[str, dict[str, object]]) -> str:
+def board_seed(setup: Setup) -> str:
     """Statuses and outputs of the version's reading and of the stick's listing."""
-    board, stick = unit["board"], unit["stick"]
-    version = str(board["version_file"]).replace("{version}", str(board["installed"]))
+    board, stick = setup.board, setup.stick
+    version = version_text(board.installed, board.version_file)
     lines = "".join(line for line in version.splitlines(keepends=True) if "Brimvale" in line)
-    read = "5" if board["link"] in ("down", "hangs") or board["login"] != "accepted" else "0" if lines else "1"
-    listed = "0" if stick["inserted"] else "2"
-    directories = stick["directories"]
-    assert isinstance(directories, list)
-    return f"{read}{listed}{lines}\x1e" + "".join(f"{name}\n" for name in directories)
+    read = "5" if board.link in ("down", "hangs") or board.login != "accepted" else "0" if lines else "1"
+    listed = "0" if stick.inserted else "2"
+    return f"{read}{listed}{lines}\x1e" + "".join(f"{name}\n" for name in stick.directories)
 
 
-def teamviewer_seed(unit: dict[str, dict[str, object]]) -> str:
+def teamviewer_seed(setup: Setup) -> str:
     """The status and the output of the marker's listing."""
-    return {"absent": "2", "file": "0" + MARKER, "directory": "0", "unreadable": "1"}[str(unit["stick"]["teamviewer"])]
+    return {"absent": "2", "file": "0" + MARKER, "directory": "0", "unreadable": "1"}[setup.stick.teamviewer]
 
 
 BOARD_FOLDER = "debs/QUORB/armhf"
@@ -67,16 +67,14 @@ ODD_STICKS = {
 }
 
 
-def stick_seed(unit: dict[str, dict[str, object]]) -> str:
+def stick_seed(setup: Setup) -> str:
     """The names on the stick."""
-    stick = unit["stick"]
-    if not stick["inserted"]:
+    stick = setup.stick
+    if not stick.inserted:
         return ""
-    directories = stick["directories"]
-    assert isinstance(directories, list)
-    names = "\x1e".join([FIT_STICK.replace("quorb2.2.0", directory) for directory in directories] or ["ddebs"])
+    names = "\x1e".join([FIT_STICK.replace("quorb2.2.0", directory) for directory in stick.directories] or ["ddebs"])
     marker = {"absent": "", "directory": "\x1eddebs/installTV"}
-    return names + marker.get(str(stick["teamviewer"]), "\x1efdebs/installTV")
+    return names + marker.get(stick.teamviewer, "\x1efdebs/installTV")
 
 
 def archive_seeds() -> dict[str, bytes]:
@@ -107,7 +105,7 @@ def main() -> None:
         folder = Path(sys.argv[1]) / target
         folder.mkdir(parents=True, exist_ok=True)
         for name in scenario.names():
-            (folder / name).write_bytes(seed(scenario.load(name).unit).encode())
+            (folder / name).write_bytes(seed(scenario.load(name).setup).encode())
     for target, seeds in {"archive": archive_seeds(), "log": log_seeds()}.items():
         folder = Path(sys.argv[1]) / target
         folder.mkdir(parents=True, exist_ok=True)

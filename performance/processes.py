@@ -43,12 +43,9 @@ class MeasuredUnit(StandInUnit):
 
     def __init__(self, name: str, folder: Path) -> None:
         what = copy.deepcopy(scenario.load(name))
-        what.unit["updater"]["stopped"] = "never"  # every program ends by itself
+        what.setup.updater.stopped = "never"  # every program ends by itself
         super().__init__(what, folder, 1, BUILD)
-        self.environment = {
-            "PATH": str(folder / "bin"), "UNIT": str(folder), "MEASURED": str(folder / "measured"),
-            **scenario.variables(what.unit),
-        }
+        self.environment = self._environment() | {"MEASURED": str(folder / "measured")}
         self.start()
 
     def _start_updater(self) -> None:

@@ -94,7 +94,7 @@ def make_image() -> Path:
 
 def time_limit(plans: list[Plan], speed: float) -> float:
     """How long `plans` may take in one boot, s."""
-    return sum(SCENARIO_LIMIT + SLOWNESS * sum(plan.like.expect["waits"]) / speed for plan in plans)
+    return sum(SCENARIO_LIMIT + SLOWNESS * sum(plan.like.expect.waits) / speed for plan in plans)
 
 
 def run_shared(plans: list[Plan], image: Path, updater: Path, speed: float) -> dict[str, tuple[Outcome, list[str]]]:
@@ -169,7 +169,7 @@ def run(plans: list[Plan], package: Path | None, speed: float) -> int:
         raise TargetError("packages are missing, see above")
     updater, image = updater_package(package), make_image()
     print(f"Package: {updater.name}", flush=True)
-    shared = [plan for plan in plans if plan.settings["event"] != "power-cut"]
+    shared = [plan for plan in plans if plan.settings.event != "power-cut"]
     results = run_shared(shared, image, updater, speed) if shared else {}
     for plan in plans:
         if plan not in shared:

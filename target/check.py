@@ -24,7 +24,7 @@ def check_bus(plan: Plan, outcome: Outcome) -> list[str]:
     sent = outcome.sent
     if sent != outcome.asked:
         return [f"bus: {len(sent)} bytes that are not the {len(outcome.asked)} bytes the kernel was asked to send"]
-    if plan.settings["event"] in ("nothing", "power-cut"):
+    if plan.settings.event in ("nothing", "power-cut"):
         if sent != ended:
             return [f"bus: {len(sent)} bytes that are not the {len(ended)} bytes of the commands"]
     elif sent[: len(ended)] != ended:  # what runs after the updater sends more
@@ -74,19 +74,19 @@ def check(plan: Plan, outcome: Outcome) -> list[str]:
         if expected != seen:
             found.append(f"{what}: expected {expected!r}, not {seen!r}")
 
-    unit = plan.like.unit
-    cut = plan.settings["event"] == "power-cut"
-    same("package before", unit["package"]["offered" if cut else "installed"], before["package"])
-    same("board before", unit["board"]["installed"], before["board"])
-    same("marker before", "yes" if unit["head"]["marker"] else "no", before["marker"])
+    setup = plan.like.setup
+    cut = plan.settings.event == "power-cut"
+    same("package before", setup.package.offered if cut else setup.package.installed, before["package"])
+    same("board before", setup.board.installed, before["board"])
+    same("marker before", "yes" if setup.head.marker else "no", before["marker"])
     same("stick before", "yes", before["stick"])
     same("journal identifiers", {IDENTIFIER}, outcome.identifiers)
-    same("result of the unit", plan.expect["result"], after["Result"])
-    same("package status", plan.expect["package_status"], after["package_status"])
-    same("harl-updater", plan.expect["updater"], "same" if before["updater"] == after["updater"] else "newer")
+    same("result of the unit", plan.expect.result, after["Result"])
+    same("package status", plan.expect.package_status, after["package_status"])
+    same("harl-updater", plan.expect.updater, "same" if before["updater"] == after["updater"] else "newer")
     same("harl-updater starts at boot", False, after["enabled"] == "enabled")
     same("harl was started again", True, int(after["harl_since"]) > int(before["harl_since"]))
-    if plan.settings["script_seconds"]:
+    if plan.settings.script_seconds:
         same("package's maintainer script", ["began", "ended"], list(outcome.package_script))
         ended = outcome.package_script.get("ended", math.inf)
         same("harl was started after the package's maintainer script", True, int(after["harl_since"]) / 1e6 > ended)

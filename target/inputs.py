@@ -53,27 +53,27 @@ def package_version(package: Path) -> str:
 
 def write_scenario(folder: Path, plan: Plan, updater: Path, speed: float, again: bool) -> None:
     """Writes the folder of a scenario: its settings, the installed package and the repository."""
-    unit = plan.like.unit
+    setup = plan.like.setup
     repository = folder / "repository"
     depends = ""
-    if plan.settings["needs_newer_updater"]:
+    if plan.settings.needs_newer_updater:
         newer = f"{package_version(updater)}+newer"
         depends = f"harl-updater (>= {newer})"
         raise_version(updater, newer, repository)
-    build(head_package(unit["package"]["installed"], "", 0, False), folder).rename(folder / "installed.deb")
-    use_up_memory = plan.settings["event"] == "out-of-memory"
-    offered = head_package(unit["package"]["offered"], depends, plan.settings["script_seconds"], use_up_memory)
+    build(head_package(setup.package.installed, "", 0, False), folder).rename(folder / "installed.deb")
+    use_up_memory = plan.settings.event == "out-of-memory"
+    offered = head_package(setup.package.offered, depends, plan.settings.script_seconds, use_up_memory)
     build(offered, repository)
     write_index(repository)
     settings = {
-        "mirrors": unit["mirrors"]["refresh"],
-        "board_version": unit["board"]["installed"],
-        "board_link": unit["board"]["link"],
-        "marker": "yes" if unit["head"]["marker"] else "no",
-        "event": "nothing" if again else plan.settings["event"],  # see plan.py
+        "mirrors": setup.mirrors.refresh,
+        "board_version": setup.board.installed,
+        "board_link": setup.board.link,
+        "marker": "yes" if setup.head.marker else "no",
+        "event": "nothing" if again else plan.settings.event,  # see plan.py
         "keep_head": "yes" if again else "no",  # the head is left as the power cut left it
         "speed": str(speed),  # how many times shorter the updater's waits are
-        "waits": str(round(sum(plan.like.expect["waits"]) / speed)),  # s, that they take
+        "waits": str(round(sum(plan.like.expect.waits) / speed)),  # s, that they take
     }
     (folder / "settings").write_text("".join(f"{key}='{value}'\n" for key, value in settings.items()))
 

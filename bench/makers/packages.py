@@ -64,7 +64,7 @@ def build_tree(tree: Path, folder: Path) -> Path:
     folder.mkdir(parents=True, exist_ok=True)
     with tempfile.TemporaryDirectory(prefix=".new-", dir=folder) as name:
         # gzip: what every dpkg of a unit can unpack.
-        command = ["dpkg-deb", "--root-owner-group", "-Zgzip", "--build", tree, name]
+        command: list[str | Path] = ["dpkg-deb", "--root-owner-group", "-Zgzip", "--build", tree, name]
         subprocess.run(command, check=True, stdout=subprocess.DEVNULL, stderr=subprocess.PIPE, text=True)
         [file] = Path(name).iterdir()
         return file.rename(folder / file.name)
@@ -86,9 +86,10 @@ def raise_version(file: Path, version: str, folder: Path, more: dict[str, str] |
 
 def write_index(repository: Path) -> None:
     """Writes the index of the packages in the folder `repository`: apt reads it there."""
-    scan = ["dpkg-scanpackages", "--multiversion", "."]
-    with (repository / "Packages").open("wb") as index:
-        subprocess.run(scan, cwd=repository, check=True, stdout=index, stderr=subprocess.PIPE)
+    # It finds nothing when it runs in a folder of another mount namespace.
+    scan: list[str | Path] = ["dpkg-scanpackages", "--multiversion", repository]
+    done = subprocess.run(scan, cwd="/", check=True, capture_output=True, text=True)
+    (repository / "Packages").write_text(done.stdout.replace(f"Filename: {repository}/", "Filename: ./"))
 
 
 # Maintainer scripts by what `package.install` in a scenario says.

@@ -4,54 +4,51 @@ import os
 import shutil
 import subprocess
 from pathlib import Path
-from typing import Any
 
 from bench.makers import sticks
 from bench.makers.board import write_version
 from bench.makers.files import write
 from bench.makers.packages import DATABASE, SOURCES, kept_package
 from bench.makers.sounds import write_sounds
-from bench.scenario import TOOLS
+from bench.scenario import TOOLS, Setup
 
 HERE = Path(__file__).parent
 MAKERS = HERE.parent / "makers"
 
-Settings = dict[str, dict[str, Any]]
 
-
-def head_package(settings: Settings) -> str:
+def head_package(setup: Setup) -> str:
     """The name of the head's own package."""
-    return "solvik4-dh" if settings["updater"]["program"] == "main" else "solvik4-rh"
+    return "solvik4-dh" if setup.updater.program == "main" else "solvik4-rh"
 
 
-def search_path(settings: Settings) -> str:
+def search_path(setup: Setup) -> str:
     """The updater's search path: with a tool missing, one that holds the other tools only."""
-    return "/opt/bench/tools" if settings["tools"]["missing"] else "/opt/bench/bin:/usr/sbin:/usr/bin:/sbin:/bin"
+    return "/opt/bench/tools" if setup.tools.missing else "/opt/bench/bin:/usr/sbin:/usr/bin:/sbin:/bin"
 
 
-def write_head(folder: Path, settings: Settings, kept: Path, has_systemd: bool) -> None:
+def write_head(folder: Path, setup: Setup, kept: Path, has_systemd: bool) -> None:
     """The head's files: package sources, sounds, marker and what the bench adds to the tools."""
     write(folder / "etc/apt/apt.conf.d/50bench", 'APT::Sandbox::User "root";\n')
     write(folder / "etc/dpkg/dpkg.cfg.d/bench", "force-unsafe-io\n")
-    _write_packages(folder, settings, kept)
+    _write_packages(folder, setup, kept)
     (folder / "root/USB_MOUNT").mkdir(parents=True)
     write_sounds(folder)
-    if settings["head"]["marker"]:
+    if setup.head.marker:
         write(folder / "root/RESOURCES/tavren1stboot", "")
-    if settings["head"]["teamviewer_script"] != "absent":
-        script = (HERE / "teamviewer" / f"{settings['head']['teamviewer_script']}.sh").read_text()
+    if setup.head.teamviewer_script != "absent":
+        script = (HERE / "teamviewer" / f"{setup.head.teamviewer_script}.sh").read_text()
         write(folder / "root/RESOURCES/teamviewer_updatescript.sh", script, 0o755)
-    if settings["head"]["sound"] == "present":
+    if setup.head.sound == "present":
         # ALSA has no sound card here: the default device is a file, in fact a program that reads the samples.
         device = 'pcm.!default { type file slave.pcm null file "|/opt/bench/bin/play" format raw }\n'
         write(folder / "etc/asound.conf", device)
-    _write_tools(folder / "opt/bench", settings, has_systemd)
+    _write_tools(folder / "opt/bench", setup, has_systemd)
 
 
-def write_board(folder: Path, settings: Settings, head: Path) -> None:
+def write_board(folder: Path, setup: Setup, head: Path) -> None:
     """The board's files: the version file, its sshd's configuration, and the keys on both sides."""
-    board = settings["board"]
-    write_version(folder, board["installed"], board["version_file"])
+    board = setup.board
+    write_version(folder, board.installed, board.version_file)
     configuration = (
         "ListenAddress 192.168.9.2\n"
         "HostKey /etc/ssh/host_key\n"
@@ -64,58 +61,58 @@ def write_board(folder: Path, settings: Settings, head: Path) -> None:
         key.parent.mkdir(parents=True, exist_ok=True)
         subprocess.run(["ssh-keygen", "-q", "-t", "ed25519", "-N", "", "-C", "bench", "-f", key], check=True)
     other = (folder.parent / "other_key.pub").read_text()
-    accepted = (head / "root/.ssh/id_ed25519.pub").read_text() if board["login"] != "key-refused" else other
-    known = (folder / "etc/ssh/host_key.pub").read_text() if board["login"] != "host-key-changed" else other
+    accepted = (head / "root/.ssh/id_ed25519.pub").read_text() if board.login != "key-refused" else other
+    known = (folder / "etc/ssh/host_key.pub").read_text() if board.login != "host-key-changed" else other
     write(folder / "root/.ssh/authorized_keys", accepted)
     write(head / "root/.ssh/known_hosts", f"192.168.9.2 {known}")
 
 
-def write_stick(folder: Path, settings: Settings) -> None:
+def write_stick(folder: Path, setup: Setup) -> None:
     """The stick's files: for each version a zip archive and a script that unpacks it; the marker for TeamViewer."""
-    script = (HERE / "stick" / f"{settings['board']['script']}.sh").read_text()
-    stick = settings["stick"]
-    sticks.write_stick(folder, stick["directories"], script, teamviewer=stick["teamviewer"])
+    script = (HERE / "stick" / f"{setup.board.script}.sh").read_text()
+    stick = setup.stick
+    sticks.write_stick(folder, stick.directories, script, teamviewer=stick.teamviewer)
 
 
-def _write_packages(folder: Path, settings: Settings, kept: Path) -> None:
+def _write_packages(folder: Path, setup: Setup, kept: Path) -> None:
     """The repository with the package that is offered, and the .deb of the one that is installed at first."""
-    name, wanted = head_package(settings), settings["package"]
+    name, wanted = head_package(setup), setup.package
     for path in DATABASE:
         (folder / path).mkdir(parents=True)
     write(folder / "var/lib/dpkg/status", "")
-    scripts = "interrupted" if settings["updater"]["stopped"] == "in-install" else wanted["install"]
+    scripts = "interrupted" if setup.updater.stopped == "in-install" else wanted.install
     (folder / "srv/installed").mkdir(parents=True)
-    if wanted["known"]:
-        shutil.copytree(kept_package(name, wanted["offered"], scripts, kept), folder / "srv/repository")
-        if wanted["installed"] != "(none)":
-            for file in kept_package(name, wanted["installed"], "works", kept).glob("*.deb"):
+    if wanted.known:
+        shutil.copytree(kept_package(name, wanted.offered, scripts, kept), folder / "srv/repository")
+        if wanted.installed != "(none)":
+            for file in kept_package(name, wanted.installed, "works", kept).glob("*.deb"):
                 shutil.copy(file, folder / "srv/installed")
     else:
         shutil.copytree(kept_package("other", "1.0", "works", kept), folder / "srv/repository")
-    if wanted["install"] == "locked":
+    if wanted.install == "locked":
         [file] = kept_package("other", "1.0", "holds-lock", kept).glob("*.deb")
         shutil.copy(file, folder / "srv/other.deb")
-    where = "repository" if settings["mirrors"]["refresh"] == "works" else "gone"
+    where = "repository" if setup.mirrors.refresh == "works" else "gone"
     write(folder / "etc/apt/sources.list", SOURCES.format(folder=where))
-    # For apt an older package is no update, unless the unit's own preferences say so.
-    write(folder / "etc/apt/preferences", 'Package: *\nPin: origin ""\nPin-Priority: 1001\n')
-    write(folder / "etc/apt/apt.conf.d/60downgrade", 'APT::Get::allow-downgrades "true";\n')
+    if wanted.downgrades:
+        write(folder / "etc/apt/preferences", 'Package: *\nPin: origin ""\nPin-Priority: 1001\n')
+        write(folder / "etc/apt/apt.conf.d/60downgrade", 'APT::Get::allow-downgrades "true";\n')
 
 
-def _write_tools(folder: Path, settings: Settings, has_systemd: bool) -> None:
+def _write_tools(folder: Path, setup: Setup, has_systemd: bool) -> None:
     """What stands in front of the real tools, and with a tool missing, a search path without it."""
     wrappers = folder / "bin"
     shutil.copytree(HERE / "head", wrappers)
     if not has_systemd:
         shutil.copy(MAKERS / "tools/systemctl", wrappers)
-    if settings["stick"]["teamviewer"] != "unreadable":
+    if setup.stick.teamviewer != "unreadable":
         (wrappers / "ls").unlink()
-    for tool in settings["tools"]["killed"]:
+    for tool in setup.tools.killed:
         shutil.copy(MAKERS / "tools/killed", wrappers / tool)
     (folder / "out").mkdir()
     (folder / "board").mkdir()
-    if settings["tools"]["missing"]:
+    if setup.tools.missing:
         (folder / "tools").mkdir()
-        for tool in set(TOOLS) - set(settings["tools"]["missing"]):
+        for tool in set(TOOLS) - set(setup.tools.missing):
             inside = "/opt/bench/bin" if (wrappers / tool).exists() else os.path.dirname(shutil.which(tool) or "")
             (folder / "tools" / tool).symlink_to(f"{inside}/{tool}")

@@ -9,7 +9,7 @@ import subprocess
 from pathlib import Path
 
 from bench.makers.files import write
-from bench.real.files import Settings
+from bench.scenario import Setup
 
 PROGRAM = Path("/lib/systemd/systemd")
 ENDED = "bench: the updater has ended: "  # the journal's line behind the updater's last one
@@ -82,21 +82,21 @@ def service_active(group: Path, name: str) -> bool:
     return False
 
 
-def updater_service(settings: Settings) -> str:
+def updater_service(setup: Setup) -> str:
     """The service that the updater runs in: not its own when it must not end with that."""
-    return "by-hand.service" if settings["updater"]["stopped"] == "never" else "harl-updater.service"
+    return "by-hand.service" if setup.updater.stopped == "never" else "harl-updater.service"
 
 
-def write_services(folder: Path, settings: Settings, command: str) -> None:
+def write_services(folder: Path, setup: Setup, command: str) -> None:
     """The head's services, with `command` as the updater."""
     units = folder / "etc/systemd/system"
-    wanted = [updater_service(settings)]
+    wanted = [updater_service(setup)]
     write(units / "harl-updater.service", APPLICATION)
-    write(units / updater_service(settings), UPDATER.format(command=command))
-    if settings["head"]["harl"] == "known":
+    write(units / updater_service(setup), UPDATER.format(command=command))
+    if setup.head.harl == "known":
         write(units / "harl.service", APPLICATION)
         wanted.append("harl.service")
-    if settings["updater"]["stopped"] == "in-install":
+    if setup.updater.stopped == "in-install":
         write(units / "stop-in-install.path", STOP_WHEN)
         write(units / "stop-in-install.service", STOP)
         wanted.append("stop-in-install.path")

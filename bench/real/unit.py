@@ -48,7 +48,7 @@ class RealUnit:
             self.name = f"real tools, but a stand-in for systemd: {no_systemd}"
         self.log_is_exact = bool(no_systemd)
         self._has_systemd = not no_systemd
-        self._settings = scenario.unit
+        self._setup = scenario.setup
         self._folder = folder
         self._speed = speed
         self._build = build
@@ -65,12 +65,12 @@ class RealUnit:
             (self._folder / name).mkdir()
         if self._has_systemd:
             self._control_group = systemd.make_control_group(self._folder)
-        write_head(self._folder / "head", self._settings, self._build / "bench/packages", self._has_systemd)
-        write_board(self._folder / "board", self._settings, self._folder / "head")
-        write_stick(self._folder / "stick", self._settings)
+        write_head(self._folder / "head", self._setup, self._build / "bench/packages", self._has_systemd)
+        write_board(self._folder / "board", self._setup, self._folder / "head")
+        write_stick(self._folder / "stick", self._setup)
         command = self._add_programs()
         if self._has_systemd:
-            systemd.write_services(self._folder / "head", self._settings, command)
+            systemd.write_services(self._folder / "head", self._setup, command)
         self._write_variables(server, command)
         users = [] if self._has_systemd else [ONE_USER]
         with (self._out / "setup").open("wb") as messages:
@@ -130,27 +130,27 @@ class RealUnit:
 
     def _add_programs(self) -> str:
         """Puts the programs on the head. Returns the command that runs the updater there."""
-        program = PROGRAMS[self._settings["updater"]["program"]]
+        program = PROGRAMS[self._setup.updater.program]
         for file in (program, "bench/call_recorder.so", "bench/i2c_bus.so"):
             shutil.copy(self._build / file, self._folder / "head/opt/bench")
         words = ["/usr/bin/env", "-i"]
-        if self._settings["updater"]["children"] == "ignored":
+        if self._setup.updater.children == "ignored":
             words.append("--ignore-signal=CHLD")
-        words += ["HOME=/root", "LANG=C.UTF-8", f"PATH={search_path(self._settings)}"]
+        words += ["HOME=/root", "LANG=C.UTF-8", f"PATH={search_path(self._setup)}"]
         words += ["LD_PRELOAD=/opt/bench/call_recorder.so", "BENCH_CALLS=/opt/bench/out/calls"]
         words.append(f"BENCH_SPEED={self._speed}")
-        if self._settings["head"]["panel"] == "present":
+        if self._setup.head.panel == "present":
             words.append("BENCH_PANEL=/opt/bench/out/panel")
-        return " ".join([*words, f"/opt/bench/{program.name}", *self._settings["updater"]["arguments"]])
+        return " ".join([*words, f"/opt/bench/{program.name}", *self._setup.updater.arguments])
 
     def _write_variables(self, server: sshd.Server, command: str) -> None:
         if server.files:
             shutil.copytree(server.files, self._folder / "board/opt/bench", dirs_exist_ok=True)
-        values = variables(self._settings) | {
+        values = variables(self._setup) | {
             "BENCH_COMMAND": command,
             "BENCH_CONTROL_GROUP": str(self._control_group or ""),
-            "BENCH_PACKAGE": head_package(self._settings),
-            "BENCH_SERVICE": systemd.updater_service(self._settings),
+            "BENCH_PACKAGE": head_package(self._setup),
+            "BENCH_SERVICE": systemd.updater_service(self._setup),
             "BENCH_SFTP_SERVER": server.sftp_server,
             "BENCH_SOUND_LENGTH": f"{sounds.SECONDS / self._speed:.3f}",
             "BENCH_SSHD": server.sshd,
@@ -160,7 +160,7 @@ class RealUnit:
             (folder / "variables").write_text(text)
 
     def _harl_state(self) -> str:
-        if self._settings["head"]["harl"] == "unknown":
+        if self._setup.head.harl == "unknown":
             return "unknown"
         if self._control_group:
             return "active" if systemd.service_active(self._control_group, "harl") else "inactive"
@@ -169,7 +169,7 @@ class RealUnit:
     def _updater_active(self) -> bool:
         if self._control_group:
             return systemd.service_active(self._control_group, "harl-updater")
-        return self._settings["updater"]["stopped"] != "never" and not (self._out / "status").exists()
+        return self._setup.updater.stopped != "never" and not (self._out / "status").exists()
 
     def _check_alive(self) -> None:
         assert self._namespaces
@@ -192,7 +192,7 @@ class RealUnit:
     def _package_version(self, status: Path) -> str:
         for paragraph in status.read_text().split("\n\n"):
             fields = dict(line.split(": ", 1) for line in paragraph.splitlines() if ": " in line)
-            if fields.get("Package") == head_package(self._settings) and not fields["Status"].endswith("not-installed"):
+            if fields.get("Package") == head_package(self._setup) and not fields["Status"].endswith("not-installed"):
                 return fields["Version"]
         return "(none)"
 

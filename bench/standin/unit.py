@@ -32,7 +32,7 @@ class StandInUnit:
     log_is_exact = True
 
     def __init__(self, scenario: Scenario, folder: Path, speed: float, build: Path) -> None:
-        self._settings = scenario.unit
+        self._setup = scenario.setup
         self._folder = folder
         self._speed = speed
         self._build = build
@@ -54,10 +54,10 @@ class StandInUnit:
 
     def state(self) -> State:
         """The unit as it is now."""
-        known = self._settings["head"]["harl"] == "known"
-        is_service = self._settings["updater"]["stopped"] != "never"
+        known = self._setup.head.harl == "known"
+        is_service = self._setup.updater.stopped != "never"
         return State(
-            package=self._read("package") if self._settings["package"]["known"] else "(none)",
+            package=self._read("package") if self._setup.package.known else "(none)",
             board=board.read_version(self._folder / "board"),
             marker=(self._folder / "head/RESOURCES/tavren1stboot").exists(),
             stick=(self._folder / "head/USB_MOUNT").is_symlink(),
@@ -80,51 +80,66 @@ class StandInUnit:
         return (self._folder / name).read_text().strip()
 
     def _make_head(self) -> None:
-        (self._folder / "package").write_text(self._settings["package"]["installed"] + "\n")
+        (self._folder / "package").write_text(self._setup.package.installed + "\n")
         (self._folder / "harl").write_text("active\n")
         sounds = self._folder / SOUND_FOLDER.replace("root", "head", 1)
         sounds.mkdir(parents=True)
         for name in SOUNDS:
             (sounds / name).touch()
-        if self._settings["head"]["marker"]:
+        if self._setup.head.marker:
             (self._folder / "head/RESOURCES/tavren1stboot").touch()
         tools = self._folder / "bin"
         tools.mkdir()
         for tool in TOOLS:
-            if tool not in self._settings["tools"]["missing"]:
+            if tool not in self._setup.tools.missing:
                 (tools / tool).symlink_to(HERE / "tools.sh")
 
     def _make_board(self) -> None:
-        settings = self._settings["board"]
-        board.write_version(self._folder / "board", settings["installed"], settings["version_file"])
+        wanted = self._setup.board
+        board.write_version(self._folder / "board", wanted.installed, wanted.version_file)
 
     def _make_stick(self) -> None:
-        stick = self._settings["stick"]
-        if not stick["inserted"]:
+        stick = self._setup.stick
+        if not stick.inserted:
             (self._folder / "head/USB_MOUNT").mkdir()
             return
-        script = "exit 3\n" if self._settings["board"]["script"] == "fails" else UNPACK
+        script = "exit 3\n" if self._setup.board.script == "fails" else UNPACK
         sticks.write_stick(
-            self._folder / "stick", stick["directories"], script, sticks.version_file_archive, stick["teamviewer"]
+            self._folder / "stick", stick.directories, script, sticks.version_file_archive, stick.teamviewer
         )
         (self._folder / "head/USB_MOUNT").symlink_to(self._folder / "stick")
 
-    def _start_updater(self) -> None:
-        environment = {
+    def _candidate(self) -> str:
+        """The version that apt takes for the candidate: an older one only when it is told to."""
+        package = self._setup.package
+        older = ["dpkg", "--compare-versions", package.offered, "lt", package.installed]
+        if package.downgrades or package.installed == "(none)" or subprocess.run(older, check=False).returncode != 0:
+            return package.offered
+        return package.installed
+
+    def _environment(self) -> dict[str, str]:
+        """What the tools need."""
+        return {
+            **variables(self._setup),
             "PATH": str(self._folder / "bin"),
             "UNIT": str(self._folder),
             "BENCH_TOOLS": str(TOOLS_FOLDER),
+            "PACKAGE_OFFERED": self._candidate(),
+        }
+
+    def _start_updater(self) -> None:
+        environment = self._environment() | {
             "BENCH_CALLS": str(self.files.calls),
             "BENCH_SPEED": str(self._speed),
-        } | variables(self._settings)
+        }
         env = ["/usr/bin/env"]
-        if self._settings["updater"]["children"] == "ignored":
+        if self._setup.updater.children == "ignored":
             env.append("--ignore-signal=CHLD")
-        program = self._build / PROGRAMS[self._settings["updater"]["program"]]
+        program = self._build / PROGRAMS[self._setup.updater.program]
         env.append("LD_PRELOAD=" + ":".join([*sanitizers(program), str(self._build / "bench/call_recorder.so")]))
         with self.files.log.open("wb") as log, (self._folder / "errors").open("wb") as errors:
             self._updater = subprocess.Popen(
-                with_pid_file(self._folder, [*env, program, *self._settings["updater"]["arguments"]]),
+                with_pid_file(self._folder, [*env, program, *self._setup.updater.arguments]),
                 env=environment,
                 cwd=self._folder,
                 stdin=subprocess.DEVNULL,

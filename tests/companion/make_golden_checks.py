@@ -19,7 +19,8 @@ from pathlib import Path
 
 from bench import scenario
 from bench.build import BUILD, build
-from bench.real.files import Settings, write_stick
+from bench.real.files import write_stick
+from bench.scenario import Setup
 
 ROOT = Path(__file__).resolve().parents[2]
 GOLDEN = ROOT / "tests/companion/golden"
@@ -31,20 +32,20 @@ def run(command: list[str | Path], folder: str) -> str:
     return f"{done.stdout}Exit status: {done.returncode}\n"
 
 
-def check_stick(tool: list[str | Path], settings: Settings) -> str:
+def check_stick(tool: list[str | Path], setup: Setup) -> str:
     """What the tool says about the stick; about an empty mount point when none is inserted."""
     with tempfile.TemporaryDirectory(prefix="golden-") as folder:
         mount_point = Path(folder) / "stick"
-        if settings["stick"]["inserted"]:
-            write_stick(mount_point, settings)
+        if setup.stick.inserted:
+            write_stick(mount_point, setup)
         else:
             mount_point.mkdir()
         return run([*tool, "stick", "stick"], folder)
 
 
-def check_unit(program: Path, settings: Settings) -> str:
+def check_unit(program: Path, setup: Setup) -> str:
     """What the tool says about the unit, without what differs from run to run."""
-    variables = scenario.variables(settings)
+    variables = scenario.variables(setup)
     said = run([program, *(f"{name}={value}" for name, value in variables.items())], "/")
     said = re.sub(r"^(Free space: +).*", r"\1(of this machine)", said, flags=re.MULTILINE)
     return re.sub(r"\b(Process|ps) \d+", r"\1 PID", said)
@@ -92,10 +93,10 @@ def main() -> int:
     tool = [*filter(None, [arguments.emulator]), programs / "companion/harl-updater-tool"]
     status = 0
     for name in arguments.scenarios or scenario.names():
-        settings = scenario.load(name).unit
-        checked = {"stick": check_stick(tool, settings)}
+        setup = scenario.load(name).setup
+        checked = {"stick": check_stick(tool, setup)}
         if not arguments.emulator:
-            checked["unit"] = check_unit(programs / "tests/companion/unit-on-standin", settings)
+            checked["unit"] = check_unit(programs / "tests/companion/unit-on-standin", setup)
         for kind, said in checked.items():
             if arguments.compare is None:
                 keep(kind, golden(kind) | {name: said})

@@ -56,12 +56,12 @@ class Outcomes(Base):
     def test_panel_and_sound_are_those_of_each_scenario(self) -> None:
         for name in scenario.names():
             what = scenario.load(name)
-            if what.unit["updater"]["program"] != "remote":
+            if what.setup.updater.program != "remote":
                 continue
             with self.subTest(name):
                 [run] = json.loads(run_tool(f"{name}.log", "--json").stdout)["runs"]
-                self.assertEqual(run["panel"], what.expect["panel"])
-                self.assertEqual(run["sound"], what.expect["sound"])
+                self.assertEqual(run["panel"], what.expect.panel)
+                self.assertEqual(run["sound"], what.expect.sound)
 
     def test_versions_are_those_of_each_scenario(self) -> None:
         for name in scenario.names():
@@ -69,11 +69,11 @@ class Outcomes(Base):
             [run] = json.loads(run_tool(f"{name}.log", "--json").stdout)["runs"]
             with self.subTest(name):
                 if run["package"]["read"]:
-                    self.assertEqual(run["package"]["from"], what.unit["package"]["installed"])
-                    self.assertEqual(run["package"]["to"], what.unit["package"]["offered"])
+                    self.assertEqual(run["package"]["from"], what.setup.package.installed)
+                    self.assertEqual(run["package"]["to"], what.setup.package.offered)
                 if run["board"]["read"]:
-                    self.assertEqual(run["board"]["from"], what.unit["board"]["installed"])
-                    self.assertEqual(run["board"]["to"], min(what.unit["stick"]["directories"])[5:])
+                    self.assertEqual(run["board"]["from"], what.setup.board.installed)
+                    self.assertEqual(run["board"]["to"], min(what.setup.stick.directories)[5:])
 
     def test_status_tells_whether_the_last_run_went_well(self) -> None:
         good, bad = "package-and-board.log", "mirrors-fail.log"

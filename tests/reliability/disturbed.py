@@ -7,6 +7,7 @@ import shutil
 from pathlib import Path
 
 from bench.compare import seen_log
+from bench.makers.files import write_script
 from bench.runner import Result
 from bench.scenario import Scenario
 from bench.standin.unit import StandInUnit
@@ -27,19 +28,18 @@ class DisturbedUnit(StandInUnit):
         (wrapped / "bench").mkdir(parents=True)
         shutil.copy(build / "bench/call_recorder.so", wrapped / "bench")
         shutil.copy(build / "harl-updater", wrapped / "updater")
-        script = f"""#!/bin/sh
+        script = f"""
 {circumstances}
 exec {runner} /usr/bin/env LD_PRELOAD={wrapped}/bench/call_recorder.so {wrapped}/updater {redirection}
 """
-        (wrapped / "harl-updater").write_text(script)
-        (wrapped / "harl-updater").chmod(0o755)
+        write_script(wrapped / "harl-updater", script)
         super().__init__(what, folder, SPEED, wrapped)
         self._made = False
         self._changed_tools: dict[str, str] = {}
 
     def change_tool(self, tool: str, lines: str) -> None:
         """Runs shell `lines` in place of a tool; in them, real "$@" is the stand-in tool itself."""
-        self._changed_tools[tool] = f'#!/bin/sh\nreal() {{ "$UNIT/real/{tool}" "$@"; }}\n{lines}\n'
+        self._changed_tools[tool] = f'real() {{ "$UNIT/real/{tool}" "$@"; }}\n{lines}\n'
 
     def start(self) -> None:
         """Makes the unit the first time, and starts the updater."""
@@ -73,8 +73,7 @@ exec {runner} /usr/bin/env LD_PRELOAD={wrapped}/bench/call_recorder.so {wrapped}
         (self._folder / "real").mkdir()
         for tool, text in self._changed_tools.items():
             (self._folder / "bin" / tool).rename(self._folder / "real" / tool)
-            (self._folder / "bin" / tool).write_text(text)
-            (self._folder / "bin" / tool).chmod(0o755)
+            write_script(self._folder / "bin" / tool, text)
 
 
 def group_lives(group: int) -> bool:
@@ -88,8 +87,8 @@ def group_lives(group: int) -> bool:
     return False
 
 
-def outcome(result: Result) -> dict[str, object]:
-    """What a run came to: how it ended, what it did, and the unit behind it."""
+def observed(result: Result) -> dict[str, object]:
+    """What a run came to: how it ended, what it did, and what it left of the unit."""
     run, state = result.run, result.state
     return {
         "status": result.status,

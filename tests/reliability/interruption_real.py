@@ -8,32 +8,25 @@ difference. COMMAND is one of the names in the lines.
 """
 
 import contextlib
-import copy
 import os
 import subprocess
 import sys
-from concurrent.futures import ThreadPoolExecutor
-from dataclasses import dataclass
-from functools import cache
 from pathlib import Path
 
-from bench import scenario
 from bench.build import BUILD, build
+from bench.makers.files import write_script
 from bench.real.files import search_path
 from bench.real.unit import RealUnit, forbidden
-from bench.runner import run_on, temporary_folder
 from bench.scenario import Scenario
-from bench.unit import State, UnitError
-from tests.reliability.disturbed import outcome
-from tests.reliability.interruption_test import COMMANDS
+from bench.unit import UnitError
+from tests.reliability import interruption
+from tests.reliability.disturbed import SPEED
+from tests.reliability.interruption import HEADER, Aftermath, Interruption, interrupt_all
 
-ROOT = Path(__file__).resolve().parents[2]
-
-SPEED = 2000  # times shorter waits, each 0.2 s at least
 AT_ONCE = 3
 
 # Behind the updater's own commands those of apt, in the middle of the installation.
-POINTS = COMMANDS | {"unpack": ("dpkg", "*--unpack*"), "configure": ("dpkg", "*--configure*")}
+POINTS = interruption.POINTS | {"unpack": ("dpkg", "*--unpack*"), "configure": ("dpkg", "*--configure*")}
 # Everything on the head has this root; the board and the bench have others.
 KILLS = {
     "updater": 'read -r updater </run/unit.pid; kill -s KILL "$updater"',
@@ -49,21 +42,12 @@ kill -s KILL $$""",
 AUDITED = {("unit", "unpack", "after"), ("unit", "configure", "before")}
 
 
-@dataclass(frozen=True)
-class Interruption:
-    """Who is killed, at which command, before or after it takes effect."""
-
-    killed: str
-    point: str
-    moment: str
-
-
-class InterruptedUnit(RealUnit):
+class InterruptedReal(RealUnit):
     """A real unit that kills itself once, and on which the updater can run again."""
 
-    def __init__(self, what: Scenario, folder: Path, interruption: Interruption | None) -> None:
+    def __init__(self, what: Scenario, folder: Path, planned: Interruption | None) -> None:
         super().__init__(what, folder, SPEED, BUILD, "the updater is killed and started again by the test")
-        self._interruption = interruption
+        self._interruption = planned
         self._started = False
 
     def start(self) -> None:
@@ -114,8 +98,8 @@ class InterruptedUnit(RealUnit):
         tool, arguments = POINTS[self._interruption.point]
         kill = KILLS[self._interruption.killed]
         before, after = (kill, "") if self._interruption.moment == "before" else ("", kill)
-        (tools / tool).write_text(f"""#!/bin/sh
-PATH={search_path(self._settings)}
+        write_script(tools / tool, f"""
+PATH={search_path(self._setup)}
 case "$*" in
 {arguments}) rm /opt/bench/interrupting/armed 2>/dev/null || exec {tool} "$@" ;;
 *) exec {tool} "$@" ;;
@@ -126,57 +110,19 @@ status=$?
 {after}
 exit "$status"
 """)
-        (tools / tool).chmod(0o755)
         if tool == "dpkg":
             configuration = self._folder / "head/etc/apt/apt.conf.d/70interrupting"
             configuration.write_text('Dir::Bin::dpkg "/opt/bench/interrupting/dpkg";\n')
         return command.replace(" PATH=", " PATH=/opt/bench/interrupting:", 1)
 
 
-def interrupt(what: Interruption) -> bool:
-    """Interrupts an update, runs another one on the same unit and prints what became of it. True when it is as due."""
-    with temporary_folder() as folder:
-        unit = InterruptedUnit(scenario.load("package-and-board"), folder, what)
-        try:
-            run_on(unit, lambda run, log: None, SPEED)
-            state = unit.state()
-            second = outcome(run_on(unit, lambda run, log: None, SPEED))
-            audit = unit.audit()
-        finally:
-            unit.end()
-    due = first_run(state.package, state.board, state.marker, state.stick)
-    wrong = [f"{key}: {second[key]!r}, not {due[key]!r}" for key in due if second[key] != due[key]]
-    if bool(audit) != ((what.killed, what.point, what.moment) in AUDITED):
-        wrong.append(f"dpkg --audit: {audit!r}")
-    print(row(what, state, second, audit), *(f"\n  DIFFERENCE: {line}" for line in wrong), sep="", flush=True)
+def report(aftermath: Aftermath) -> bool:
+    """Prints what became of an interruption. True when it is as due."""
+    what, wrong = aftermath.interruption, aftermath.differences()
+    if bool(aftermath.audit) != ((what.killed, what.point, what.moment) in AUDITED):
+        wrong.append(f"dpkg --audit: {aftermath.audit!r}")
+    print(aftermath.row(), *(f"\n  DIFFERENCE: {line}" for line in wrong), sep="", flush=True)
     return not wrong
-
-
-def row(what: Interruption, state: State, second: dict[str, object], audit: str) -> str:
-    """One line: the unit right behind the interruption, and what the next run shows and leaves."""
-    panel = " ".join(f"{led} {color}" for led, color in second["panel"].items())  # type: ignore[attr-defined]
-    return (
-        f"{what.killed:8} {what.point:16} {what.moment:7} | {state.package:7} {state.board or '?':6} "
-        f"{'there' if state.marker else 'gone':6} {'there' if state.stick else 'gone':6} {state.harl:8} | "
-        f"{panel:22} {second['package']:7} {second['board']:6} {'stays' if second['marker'] else 'gone':6} "
-        f"{'not configured' if audit else 'clean'}"
-    )
-
-
-@cache
-def first_run(package: str, board: str, marker: bool, stick: bool) -> dict[str, object]:
-    """What a first run makes of a unit in that state. Whether harl runs makes no difference: an update stops it."""
-    what = copy.deepcopy(scenario.load("package-and-board"))
-    what.unit["package"]["installed"] = package
-    what.unit["board"]["installed"] = board
-    what.unit["head"]["marker"] = marker
-    what.unit["stick"]["inserted"] = stick
-    with temporary_folder() as folder:
-        unit = InterruptedUnit(what, folder, None)
-        try:
-            return outcome(run_on(unit, lambda run, log: None, SPEED))
-        finally:
-            unit.end()
 
 
 def main() -> int:
@@ -189,13 +135,9 @@ def main() -> int:
     build()
     if reason := forbidden():
         sys.exit(f"interruption_real: this machine forbids namespaces: {reason}")
-    print("killed   command          moment  | package board  marker stick  harl     | "
-          "next run               package board  marker dpkg --audit")
-    cases = [Interruption(killed, point, moment) for killed in KILLS for point in points
-             for moment in ("before", "after")]
+    print(HEADER)
     try:
-        with ThreadPoolExecutor(AT_ONCE) as pool:
-            as_due = list(pool.map(interrupt, cases))
+        as_due = [report(aftermath) for aftermath in interrupt_all(InterruptedReal, list(KILLS), points, AT_ONCE)]
     except UnitError as error:
         sys.exit(f"interruption_real: {error}")
     print(f"{len(as_due)} interruptions, {as_due.count(False)} with a difference")

@@ -11,16 +11,16 @@ from pathlib import Path
 from bench import scenario
 from bench.build import BUILD, build
 from bench.compare import differences
-from bench.display import PlainDisplay, Summary, print_summary, terminal
-from bench.page import page
+from bench.show.text import PlainDisplay, Summary, print_summary, terminal
+from bench.show.page import page
 from bench.runner import KINDS, UnitMaker, run_on, temporary_folder
-from bench.table import run_all
-from bench.terminal import LiveDisplay
+from bench.run_all import run_all
+from bench.show.terminal import LiveDisplay
 from bench.unit import PROGRAMS, UnitError
 
 
-def run(maker: UnitMaker, what: scenario.Scenario, record: Path | None) -> int:
-    """Runs the scenario `what`, shows it and writes the page `record`. Returns the status of the command."""
+def run(maker: UnitMaker, what: scenario.Scenario, page_file: Path | None) -> int:
+    """Runs the scenario `what`, shows it and writes the page `page_file`. Returns the status of the command."""
     with temporary_folder() as folder:
         unit = maker.make(what, folder)
         print(f"{what.name}: {what.summary}\nUnit: {unit.name}\n", flush=True)
@@ -28,9 +28,9 @@ def run(maker: UnitMaker, what: scenario.Scenario, record: Path | None) -> int:
             result = run_on(unit, display.show, maker.speed)
     summary = Summary(what, unit.name, result, differences(what, result))
     print_summary(summary)
-    if record:
-        record.write_text(page(summary, maker.speed), encoding="utf-8", errors="replace")
-        print(f"Page: {record}")
+    if page_file:
+        page_file.write_text(page(summary, maker.speed), encoding="utf-8", errors="replace")
+        print(f"Page: {page_file}")
     return 1 if summary.wrong else 0
 
 

@@ -16,7 +16,7 @@ from bench.scenario import ScenarioError
 from target.check import check, check_cut
 from target.inputs import write_input
 from target.machine import MachineError, boot
-from target.outcome import Outcome, read, read_bus
+from target.evidence import Evidence, read, read_bus
 from target.plan import Plan, PlanError, load, names
 
 HERE = Path(__file__).parent
@@ -97,7 +97,7 @@ def time_limit(plans: list[Plan], speed: float) -> float:
     return sum(SCENARIO_LIMIT + SLOWNESS * sum(plan.like.expect.waits) / speed for plan in plans)
 
 
-def run_shared(plans: list[Plan], image: Path, updater: Path, speed: float) -> dict[str, tuple[Outcome, list[str]]]:
+def run_shared(plans: list[Plan], image: Path, updater: Path, speed: float) -> dict[str, tuple[Evidence, list[str]]]:
     """Runs `plans` one after the other in one boot. Returns what each left and its differences. Raises MachineError."""
     folder, inputs = WORK / "shared", WORK / "in.tar"
     write_input(inputs, WORK / "in", image, updater, plans, speed, again=False)
@@ -105,7 +105,7 @@ def run_shared(plans: list[Plan], image: Path, updater: Path, speed: float) -> d
     return evaluate(plans, folder)
 
 
-def run_cut(plan: Plan, image: Path, updater: Path, speed: float) -> dict[str, tuple[Outcome, list[str]]]:
+def run_cut(plan: Plan, image: Path, updater: Path, speed: float) -> dict[str, tuple[Evidence, list[str]]]:
     """Runs `plan` until it stops the machine hard, boots the same disk again and runs the update. As run_shared."""
     folder, inputs, disk = WORK / plan.name, WORK / "in.tar", WORK / "disk.ext4"
     subprocess.run(["cp", "--sparse=always", image / "root.ext4", disk], check=True)
@@ -120,36 +120,36 @@ def run_cut(plan: Plan, image: Path, updater: Path, speed: float) -> dict[str, t
     finally:
         disk.unlink(missing_ok=True)
     results = evaluate([plan], folder)
-    outcome, found = results[plan.name]
-    return {plan.name: (outcome, check_cut(panel) + found)}
+    evidence, found = results[plan.name]
+    return {plan.name: (evidence, check_cut(panel) + found)}
 
 
-def evaluate(plans: list[Plan], folder: Path) -> dict[str, tuple[Outcome, list[str]]]:
+def evaluate(plans: list[Plan], folder: Path) -> dict[str, tuple[Evidence, list[str]]]:
     """Reads and checks what a boot with `plans` left in `folder`. Raises MachineError."""
     parts = read_bus(folder / "bus")
     if len(parts) != 2 * len(plans) + 1:
         raise MachineError(f"{len(parts) - 1} marks on the I2C bus for {len(plans)} scenarios: see {folder / 'bus'}")
     results = {}
     for index, plan in enumerate(plans):
-        outcome = read(folder / plan.name, parts[2 * index + 1])
-        results[plan.name] = (outcome, check(plan, outcome))
+        evidence = read(folder / plan.name, parts[2 * index + 1])
+        results[plan.name] = (evidence, check(plan, evidence))
     return results
 
 
-def print_table(results: dict[str, tuple[Outcome, list[str]]]) -> None:
+def print_table(results: dict[str, tuple[Evidence, list[str]]]) -> None:
     """The results as a table for a document."""
     print("\n| Scenario | Result | Unit | Package | Board | Panel | Sound | Time |\n|---|---|---|---|---|---|---|---|")
-    for name, (outcome, found) in results.items():
-        run, state, before = outcome.result.run, outcome.result.state, outcome.before
+    for name, (evidence, found) in results.items():
+        run, state, before = evidence.result.run, evidence.result.state, evidence.before
         cells = [
             name,
             "different" if found else "as expected",
-            f"{outcome.after['Result']}, status {outcome.result.status}",
+            f"{evidence.after['Result']}, status {evidence.result.status}",
             f"{before['package']} → {state.package}",
             f"{before['board']} → {state.board}",
             ", ".join(f"{led} {color}" for led, color in run.panel.pattern(0).items()) or "dark",
             ", ".join(file.removeprefix("SND_RESULT_").removesuffix(".wav").lower() for file in state.sounds) or "none",
-            f"{outcome.result.seconds:.0f} s",
+            f"{evidence.result.seconds:.0f} s",
         ]
         print(f"| {' | '.join(cells)} |")
 

@@ -6,7 +6,7 @@ import re
 from bench.compare import differences
 from bench.observation import Call
 from bench.panel import Panel, color_name, led_name
-from target.outcome import Outcome
+from target.evidence import Evidence
 from target.plan import Plan
 
 IDENTIFIER = "harl-updater"
@@ -17,13 +17,13 @@ def panel_bytes(calls: list[Call]) -> list[int]:
     return [int(byte, 16) for call in calls for byte in re.findall(r"i2cset -y 0 0x07 (0x\w+) c", call.text)]
 
 
-def check_bus(plan: Plan, outcome: Outcome) -> list[str]:
+def check_bus(plan: Plan, evidence: Evidence) -> list[str]:
     """The bytes on the bus must be those of the updater's commands, in their order; no pair is split."""
-    run = outcome.result.run
+    run = evidence.result.run
     ended = panel_bytes([call for call in run.calls if call.end is not None])
-    sent = outcome.sent
-    if sent != outcome.asked:
-        return [f"bus: {len(sent)} bytes that are not the {len(outcome.asked)} bytes the kernel was asked to send"]
+    sent = evidence.sent
+    if sent != evidence.asked:
+        return [f"bus: {len(sent)} bytes that are not the {len(evidence.asked)} bytes the kernel was asked to send"]
     if plan.settings.event in ("nothing", "power-cut"):
         if sent != ended:
             return [f"bus: {len(sent)} bytes that are not the {len(ended)} bytes of the commands"]
@@ -32,11 +32,11 @@ def check_bus(plan: Plan, outcome: Outcome) -> list[str]:
     return []
 
 
-def check_main_thread(outcome: Outcome) -> list[str]:
+def check_main_thread(evidence: Evidence) -> list[str]:
     """The records of the thread that waits for the update; the bench's comparison is of the others."""
-    records = outcome.result.run.records()
+    records = evidence.result.run.records()
     seen = [f"{record.operation}: {record.message}".strip() for record in records if record.thread == records[0].thread]
-    banner = f"main: TavrenUpdater version: {outcome.before['updater']}"
+    banner = f"main: TavrenUpdater version: {evidence.before['updater']}"
     expected = [banner, "main: BEFORE UPDATE", "update:", "lockApp:"]
     return [] if seen == expected else [f"log of the main thread: expected {expected}, not {seen}"]
 
@@ -46,9 +46,9 @@ def lit(leds: dict[int, int]) -> dict[str, str]:
     return {led_name(led): color_name(color) for led, color in leds.items() if color}
 
 
-def check_sound(outcome: Outcome) -> list[str]:
+def check_sound(evidence: Evidence) -> list[str]:
     """The panel must flash blue before the sound, stay dark while it plays, and light the outcome after it."""
-    run = outcome.result.run
+    run = evidence.result.run
     sound = next((call for call in run.calls if call.text.startswith("aplay ")), None)
     if sound is None or sound.end is None:
         return []  # the bench's comparison tells whether one was expected
@@ -64,11 +64,11 @@ def check_sound(outcome: Outcome) -> list[str]:
     return found
 
 
-def check(plan: Plan, outcome: Outcome) -> list[str]:
+def check(plan: Plan, evidence: Evidence) -> list[str]:
     """One line for each difference; none when the run came out as `plan` says."""
-    before, after = outcome.before, outcome.after
-    found = differences(plan.like, outcome.result) + check_main_thread(outcome)
-    found += check_bus(plan, outcome) + check_sound(outcome)
+    before, after = evidence.before, evidence.after
+    found = differences(plan.like, evidence.result) + check_main_thread(evidence)
+    found += check_bus(plan, evidence) + check_sound(evidence)
 
     def same(what: str, expected: object, seen: object) -> None:
         if expected != seen:
@@ -80,15 +80,15 @@ def check(plan: Plan, outcome: Outcome) -> list[str]:
     same("board before", setup.board.installed, before["board"])
     same("marker before", "yes" if setup.head.marker else "no", before["marker"])
     same("stick before", "yes", before["stick"])
-    same("journal identifiers", {IDENTIFIER}, outcome.identifiers)
+    same("journal identifiers", {IDENTIFIER}, evidence.identifiers)
     same("result of the unit", plan.expect.result, after["Result"])
     same("package status", plan.expect.package_status, after["package_status"])
     same("harl-updater", plan.expect.updater, "same" if before["updater"] == after["updater"] else "newer")
     same("harl-updater starts at boot", False, after["enabled"] == "enabled")
     same("harl was started again", True, int(after["harl_since"]) > int(before["harl_since"]))
     if plan.settings.script_seconds:
-        same("package's maintainer script", ["began", "ended"], list(outcome.package_script))
-        ended = outcome.package_script.get("ended", math.inf)
+        same("package's maintainer script", ["began", "ended"], list(evidence.package_script))
+        ended = evidence.package_script.get("ended", math.inf)
         same("harl was started after the package's maintainer script", True, int(after["harl_since"]) / 1e6 > ended)
     if cut:
         same("harl after the boot", "active", before["harl"])

@@ -14,7 +14,7 @@ import unittest
 from pathlib import Path
 
 from bench.observation import Run
-from bench.terminal import LiveDisplay
+from bench.show.terminal import LiveDisplay
 from bench.unit import Files, State
 
 ROOT = Path(__file__).parents[2]

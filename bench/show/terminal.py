@@ -4,7 +4,7 @@ import contextlib
 import sys
 import time
 
-from bench.display import paint
+from bench.show.text import paint
 from bench.observation import Run, now
 from bench.panel import color_name, led_name
 from bench.unit import State, Unit, UnitError

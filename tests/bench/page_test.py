@@ -1,4 +1,4 @@
-"""Usage: record_test.py BUILD_FOLDER
+"""Usage: page_test.py BUILD_FOLDER
 
 The page that bench/run --record writes."""
 
@@ -11,7 +11,7 @@ import unittest
 from html.parser import HTMLParser
 from pathlib import Path
 
-from bench import page as record
+from bench.show import page as page_module
 from bench.observation import Run
 from bench.panel import STEP_TIME
 from bench.unit import Files
@@ -20,7 +20,7 @@ ROOT = Path(__file__).parents[2]
 BUILD = ROOT / "build/default"
 
 
-BLUE, PASS = record.FILLS["blue"], record.FILLS["pass"]
+BLUE, PASS = page_module.FILLS["blue"], page_module.FILLS["pass"]
 
 
 class Elements(HTMLParser):
@@ -67,7 +67,7 @@ class Lit(unittest.TestCase):
     def lit(self, *sent: tuple[float, int]) -> dict[int, list[tuple[float, float, int]]]:
         nothing = Path("none")
         run = Run(Files(nothing, nothing, nothing), sent=list(sent))
-        return {led: spans for led, spans in record.lit(run, 20.0).items() if spans}
+        return {led: spans for led, spans in page_module.lit(run, 20.0).items() if spans}
 
     def test_nothing_sent(self) -> None:
         self.assertEqual(self.lit(), {})
@@ -107,9 +107,9 @@ class Page(unittest.TestCase):
         self.assertTrue(all(re.match(r"(REMOTE|MAIN) blue from ", title) for title in elements.filled(BLUE)))
         self.assertEqual(len(elements.filled(PASS)), 1)
         self.assertRegex(elements.filled(PASS)[0], r"^PASS pass from ")
-        waits = [title.split(":")[0] for title in elements.filled(record.WAIT)]
+        waits = [title.split(":")[0] for title in elements.filled(page_module.WAIT)]
         self.assertEqual(waits, ["wait of 780 s", "wait of 30 s", "wait of 10 s"])
-        commands = elements.filled(record.COMMAND)
+        commands = elements.filled(page_module.COMMAND)
         self.assertEqual(len(commands), 13)  # the sound's, and those of the table
         self.assertRegex(commands[3], r"^apt --assume-yes install solvik4-rh: \d+\.\d\d s$")
         self.assertEqual(len(elements.texts("code")), 12)

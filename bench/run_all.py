@@ -13,7 +13,7 @@ from bench.unit import UnitError
 
 
 @dataclass
-class Outcome:
+class Row:
     """How one scenario came out."""
 
     scenario: Scenario
@@ -23,12 +23,12 @@ class Outcome:
     wrong: list[str]
 
 
-def run_one(maker: UnitMaker, what: Scenario, stop: threading.Event) -> Outcome:
+def run_one(maker: UnitMaker, what: Scenario, stop: threading.Event) -> Row:
     """Runs the scenario `what` and shows nothing. Ends early when `stop` is set."""
     begin = time.monotonic()
 
-    def outcome(kind: str, text: str, wrong: list[str]) -> Outcome:
-        return Outcome(what, kind, time.monotonic() - begin, text, wrong)
+    def row(kind: str, text: str, wrong: list[str]) -> Row:
+        return Row(what, kind, time.monotonic() - begin, text, wrong)
 
     def check(*_: object) -> None:
         if stop.is_set():
@@ -40,10 +40,10 @@ def run_one(maker: UnitMaker, what: Scenario, stop: threading.Event) -> Outcome:
             unit = maker.make(what, folder)
             wrong = differences(what, run_on(unit, check, maker.speed))
         except NotServed as error:
-            return outcome("none", f"not run: {error}", [])
+            return row("none", f"not run: {error}", [])
         except (UnitError, OSError, subprocess.SubprocessError) as error:
-            return outcome("none", "FAILED", [str(error)])
-    return outcome(unit.kind, "DIFFERENT" if wrong else "as it says", wrong)
+            return row("none", "FAILED", [str(error)])
+    return row(unit.kind, "DIFFERENT" if wrong else "as it says", wrong)
 
 
 def run_all(maker: UnitMaker, scenarios: list[Scenario], at_once: int) -> bool:
@@ -57,12 +57,12 @@ def run_all(maker: UnitMaker, scenarios: list[Scenario], at_once: int) -> bool:
     with ThreadPoolExecutor(at_once) as workers:
         try:
             for done in as_completed([workers.submit(run_one, maker, what, stop) for what in order]):
-                outcome = done.result()
-                print(f"{outcome.scenario.name:38} {outcome.unit:8} {outcome.seconds:5.1f} s  {outcome.text}")
-                for line in outcome.wrong:
+                row = done.result()
+                print(f"{row.scenario.name:38} {row.unit:8} {row.seconds:5.1f} s  {row.text}")
+                for line in row.wrong:
                     print(f"    {line}")
                 print(end="", flush=True)
-                wrong += bool(outcome.wrong)
+                wrong += bool(row.wrong)
         finally:
             stop.set()
     print(f"{len(scenarios)} scenarios, {wrong} wrong, {time.monotonic() - begin:.0f} s")

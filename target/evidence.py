@@ -20,7 +20,7 @@ CLD_EXITED = 1  # waitid(2), as the service manager shows it in ExecMainCode; ot
 
 
 @dataclass
-class Outcome:
+class Evidence:
     """Everything about one scenario's run; `before` and `after` are the guest's state lines by their names."""
 
     result: Result
@@ -84,7 +84,7 @@ def heard(recording: Path) -> list[str]:
     return names
 
 
-def read(folder: Path, sent: list[int]) -> Outcome:
+def read(folder: Path, sent: list[int]) -> Evidence:
     """Reads what one scenario left in `folder`; the bytes `sent` went over the bus meanwhile."""
     before, after = read_state(folder / "before"), read_state(folder / "after")
     files = Files(log=folder / "log", calls=folder / "calls", panel=folder / "panel")
@@ -112,4 +112,4 @@ def read(folder: Path, sent: list[int]) -> Outcome:
     lines = script.read_text().splitlines() if script.exists() else []
     package_script = {line.split()[0]: float(line.split()[1]) for line in lines}
     asked = [int(write["byte"], 16) for write in writes]
-    return Outcome(result, asked, sent, before, after, identifiers, package_script)
+    return Evidence(result, asked, sent, before, after, identifiers, package_script)

@@ -6,7 +6,7 @@ from html import escape
 from itertools import pairwise
 from string import Template
 
-from bench.display import Summary
+from bench.show.text import Summary
 from bench.observation import Call, Run, now
 from bench.panel import STEP_UNIT, Panel, color_name, led_name
 

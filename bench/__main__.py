@@ -1,6 +1,7 @@
 """bench/run: runs one update of the real updater on a unit that a scenario describes, with its log and its panel."""
 
 import argparse
+import io
 import math
 import os
 import signal
@@ -24,7 +25,8 @@ def run(maker: UnitMaker, what: scenario.Scenario, page_file: Path | None) -> in
     with temporary_folder() as folder:
         unit = maker.make(what, folder)
         print(f"{what.name}: {what.summary}\nUnit: {unit.name}\n", flush=True)
-        with LiveDisplay(unit) if terminal() else PlainDisplay() as display:
+        shown: LiveDisplay | PlainDisplay = LiveDisplay(unit) if terminal() else PlainDisplay()
+        with shown as display:
             result = run_on(unit, display.show, maker.speed)
     summary = Summary(what, unit.name, result, differences(what, result))
     print_summary(summary)
@@ -91,7 +93,8 @@ def arguments() -> argparse.Namespace:
 def main() -> int:
     """The command."""
     given = arguments()
-    sys.stdout.reconfigure(errors="replace")  # type: ignore[union-attr]
+    if isinstance(sys.stdout, io.TextIOWrapper):
+        sys.stdout.reconfigure(errors="replace")
     signal.signal(signal.SIGTERM, lambda *_: sys.exit(143))
     try:
         if given.list:

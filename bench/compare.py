@@ -4,6 +4,7 @@ import re
 
 from bench.expected import expected_commands, expected_log
 from bench.observation import Run, now
+from bench.outcomes import SOUND_FILES
 from bench.runner import Result
 from bench.scenario import Scenario
 
@@ -71,8 +72,7 @@ def differences(scenario: Scenario, result: Result) -> list[str]:
         pattern = {"any": color for color in pattern.values()} or expect.panel
     same("panel", expect.panel, pattern)
     same("panel faults", [], run.panel.faults)
-    sound = {"": [], "pass": ["SND_RESULT_PASS.wav"], "fail": ["SND_RESULT_FAIL.wav"]}[expect.sound]
-    same("sound", sound, state.sounds)
+    same("sound", [SOUND_FILES[expect.sound]] if expect.sound else [], state.sounds)
     for key in ("package", "board", "marker", "stick", "harl"):
         same(key, getattr(expect, key), getattr(state, key))
     return found

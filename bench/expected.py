@@ -2,10 +2,12 @@
 
 import re
 
+from bench.outcomes import SOUND_FILES
+
 SSH_OPTIONS = "-o ServerAliveInterval=4 -o ServerAliveCountMax=10 -o ConnectTimeout=2 -o TCPKeepAlive=yes"
 BOARD_FILES = "/root/USB_MOUNT/debs/QUORB/armhf"
 
-# Short names, for the scenario files, of the command lines on the whole.
+# Short names, for the scenario files, of the complete command lines.
 COMMANDS = {
     "stop-harl": "systemctl stop harl",
     "start-harl": "systemctl start harl",
@@ -25,6 +27,20 @@ COMMANDS = {
     "remove-marker": "rm /root/RESOURCES/tavren1stboot",
     "release-stick": "umount /root/USB_MOUNT/",
 }
+
+# The panel's and the sound's commands, which the scenarios do not name.
+SOUND_FOLDER = "/root/RESOURCES/SOUNDS"
+
+
+def led_command(led: int, color: int) -> str:
+    """The command line that gives a LED a colour, both as the controller numbers them."""
+    return f"i2cset -y 0 0x07 {led:#04x} c ; i2cset -y 0 0x07 {color:#x} c"
+
+
+def sound_command(sound: str) -> str:
+    """The command line that plays a sound of outcomes.py."""
+    return f"aplay {SOUND_FOLDER}/{SOUND_FILES[sound]}"
+
 
 # Runs of records that many scenarios share, for `log` in their files: "(name)", with arguments for {1}, {2} behind the
 # name. A line is an operation's name, a colon and the message.

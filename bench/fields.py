@@ -39,7 +39,7 @@ def fill(section: type[Section], prefix: str, values: dict[str, Any]) -> Section
     for key in values:
         if key not in types:
             raise FieldError(f"{prefix}{key}", f"not known; the keys are {', '.join(types)}")
-    for field in dataclasses.fields(section):  # type: ignore[arg-type]
+    for field in dataclasses.fields(section):
         if field.name in values:
             check(f"{prefix}{field.name}", values[field.name], types[field.name])
         elif field.default is field.default_factory is dataclasses.MISSING:

@@ -8,6 +8,8 @@ STEP_TIME = 0x1F  # register, in units of STEP_UNIT
 STEP_UNIT = 0.02  # s
 NAMES = {0x12: "REMOTE", 0x13: "PASS", 0x14: "FAIL", 0x15: "MAIN"}
 COLORS = {0: "off", 1: "blue", 2: "pass", 8: "fail"}
+LED_CODES = {name: code for code, name in NAMES.items()}
+COLOR_CODES = {name: code for code, name in COLORS.items()}
 
 
 def led_name(led: int) -> str:
@@ -18,6 +20,11 @@ def led_name(led: int) -> str:
 def color_name(color: int) -> str:
     """The name of a colour in use, otherwise its code."""
     return COLORS.get(color, f"{color:#x}")
+
+
+def lit(leds: dict[int, int]) -> dict[str, str]:
+    """The LEDs that are lit, by name, with the names of their colours."""
+    return {led_name(led): color_name(color) for led, color in leds.items() if color}
 
 
 @dataclass
@@ -84,4 +91,4 @@ class Panel:
 
     def pattern(self, time: float) -> dict[str, str]:
         """The LEDs that are lit at `time` (s), by name, with the names of their colours."""
-        return {led_name(led): color_name(color) for led, color in self.shown(time).items() if color}
+        return lit(self.shown(time))

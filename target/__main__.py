@@ -11,8 +11,10 @@ import time
 from pathlib import Path
 from typing import IO
 
+from bench.outcomes import SOUND_FILES
 from bench.panel import Panel
 from bench.scenario import ScenarioError
+from bench.show.text import panel_line
 from target.check import check, check_cut
 from target.inputs import write_input
 from target.machine import MachineError, boot
@@ -57,7 +59,7 @@ def run_tool(command: list[str | Path], output: int | IO[str], errors: IO[str] |
 def updater_package(given: Path | None) -> Path:
     """The package to prove: the one that was given, or one built from the checked-out commit. Raises TargetError."""
     if given:
-        fields = ["dpkg-deb", "--field", given, "Package", "Architecture"]
+        fields: list[str | Path] = ["dpkg-deb", "--field", given, "Package", "Architecture"]
         seen = subprocess.run(fields, stdout=subprocess.PIPE, stderr=subprocess.DEVNULL, text=True, check=False).stdout
         if seen != "Package: harl-updater\nArchitecture: armhf\n":
             raise TargetError(f"{given}: is not harl-updater for armhf; packaging/build armhf makes such a package")
@@ -147,8 +149,8 @@ def print_table(results: dict[str, tuple[Evidence, list[str]]]) -> None:
             f"{evidence.after['Result']}, status {evidence.result.status}",
             f"{before['package']} → {state.package}",
             f"{before['board']} → {state.board}",
-            ", ".join(f"{led} {color}" for led, color in run.panel.pattern(0).items()) or "dark",
-            ", ".join(file.removeprefix("SND_RESULT_").removesuffix(".wav").lower() for file in state.sounds) or "none",
+            panel_line(run.panel.shown(0)),
+            ", ".join(name for name, file in SOUND_FILES.items() if file in state.sounds) or "none",
             f"{evidence.result.seconds:.0f} s",
         ]
         print(f"| {' | '.join(cells)} |")

@@ -5,7 +5,7 @@ import re
 
 from bench.compare import differences
 from bench.observation import Call
-from bench.panel import Panel, color_name, led_name
+from bench.panel import Panel, lit
 from target.evidence import Evidence
 from target.plan import Plan
 
@@ -39,11 +39,6 @@ def check_main_thread(evidence: Evidence) -> list[str]:
     banner = f"main: TavrenUpdater version: {evidence.before['updater']}"
     expected = [banner, "main: BEFORE UPDATE", "update:", "lockApp:"]
     return [] if seen == expected else [f"log of the main thread: expected {expected}, not {seen}"]
-
-
-def lit(leds: dict[int, int]) -> dict[str, str]:
-    """The LEDs that are lit, by name, with the names of their colours."""
-    return {led_name(led): color_name(color) for led, color in leds.items() if color}
 
 
 def check_sound(evidence: Evidence) -> list[str]:

@@ -7,11 +7,16 @@ from typing import NoReturn
 SKIPPED = 77  # cmake/python_test.cmake
 
 
-def take_path() -> Path:
-    """Takes the first word off the command line, a path. Ends the test with its usage when there is none."""
+def take_word() -> str:
+    """Takes the first word off the command line. Ends the test with its usage when there is none."""
     if len(sys.argv) < 2:
         sys.exit(sys.modules["__main__"].__doc__)
-    return Path(sys.argv.pop(1)).resolve()
+    return sys.argv.pop(1)
+
+
+def take_path() -> Path:
+    """Takes the first word off the command line, a path."""
+    return Path(take_word()).resolve()
 
 
 def skip(why: str) -> NoReturn:

@@ -6,11 +6,14 @@ import wave
 from functools import cache
 from pathlib import Path
 
-FOLDER = "root/RESOURCES/SOUNDS"  # below the head's root
+from bench.expected import SOUND_FOLDER
+from bench.outcomes import SOUND_FILES
+
+FOLDER = SOUND_FOLDER.lstrip("/")  # below the head's root
 RATE = 8000  # Hz; 16 bit, mono
 SECONDS = 1.5
 # Each is a sweep: its first and its last frequency, Hz.
-SOUNDS = {"SND_RESULT_PASS.wav": (300, 900), "SND_RESULT_FAIL.wav": (1000, 1600)}
+SOUNDS = {SOUND_FILES["pass"]: (300, 900), SOUND_FILES["fail"]: (1000, 1600)}
 
 
 @cache

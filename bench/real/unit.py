@@ -131,7 +131,7 @@ class RealUnit:
     def _add_programs(self) -> str:
         """Puts the programs on the head. Returns the command that runs the updater there."""
         program = PROGRAMS[self._setup.updater.program]
-        for file in (program, "bench/call_recorder.so", "bench/i2c_bus.so"):
+        for file in (program, Path("bench/call_recorder.so"), Path("bench/i2c_bus.so")):
             shutil.copy(self._build / file, self._folder / "head/opt/bench")
         words = ["/usr/bin/env", "-i"]
         if self._setup.updater.children == "ignored":

@@ -1,13 +1,14 @@
-"""Shows a run on a terminal: the log runs through above, the unit stands below: panel, services, stick, board, wait."""
+"""Shows a run on a terminal: the log runs through above, the unit is below: panel, services, stick, board, wait."""
 
 import contextlib
 import sys
 import time
+from typing import Protocol
 
 from bench.show.text import paint
 from bench.observation import Run, now
 from bench.panel import color_name, led_name
-from bench.unit import State, Unit, UnitError
+from bench.unit import State, UnitError
 
 REDRAW = 0.1  # s
 LOOK = 0.3  # s, between two looks at the unit's lasting things
@@ -49,10 +50,17 @@ def activity(run: Run, moment: float) -> str:
     return f"runs, for {moment - own[-1].start:.1f} s: {own[-1].text}" if own else "between two commands"
 
 
+class HasState(Protocol):
+    """What the display looks at."""
+
+    def state(self) -> State:
+        """The unit as it is now."""
+
+
 class LiveDisplay:
     """The display on a terminal. Use it in a `with`: in the end the lower part is gone."""
 
-    def __init__(self, unit: Unit) -> None:
+    def __init__(self, unit: HasState) -> None:
         self._unit = unit
         self._state: State | None = None
         self._looked = self._drawn = float("-inf")

@@ -5,19 +5,13 @@ import sys
 from dataclasses import dataclass
 
 from bench.observation import Run, now
-from bench.panel import color_name, led_name
+from bench.outcomes import meaning_of
+from bench.panel import color_name, lit
 from bench.runner import Result
 from bench.scenario import Scenario
 
 ANSI = {"off": "2", "blue": "1;34", "pass": "1;32", "fail": "1;31"}
 OTHER_COLOR = "1;35"
-# What the panel says at the end of an update.
-OUTCOMES = {
-    "REMOTE pass, MAIN pass": "nothing to update",
-    "PASS pass": "updated",
-    "REMOTE fail, MAIN fail": "the mirrors or a version could not be read",
-    "FAIL fail": "the package or the board could not be installed",
-}
 
 
 def terminal() -> bool:
@@ -37,7 +31,7 @@ def paint(text: str, color: str) -> str:
 
 def panel_line(leds: dict[int, int]) -> str:
     """The LEDs that are lit, in words."""
-    return ", ".join(f"{led_name(led)} {color_name(color)}" for led, color in leds.items() if color) or "dark"
+    return ", ".join(f"{led} {color}" for led, color in lit(leds).items()) or "dark"
 
 
 class PlainDisplay:
@@ -73,7 +67,7 @@ class Summary:
     @property
     def outcome(self) -> str:
         """What the operator learns from the panel, in words."""
-        return OUTCOMES.get(panel_line(self.result.run.panel.shown(now())), "the panel shows no outcome")
+        return meaning_of(self.result.run.panel.pattern(now()))
 
     def rows(self) -> list[tuple[str, str]]:
         """Names and values."""
@@ -103,8 +97,8 @@ def print_summary(summary: Summary) -> None:
         print(f"  {call.start - begin:7.2f} s  {took}  {call.text}")
     print("Waits: " + (", ".join(f"{call.seconds} s in {call.real:.1f} s" for call in run.waits()) or "none"))
     print()
-    lit = [color_name(color) for color in run.panel.shown(now()).values() if color]
+    colors = [color_name(color) for color in run.panel.shown(now()).values() if color]
     for name, value in summary.rows():
-        print(f"{name}: {paint(value, lit[0]) if lit and name == 'Outcome' else value}")
+        print(f"{name}: {paint(value, colors[0]) if colors and name == 'Outcome' else value}")
     for line in summary.wrong:
         print(f"DIFFERENCE: {line}")

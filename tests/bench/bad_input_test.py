@@ -28,7 +28,7 @@ class BadInput(unittest.TestCase):
         (self.build / "harl-updater").touch()
 
     def bench(self, *arguments: str | Path, **variables: str) -> tuple[int, str, str]:
-        command = [sys.executable, "-B", "-m", "bench", *arguments]
+        command: list[str | Path] = [sys.executable, "-B", "-m", "bench", *arguments]
         done = subprocess.run(command, env=os.environ | variables, capture_output=True, text=True, check=False)
         return done.returncode, done.stdout, done.stderr
 
@@ -75,7 +75,7 @@ class BadInput(unittest.TestCase):
         self.check_words(reason, "--build", self.folder)
 
     def test_paths_count_from_where_the_user_is(self) -> None:
-        command = [ROOT / "bench/run", "scenario.toml"]
+        command: list[str | Path] = [ROOT / "bench/run", "scenario.toml"]
         done = subprocess.run(command, cwd=self.folder, capture_output=True, text=True, check=False)
         message = "bench: scenario.toml: No such file or directory\n"
         self.assertEqual((done.returncode, done.stdout, done.stderr), (2, "", message))

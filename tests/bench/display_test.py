@@ -16,6 +16,7 @@ from pathlib import Path
 from bench.observation import Run
 from bench.show.terminal import LiveDisplay
 from bench.unit import Files, State
+from tests.command_line import take_path
 
 ROOT = Path(__file__).parents[2]
 
@@ -124,5 +125,5 @@ class Display(unittest.TestCase):
 
 
 if __name__ == "__main__":
-    BUILD = Path(sys.argv.pop())
+    BUILD = take_path()
     unittest.main()

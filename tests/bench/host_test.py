@@ -9,10 +9,12 @@ import sys
 import tempfile
 import time
 import unittest
+from collections.abc import Callable
 from pathlib import Path
 
 from bench.real.unit import forbidden
 from bench.runner import CLEANUP
+from tests.command_line import take_path
 
 ROOT = Path(__file__).parents[2]
 
@@ -75,7 +77,7 @@ class HostTest(unittest.TestCase):
             start_new_session=True,
         )
 
-    def wait_until(self, what: str, holds) -> None:
+    def wait_until(self, what: str, holds: Callable[[], object]) -> None:
         end = time.monotonic() + LONGEST_CLEARING
         while not holds():
             self.assertLess(time.monotonic(), end, f"{what}: {os.listdir(self.folder)} {users_of(self.folder)}")
@@ -111,6 +113,7 @@ class HostTest(unittest.TestCase):
             for number, status in ((signal.SIGINT, 130), (signal.SIGTERM, 143), (signal.SIGKILL, -9)):
                 arguments = ["--unit", kind, "package-and-board", "--speed", "1"]
                 with self.subTest(kind, number=number), self.start(*arguments) as bench:
+                    assert bench.stdout
                     while "Running command: apt-cache" not in (line := bench.stdout.readline()):
                         self.assertNotEqual(line, "", "the bench ended early")
                     self.assertTrue(users_of(self.folder))
@@ -124,7 +127,7 @@ class HostTest(unittest.TestCase):
         folder.mkdir()
         with subprocess.Popen(["sleep", "60"], start_new_session=True) as left:
             (folder / "unit.pid").write_text(f"{left.pid}\n")
-            guard = [sys.executable, "-I", "-S", CLEANUP, folder]
+            guard: list[str | Path] = [sys.executable, "-I", "-S", CLEANUP, folder]
             # No program on its search path.
             subprocess.run(guard, env={"PATH": self.folder}, stdin=subprocess.DEVNULL, check=True)
             self.assertEqual(left.wait(), -signal.SIGKILL)
@@ -153,5 +156,5 @@ class HostTest(unittest.TestCase):
 
 
 if __name__ == "__main__":
-    BUILD = sys.argv.pop()
+    BUILD = take_path()
     unittest.main()

@@ -15,6 +15,7 @@ from bench.show import page as page_module
 from bench.observation import Run
 from bench.panel import STEP_TIME
 from bench.unit import Files
+from tests.command_line import take_path
 
 ROOT = Path(__file__).parents[2]
 BUILD = ROOT / "build/default"
@@ -53,7 +54,7 @@ class Elements(HTMLParser):
 def written(scenario: str, folder: str) -> str:
     """The page of a run of `scenario` on stand-ins."""
     file = Path(folder) / "page.html"
-    arguments = ["--build", BUILD, "--unit", "stand-in", "--speed", "2000", "--record", file, scenario]
+    arguments = ["--build", str(BUILD), "--unit", "stand-in", "--speed", "2000", "--record", str(file), scenario]
     command = [sys.executable, "-B", "-m", "bench", *arguments]
     done = subprocess.run(command, env=os.environ | {"TMPDIR": folder}, capture_output=True, text=True, check=False)
     assert file.exists(), done.stdout + done.stderr
@@ -136,5 +137,5 @@ class Page(unittest.TestCase):
 
 
 if __name__ == "__main__":
-    BUILD = Path(sys.argv.pop())
+    BUILD = take_path()
     unittest.main()

@@ -3,16 +3,17 @@
 Runs the updater's executable on the stand-in unit and compares all that can be seen of it from outside.
 """
 
-import sys
 import unittest
-from pathlib import Path
 
 from bench import scenario
 from bench.compare import differences
+from bench.expected import COMMANDS, led_command, sound_command
 from bench.observation import RECORD, Call
-from bench.panel import FIRST_LED, LAST_LED
+from bench.outcomes import OUTCOMES
+from bench.panel import COLOR_CODES, FIRST_LED, LAST_LED, LED_CODES
 from bench.runner import Result, run_on, temporary_folder
 from bench.standin.unit import StandInUnit
+from tests.command_line import take_path, take_word
 
 SPEED = 2000  # times shorter waits, each 0.2 s at least
 
@@ -50,17 +51,8 @@ FUNCTIONS = {
     "SoundManager.cpp": {"static void SoundManager::play(SoundManager::Sound)"},
 }
 
-SOUNDS = {
-    "resultCallback": "aplay /root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav",
-    "errorCallback": "aplay /root/RESOURCES/SOUNDS/SND_RESULT_FAIL.wav",
-}
-LEDS_OFF = [f"i2cset -y 0 0x07 {led:#04x} c ; i2cset -y 0 0x07 0x0 c" for led in range(FIRST_LED, LAST_LED + 1)]
-OUTCOME_LEDS = {
-    "REMOTE MAIN pass": ["0x12 c ; i2cset -y 0 0x07 0x2 c", "0x15 c ; i2cset -y 0 0x07 0x2 c"],
-    "PASS pass": ["0x13 c ; i2cset -y 0 0x07 0x2 c"],
-    "REMOTE MAIN fail": ["0x12 c ; i2cset -y 0 0x07 0x8 c", "0x15 c ; i2cset -y 0 0x07 0x8 c"],
-    "FAIL fail": ["0x14 c ; i2cset -y 0 0x07 0x8 c"],
-}
+CALLBACK_SOUNDS = {"resultCallback": "pass", "errorCallback": "fail"}
+LEDS_OFF = [led_command(led, COLOR_CODES["off"]) for led in range(FIRST_LED, LAST_LED + 1)]
 
 
 class ProgramTest(unittest.TestCase):
@@ -74,11 +66,11 @@ class ProgramTest(unittest.TestCase):
         self.run_seen = self.result.run
         self.calls = self.run_seen.calls
         self.records = self.run_seen.records()
-        self.callbacks = [record.operation for record in self.records if record.operation in SOUNDS]
+        self.callbacks = [record.operation for record in self.records if record.operation in CALLBACK_SOUNDS]
 
     def update_calls(self) -> list[Call]:
         """The commands and waits of the update's thread."""
-        first = next(call for call in self.calls if call.text == "systemctl stop harl")
+        first = next(call for call in self.calls if call.text == COMMANDS["stop-harl"])
         return [call for call in self.calls if call.thread == first.thread]
 
     def test_comes_out_as_the_scenario_says(self) -> None:
@@ -113,8 +105,8 @@ class ProgramTest(unittest.TestCase):
 
     def test_waits_stand_at_their_places(self) -> None:
         calls = [call.text or call.seconds for call in self.update_calls()]
-        before = {30: "i2cset", 10: "systemctl start harl", 780: "ssh  "}
-        after = {30: "umount", 10: "systemctl stop harl-updater", 780: "rm "}
+        before = {30: "i2cset", 10: COMMANDS["start-harl"], 780: COMMANDS["install-board"]}
+        after = {30: COMMANDS["release-stick"], 10: COMMANDS["stop-updater"], 780: COMMANDS["remove-marker"]}
         for index, call in enumerate(calls):
             if isinstance(call, int):
                 self.assertTrue(str(calls[index - 1]).startswith(before[call]), calls[index - 1])
@@ -125,24 +117,25 @@ class ProgramTest(unittest.TestCase):
         if not self.callbacks:
             return
         [sound] = [index for index, call in enumerate(self.calls) if call.text.startswith("aplay ")]
-        self.assertEqual(self.calls[sound].text, SOUNDS[self.callbacks[0]])
+        self.assertEqual(self.calls[sound].text, sound_command(CALLBACK_SOUNDS[self.callbacks[0]]))
         self.assertEqual([call.text for call in self.calls[sound - 14 : sound]], LEDS_OFF)
         self.assertEqual({call.thread for call in self.calls[sound - 14 :]}, {self.calls[sound].thread})
         lit = [call.text for call in self.calls[sound + 1 :] if call.text.startswith("i2cset")]
-        self.assertIn(lit, [[f"i2cset -y 0 0x07 {text}" for text in leds] for leds in OUTCOME_LEDS.values()])
+        shown = [outcome for outcome in OUTCOMES if outcome.sound == CALLBACK_SOUNDS[self.callbacks[0]]]
+        commands = [[led_command(LED_CODES[led], COLOR_CODES[o.color]) for led in o.leds] for o in shown]
+        self.assertIn(lit, commands)
 
     def test_remote_and_main_flash_blue_in_turn(self) -> None:
         on = [call.text for call in self.calls if call.text.endswith("0x1 c")]
-        blue = [f"i2cset -y 0 0x07 {led} c ; i2cset -y 0 0x07 0x1 c" for led in ("0x12", "0x15")]
+        blue = [led_command(LED_CODES[led], COLOR_CODES["blue"]) for led in ("REMOTE", "MAIN")]
         self.assertEqual(on, (blue * len(on))[: len(on)])
         if self.callbacks:  # an update that ended earlier may have met its first cycle
             self.assertTrue(on)
 
 
 if __name__ == "__main__":
-    name, folder = sys.argv[1:]
-    ProgramTest.what = scenario.load(name)
+    ProgramTest.what, build = scenario.load(take_word()), take_path()
     with temporary_folder() as temporary:
-        unit = StandInUnit(ProgramTest.what, temporary, SPEED, Path(folder))
+        unit = StandInUnit(ProgramTest.what, temporary, SPEED, build)
         ProgramTest.result = run_on(unit, lambda run, log: None, SPEED)
-    unittest.main(argv=sys.argv[:1])
+    unittest.main()

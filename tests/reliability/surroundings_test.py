@@ -7,7 +7,6 @@ standard output that takes nothing. Where the updater does not come through, the
 import os
 import signal
 import subprocess
-import sys
 import threading
 import time
 import unittest
@@ -15,14 +14,27 @@ from pathlib import Path
 
 from bench import scenario
 from bench.compare import differences
-from bench.expected import COMMANDS
+from bench.expected import COMMANDS, led_command
 from bench.observation import Run
+from bench.outcomes import CHECK_FAILED
+from bench.panel import COLOR_CODES, LED_CODES
 from bench.runner import Result, run_on, temporary_folder
+from tests.command_line import take_path
 from tests.reliability.disturbed import SPEED, DisturbedUnit
 
 BUILD = Path()
 PLAIN_USER = 60000 + os.getpid() % 5000  # has no processes of its own, nor any of another run of this test
 AS_PLAIN_USER = ["/usr/bin/setpriv", f"--reuid={PLAIN_USER}", f"--regid={PLAIN_USER}", "--clear-groups"]
+
+
+class PlainUsersUnit(DisturbedUnit):
+    """A unit whose files every user may change."""
+
+    def _start_updater(self) -> None:
+        for path in self._folder.rglob("*"):
+            if not path.is_symlink():
+                path.chmod(0o777)
+        super()._start_updater()
 
 
 class SurroundingsTest(unittest.TestCase):
@@ -130,24 +142,14 @@ class SurroundingsTest(unittest.TestCase):
         self.assertEqual(commands, [COMMANDS[name] for name in names])
         self.assertEqual(result.status, 0)
         last = [call.text for call in result.run.calls if call.text.startswith("i2cset")][-2:]
-        self.assertEqual(last, [f"i2cset -y 0 0x07 {led} c ; i2cset -y 0 0x07 0x8 c" for led in ("0x12", "0x15")])
+        self.assertEqual(last, [led_command(LED_CODES[led], COLOR_CODES["fail"]) for led in CHECK_FAILED.leds])
 
     def plain_users_unit(self, runner: str = "") -> DisturbedUnit:
         """A unit whose updater runs, behind `runner`, as a user for whom limits count."""
         if os.geteuid() != 0:
             self.skipTest("needs root, to run as a user without other processes")
-        unit = self.unit(runner=" ".join([runner, *AS_PLAIN_USER]))
         self.folder.chmod(0o777)
-        make = unit._start_updater
-
-        def start_updater() -> None:
-            for path in self.folder.rglob("*"):
-                if not path.is_symlink():
-                    path.chmod(0o777)
-            make()
-
-        unit._start_updater = start_updater  # type: ignore[method-assign]
-        return unit
+        return PlainUsersUnit(self.what, self.folder, BUILD, runner=" ".join([runner, *AS_PLAIN_USER]))
 
     def test_without_processes_the_run_ends_with_no_further_command_done(self) -> None:
         unit = self.plain_users_unit()
@@ -187,5 +189,5 @@ class SurroundingsTest(unittest.TestCase):
 
 
 if __name__ == "__main__":
-    BUILD = Path(sys.argv.pop(1))
+    BUILD = take_path()
     unittest.main()

@@ -3,17 +3,18 @@
 import re
 import shutil
 import subprocess
-import sys
 import tempfile
 import unittest
 from pathlib import Path
 
-from bench.panel import Panel, color_name, led_name
+from bench.makers.files import write_script
+from bench.outcomes import ENDED_EARLY
+from bench.panel import COLOR_CODES, LED_CODES, Panel
+from tests.command_line import skip
 
 ROOT = Path(__file__).parents[2]
 
 
-SKIPPED = 77
 NAMESPACES = ["unshare", "--map-root-user", "--mount", "--pid", "--fork", "--kill-child", "--mount-proc"]
 GIVE_BACK = ROOT / "service/give-back"
 START = "systemctl --no-block start harl"
@@ -47,8 +48,7 @@ class GiveBack(unittest.TestCase):
         }
         for name, text in TOOLS.items():
             log = '[ "${0##*/}" = sleep ] || [ "${0##*/}" = mountpoint ] || echo "${0##*/} $*" >>"$UNIT/calls"'
-            (self.unit / "bin" / name).write_text(f"#!/bin/sh\n{log}\n{text}\n")
-            (self.unit / "bin" / name).chmod(0o755)
+            write_script(self.unit / "bin" / name, f"{log}\n{text}")
         # Copies of sleep(1) under the names of what the updater may leave at work.
         for name in ("apt", "dpkg", "scp", "ssh"):
             shutil.copy("/usr/bin/sleep", self.unit / name)
@@ -74,10 +74,11 @@ class GiveBack(unittest.TestCase):
     def panel(self) -> dict[str, str]:
         """The LEDs that are lit after what was sent, had they flashed blue before."""
         panel = Panel()
-        for byte in ("0x12", "0x1", *[line.split()[4] for line in self.calls("i2cset")]):
-            panel.send(int(byte, 16), 0)
+        sent = [int(line.split()[4], 16) for line in self.calls("i2cset")]
+        for byte in (LED_CODES["REMOTE"], COLOR_CODES["blue"], *sent):
+            panel.send(byte, 0)
         self.assertEqual(panel.faults, [])
-        return {led_name(led): color_name(color) for led, color in panel.shown(0).items() if color}
+        return panel.pattern(0)
 
     def test_after_a_normal_end_nothing_is_left_to_do(self) -> None:
         (self.unit / "run/outcome").touch()
@@ -88,7 +89,7 @@ class GiveBack(unittest.TestCase):
     def test_end_before_the_outcome_shows_the_failure(self) -> None:
         said = self.give_back()
         self.assertIn("ended (success killed TERM) before it showed an outcome", said)
-        self.assertEqual(self.panel(), {"FAIL": "fail"})
+        self.assertEqual(self.panel(), ENDED_EARLY.panel)
         self.assertEqual(self.calls("umount", "systemctl"), ["umount /root/USB_MOUNT", START])
         # The operator sees the failure even if what follows should hang.
         self.assertEqual(self.calls()[-2:], ["umount /root/USB_MOUNT", START])
@@ -99,7 +100,7 @@ class GiveBack(unittest.TestCase):
         self.assertEqual(self.calls(), ["umount /root/USB_MOUNT", START])
 
     def test_outcome_whose_last_byte_is_still_under_way_is_left_alone(self) -> None:
-        (self.unit / "bin/sleep").write_text('#!/bin/sh\n: >"$RUNTIME_DIRECTORY/outcome"\n')
+        write_script(self.unit / "bin/sleep", ': >"$RUNTIME_DIRECTORY/outcome"')
         self.assertEqual(self.give_back(), "")
         self.assertEqual(self.calls("i2cset"), [])
 
@@ -159,7 +160,7 @@ class GiveBack(unittest.TestCase):
         for name in ("RUNTIME_DIRECTORY", "SERVICE_RESULT", "EXIT_CODE", "EXIT_STATUS"):
             del self.environment[name]
         self.give_back()
-        self.assertEqual(self.panel(), {"FAIL": "fail"})
+        self.assertEqual(self.panel(), ENDED_EARLY.panel)
         self.assertEqual(self.calls()[-1], START)
 
     def test_unit_file_names_the_runtime_directory_for_an_old_service_manager(self) -> None:
@@ -172,6 +173,5 @@ class GiveBack(unittest.TestCase):
 if __name__ == "__main__":
     probe = subprocess.run([*NAMESPACES, "true"], capture_output=True, text=True, check=False)
     if probe.returncode != 0:
-        print(f"left out: this machine allows no process namespace: {probe.stderr.strip()}")
-        sys.exit(SKIPPED)
+        skip(f"this machine allows no process namespace: {probe.stderr.strip()}")
     unittest.main()

@@ -8,7 +8,6 @@ stand-ins.
 import os
 import shutil
 import subprocess
-import sys
 import time
 import unittest
 from collections.abc import Callable
@@ -19,12 +18,12 @@ from bench.makers.files import write, write_script
 from bench.makers.packages import DATABASE, SOURCES, Package, build, raise_version, write_index
 from bench.makers.sticks import VERSIONS, version_file_archive, write_stick
 from bench.observation import RECORD
-from bench.panel import Panel, color_name, led_name
+from bench.panel import Panel
+from tests.command_line import skip, take_path, take_word
 
 ROOT = Path(__file__).parents[2]
 
 
-SKIPPED = 77
 STICK = "/root/USB_MOUNT"
 SPEED = 10  # times shorter waits of the updater
 TOOLS = {
@@ -162,7 +161,7 @@ class ServiceTest(unittest.TestCase):
         for byte in self.read("/var/log/panel").split():
             panel.send(int(byte, 16), 0)
         self.assertEqual(panel.faults, [])
-        return {led_name(led): color_name(color) for led, color in panel.shown(0).items() if color}
+        return panel.pattern(0)
 
     def read(self, path: str) -> str:
         """Text of a file inside."""
@@ -374,14 +373,8 @@ class Ends(ServiceTest):
         self.assertNotEqual(self.show("ActiveState"), "active")
 
 
-def skip(why: str) -> None:
-    """Ends the test as left out."""
-    print(f"left out: {why}")
-    sys.exit(SKIPPED)
-
-
 if __name__ == "__main__":
-    programs, package, system = Path(sys.argv[1]), sys.argv[2], Path(sys.argv[3])
+    programs, package, system = take_path(), take_word(), take_path()
     architecture = subprocess.check_output(["dpkg", "--print-architecture"], text=True).strip()
     found = sorted((ROOT / "build/package").glob(f"{package}_*_{architecture}.deb"))
     if not found:
@@ -396,4 +389,4 @@ if __name__ == "__main__":
             skip(f"this machine allows no machine of its own: {error}")
         ServiceTest.unit, ServiceTest.package = made, package
         install(made)
-        unittest.main(argv=[sys.argv[0], *sys.argv[4:]], verbosity=2)
+        unittest.main(verbosity=2)

@@ -53,7 +53,7 @@ def check_unit(program: Path, setup: Setup) -> str:
 
 def golden(kind: str) -> dict[str, str]:
     """What is kept of each scenario."""
-    kept = {}
+    kept: dict[str, str] = {}
     text = (GOLDEN / f"{kind}.txt").read_text(encoding="utf-8")
     for names, said in re.findall(r"((?:^# .*\n)+)((?:^(?!# ).*\n)+)", text, re.MULTILINE):
         kept |= dict.fromkeys(re.findall("# (.*)", names), said)

@@ -12,22 +12,23 @@ import select
 import signal
 import struct
 import subprocess
-import sys
 import tempfile
 import termios
 import time
 import unittest
 from html.parser import HTMLParser
 from pathlib import Path
+from typing import IO, Any
 
 from bench import scenario
+from tests.command_line import take_path
 
 ROOT = Path(__file__).resolve().parents[3]
 GOLDEN = ROOT / "tests/companion/golden/log"
 TOOL = ""
 
 
-def run_tool(*arguments: str, text: bytes = b"", **options) -> subprocess.CompletedProcess:
+def run_tool(*arguments: str, text: bytes = b"", **options: Any) -> subprocess.CompletedProcess[bytes]:
     """Runs `harl-updater-tool log` where the golden files lie, with `text` as its input."""
     command = [TOOL, "log", *arguments]
     return subprocess.run(command, cwd=GOLDEN, input=text, capture_output=True, timeout=60, check=False, **options)
@@ -116,7 +117,7 @@ class Pieces(Base):
 class BadInput(Base):
     """One clear line on standard error, and status 2."""
 
-    def refused(self, *arguments: str, text: bytes = b"", **options) -> str:
+    def refused(self, *arguments: str, text: bytes = b"", **options: Any) -> str:
         done = run_tool(*arguments, text=text, **options)
         self.assertEqual(done.returncode, 2)
         self.assertEqual(done.stderr.count(b"\n"), 1, done.stderr)
@@ -202,6 +203,7 @@ class BadInput(Base):
             command = [TOOL, "log", "--html", str(self.folder / "page.html")]
             with subprocess.Popen(command, stdin=subprocess.PIPE, stdout=subprocess.DEVNULL,
                                   preexec_fn=lambda: signal.signal(number, signal.SIG_DFL)) as tool:
+                assert tool.stdin
                 tool.stdin.write((GOLDEN / "up-to-date.log").read_bytes())
                 tool.stdin.flush()
                 self.await_read(tool)
@@ -210,8 +212,9 @@ class BadInput(Base):
                 self.assertEqual(tool.wait(30), -number)
             self.assertEqual(list(self.folder.iterdir()), [])
 
-    def await_read(self, tool: subprocess.Popen) -> None:
+    def await_read(self, tool: subprocess.Popen[bytes]) -> None:
         """Waits until the tool has read what was written to it."""
+        assert tool.stdin
         deadline = time.monotonic() + 30
         while struct.unpack("i", fcntl.ioctl(tool.stdin, termios.FIONREAD, bytes(4))) != (0,):
             self.assertLess(time.monotonic(), deadline)
@@ -248,14 +251,16 @@ class Unit(Base):
 class Follow(Base):
     """A run that goes on."""
 
-    def follow(self, lines: list[bytes], *arguments: str, cut: int, terminal=(None, None)) -> tuple[int, bytes]:
+    def follow(
+        self, lines: list[bytes], *arguments: str, cut: int, terminal: tuple[int, int] | None = None
+    ) -> tuple[int, bytes]:
         """Follows a file that holds the first `cut` lines; the rest comes once something of them has been shown.
 
         `terminal`, both sides of one, takes the output in place of a pipe.
         """
         file = self.folder / "growing.log"
         file.write_bytes(b"".join(lines[:cut]))
-        ours, theirs = terminal
+        ours, theirs = terminal or (None, None)
         command = [TOOL, "log", str(file), "--follow", *arguments]
         with subprocess.Popen(command, stdout=theirs or subprocess.PIPE) as tool:
             self.await_output(ours or tool.stdout)
@@ -264,11 +269,11 @@ class Follow(Base):
             shown = self.output_of(tool)[0]
             return tool.returncode, shown
 
-    def await_output(self, output) -> None:
+    def await_output(self, output: int | IO[bytes] | None) -> None:
         """Waits until the tool has shown something."""
         self.assertTrue(select.select([output], [], [], 30)[0], "nothing is shown")
 
-    def output_of(self, tool: subprocess.Popen) -> tuple[bytes, bytes]:
+    def output_of(self, tool: subprocess.Popen[bytes]) -> tuple[bytes, bytes]:
         """Waits for the tool's end; ends one that does not come to it."""
         try:
             return tool.communicate(timeout=30)
@@ -336,10 +341,27 @@ class Follow(Base):
         self.assertIn(b"the file was made shorter while it was read", errors)
 
 
-class Page(Base):
-    """The page with the timelines."""
+class Nesting(HTMLParser):
+    """The elements that are open, and the ends that are not theirs."""
 
     VOID = {"meta", "br"}
+
+    def __init__(self) -> None:
+        super().__init__()
+        self.opened: list[str] = []
+        self.wrong: list[str] = []
+
+    def handle_starttag(self, tag: str, attributes: list[tuple[str, str | None]]) -> None:
+        if tag not in self.VOID:
+            self.opened.append(tag)
+
+    def handle_endtag(self, tag: str) -> None:
+        if not self.opened or self.opened.pop() != tag:
+            self.wrong.append(tag)
+
+
+class Page(Base):
+    """The page with the timelines."""
 
     def page(self, name: str, text: bytes = b"") -> str:
         file = self.folder / "page.html"
@@ -349,13 +371,10 @@ class Page(Base):
     def test_it_is_whole_and_needs_nothing_from_outside(self) -> None:
         for file in sorted(GOLDEN.glob("*.log")):
             text = self.page(file.name)
-            opened: list[str] = []
-            parser = HTMLParser()
-            parser.handle_starttag = lambda tag, _: opened.append(tag) if tag not in self.VOID else None
-            parser.handle_endtag = lambda tag: self.assertEqual(opened.pop(), tag, file.name)
+            parser = Nesting()
             parser.feed(text)
             parser.close()
-            self.assertEqual(opened, [], file.name)
+            self.assertEqual((parser.opened, parser.wrong), ([], []), file.name)
             for outside in ("src=", "href=", "url(", "@import", "<script"):
                 self.assertNotIn(outside, text)
 
@@ -430,5 +449,5 @@ class Output(Base):
 
 
 if __name__ == "__main__":
-    TOOL = str(Path(sys.argv.pop()).resolve())
+    TOOL = str(take_path())
     unittest.main()

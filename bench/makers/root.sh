@@ -6,7 +6,7 @@
 make_root() { # ROOT SYSTEM USER_ID
     mkdir -p "$1"
     mount --bind "$1" "$1"
-    cd "$1"
+    cd "$1" || exit
     mkdir -p usr proc dev run tmp etc root opt srv var/log
     chmod 1777 tmp
     for link in bin sbin lib lib64; do ln -s "usr/$link" "$link"; done
@@ -52,5 +52,6 @@ become_systemd() { # GROUP ROOT TARGET [OPTION...]
     tr -d - </proc/sys/kernel/random/uuid >"$root/etc/machine-id"
     # The group is joined before the namespace is made: it becomes the root of that.
     sh -c 'echo $PPID' >"$group/cgroup.procs"
+    # shellcheck disable=SC2154 # the caller sets `makers`
     exec unshare --cgroup "$@" "$makers/systemd.sh" "$root" "$target"
 }

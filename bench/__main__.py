@@ -5,19 +5,19 @@ import io
 import math
 import os
 import signal
-import subprocess
 import sys
 from pathlib import Path
 
 from bench import scenario
 from bench.build import BUILD, build
+from bench.command import status_of
 from bench.compare import differences
 from bench.show.text import PlainDisplay, Summary, print_summary, terminal
 from bench.show.page import page
 from bench.runner import KINDS, UnitMaker, run_on, temporary_folder
 from bench.run_all import run_all
 from bench.show.terminal import LiveDisplay
-from bench.unit import PROGRAMS, UnitError
+from bench.unit import PROGRAMS
 
 
 def run(maker: UnitMaker, what: scenario.Scenario, page_file: Path | None) -> int:
@@ -96,29 +96,22 @@ def main() -> int:
     if isinstance(sys.stdout, io.TextIOWrapper):
         sys.stdout.reconfigure(errors="replace")
     signal.signal(signal.SIGTERM, lambda *_: sys.exit(143))
-    try:
-        if given.list:
-            for name in scenario.names():
-                print(f"{name:38}  {scenario.load(name).summary}")
-            return 0
-        wanted = [scenario.load(name) for name in (scenario.names() if given.all else [given.scenario])]
-        if not given.build:
-            build()
-        maker = UnitMaker(given.unit, given.speed, (given.build or BUILD).resolve())
-        if given.all:
-            return 0 if run_all(maker, wanted, given.jobs) else 1
-        return run(maker, wanted[0], given.record)
-    except BrokenPipeError:
-        os.dup2(os.open(os.devnull, os.O_WRONLY), sys.stdout.fileno())
-        return 1
-    except scenario.ScenarioError as error:
-        print(f"bench: {error}", file=sys.stderr)
-        return 2
-    except (UnitError, OSError, subprocess.SubprocessError) as error:
-        print(f"bench: {error}", file=sys.stderr)
-        return 1
-    except KeyboardInterrupt:
-        return 130
+    return status_of(lambda: show(given))
+
+
+def show(given: argparse.Namespace) -> int:
+    """Lists or runs what the command line asks for. Returns the status."""
+    if given.list:
+        for name in scenario.names():
+            print(f"{name:38}  {scenario.load(name).summary}")
+        return 0
+    wanted = [scenario.load(name) for name in (scenario.names() if given.all else [given.scenario])]
+    if not given.build:
+        build()
+    maker = UnitMaker(given.unit, given.speed, (given.build or BUILD).resolve())
+    if given.all:
+        return 0 if run_all(maker, wanted, given.jobs) else 1
+    return run(maker, wanted[0], given.record)
 
 
 sys.exit(main())

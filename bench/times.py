@@ -12,6 +12,7 @@ import time
 
 from bench import scenario
 from bench.build import BUILD, build
+from bench.command import status_of
 from bench.compare import differences
 from bench.runner import UnitMaker, run_on, temporary_folder
 from bench.unit import UnitError
@@ -93,22 +94,18 @@ def main() -> int:
     given = parser.parse_args()
     if given.runs < 1:
         parser.error("--runs: must be 1 or more")
-    try:
-        for name in given.scenario:
-            scenario.load(name)
-        build()
-        load = os.getloadavg()[0]
-        print(f"{os.cpu_count()} cores, load {load:.1f}; the updater's waits are {SPEED} times shorter")
-        for name in given.scenario:
-            print_times(name, given.runs)
-    except scenario.ScenarioError as error:
-        print(f"bench: {error}", file=sys.stderr)
-        return 2
-    except (UnitError, OSError, subprocess.CalledProcessError) as error:
-        print(f"bench: {error}", file=sys.stderr)
-        return 1
-    except KeyboardInterrupt:
-        return 130
+    return status_of(lambda: measure_all(given.scenario, given.runs))
+
+
+def measure_all(names: list[str], runs: int) -> int:
+    """Prints the table of each of the scenarios. Returns the status."""
+    for name in names:
+        scenario.load(name)
+    build()
+    load = os.getloadavg()[0]
+    print(f"{os.cpu_count()} cores, load {load:.1f}; the updater's waits are {SPEED} times shorter")
+    for name in names:
+        print_times(name, runs)
     return 0
 
 

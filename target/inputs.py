@@ -6,7 +6,7 @@ import subprocess
 import tarfile
 from pathlib import Path
 
-from bench.makers.board import VERSION_FILE, version_text
+from bench.makers.board import VERSION_FILE, version_text, write_version
 from bench.makers.files import write
 from bench.makers.packages import SOURCES, Package, build, raise_version, write_index
 from bench.makers.sounds import write_sounds
@@ -65,9 +65,9 @@ def write_scenario(folder: Path, plan: Plan, updater: Path, speed: float, again:
     offered = head_package(setup.package.offered, depends, plan.settings.script_seconds, use_up_memory)
     build(offered, repository)
     write_index(repository)
+    write_version(folder / "board", setup.board.installed)
     settings = {
         "mirrors": setup.mirrors.refresh,
-        "board_version": setup.board.installed,
         "board_link": setup.board.link,
         "marker": "yes" if setup.head.marker else "no",
         "event": "nothing" if again else plan.settings.event,  # see plan.py

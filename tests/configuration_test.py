@@ -30,7 +30,7 @@ class ConfigurationTest(unittest.TestCase):
     def configure(self, *options: str, **variables: str) -> tuple[int, str]:
         """The status and the output of CMake in this test's folder, with no flags but those in `variables`."""
         environment = {name: value for name, value in os.environ.items() if name not in FLAGS} | variables
-        command = ["cmake", "--preset", "default", "-B", self.folder, *options]
+        command = ["cmake", "--preset", "default", "-B", str(self.folder), *options]
         done = subprocess.run(
             command, cwd=ROOT, env=environment, stdout=subprocess.PIPE, stderr=subprocess.STDOUT, text=True, check=False
         )

@@ -5,29 +5,13 @@ import tempfile
 import unittest
 from pathlib import Path
 
+from bench.makers.files import write_script
+from bench.makers.i2cset import NEWER, OLDER
+
 I2CSET = Path(__file__).parents[2] / "service/i2cset"
-# What both kinds say to an option that they do not know, before their usage text.
-UNKNOWN = 'echo "Error: Unsupported option \\"$1\\"!" >&2; echo "{usage}" >&2; exit 1'
-OLD = f"""#!/bin/sh
-# i2c-tools before 4.2
-case $1 in
--y) ;;
-*) {UNKNOWN.format(usage="Usage: i2cset [-f] [-y] [-m MASK] [-r] I2CBUS CHIP-ADDRESS DATA-ADDRESS [VALUE]")} ;;
-esac
-echo "$*" >>"$SENT"
-exit "$STATUS"
-"""
-NEW = f"""#!/bin/sh
-# i2c-tools since 4.2
-case $1 in
--a) ;;
--y) echo "Error: Chip address out of range (0x08-0x77)!" >&2; exit 1 ;;
-*) {UNKNOWN.format(usage="Usage: i2cset [-f] [-y] [-m MASK] [-r] [-a] I2CBUS CHIP-ADDRESS DATA-ADDRESS [VALUE]")} ;;
-esac
-shift
-echo "$*" >>"$SENT"
-exit "$STATUS"
-"""
+SEND = 'echo "$*" >>"$SENT"\nexit "$STATUS"'
+OLD = OLDER + SEND
+NEW = NEWER + SEND
 
 
 class I2cset(unittest.TestCase):
@@ -42,8 +26,7 @@ class I2cset(unittest.TestCase):
 
     def send(self, real: str, *arguments: str, status: int = 0, notes: bool = True) -> subprocess.CompletedProcess[str]:
         """Runs the service's i2cset as the updater does, found in the search path."""
-        (self.folder / "tools/i2cset").write_text(real)
-        (self.folder / "tools/i2cset").chmod(0o755)
+        write_script(self.folder / "tools/i2cset", real)
         environment = {
             "PATH": f"{I2CSET.parent}:{self.folder}/tools:/usr/bin:/bin",
             "SENT": str(self.folder / "sent"),
@@ -104,7 +87,7 @@ class I2cset(unittest.TestCase):
         if not real.exists():
             self.skipTest("no i2c-tools here")
         # A bus that does not exist: the arguments are judged before it is opened.
-        done = self.send(f'#!/bin/sh\nexec {real} "$@"\n', "-y", "9999", "0x07", "0x12", "c")
+        done = self.send(f'exec {real} "$@"', "-y", "9999", "0x07", "0x12", "c")
         self.assertIn("No such file or directory", done.stderr)
 
 

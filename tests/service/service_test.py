@@ -15,6 +15,7 @@ from pathlib import Path
 
 from bench.machine.machine import Machine, MachineError, machine
 from bench.makers.files import write, write_script
+from bench.makers.i2cset import NEWER
 from bench.makers.packages import DATABASE, SOURCES, Package, build, raise_version, write_index
 from bench.makers.sticks import VERSIONS, version_file_archive, write_stick
 from bench.observation import RECORD
@@ -27,12 +28,7 @@ ROOT = Path(__file__).parents[2]
 STICK = "/root/USB_MOUNT"
 SPEED = 10  # times shorter waits of the updater
 TOOLS = {
-    # As i2c-tools 4.3: the panel's address only with -a. The panel keeps what it is sent.
-    "i2cset": """
-[ "$1" != -h ] || { echo "Usage: i2cset [-f] [-y] [-m MASK] [-r] [-a] I2CBUS CHIP-ADDRESS DATA-ADDRESS" >&2; exit 1; }
-[ "$1" = -a ] || { echo "Error: Chip address out of range (0x08-0x77)!" >&2; exit 1; }
-echo "$5" >>/var/log/panel
-""",
+    "i2cset": NEWER + 'echo "$4" >>/var/log/panel',  # the panel keeps what it is sent
     "aplay": 'sleep 0.2; echo "${1##*/}" >>/var/log/sounds',
     "ssh": r"""
 case $* in

@@ -24,11 +24,15 @@ class MachineError(Exception):
 
 
 class Machine:
-    """A running machine. `files` is what it has besides the /usr of the root file system `system`."""
+    """A running machine. `files` is what it has besides the /usr of the root file system `system`.
 
-    def __init__(self, folder: Path, system: Path) -> None:
+    What it writes stays in memory, or goes to the file system in the file `disk`.
+    """
+
+    def __init__(self, folder: Path, system: Path, disk: Path | None = None) -> None:
         self._folder = folder
         self.system = system
+        self._disk = [disk] if disk else []
         self.files = folder / "files"
         self.files.mkdir()
         (folder / "memory").mkdir()
@@ -42,14 +46,16 @@ class Machine:
         self._control_group = make_control_group(self._folder)
         with (self._folder / "console").open("wb") as console:
             self._namespaces = subprocess.Popen(
-                [*NAMESPACES, Path(__file__).with_name("machine.sh"), self._folder, self.system, self._control_group],
+                [*NAMESPACES, Path(__file__).with_name("machine.sh"), self._folder, self.system, self._control_group]
+                + self._disk,
                 stdin=subprocess.DEVNULL,
                 stdout=console,
                 stderr=console,
                 start_new_session=True,
             )
         end = time.monotonic() + LONGEST_START
-        while self.status("systemctl", "is-active", "--quiet", "basic.target") != 0:
+        # The word, not the status: before systemd is there, systemctl takes the machine for a chroot and ends with 0.
+        while self._inside("systemctl", "is-active", "basic.target").stdout != "active\n":
             if self._namespaces.poll() is not None or time.monotonic() > end:
                 text = (self._folder / "console").read_text(errors="replace").strip().splitlines()
                 raise MachineError(text[-1] if text else "systemd does not come up")
@@ -105,10 +111,10 @@ class Machine:
 
 
 @contextlib.contextmanager
-def machine(system: Path) -> Iterator[Machine]:
-    """A machine with the programs of `system` that is not started yet, and goes with the block."""
+def machine(system: Path, disk: Path | None = None) -> Iterator[Machine]:
+    """A machine with the programs of `system`, see Machine, that is not started yet and goes with the block."""
     with tempfile.TemporaryDirectory(prefix="machine-") as folder:
-        made = Machine(Path(folder), system)
+        made = Machine(Path(folder), system, disk)
         try:
             yield made
         finally:

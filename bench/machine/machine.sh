@@ -1,9 +1,10 @@
 #!/bin/sh
 # Starts systemd as the first process of a machine of its own: new namespaces, in which machine.py runs this as root.
 #
-# Usage: machine.sh FOLDER SYSTEM GROUP
-# FOLDER/files is what the machine has besides the /usr of the root file system SYSTEM. What it writes stays in memory.
-# GROUP is its control group.
+# Usage: machine.sh FOLDER SYSTEM GROUP [DISK]
+# FOLDER/files is what the machine has besides the /usr of the root file system SYSTEM. What it writes stays in memory, or
+# goes to the file system in the file DISK, from which it starts when it has been there before. GROUP is its control
+# group.
 set -eu
 
 folder=$1
@@ -15,10 +16,18 @@ makers=$(dirname "$0")/../makers
 memory=$folder/memory
 root=$memory/root
 mount --make-rprivate /
-mount -t tmpfs tmpfs "$memory"
+if [ -z "${4-}" ]; then
+    mount -t tmpfs tmpfs "$memory"
+else
+    mount -o loop,nodiscard "$4" "$memory"
+fi
+is_new=true
+[ ! -e "$memory/upper" ] || is_new=false
 make_root "$root" "$system" 0
-mkdir "$memory/upper" "$memory/work"
+mkdir -p "$memory/upper" "$memory/work"
 mount -t overlay -o "lowerdir=$system/usr,upperdir=$memory/upper,workdir=$memory/work" overlay "$root/usr"
 printf 'systemd-journal:x:101:\ntty:x:5:\nutmp:x:43:\nadm:x:4:\n' >>"$root/etc/group"
-add_files "$root" "$folder/files"
+if $is_new; then
+    add_files "$root" "$folder/files"
+fi
 become_systemd "$3" "$root" basic.target

@@ -9,7 +9,7 @@ make_root() { # ROOT SYSTEM USER_ID
     cd "$1" || exit
     mkdir -p usr proc dev run tmp etc root opt srv var/log
     chmod 1777 tmp
-    for link in bin sbin lib lib64; do ln -s "usr/$link" "$link"; done
+    for link in bin sbin lib lib64; do ln -sfn "usr/$link" "$link"; done
     mount --rbind "${2%/}/usr" usr
     mount -o remount,bind,ro usr
     mount --bind /proc proc
@@ -46,7 +46,7 @@ become_systemd() { # GROUP ROOT TARGET [OPTION...]
     group=$1 root=$2 target=$3
     shift 3
     umount "$root/proc"
-    mkdir "$root/sys"
+    mkdir -p "$root/sys"
     mount -t sysfs -o ro sysfs "$root/sys"
     : >"$root/dev/console"
     tr -d - </proc/sys/kernel/random/uuid >"$root/etc/machine-id"

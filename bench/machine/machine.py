@@ -15,6 +15,7 @@ from bench.real.systemd import make_control_group, obstacle
 # The machine goes with the process that made it, however that ends.
 NAMESPACES = ["setpriv", "--pdeathsig", "KILL", "unshare", "--mount", "--net", "--ipc", "--uts", "--pid", "--fork"]
 NAMESPACES += ["--kill-child", "--mount-proc"]
+MACHINE = Path(__file__).with_name("machine.sh")
 LONGEST_START = 60  # s
 LONGEST_COMMAND = 120  # s
 
@@ -46,8 +47,7 @@ class Machine:
         self._control_group = make_control_group(self._folder)
         with (self._folder / "console").open("wb") as console:
             self._namespaces = subprocess.Popen(
-                [*NAMESPACES, Path(__file__).with_name("machine.sh"), self._folder, self.system, self._control_group]
-                + self._disk,
+                [*NAMESPACES, MACHINE, self._folder, self.system, self._control_group, *self._disk],
                 stdin=subprocess.DEVNULL,
                 stdout=console,
                 stderr=console,

@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <cstdio>
 #include <ctime>
@@ -47,6 +48,7 @@ protected:
 };
 
 std::mutex mutex;
+std::atomic<const void*> lastCommandText{nullptr};
 std::vector<Entry> entryList;
 std::map<std::string, Script> scripts;
 std::map<FILE*, int> pipes;
@@ -207,6 +209,11 @@ std::vector<Record> records()
     return result;
 }
 
+const void* lastCommand()
+{
+    return lastCommandText;
+}
+
 void waitFor(const std::function<bool()>& condition)
 {
     for (int i = 0; i < 10000; ++i) {
@@ -231,6 +238,7 @@ extern "C" {
 
 int system(const char* command)
 {
+    platform::lastCommandText = command;
     platform::enter(std::string("system:") + command);
     return platform::answerOf(command).status;
 }
@@ -238,6 +246,7 @@ int system(const char* command)
 FILE* popen(const char* command, const char* mode)
 {
     EXPECT_STREQ(mode, "r");
+    platform::lastCommandText = command;
     platform::enter(std::string("popen:") + command);
     const platform::Answer answer = platform::answerOf(command);
     if (!answer.starts) {

@@ -59,6 +59,9 @@ Lines entries(const std::string& prefix);
 /// The log records so far. Fails the test when one is not well-formed.
 std::vector<Record> records();
 
+/// Where the text of the last command was kept. Two calls got the same text, not two equal ones, when it is the same.
+const void* lastCommand();
+
 /// How many objects of `size` bytes (less than 64) the calling thread has released with delete.
 int released(std::size_t size);
 

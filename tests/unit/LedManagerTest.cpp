@@ -12,36 +12,17 @@ namespace
 class Leds : public UnitTest
 {
 protected:
-    /// The command line that sends the controller the two bytes.
-    static std::string bytes(const std::string& first, const std::string& second)
-    {
-        return "i2cset -y 0 0x07 " + first + " c ; i2cset -y 0 0x07 " + second + " c";
-    }
-
-    /// The commands that send every LED the same second byte.
-    static Lines allLeds(const std::string& second)
-    {
-        Lines lines;
-        for (const char* led : {"0x10", "0x11", "0x12", "0x13", "0x14", "0x15", "0x16", "0x17", "0x18", "0x19", "0x1a",
-                                "0x1b", "0x1c", "0x1d"}) {
-            lines.push_back(bytes(led, second));
-        }
-        return lines;
-    }
-
+    /// The journal of `commands` that fail.
     static Lines failing(const Lines& commands)
     {
         Lines lines;
         for (const std::string& command : commands) {
-            lines.push_back("system:" + command);
-            lines.push_back("log:system returned false: " + command);
+            lines.push_back(ran(command));
+            lines.push_back(logged("system returned false: " + command));
         }
         return lines;
     }
 };
-
-const char remote[] = "0x12";
-const char mainHead[] = "0x15";
 
 TEST_F(Leds, PanelIsOneObject)
 {
@@ -97,9 +78,9 @@ TEST_F(Leds, AnyStatusButZeroIsAFailure)
 {
     for (const int status : {-1, 1, 9, 256}) {
         platform::reset();
-        script(bytes(remote, "0x1"), {{status, "", true, {}}});
+        script(ledCommand(ledRemote, blue), {raw(status)});
         LedManager::turnOn(LedManager::LED_REMOTE, LedManager::COLOR_BLUE);
-        EXPECT_EQ(journal(), failing({bytes(remote, "0x1")}));
+        EXPECT_EQ(journal(), failing({ledCommand(ledRemote, blue)}));
     }
 }
 
@@ -122,23 +103,19 @@ protected:
         LedManager::instance()->waitForFlashingEnd();
     }
 
-    static Lines cycle(const char* lit, const char* dark)
+    static Lines cycle(const char* lit, const char* unlit)
     {
-        Lines lines;
-        for (const std::string& command : allLeds("0x0")) {
-            lines.push_back("system:" + command);
-        }
-        return joined({lines, {"system:" + bytes(lit, "0x1"), "system:" + bytes(dark, "0x0"), "sleep:1"}});
+        return joined({ran(allLeds(dark)), {ran(ledCommand(lit, blue)), ran(ledCommand(unlit, dark)), "sleep:1"}});
     }
 
-    static Lines bothOff() { return {"system:" + bytes(mainHead, "0x0"), "system:" + bytes(remote, "0x0")}; }
+    static Lines bothOff() { return {ran(ledCommand(ledMain, dark)), ran(ledCommand(ledRemote, dark))}; }
 };
 
 TEST_F(Flashing, RemoteIsLitFirstThenMainInTurn)
 {
     flash(3);
     EXPECT_EQ(journal(),
-              joined({cycle(remote, mainHead), cycle(mainHead, remote), cycle(remote, mainHead), bothOff()}));
+              joined({cycle(ledRemote, ledMain), cycle(ledMain, ledRemote), cycle(ledRemote, ledMain), bothOff()}));
 }
 
 TEST_F(Flashing, StartsWithRemoteAgainAfterAStop)
@@ -146,7 +123,7 @@ TEST_F(Flashing, StartsWithRemoteAgainAfterAStop)
     flash(1);
     platform::reset();
     flash(2);
-    EXPECT_EQ(journal(), joined({cycle(remote, mainHead), cycle(mainHead, remote), bothOff()}));
+    EXPECT_EQ(journal(), joined({cycle(ledRemote, ledMain), cycle(ledMain, ledRemote), bothOff()}));
 }
 
 TEST_F(Flashing, StartReplacesAThreadThatHasEnded)
@@ -162,7 +139,7 @@ TEST_F(Flashing, StartReplacesAThreadThatHasEnded)
         platform::waitFor([&pauses, round] { return pauses == round; });
     }
     LedManager::instance()->waitForFlashingEnd();
-    EXPECT_EQ(journal(), joined({cycle(remote, mainHead), bothOff(), cycle(remote, mainHead), bothOff()}));
+    EXPECT_EQ(journal(), joined({cycle(ledRemote, ledMain), bothOff(), cycle(ledRemote, ledMain), bothOff()}));
 }
 
 TEST_F(Flashing, ThreadThatIsStoppedBeforeItsFirstCheckOnlyTurnsBothOff)
@@ -179,10 +156,10 @@ TEST_F(Flashing, RunsOnAThreadOfItsOwn)
 
 TEST_F(Flashing, FailedCommandsDoNotEndIt)
 {
-    script(bytes(remote, "0x1"), {exits(1)});
+    script(ledCommand(ledRemote, blue), {exits(1)});
     flash(2);
     const Lines log = entries("log:");
-    EXPECT_EQ(log, Lines{"system returned false: " + bytes(remote, "0x1")});
+    EXPECT_EQ(log, Lines{"system returned false: " + ledCommand(ledRemote, blue)});
     EXPECT_EQ(entries("sleep:"), (Lines{"1", "1"}));
 }
 
@@ -307,12 +284,12 @@ TEST_F(Sequences, ResetStartAndStopSendTheirModes)
 TEST_F(Sequences, FailedModeIsLogged)
 {
     for (const char* mode : {"0x80", "0x40", "0x0"}) {
-        script(bytes("0x13", mode), {exits(1)});
+        script(ledCommand("0x13", mode), {exits(1)});
     }
     LedManager::resetFlashingSequence(LedManager::LED_PASS);
     LedManager::startFlashingSequence(LedManager::LED_PASS);
     LedManager::stopFlashingSequence(LedManager::LED_PASS);
-    EXPECT_EQ(journal(), failing({bytes("0x13", "0x80"), bytes("0x13", "0x40"), bytes("0x13", "0x0")}));
+    EXPECT_EQ(journal(), failing({ledCommand("0x13", "0x80"), ledCommand("0x13", "0x40"), ledCommand("0x13", "0x0")}));
     EXPECT_EQ(platform::records().at(0).function, "static void LedManager::resetFlashingSequence(LedManager::Led)");
     EXPECT_EQ(platform::records().at(1).function, "static void LedManager::startFlashingSequence(LedManager::Led)");
     EXPECT_EQ(platform::records().at(2).function, "static void LedManager::stopFlashingSequence(LedManager::Led)");
@@ -327,17 +304,17 @@ TEST_F(Sequences, SetAppendsTheColourThenDarkness)
 
 TEST_F(Sequences, StepTimeIsInUnitsOf20MillisecondsRoundedTowardsZero)
 {
-    EXPECT_EQ(stepTimeOf(0), bytes("0x1f", "0x00"));
-    EXPECT_EQ(stepTimeOf(19), bytes("0x1f", "0x00"));
-    EXPECT_EQ(stepTimeOf(39), bytes("0x1f", "0x01"));
-    EXPECT_EQ(stepTimeOf(5119), bytes("0x1f", "0xff"));
+    EXPECT_EQ(stepTimeOf(0), ledCommand("0x1f", "0x00"));
+    EXPECT_EQ(stepTimeOf(19), ledCommand("0x1f", "0x00"));
+    EXPECT_EQ(stepTimeOf(39), ledCommand("0x1f", "0x01"));
+    EXPECT_EQ(stepTimeOf(5119), ledCommand("0x1f", "0xff"));
 }
 
 TEST_F(Sequences, StepTimesOutOfRangeAreLeftToTheToolToRefuse)
 {
-    EXPECT_EQ(stepTimeOf(5120), bytes("0x1f", "0x100"));
-    EXPECT_EQ(stepTimeOf(-19), bytes("0x1f", "0x00"));
-    EXPECT_EQ(stepTimeOf(-20), bytes("0x1f", "0xffffffff"));
+    EXPECT_EQ(stepTimeOf(5120), ledCommand("0x1f", "0x100"));
+    EXPECT_EQ(stepTimeOf(-19), ledCommand("0x1f", "0x00"));
+    EXPECT_EQ(stepTimeOf(-20), ledCommand("0x1f", "0xffffffff"));
 }
 
 TEST_F(Sequences, SetEndsAtItsFirstFailedCommand)

@@ -14,7 +14,7 @@ protected:
         const std::string query = teamViewerCheckCommand;
         if (required) {
             return {"log:Running command: " + query, "popen:" + query, "log:Exit code:0",
-                    std::string("log:Teamviewer path") + teamViewerMarker, "log:Teamviewer install is required"};
+                    logged(std::string("Teamviewer path") + teamViewerMarker), "log:Teamviewer install is required"};
         }
         return {"log:Running command: " + query, "popen:" + query, "log:Exit code:2",
                 "log:install Teamviewer flag doesnot exist"};
@@ -64,7 +64,7 @@ const Lines finished = {"log:update maainhead finished", "result:1"};
 
 Lines teamViewerInstalled(const std::string& status)
 {
-    return {"log:", std::string("log:") + teamViewerScriptCommand, std::string("system:") + teamViewerScriptCommand,
+    return {"log:", logged(teamViewerScriptCommand), ran(teamViewerScriptCommand),
             "log:Install script ended with code: " + status};
 }
 
@@ -86,9 +86,9 @@ TEST_F(MainHead, UnreadPackageVersionsAreACheckError)
     EXPECT_EQ(journal(), joined({entry,
                                  harlStopped(),
                                  mirrorsOk(),
-                                 {std::string("log:") + dhPolicy, std::string("log:Running command: ") + dhPolicy,
-                                  std::string("popen:") + dhPolicy, "log:Exit code:0", "log:solvik4:", "log:",
-                                  "log:1.3.0", "log:  Version table:", "log:  1.3.0", "log:NWM_UM_CHECK_UPDATE_FAILED"},
+                                 {logged(dhPolicy), running(dhPolicy), opened(dhPolicy), "log:Exit code:0",
+                                  "log:solvik4:", "log:", "log:1.3.0", "log:  Version table:", "log:  1.3.0",
+                                  "log:NWM_UM_CHECK_UPDATE_FAILED"},
                                  checkFailed}));
 }
 
@@ -119,8 +119,7 @@ TEST_F(MainHead, FailedTeamViewerTestIsACheckError)
                                  mirrorsOk(),
                                  packageIs("1.3.0"),
                                  boardChecked("2.1.0", "2.2.0"),
-                                 {std::string("log:Running command: ") + teamViewerCheckCommand,
-                                  std::string("popen:") + teamViewerCheckCommand, "log:Exit code:1",
+                                 {running(teamViewerCheckCommand), opened(teamViewerCheckCommand), "log:Exit code:1",
                                   "log:Failed to check if TV install is needed"},
                                  checkFailed}));
 }
@@ -194,7 +193,7 @@ TEST_F(MainHead, MarkerThatIsAlreadyGoneCountsAsRemoved)
 TEST_F(MainHead, MarkerRemovalThatDoesNotStartIsNotLogged)
 {
     scriptUnit("1.2.0", "2.1.0", false);
-    script(markerCommand, {{-1, "", true, {}}});
+    script(markerCommand, {raw(-1)});
     UpdateManager::initMainHead();
     const Lines lines = journal();
     EXPECT_EQ(Lines(lines.end() - 2, lines.end()), (Lines{"system:rm /root/RESOURCES/tavren1stboot", "result:0"}));
@@ -226,11 +225,11 @@ TEST_F(MainHead, UnknownKindsArePassedOver)
 
 TEST_F(MainHead, FailedPackageInstallLeavesTheRestUninstalled)
 {
-    EXPECT_EQ(installAll(dhInstall, exits(100, "E: dpkg\n")),
-              joined({entry,
-                      packageStep,
-                      {"log:", std::string("log:Running command: ") + dhInstall, std::string("popen:") + dhInstall,
-                       "log:Exit code:100", "log:100E: dpkg\n", "error:2"}}));
+    EXPECT_EQ(
+        installAll(dhInstall, exits(100, "E: dpkg\n")),
+        joined({entry,
+                packageStep,
+                {"log:", running(dhInstall), opened(dhInstall), "log:Exit code:100", "log:100E: dpkg\n", "error:2"}}));
 }
 
 TEST_F(MainHead, FailedBoardInstallLeavesTeamViewerUninstalled)

@@ -142,8 +142,8 @@ TEST_F(CheckQuorbUpdate, VersionWithoutCarriageReturnIsUsedWhole)
 
 TEST_F(CheckQuorbUpdate, CommandsThatDoNotStartFail)
 {
-    script(boardVersionCommand, {{0, "", false, {}}});
-    script(stickVersionCommand, {{0, "", false, {}}});
+    script(boardVersionCommand, {doesNotStart()});
+    script(stickVersionCommand, {doesNotStart()});
     EXPECT_FALSE(UpdateManager::checkQuorbUpdate(installed, candidate, versionsFound));
     EXPECT_FALSE(versionsFound);
     EXPECT_EQ(journal().back(), "log:Failed to checkUpdate");
@@ -156,7 +156,7 @@ class UploadQuorb : public UnitTest
 TEST_F(UploadQuorb, FirstAttemptSucceeds)
 {
     EXPECT_TRUE(UpdateManager::uploadQuorbFiles());
-    EXPECT_EQ(journal(), (Lines{std::string("log:") + uploadCommand, std::string("system:") + uploadCommand}));
+    EXPECT_EQ(journal(), (Lines{logged(uploadCommand), ran(uploadCommand)}));
     EXPECT_EQ(platform::records().at(0).function, "static bool UpdateManager::uploadQuorbFiles()");
 }
 
@@ -221,7 +221,7 @@ TEST_F(InstallQuorb, RawStatusesAreLogged)
 {
     for (const int status : {-1, 9, 255 * 256}) {
         platform::reset();
-        script(boardScriptCommand, {{status, "", true, {}}});
+        script(boardScriptCommand, {raw(status)});
         EXPECT_TRUE(UpdateManager::installQuorbUpdate());
         EXPECT_EQ(journal(), boardInstalled(std::to_string(status)));
     }

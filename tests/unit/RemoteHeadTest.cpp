@@ -63,9 +63,8 @@ TEST_F(RemoteHead, FailedPackageInstallEndsTheUpdate)
     EXPECT_EQ(journal(), joined({entry,
                                  mirrorsOk(),
                                  packageIs("1.2.0", "1.3.0"),
-                                 {"log:", std::string("log:Running command: ") + installCommand,
-                                  std::string("popen:") + installCommand, "log:Exit code:100", "log:100E: dpkg\n",
-                                  "log:update failed", "error:2"}}));
+                                 {"log:", running(installCommand), opened(installCommand), "log:Exit code:100",
+                                  "log:100E: dpkg\n", "log:update failed", "error:2"}}));
 }
 
 TEST_F(RemoteHead, FailedBoardInstallEndsTheUpdate)
@@ -142,7 +141,7 @@ TEST_F(RemoteHead, MarkerThatIsAlreadyGoneCountsAsRemoved)
         platform::reset();
         scriptPackage(policyCommand, "1.2.0", "1.3.0");
         scriptBoard("2.1.0", "2.1.0");
-        script(markerCommand, {{status, "", true, {}}});
+        script(markerCommand, {raw(status)});
         UpdateManager::updateRemoteHead();
         const Lines all = journal();
         EXPECT_EQ(Lines(all.end() - 3, all.end()), joined({markerRemoved, updated}));
@@ -153,7 +152,7 @@ TEST_F(RemoteHead, MarkerRemovalThatDoesNotStartIsNotLogged)
 {
     scriptPackage(policyCommand, "1.2.0", "1.3.0");
     scriptBoard("2.1.0", "2.1.0");
-    script(markerCommand, {{-1, "", true, {}}});
+    script(markerCommand, {raw(-1)});
     UpdateManager::updateRemoteHead();
     const Lines all = journal();
     EXPECT_EQ(Lines(all.end() - 3, all.end()),

@@ -10,147 +10,115 @@
 namespace
 {
 
-const char passSound[] = "system:aplay /root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav";
-const char failSound[] = "system:aplay /root/RESOURCES/SOUNDS/SND_RESULT_FAIL.wav";
-
-std::string led(const std::string& code, const std::string& color)
+/// What each value lights, after its sound.
+struct Outcome
 {
-    return "system:i2cset -y 0 0x07 " + code + " c ; i2cset -y 0 0x07 " + color + " c";
-}
-
-Lines panelDark()
-{
-    Lines lines;
-    for (const char* code : {"0x10", "0x11", "0x12", "0x13", "0x14", "0x15", "0x16", "0x17", "0x18", "0x19", "0x1a",
-                             "0x1b", "0x1c", "0x1d"}) {
-        lines.push_back(led(code, "0x0"));
-    }
-    return lines;
-}
-
-class Feedback : public UnitTest
-{
-protected:
-    static Lines result(std::int32_t value)
-    {
-        platform::reset();
-        RemoteUpdateManager::resultCallback(static_cast<UpdateManager::Result>(value));
-        return journal();
-    }
-
-    static Lines error(std::int32_t value)
-    {
-        platform::reset();
-        RemoteUpdateManager::errorCallback(static_cast<UpdateManager::Error>(value));
-        return journal();
-    }
-
-    static Lines shown(const std::string& sound, const Lines& lit)
-    {
-        return joined({{"log:"}, panelDark(), {sound}, lit});
-    }
+    const char* name;
+    void (*report)();
+    const char* sound;
+    Lines lit;
 };
 
-TEST_F(Feedback, NothingToUpdateLightsBothHeadsInThePassColour)
+template <UpdateManager::Result value>
+void reportResult()
 {
-    EXPECT_EQ(result(UpdateManager::RESULT_NO_UPDATE), shown(passSound, {led("0x12", "0x2"), led("0x15", "0x2")}));
+    RemoteUpdateManager::resultCallback(value);
+}
+
+template <UpdateManager::Error value>
+void reportError()
+{
+    RemoteUpdateManager::errorCallback(value);
+}
+
+const Lines bothPass = {ledCommand(ledRemote, passColor), ledCommand(ledMain, passColor)};
+const Lines bothFail = {ledCommand(ledRemote, failColor), ledCommand(ledMain, failColor)};
+const Lines pass = {ledCommand(ledPass, passColor)};
+const Lines fail = {ledCommand(ledFail, failColor)};
+
+const Outcome outcomes[] = {
+    {"NothingToUpdate", reportResult<UpdateManager::RESULT_NO_UPDATE>, passSoundCommand, bothPass},
+    {"Updated", reportResult<UpdateManager::RESULT_UPDATED>, passSoundCommand, pass},
+    {"UnknownResult", reportResult<static_cast<UpdateManager::Result>(2)>, passSoundCommand, {}},
+    {"NegativeResult", reportResult<static_cast<UpdateManager::Result>(-1)>, passSoundCommand, {}},
+    {"FailedCheck", reportError<UpdateManager::ERROR_CHECK_UPDATE>, failSoundCommand, bothFail},
+    {"FailedRefresh", reportError<UpdateManager::ERROR_UPDATE_MIRRORS>, failSoundCommand, bothFail},
+    {"FailedPackage", reportError<UpdateManager::ERROR_INSTALL_PACKAGE>, failSoundCommand, fail},
+    {"FailedBoard", reportError<UpdateManager::ERROR_INSTALL_QUORB>, failSoundCommand, fail},
+    {"FailedTeamViewer", reportError<UpdateManager::ERROR_INSTALL_TEAMVIEWER>, failSoundCommand, {}},
+    {"UnknownError", reportError<static_cast<UpdateManager::Error>(5)>, failSoundCommand, {}},
+    {"NegativeError", reportError<static_cast<UpdateManager::Error>(-1)>, failSoundCommand, {}},
+};
+
+template <typename Row>
+std::string nameOf(const testing::TestParamInfo<Row>& info)
+{
+    return info.param.name;
+}
+
+void PrintTo(const Outcome& outcome, std::ostream* stream)
+{
+    *stream << outcome.name;
+}
+
+class Feedback : public UnitTest, public testing::WithParamInterface<Outcome>
+{
+};
+INSTANTIATE_TEST_SUITE_P(Outcomes, Feedback, testing::ValuesIn(outcomes), nameOf<Outcome>);
+
+TEST_P(Feedback, DarkensThePanelPlaysItsSoundAndLightsItsLeds)
+{
+    GetParam().report();
+    EXPECT_EQ(journal(), joined({{"log:"}, ran(allLeds(dark)), {ran(GetParam().sound)}, ran(GetParam().lit)}));
     EXPECT_EQ(platform::records().at(0).function,
-              "static void RemoteUpdateManager::resultCallback(UpdateManager::Result)");
+              GetParam().sound == passSoundCommand
+                  ? "static void RemoteUpdateManager::resultCallback(UpdateManager::Result)"
+                  : "static void RemoteUpdateManager::errorCallback(UpdateManager::Error)");
 }
 
-TEST_F(Feedback, UpdatedLightsThePassLed)
+TEST_P(Feedback, FlashingSendsNothingOnceTheOutcomeIsBeingShown)
 {
-    EXPECT_EQ(result(UpdateManager::RESULT_UPDATED), shown(passSound, {led("0x13", "0x2")}));
+    LedManager::instance()->startFlashRemoteAndMainInBlue();
+    platform::waitFor([] { return entries("sleep:").size() >= 3; });
+    GetParam().report();
+    const Lines own = journal(std::this_thread::get_id());
+    ASSERT_EQ(own.size(), 1 + 14 + 1 + GetParam().lit.size());
+    Lines end = journal();
+    end.erase(end.begin(), end.end() - static_cast<std::ptrdiff_t>(own.size()) + 1);
+    EXPECT_EQ(end, Lines(own.begin() + 1, own.end())) << "another thread's command is among the outcome's";
 }
 
-TEST_F(Feedback, OtherResultsPlayThePassSoundInTheDark)
+TEST_P(Feedback, IsLoggedBeforeTheFlashingHasEnded)
 {
-    for (const std::int32_t value : {-1, 2, 7}) {
-        EXPECT_EQ(result(value), shown(passSound, {}));
-    }
+    platform::scriptSleep([](const timespec*, timespec*) {
+        platform::note("pause");
+        platform::waitFor([] { return !entries("log:").empty(); });
+        return 0;
+    });
+    LedManager::instance()->startFlashRemoteAndMainInBlue();
+    platform::waitFor([] { return !entries("pause").empty(); });
+    GetParam().report();
 }
 
-TEST_F(Feedback, FailedCheckAndRefreshLightBothHeadsInTheFailColour)
+class OtherFeedback : public UnitTest
 {
-    const Lines expected = shown(failSound, {led("0x12", "0x8"), led("0x15", "0x8")});
-    EXPECT_EQ(error(UpdateManager::ERROR_CHECK_UPDATE), expected);
-    EXPECT_EQ(error(UpdateManager::ERROR_UPDATE_MIRRORS), expected);
-    EXPECT_EQ(platform::records().at(0).function,
-              "static void RemoteUpdateManager::errorCallback(UpdateManager::Error)");
-}
+};
 
-TEST_F(Feedback, FailedInstallationsLightTheFailLed)
-{
-    const Lines expected = shown(failSound, {led("0x14", "0x8")});
-    EXPECT_EQ(error(UpdateManager::ERROR_INSTALL_PACKAGE), expected);
-    EXPECT_EQ(error(UpdateManager::ERROR_INSTALL_QUORB), expected);
-}
-
-TEST_F(Feedback, OtherErrorsPlayTheFailSoundInTheDark)
-{
-    for (const std::int32_t value : {-1, static_cast<std::int32_t>(UpdateManager::ERROR_INSTALL_TEAMVIEWER), 5}) {
-        EXPECT_EQ(error(value), shown(failSound, {}));
-    }
-}
-
-TEST_F(Feedback, OfferedListIsIgnored)
+TEST_F(OtherFeedback, OfferedListIsIgnored)
 {
     RemoteUpdateManager::updateFoundCallback({{UpdateManager::COMPONENT_QUORB, "QUORB", "1", "2"}});
     EXPECT_EQ(journal(), Lines{});
 }
 
-struct Outcome
+TEST_F(OtherFeedback, LedsAreLitOnlyAfterTheSoundHasEnded)
 {
-    void (*report)();
-    std::size_t leds; // that it lights
-};
-
-const Outcome outcomes[] = {
-    {[] { RemoteUpdateManager::resultCallback(UpdateManager::RESULT_NO_UPDATE); }, 2},
-    {[] { RemoteUpdateManager::resultCallback(UpdateManager::RESULT_UPDATED); }, 1},
-    {[] { RemoteUpdateManager::errorCallback(UpdateManager::ERROR_UPDATE_MIRRORS); }, 2},
-    {[] { RemoteUpdateManager::errorCallback(UpdateManager::ERROR_INSTALL_QUORB); }, 1},
-};
-
-TEST_F(Feedback, FlashingSendsNothingOnceTheOutcomeIsBeingShown)
-{
-    for (const Outcome& outcome : outcomes) {
-        platform::reset();
-        LedManager::instance()->startFlashRemoteAndMainInBlue();
-        platform::waitFor([] { return entries("sleep:").size() >= 3; });
-        outcome.report();
-        const Lines own = journal(std::this_thread::get_id());
-        ASSERT_EQ(own.size(), 1 + 14 + 1 + outcome.leds);
-        Lines end = journal();
-        end.erase(end.begin(), end.end() - static_cast<std::ptrdiff_t>(own.size()) + 1);
-        EXPECT_EQ(end, Lines(own.begin() + 1, own.end())) << "another thread's command is among the outcome's";
-    }
-}
-
-TEST_F(Feedback, IsLoggedBeforeTheFlashingHasEnded)
-{
-    for (const Outcome& outcome : outcomes) {
-        platform::reset();
-        platform::scriptSleep([](const timespec*, timespec*) {
-            platform::note("pause");
-            platform::waitFor([] { return !entries("log:").empty(); });
-            return 0;
-        });
-        LedManager::instance()->startFlashRemoteAndMainInBlue();
-        platform::waitFor([] { return !entries("pause").empty(); });
-        outcome.report();
-    }
-}
-
-TEST_F(Feedback, LedsAreLitOnlyAfterTheSoundHasEnded)
-{
-    script("aplay /root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav", {{0, "", true, [] {
-                                                                     platform::delay(30);
-                                                                     platform::note("sound ended");
-                                                                 }}});
+    script(passSoundCommand, {{0, "", true, [] {
+                                   platform::delay(30);
+                                   platform::note("sound ended");
+                               }}});
     RemoteUpdateManager::resultCallback(UpdateManager::RESULT_UPDATED);
     const Lines all = journal();
-    EXPECT_EQ(Lines(all.end() - 3, all.end()), (Lines{passSound, "sound ended", led("0x13", "0x2")}));
+    EXPECT_EQ(Lines(all.end() - 3, all.end()), joined({{ran(passSoundCommand), "sound ended"}, ran(pass)}));
 }
 
 class ApplicationLock : public UnitTest
@@ -236,7 +204,7 @@ protected:
     void SetUp() override
     {
         ApplicationLock::SetUp();
-        script("systemctl stop harl", {{0, "", true, untilItIsWaitedFor}});
+        script(stopHarlCommand, {{0, "", true, untilItIsWaitedFor}});
     }
 
     /// Runs it. The journal is parted by threads: the caller's, the flashing thread's, and the update thread's.
@@ -346,44 +314,51 @@ TEST_F(WholeUpdate, RunsOpeningUpdateAndClosingInOrder)
             commands.push_back(command);
         }
     }
-    EXPECT_EQ(commands,
-              (Lines{"systemctl stop harl", mirrorsCommand, policyCommand, installCommand, boardVersionCommand,
-                     stickVersionCommand, uploadCommand, boardScriptCommand, "780", markerCommand,
-                     "aplay /root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav", "30", "umount /root/USB_MOUNT/",
-                     "systemctl start harl", "10", "systemctl stop harl-updater"}));
-    EXPECT_EQ(flashing.front(), led("0x12", "0x1"));
+    EXPECT_EQ(commands, (Lines{stopHarlCommand, mirrorsCommand, policyCommand, installCommand, boardVersionCommand,
+                               stickVersionCommand, uploadCommand, boardScriptCommand, "780", markerCommand,
+                               passSoundCommand, "30", unmountCommand, startHarlCommand, "10", stopUpdaterCommand}));
+    EXPECT_EQ(flashing.front(), ran(ledCommand(ledRemote, blue)));
 }
 
-TEST_F(WholeUpdate, OutcomeStaysOnThePanel)
+/// A command that fails, or none, and what the panel must show at the end.
+struct Failure
 {
-    struct Row
-    {
-        const char* failing;
-        int status;
-        const char* sound;
-        Lines lit;
-    };
-    const Row rows[] = {
-        {"", 0, passSound, {led("0x13", "0x2")}},
-        {mirrorsCommand, 1, failSound, {led("0x12", "0x8"), led("0x15", "0x8")}},
-        {installCommand, 1, failSound, {led("0x14", "0x8")}},
-        {uploadCommand, 1, failSound, {led("0x14", "0x8")}},
-        {boardVersionCommand, 255, failSound, {led("0x12", "0x8"), led("0x15", "0x8")}},
-    };
-    for (const Row& row : rows) {
-        SetUp();
-        scriptPackage(policyCommand, "1.2.0", "1.3.0");
-        scriptBoard("2.1.0", "2.2.0");
-        script(row.failing, {exits(row.status)});
-        run();
-        const Lines all = journal();
-        const auto sound = std::find(all.begin(), all.end(), row.sound);
-        ASSERT_NE(sound, all.end()) << row.failing;
-        Lines after;
-        std::copy_if(sound, all.end(), std::back_inserter(after),
-                     [](const std::string& line) { return line.find("i2cset") != std::string::npos; });
-        EXPECT_EQ(after, row.lit) << row.failing;
-    }
+    const char* name;
+    const char* command;
+    int code;
+    const char* sound;
+    Lines lit;
+};
+
+void PrintTo(const Failure& failure, std::ostream* stream)
+{
+    *stream << failure.name;
+}
+
+class OutcomeOfAWholeUpdate : public WholeUpdate, public testing::WithParamInterface<Failure>
+{
+};
+INSTANTIATE_TEST_SUITE_P(Failures, OutcomeOfAWholeUpdate,
+                         testing::Values(Failure{"None", "", 0, passSoundCommand, pass},
+                                         Failure{"Refresh", mirrorsCommand, 1, failSoundCommand, bothFail},
+                                         Failure{"Package", installCommand, 1, failSoundCommand, fail},
+                                         Failure{"Board", uploadCommand, 1, failSoundCommand, fail},
+                                         Failure{"BoardCheck", boardVersionCommand, 255, failSoundCommand, bothFail}),
+                         nameOf<Failure>);
+
+TEST_P(OutcomeOfAWholeUpdate, StaysOnThePanel)
+{
+    scriptPackage(policyCommand, "1.2.0", "1.3.0");
+    scriptBoard("2.1.0", "2.2.0");
+    script(GetParam().command, {exits(GetParam().code)});
+    run();
+    const Lines commands = entries("system:");
+    const auto sound = std::find(commands.begin(), commands.end(), GetParam().sound);
+    ASSERT_NE(sound, commands.end());
+    Lines after;
+    std::copy_if(sound, commands.end(), std::back_inserter(after),
+                 [](const std::string& command) { return command.compare(0, 7, "i2cset ") == 0; });
+    EXPECT_EQ(after, GetParam().lit);
 }
 
 } // namespace

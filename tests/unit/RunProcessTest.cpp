@@ -62,7 +62,7 @@ TEST_F(RunProcess, UnknownStatusGivesZero)
 
 TEST_F(RunProcess, CommandThatDoesNotStartGivesZeroAndNoFurtherRecord)
 {
-    script("x", {{0, "", false, {}}});
+    script("x", {doesNotStart()});
     EXPECT_EQ(UpdateManager::runProcess("x", output), 0);
     EXPECT_EQ(output, "");
     EXPECT_EQ(journal(), (Lines{"log:Running command: x", "popen:x"}));
@@ -104,13 +104,13 @@ TEST_F(InstallUpdate, FailureLogsCodeAndOutputBackToBack)
 
 TEST_F(InstallUpdate, InstallThatDoesNotStartCounts)
 {
-    script(installCommand, {{0, "", false, {}}});
+    script(installCommand, {doesNotStart()});
     EXPECT_TRUE(UpdateManager::installUpdate(installCommand));
 }
 
 TEST_F(InstallUpdate, KilledInstallCounts)
 {
-    script(installCommand, {{SIGKILL, "", true, {}}});
+    script(installCommand, {raw(SIGKILL)});
     EXPECT_TRUE(UpdateManager::installUpdate(installCommand));
 }
 

@@ -13,7 +13,7 @@ TEST_F(Services, StopHARLLogsTheRawStatus)
 {
     for (const int status : {0, 256, 5 * 256, 15, -1}) {
         platform::reset();
-        script("systemctl stop harl", {{status, "", true, {}}});
+        script("systemctl stop harl", {raw(status)});
         UpdateManager::stopHARL();
         EXPECT_EQ(journal(), (Lines{"log:", "system:systemctl stop harl", "log:" + std::to_string(status)}));
         EXPECT_EQ(platform::records().at(0).function, "static void UpdateManager::stopHARL()");
@@ -31,7 +31,7 @@ TEST_F(Services, StopUpdaterLogsTheRawStatus)
 {
     for (const int status : {0, 256, 15, -1}) {
         platform::reset();
-        script("systemctl stop harl-updater", {{status, "", true, {}}});
+        script("systemctl stop harl-updater", {raw(status)});
         UpdateManager::stopUpdater();
         EXPECT_EQ(journal(), (Lines{"log:", "system:systemctl stop harl-updater", "log:" + std::to_string(status)}));
         EXPECT_EQ(platform::records().at(0).function, "static void UpdateManager::stopUpdater()");
@@ -49,7 +49,7 @@ TEST_F(Services, StartHARLCarriesOnWhenEveryCommandFails)
 {
     script("umount /root/USB_MOUNT/", {exits(32)});
     script("systemctl start harl", {exits(5)});
-    script("systemctl stop harl-updater", {{-1, "", true, {}}});
+    script("systemctl stop harl-updater", {raw(-1)});
     UpdateManager::startHARL();
     EXPECT_EQ(journal(), (Lines{"log:", "system:umount /root/USB_MOUNT/", "log:8192", "system:systemctl start harl",
                                 "log:1280", "sleep:10", "log:", "system:systemctl stop harl-updater", "log:-1"}));

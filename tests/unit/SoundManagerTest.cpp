@@ -41,7 +41,7 @@ TEST_F(SoundManagerTest, FailedPlaybackIsLogged)
 {
     for (const int status : {256, 9, -1}) {
         platform::reset();
-        script("aplay /root/RESOURCES/SOUNDS/SND_RESULT_FAIL.wav", {{status, "", true, {}}});
+        script("aplay /root/RESOURCES/SOUNDS/SND_RESULT_FAIL.wav", {raw(status)});
         SoundManager::play(SoundManager::SOUND_FAIL);
         EXPECT_EQ(journal(),
                   (Lines{"system:aplay /root/RESOURCES/SOUNDS/SND_RESULT_FAIL.wav", "log:Failed to play a sound"}));

@@ -97,7 +97,7 @@ TEST_F(InstallTVUpdate, RawStatusIsLoggedAndNeverAFailure)
 {
     for (const int status : {0, 5 * 256, 127 * 256, 9, -1}) {
         platform::reset();
-        script(teamViewerScriptCommand, {{status, "", true, {}}});
+        script(teamViewerScriptCommand, {raw(status)});
         EXPECT_TRUE(UpdateManager::installTVUpdate());
         EXPECT_EQ(journal(), (Lines{"log:", "log:/root/RESOURCES/teamviewer_updatescript.sh",
                                     "system:/root/RESOURCES/teamviewer_updatescript.sh",

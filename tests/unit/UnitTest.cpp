@@ -51,6 +51,60 @@ void noteUpdateFound(std::vector<UpdateManager::UpdateComponent> components)
     platform::note(text);
 }
 
+std::string ledCommand(const std::string& first, const std::string& second)
+{
+    return "i2cset -y 0 0x07 " + first + " c ; i2cset -y 0 0x07 " + second + " c";
+}
+
+Lines allLeds(const std::string& second)
+{
+    Lines lines;
+    for (const char* led : {"0x10", "0x11", "0x12", "0x13", "0x14", "0x15", "0x16", "0x17", "0x18", "0x19", "0x1a",
+                            "0x1b", "0x1c", "0x1d"}) {
+        lines.push_back(ledCommand(led, second));
+    }
+    return lines;
+}
+
+std::string logged(const std::string& message)
+{
+    return "log:" + message;
+}
+
+std::string ran(const std::string& command)
+{
+    return "system:" + command;
+}
+
+std::string opened(const std::string& command)
+{
+    return "popen:" + command;
+}
+
+std::string running(const std::string& command)
+{
+    return logged("Running command: " + command);
+}
+
+Lines ran(const Lines& commands)
+{
+    Lines lines;
+    for (const std::string& command : commands) {
+        lines.push_back(ran(command));
+    }
+    return lines;
+}
+
+platform::Answer raw(int status)
+{
+    return {status};
+}
+
+platform::Answer doesNotStart()
+{
+    return {0, "", false};
+}
+
 std::string policy(const std::string& installed, const std::string& candidate)
 {
     return "solvik4:\n  Installed: " + installed + "\n  Candidate: " + candidate + "\n  Version table:\n";
@@ -92,12 +146,12 @@ Lines packageInstalled(const std::string& command)
 
 Lines boardChecked(const std::string& installed, const std::string& candidate)
 {
-    return {std::string("log:Running command: ") + boardVersionCommand,
-            std::string("popen:") + boardVersionCommand,
+    return {running(boardVersionCommand),
+            opened(boardVersionCommand),
             "log:Exit code:0",
             "log:" + installed + "\r",
-            std::string("log:Running command: ") + stickVersionCommand,
-            std::string("popen:") + stickVersionCommand,
+            running(stickVersionCommand),
+            opened(stickVersionCommand),
             "log:Exit code:0",
             "log:" + installed + "  " + candidate,
             installed == candidate ? "log:QUORB up to date" : "log:Update found: " + installed + " -> " + candidate};
@@ -105,17 +159,17 @@ Lines boardChecked(const std::string& installed, const std::string& candidate)
 
 Lines boardNotReadable()
 {
-    return {std::string("log:Running command: ") + boardVersionCommand, std::string("popen:") + boardVersionCommand,
-            "log:Exit code:255", "log:Failed to checkUpdate"};
+    return {running(boardVersionCommand), opened(boardVersionCommand), "log:Exit code:255",
+            "log:Failed to checkUpdate"};
 }
 
 Lines boardInstalled(const std::string& scriptStatus)
 {
     return {"log:",
-            std::string("log:") + uploadCommand,
-            std::string("system:") + uploadCommand,
-            std::string("log:") + boardScriptCommand,
-            std::string("system:") + boardScriptCommand,
+            logged(uploadCommand),
+            ran(uploadCommand),
+            logged(boardScriptCommand),
+            ran(boardScriptCommand),
             "log:Install script ended with code: " + scriptStatus,
             "log:Starts sleeping for 13mins",
             "sleep:780",
@@ -124,9 +178,9 @@ Lines boardInstalled(const std::string& scriptStatus)
 
 Lines boardUploadFailed()
 {
-    Lines lines = {"log:", std::string("log:") + uploadCommand};
+    Lines lines = {"log:", logged(uploadCommand)};
     for (int attempt = 0; attempt < 20; ++attempt) {
-        lines.push_back(std::string("system:") + uploadCommand);
+        lines.push_back(ran(uploadCommand));
         lines.push_back("log:Uploading failed. Trying again. ");
     }
     lines.push_back("log:Failed to upload QUORB with 20 tries. Closing");
@@ -136,13 +190,13 @@ Lines boardUploadFailed()
 
 Lines harlStopped()
 {
-    return {"log:", "system:systemctl stop harl", "log:0"};
+    return {"log:", ran(stopHarlCommand), "log:0"};
 }
 
 Lines harlStarted()
 {
-    return {"log:", "system:umount /root/USB_MOUNT/",     "log:0", "system:systemctl start harl", "log:0", "sleep:10",
-            "log:", "system:systemctl stop harl-updater", "log:0"};
+    return {"log:", ran(unmountCommand),     "log:0", ran(startHarlCommand), "log:0", "sleep:10",
+            "log:", ran(stopUpdaterCommand), "log:0"};
 }
 
 void scriptPackage(const std::string& query, const std::string& installed, const std::string& candidate)

@@ -61,6 +61,38 @@ const char teamViewerCheckCommand[] = "ls /root/USB_MOUNT/debs/installTV";
 const char teamViewerMarker[] = "/root/USB_MOUNT/debs/installTV";
 const char teamViewerScriptCommand[] = "/root/RESOURCES/teamviewer_updatescript.sh";
 
+const char stopHarlCommand[] = "systemctl stop harl";
+const char startHarlCommand[] = "systemctl start harl";
+const char stopUpdaterCommand[] = "systemctl stop harl-updater";
+const char unmountCommand[] = "umount /root/USB_MOUNT/";
+const char passSoundCommand[] = "aplay /root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav";
+const char failSoundCommand[] = "aplay /root/RESOURCES/SOUNDS/SND_RESULT_FAIL.wav";
+
+/// LED codes and second bytes, as the command lines spell them.
+const char ledRemote[] = "0x12";
+const char ledPass[] = "0x13";
+const char ledFail[] = "0x14";
+const char ledMain[] = "0x15";
+const char dark[] = "0x0";
+const char blue[] = "0x1";
+const char passColor[] = "0x2";
+const char failColor[] = "0x8";
+
+/// The command line that sends the panel's controller two bytes, and those that send every LED the same `second` byte.
+std::string ledCommand(const std::string& first, const std::string& second);
+Lines allLeds(const std::string& second);
+
+/// As the journal spells them: a record's message, a command run by system(3), and one opened by popen(3).
+std::string logged(const std::string& message);
+std::string ran(const std::string& command);
+std::string opened(const std::string& command);
+std::string running(const std::string& command); // the runner's record in front of opened()
+Lines ran(const Lines& commands);
+
+/// Answers: a raw wait status without output, and no shell at all.
+platform::Answer raw(int status);
+platform::Answer doesNotStart();
+
 /// What `apt-cache policy` prints for a package with these two versions.
 std::string policy(const std::string& installed, const std::string& candidate);
 

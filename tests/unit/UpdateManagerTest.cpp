@@ -37,8 +37,6 @@ protected:
     UpdateManager* const manager = UpdateManager::instance();
 };
 
-const char stopHarl[] = "systemctl stop harl";
-const char stopUpdater[] = "systemctl stop harl-updater";
 const Lines entry = {"log:"};
 
 /// An answer of a command that does not end, with `code`, before `goOn` is true.
@@ -142,7 +140,7 @@ TEST_F(Manager, MainHeadChecksInstallsWhatItOfferedAndClosesOnWorkerThreads)
     scriptBoard("2.1.0", "2.1.0");
     script(teamViewerCheckCommand, {exits(0, std::string(teamViewerMarker) + "\n")});
     std::atomic<bool> goOn{false};
-    script(stopHarl, {heldUntil(goOn)});
+    script(stopHarlCommand, {heldUntil(goOn)});
 
     manager->init(false);
     EXPECT_EQ(entries("found:"), Lines{}) << "init() waited for its worker";
@@ -153,7 +151,7 @@ TEST_F(Manager, MainHeadChecksInstallsWhatItOfferedAndClosesOnWorkerThreads)
     platform::waitFor([] { return noted("result:1"); });
     const std::size_t before = journal().size();
     manager->deinit(false);
-    platform::waitFor([] { return noted(std::string("system:") + stopUpdater) && journal().back() == "log:0"; });
+    platform::waitFor([] { return noted(ran(stopUpdaterCommand)) && journal().back() == "log:0"; });
 
     const Lines all = journal();
     EXPECT_EQ(Lines(all.begin(), all.begin() + static_cast<std::ptrdiff_t>(before)),
@@ -163,17 +161,16 @@ TEST_F(Manager, MainHeadChecksInstallsWhatItOfferedAndClosesOnWorkerThreads)
                       mirrorsOk(),
                       packageChecked("apt-cache policy solvik4-dh", "1.2.0", "1.3.0"),
                       boardChecked("2.1.0", "2.1.0"),
-                      {std::string("log:Running command: ") + teamViewerCheckCommand,
-                       std::string("popen:") + teamViewerCheckCommand, "log:Exit code:0",
-                       std::string("log:Teamviewer path") + teamViewerMarker, "log:Teamviewer install is required",
+                      {running(teamViewerCheckCommand), opened(teamViewerCheckCommand), "log:Exit code:0",
+                       logged(std::string("Teamviewer path") + teamViewerMarker), "log:Teamviewer install is required",
                        "log:going to install TV", "system:rm /root/RESOURCES/tavren1stboot",
                        "log:removedrm /root/RESOURCES/tavren1stboot", "found:{0,Solvik IV,1.2.0,1.3.0}{2,TV,1,2}"},
                       entry,
                       entry,
                       {"log:now call install MAIN udate0", "log:now call install DH udate"},
                       packageInstalled("apt --assume-yes install solvik4-dh"),
-                      {"log:now call install MAIN udate2", "log:now call install TV udate", "log:",
-                       std::string("log:") + teamViewerScriptCommand, std::string("system:") + teamViewerScriptCommand,
+                      {"log:now call install MAIN udate2", "log:now call install TV udate",
+                       "log:", logged(teamViewerScriptCommand), ran(teamViewerScriptCommand),
                        "log:Install script ended with code: 0", "log:update maainhead finished", "result:1"}}));
     EXPECT_EQ(Lines(all.begin() + static_cast<std::ptrdiff_t>(before), all.end()), joined({entry, harlStarted()}));
 
@@ -190,7 +187,7 @@ TEST_F(Manager, MainHeadChecksInstallsWhatItOfferedAndClosesOnWorkerThreads)
 
 TEST_F(Manager, UpdateOfTheMainHeadWaitsForTheCheckAndReturnsBeforeTheInstallation)
 {
-    script(stopHarl, {{0, "", true, [] { platform::delay(100); }}});
+    script(stopHarlCommand, {{0, "", true, [] { platform::delay(100); }}});
     script(mirrorsCommand, {exits(100)});
     std::atomic<bool> goOn{false};
     script(teamViewerScriptCommand, {heldUntil(goOn)});
@@ -208,7 +205,7 @@ TEST_F(Manager, ClosingStepOfTheMainHeadDoesNotWaitForTheInstallation)
 {
     script(mirrorsCommand, {exits(100)});
     script(teamViewerScriptCommand,
-           {{0, "", true, [] { platform::waitFor([] { return noted(std::string("system:") + stopUpdater); }); }}});
+           {{0, "", true, [] { platform::waitFor([] { return noted(ran(stopUpdaterCommand)); }); }}});
     manager->init(false);
     manager->update({{UpdateManager::COMPONENT_TEAMVIEWER, "TV", "1", "2"}}, false);
     manager->deinit(false);

@@ -1,5 +1,7 @@
 #include "Cases.h"
 
+#include "UnitTest.h"
+
 #include <algorithm>
 #include <cctype>
 
@@ -41,8 +43,8 @@ platform::Lines ledCommands(const std::vector<std::string>& reports)
         const platform::Lines lit = outcomePanel(report);
         commands.insert(commands.end(), lit.begin(), lit.end());
     }
-    for (const char* led : {"0x12", "0x15"}) {
-        commands.push_back(std::string("i2cset -y 0 0x07 ") + led + " c ; i2cset -y 0 0x07 0x1 c");
+    for (const char* led : {ledRemote, ledMain}) { // the flashing
+        commands.push_back(ledCommand(led, blue));
     }
     return commands;
 }

@@ -24,7 +24,7 @@ std::set<std::string> failingCommands;
 void scriptCommand(const std::string& command, int healthyStatus, const std::string& healthy,
                    const Injection* injection)
 {
-    const bool opens = command == "systemctl stop harl";
+    const bool opens = command == stopHarlCommand;
     const auto before = [opens](int delay) {
         if (opens) {
             updateThread = std::this_thread::get_id();
@@ -156,17 +156,26 @@ void expectOneReport(const std::string& report, const std::string& message)
 /// The main thread announces itself, darkens the panel before anything else happens, and waits for the update.
 void expectMainThread(const platform::Lines& own)
 {
-    platform::Lines expected = {"log:TavrenUpdater version: 1.0.0"};
-    for (const std::string& command : darkPanel()) {
-        expected.push_back("system:" + command);
-    }
-    for (const char* message : {"BEFORE UPDATE", "", "", "", "1", "AFTER UPDATE"}) {
-        expected.push_back(std::string("log:") + message);
-    }
+    const platform::Lines expected =
+        joined({{logged("TavrenUpdater version: 1.0.0")},
+                ran(darkPanel()),
+                {logged("BEFORE UPDATE"), logged(""), logged(""), logged(""), logged("1"), logged("AFTER UPDATE")}});
     platform::Lines seen;
     std::copy_if(own.begin(), own.end(), std::back_inserter(seen),
                  [](const std::string& entry) { return entry.compare(0, 27, "log:system returned false: ") != 0; });
     EXPECT_EQ(seen, expected);
+}
+
+/// Up to "BEFORE UPDATE" only the main thread has logged.
+void expectOpeningBeforeTheUpdate()
+{
+    const std::vector<platform::Record> records = platform::records();
+    const auto opened = std::find_if(records.begin(), records.end(),
+                                     [](const platform::Record& record) { return record.message == "BEFORE UPDATE"; });
+    ASSERT_NE(opened, records.end());
+    for (auto record = records.begin(); record != opened; ++record) {
+        EXPECT_EQ(record->thread, opened->thread);
+    }
 }
 
 // Runs
@@ -178,6 +187,7 @@ void runRemoteHead(const Case& what)
     EXPECT_EQ(updaterMain(0, nullptr), 0);
     EXPECT_EQ(callsIn(journal(updateThread)), expected.calls);
     expectMainThread(journal(std::this_thread::get_id()));
+    expectOpeningBeforeTheUpdate();
     expectWholeRecords();
     expectFailuresLogged();
     expectPanelShows(expected.report);
@@ -222,7 +232,7 @@ void runMainHead(const Case& what)
     EXPECT_TRUE(expected.message.empty() || last == expected.message) << last;
     manager->deinit(false);
     platform::waitFor([] { // the last command and the record of its status
-        return !entries("system:systemctl stop harl-updater").empty() && journal().back().compare(0, 4, "log:") == 0 &&
+        return !entries(ran(stopUpdaterCommand)).empty() && journal().back().compare(0, 4, "log:") == 0 &&
                platform::records().back().flushed;
     });
     EXPECT_EQ(callsIn(journal()), expected.calls);

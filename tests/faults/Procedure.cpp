@@ -96,8 +96,7 @@ const std::vector<Component> components = {
 const int attempts = 20;
 
 /// Closing steps; the remote head leaves 30 s to the operator first.
-const platform::Lines closing = {"system:umount /root/USB_MOUNT/", "system:systemctl start harl", "sleep:10",
-                                 "system:systemctl stop harl-updater"};
+const platform::Lines closing = {ran(unmountCommand), ran(startHarlCommand), "sleep:10", ran(stopUpdaterCommand)};
 
 const Fault* faultOf(const std::vector<Injection>& injections, const std::string& step, int attempt = 0)
 {
@@ -176,14 +175,14 @@ Seen Walk::take(const std::string& state)
         return takeUpload(*step);
     }
     const bool run = step->reads == Reads::Nothing || step->reads == Reads::Status;
-    mCalls.push_back((run ? "system:" : "popen:") + step->command);
+    mCalls.push_back(run ? ran(step->command) : opened(step->command));
     return answer(*step);
 }
 
 Seen Walk::takeUpload(const Step& step)
 {
     for (int attempt = 0; attempt < attempts; ++attempt) {
-        mCalls.push_back("system:" + step.command);
+        mCalls.push_back(ran(step.command));
         const Fault* fault = faultOf(mInjections, "upload", attempt);
         if (fault == nullptr || fault->status == 0) {
             return Seen::Success;
@@ -235,15 +234,11 @@ Expected followRemoteHead(Walk& walk)
 {
     Expected expected;
     expected.report = walk.go(remoteHead, "stop harl");
-    expected.calls = walk.mCalls;
-    for (const std::string& command : darkPanel()) {
-        expected.calls.push_back("system:" + command);
-    }
-    expected.calls.push_back("system:" + outcomeSound(expected.report));
-    for (const std::string& command : outcomePanel(expected.report)) {
-        expected.calls.push_back("system:" + command);
-    }
-    expected.calls.push_back("sleep:30");
+    expected.calls = joined({walk.mCalls,
+                             ran(darkPanel()),
+                             {ran(outcomeSound(expected.report))},
+                             ran(outcomePanel(expected.report)),
+                             {"sleep:30"}});
     return expected;
 }
 
@@ -316,7 +311,7 @@ std::vector<Step> stepsOf(const Unit& unit)
 {
     const std::string package = unit.mainHead ? "solvik4-dh" : "solvik4-rh";
     std::vector<Step> steps = {
-        {"stop harl", "systemctl stop harl", Reads::Nothing},
+        {"stop harl", stopHarlCommand, Reads::Nothing},
         {"refresh", mirrorsCommand, Reads::Code},
         {"query", "apt-cache policy " + package, Reads::Policy},
         {"install", "apt --assume-yes install " + package, Reads::Code},
@@ -325,9 +320,9 @@ std::vector<Step> stepsOf(const Unit& unit)
         {"upload", uploadCommand, Reads::Status},
         {"board script", boardScriptCommand, Reads::Nothing},
         {"remove marker", markerCommand, Reads::Nothing},
-        {"release stick", "umount /root/USB_MOUNT/", Reads::Nothing},
-        {"start harl", "systemctl start harl", Reads::Nothing},
-        {"stop updater", "systemctl stop harl-updater", Reads::Nothing},
+        {"release stick", unmountCommand, Reads::Nothing},
+        {"start harl", startHarlCommand, Reads::Nothing},
+        {"stop updater", stopUpdaterCommand, Reads::Nothing},
     };
     if (unit.mainHead) {
         steps.push_back({"find TeamViewer", teamViewerCheckCommand, Reads::Marker});
@@ -360,32 +355,24 @@ int healthyCode(const Unit& unit, const std::string& step)
 
 platform::Lines darkPanel()
 {
-    platform::Lines commands;
-    for (const char* led : {"10", "11", "12", "13", "14", "15", "16", "17", "18", "19", "1a", "1b", "1c", "1d"}) {
-        commands.push_back(std::string("i2cset -y 0 0x07 0x") + led + " c ; i2cset -y 0 0x07 0x0 c");
-    }
-    return commands;
+    return allLeds(dark);
 }
 
 platform::Lines outcomePanel(const std::string& report)
 {
-    const std::string color = report[0] == 'r' ? "0x2" : "0x8";
-    const auto lit = [&](const std::string& led) {
-        return "i2cset -y 0 0x07 " + led + " c ; i2cset -y 0 0x07 " + color + " c";
-    };
+    const char* color = report[0] == 'r' ? passColor : failColor;
     if (report == "result 1") {
-        return {lit("0x13")};
+        return {ledCommand(ledPass, color)};
     }
     if (report == "error 2" || report == "error 3") {
-        return {lit("0x14")};
+        return {ledCommand(ledFail, color)};
     }
-    return {lit("0x12"), lit("0x15")};
+    return {ledCommand(ledRemote, color), ledCommand(ledMain, color)};
 }
 
 std::string outcomeSound(const std::string& report)
 {
-    return report[0] == 'r' ? "aplay /root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav"
-                            : "aplay /root/RESOURCES/SOUNDS/SND_RESULT_FAIL.wav";
+    return report[0] == 'r' ? passSoundCommand : failSoundCommand;
 }
 
 Expected follow(const Unit& unit, const std::vector<Injection>& injections)

@@ -3,6 +3,7 @@
 
 #include "Cases.h"
 #include "Procedure.h"
+#include "UnitTest.h"
 
 #include <gtest/gtest.h>
 
@@ -14,7 +15,6 @@
 #include <fstream>
 #include <map>
 #include <memory>
-#include <regex>
 #include <sstream>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -28,17 +28,16 @@ const int atOnce = 8;      // runs; they mostly wait
 const int longestRun = 60; // s
 const int sampleDivisor = 3;
 
-/// The arguments by which a tool knows the step, as a pattern of the shell.
-const std::map<std::string, std::string> patterns = {
-    {"stop harl", "stop\\ harl"},  {"refresh", "update"},           {"query", "*"},
-    {"install", "*install*"},      {"read board", "*version.txt*"}, {"list stick", "*"},
-    {"upload", "*OSUpgrade.zip*"}, {"board script", "*"},           {"remove marker", "*"},
-    {"release stick", "*"},        {"start harl", "start\\ harl"},  {"stop updater", "stop\\ harl-updater"},
-};
-
 std::string toolOf(const std::string& command)
 {
     return command.substr(0, command.find(' '));
+}
+
+/// The arguments of the first tool of a command line, as the shell is to read them.
+std::string argumentsOf(const std::string& command)
+{
+    const std::string first = command.substr(0, command.find(" && "));
+    return first.substr(toolOf(first).size());
 }
 
 void write(const fs::path& path, const std::string& text)
@@ -143,7 +142,6 @@ void RealRun::makeTools()
     for (const Step& step : steps) {
         ++served[toolOf(step.command)];
     }
-    // ssh's general pattern comes behind the other one.
     for (const Step& step : steps) {
         const Injection* injection = injectionOf(step.name);
         const std::string tool = toolOf(step.command);
@@ -151,19 +149,19 @@ void RealRun::makeTools()
             injection->times == 0) {
             continue;
         }
-        tools[tool] += patterns.at(step.name) + ") " +
-                       answer(step.name, healthyOutput(mCase.unit, step.name), injection) + " ;;\n";
+        tools[tool] += "set --" + argumentsOf(step.command) + "\n[ \"$called\" != \"$*\" ] || { " +
+                       answer(step.name, healthyOutput(mCase.unit, step.name), injection) + "; }\n";
     }
     for (const auto& [step, tool] : {std::pair{panelStep, "i2cset"}, std::pair{soundStep, "aplay"}}) {
         const Injection* injection = injectionOf(step);
         if (injection == nullptr) {
             fs::create_symlink("/bin/true", mFolder / "bin" / tool);
         } else if (injection->fault->name != "toolMissing") {
-            tools[tool] = "*) " + answer(step, "", injection) + " ;;\n";
+            tools[tool] = answer(step, "", injection) + "\n";
         }
     }
     for (const auto& [tool, answers] : tools) {
-        write(mFolder / "bin" / tool, "#!/bin/sh\ncase \"$*\" in\n" + answers + "esac\n");
+        write(mFolder / "bin" / tool, "#!/bin/sh\ncalled=$*\n" + answers);
         fs::permissions(mFolder / "bin" / tool, fs::perms::owner_all);
     }
 }
@@ -218,8 +216,8 @@ void RealRun::expectCalls(const Expected& expected)
             calls.push_back({thread, call == "nanosleep" ? "sleep:" + value : call + ":" + text});
         }
     }
-    const auto first = std::find_if(calls.begin(), calls.end(),
-                                    [](const Call& call) { return call.text == "system:systemctl stop harl"; });
+    const auto first =
+        std::find_if(calls.begin(), calls.end(), [](const Call& call) { return call.text == ran(stopHarlCommand); });
     ASSERT_NE(first, calls.end());
     platform::Lines update;
     platform::Lines lit;
@@ -240,27 +238,19 @@ void RealRun::expectCalls(const Expected& expected)
 /// Every record begins at a line's start and is whole, and there is one report.
 void RealRun::expectLog()
 {
-    static const std::regex form("Updater \\| [0-9]{2}-[0-9]{2}-[0-9]{4} [0-9]{2}-[0-9]{2}-[0-9]{2}\t[0-9]+\t"
-                                 "[A-Za-z]+\\.cpp:[0-9]+\t[^\t]+");
-    const std::string begin = "Updater | ";
-    const std::string log = read(mFolder / "log");
-    EXPECT_EQ(log.compare(0, begin.size(), begin), 0);
-    EXPECT_EQ(log.back(), '\n');
     int reports = 0;
-    std::size_t found = 0;
-    std::size_t records = 0;
-    for (; (found = log.find(begin, found)) != std::string::npos; ++found, ++records) {
-        EXPECT_TRUE(found == 0 || log[found - 1] == '\n') << "torn at " << found;
-        const std::size_t end = log.find('\n', found);
-        const std::string head = log.substr(found, end - found);
-        EXPECT_TRUE(std::regex_match(head, form)) << head;
-        EXPECT_EQ(log.compare(end, 4, "\n\t\t\t"), 0) << head;
-        reports += head.find("Callback(UpdateManager::Result)") != std::string::npos;
-        reports += head.find("Callback(UpdateManager::Error)") != std::string::npos;
+    std::vector<platform::Record> records;
+    for (const std::string& text : platform::splitLog(read(mFolder / "log"))) {
+        const std::optional<platform::Record> record = platform::parseRecord(text);
+        ASSERT_TRUE(record) << text;
+        EXPECT_EQ(record->message.find("Updater | "), std::string::npos) << "torn: " << text;
+        reports += record->function.find("Callback(UpdateManager::Result)") != std::string::npos;
+        reports += record->function.find("Callback(UpdateManager::Error)") != std::string::npos;
+        records.push_back(*record);
     }
-    EXPECT_GT(records, 20U);
+    ASSERT_GT(records.size(), 20U);
     EXPECT_EQ(reports, 1);
-    EXPECT_EQ(log.find("AFTER UPDATE\n") + 13, log.size());
+    EXPECT_EQ(records.back().message, "AFTER UPDATE");
 }
 
 /// Every n-th case of the remote head that a real shell can show.

@@ -116,7 +116,7 @@ void runRemoteHead(unsigned seed)
     const Lines commands = entries("system:");
     const auto sound = std::find(commands.begin(), commands.end(), outcomeSound(report));
     ASSERT_NE(sound, commands.end());
-    const Lines closing = {"umount /root/USB_MOUNT/", "systemctl start harl", "systemctl stop harl-updater"};
+    const Lines closing = {unmountCommand, startHarlCommand, stopUpdaterCommand};
     EXPECT_EQ(Lines(sound + 1, commands.end()), joined({outcomePanel(report), closing}));
 }
 
@@ -152,8 +152,7 @@ void runMainHead(const std::string& order, unsigned seed)
             platform::waitFor([&] { return reports == due; });
         }
     }
-    platform::waitFor(
-        [&] { return reports == due && entries("system:systemctl stop harl-updater").size() == closings; });
+    platform::waitFor([&] { return reports == due && entries(ran(stopUpdaterCommand)).size() == closings; });
     EXPECT_FALSE(workersMixed);
     EXPECT_FALSE(platform::records().empty());
 }

@@ -8,11 +8,12 @@ import json
 import os
 import re
 import subprocess
-import sys
 import tempfile
 import unittest
 from fnmatch import fnmatchcase
 from pathlib import Path
+
+from tests.command_line import take_path
 
 ROOT = Path(__file__).parents[1]
 BUILD = Path()
@@ -79,5 +80,5 @@ class ConfigurationTest(unittest.TestCase):
 
 
 if __name__ == "__main__":
-    BUILD = Path(sys.argv.pop())
+    BUILD = take_path()
     unittest.main()

@@ -89,18 +89,18 @@ def updater_service(setup: Setup) -> str:
 
 def write_services(folder: Path, setup: Setup, command: str) -> None:
     """The head's services, with `command` as the updater."""
-    units = folder / "etc/systemd/system"
+    services = folder / "etc/systemd/system"
     wanted = [updater_service(setup)]
-    write(units / "harl-updater.service", APPLICATION)
-    write(units / updater_service(setup), UPDATER.format(command=command))
+    write(services / "harl-updater.service", APPLICATION)
+    write(services / updater_service(setup), UPDATER.format(command=command))
     if setup.head.harl == "known":
-        write(units / "harl.service", APPLICATION)
+        write(services / "harl.service", APPLICATION)
         wanted.append("harl.service")
     if setup.updater.stopped == "in-install":
-        write(units / "stop-in-install.path", STOP_WHEN)
-        write(units / "stop-in-install.service", STOP)
+        write(services / "stop-in-install.path", STOP_WHEN)
+        write(services / "stop-in-install.service", STOP)
         wanted.append("stop-in-install.path")
-    write(units / "bench.target", TARGET.format(services=" ".join(wanted)))
+    write(services / "bench.target", TARGET.format(services=" ".join(wanted)))
     write(folder / "etc/systemd/journald.conf", JOURNAL)
 
 

@@ -104,7 +104,7 @@ std::string lastBehind(const std::vector<std::string>& lines, const std::string&
 
 std::string takeLog()
 {
-    const std::string text = log().str();
+    std::string text = log().str();
     log().str("");
     return text;
 }

@@ -25,7 +25,7 @@
 namespace
 {
 
-const std::size_t mebibyte = 1024 * 1024;
+const std::size_t mebibyte = 1U << 20U;
 
 /// A file of `size` bytes in lines of `lineLength`, line end included; a length of 0 makes one line without an end. It
 /// has no name: it goes with the process, in whatever way that ends.

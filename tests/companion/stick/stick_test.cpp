@@ -13,7 +13,6 @@
 
 namespace fs = std::filesystem;
 using testing::HasSubstr;
-using testing::Not;
 
 namespace
 {

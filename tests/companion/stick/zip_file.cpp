@@ -45,7 +45,10 @@ std::string zipArchive(const std::vector<ZipEntry>& entries)
         directory += littleEndian(0, 10); // comment, disk, attributes
         directory += littleEndian(archive.size(), 4);
         directory += entry.name;
-        archive += "PK\x03\x04" + fields + entry.name + data;
+        archive += "PK\x03\x04";
+        archive += fields;
+        archive += entry.name;
+        archive += data;
     }
     const std::size_t start = archive.size();
     archive += directory + "PK\x05\x06";

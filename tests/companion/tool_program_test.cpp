@@ -1,7 +1,7 @@
 #include "command.h"
 
-#include "test_folder.h"
 #include "stick/zip_file.h"
+#include "test_folder.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>

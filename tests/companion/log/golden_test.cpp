@@ -45,7 +45,8 @@ TEST_P(LogGolden, ExplanationIsAsKept)
     LogOptions options;
     options.file = GetParam() + ".log";
     const int status = runLog(options, out, errors);
-    EXPECT_EQ(out.str(), content(GetParam() + ".txt")) << "If it is meant: tests/companion/log/make-golden --explanations";
+    EXPECT_EQ(out.str(), content(GetParam() + ".txt"))
+        << "If it is meant: tests/companion/log/make-golden --explanations";
     EXPECT_EQ(errors.str(), "");
     EXPECT_NE(status, LOG_UNREADABLE);
 }

@@ -1,8 +1,8 @@
 #include "stick/stick_check.h"
 
 #include "finding_lines.h"
-#include "test_folder.h"
 #include "stick/zip_file.h"
+#include "test_folder.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>

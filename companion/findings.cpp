@@ -180,8 +180,15 @@ nlohmann::ordered_json Report::toJson() const
                             {"effect", finding.effect},
                             {"remedy", finding.remedy}});
     }
-    return {{"command", mCommand},           {"subject", mSubject}, {"status", static_cast<int>(status())},
-            {"fit", status() == STATUS_FIT}, {"facts", facts},      {"findings", findings}};
+    return {{"command", mCommand},           {"version", jsonVersion},
+            {"subject", mSubject},           {"status", static_cast<int>(status())},
+            {"fit", status() == STATUS_FIT}, {"facts", facts},
+            {"findings", findings}};
+}
+
+nlohmann::ordered_json refusal(const std::string& command, const std::string& error)
+{
+    return {{"command", command}, {"version", jsonVersion}, {"status", Report::STATUS_UNCHECKED}, {"error", error}};
 }
 
 std::string escaped(std::string_view text)

@@ -81,6 +81,12 @@ private:
     std::vector<Finding> mFindings;
 };
 
+/// Version of the JSON that every command prints: docs/harl-updater-tool.schema.json.
+inline constexpr int jsonVersion = 1;
+
+/// The object for a command that could not do its work.
+nlohmann::ordered_json refusal(const std::string& command, const std::string& error);
+
 /// `text` made fit for a terminal and for JSON whatever bytes it holds.
 ///
 /// Control characters, invalid UTF-8 and characters that are invisible or change the direction of writing become \n,

@@ -1,16 +1,20 @@
 #include "findings.h"
+#include "log/catalogue.h"
 #include "log/log_command.h"
 #include "procedure.h"
 #include "stick/stick_check.h"
 #include "unit/unit_check.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
 #include <exception>
 #include <iostream>
 #include <new>
+#include <numeric>
 #include <string>
+#include <vector>
 
 #include <CLI/CLI.hpp>
 #include <unistd.h>
@@ -18,54 +22,133 @@
 namespace
 {
 
-int run(int argc, char** argv)
+/// How many letters must be put in, left out or changed to make `to` of `from`.
+std::size_t distance(const std::string& from, const std::string& to)
+{
+    std::vector<std::size_t> row(to.size() + 1);
+    std::iota(row.begin(), row.end(), std::size_t{0});
+    for (std::size_t line = 0; line < from.size(); ++line) {
+        std::size_t before = std::exchange(row[0], line + 1);
+        for (std::size_t column = 0; column < to.size(); ++column) {
+            const std::size_t changed = before + (from[line] == to[column] ? 0 : 1);
+            before = row[column + 1];
+            row[column + 1] = std::min({changed, row[column] + 1, before + 1});
+        }
+    }
+    return row.back();
+}
+
+/// What is wrong with a command line, in plain words.
+std::string usageText(const CLI::App& app, const CLI::ParseError& error)
+{
+    const std::vector<CLI::App*> parsed = app.get_subcommands();
+    const std::vector<std::string> rest = app.remaining(true);
+    if (parsed.empty() && rest.empty()) {
+        return "Name a command: stick, unit, log or explain.";
+    }
+    if (parsed.empty()) {
+        std::string text = rest.front() + " is not a command.";
+        for (const CLI::App* command : app.get_subcommands([](const CLI::App*) { return true; })) {
+            if (distance(rest.front(), command->get_name()) <= 2) {
+                text += " Did you mean " + command->get_name() + '?';
+            }
+        }
+        return text;
+    }
+    if (!rest.empty()) {
+        return rest.front() +
+               (rest.front().rfind('-', 0) == 0 ? " is not an option of " : " is one argument too many for ") +
+               parsed.front()->get_name() + '.';
+    }
+    const std::string text = error.what(); // "--html: 1 required PAGE missing"
+    return text.substr(0, text.find(':')) + " needs a value that fits.";
+}
+
+/// Reports a wrong command line: in words, and to programs as an object.
+int refuse(const std::string& command, bool json, const std::string& text)
+{
+    if (json) {
+        std::cout << refusal(command, text).dump(2) << '\n';
+    }
+    std::cerr << "harl-updater-tool: " << text << " See: harl-updater-tool " << command << (command.empty() ? "" : " ")
+              << "--help\n";
+    return Report::STATUS_UNCHECKED;
+}
+
+int run(std::vector<std::string> arguments)
 {
     CLI::App app("Answers what a technician asks before and after an update. It never changes the updater.",
                  "harl-updater-tool");
     app.require_subcommand(1);
-    app.set_version_flag("--version", "harl-updater-tool " VERSION, "Print the program's name and version and exit");
+    app.set_version_flag("-V,--version", "harl-updater-tool " VERSION, "Print the program's name and version and exit");
 
     std::string stickPath = stickMountPoint;
     bool json = false;
-    CLI::App* stick = app.add_subcommand("stick", "Tell what the updater would do with a stick. Reads only.");
+    CLI::App* stick = app.add_subcommand("stick", "Show what the updater would do with a stick. Reads only.");
     stick->add_option("PATH", stickPath, "the folder that the stick is mounted at")->capture_default_str();
     stick->add_flag("--json", json, "print one JSON object");
     stick->footer("Exit status: 0 fit for an update, 1 not fit, 2 wrong usage or not everything could be read.\n");
 
     UnitOptions unitOptions;
-    CLI::App* unit = app.add_subcommand("unit", "Tell whether this unit is fit for an update. Run it as root.");
+    CLI::App* unit = app.add_subcommand("unit", "Show whether this unit is fit for an update. Run it as root.");
     unit->add_flag("--panel", unitOptions.panel, "lamp test instead: all 14 LEDs in every colour");
     unit->add_flag("--sound", unitOptions.sound, "play both sounds instead");
-    unit->add_flag("--json", unitOptions.json, "print one JSON object");
+    unit->add_flag("--json", json, "print one JSON object");
     unit->footer("Exit status: 0 fit or test passed, 1 not fit or test failed, 2 wrong usage, test refused or not "
                  "everything could be checked.\n");
 
     LogOptions logOptions;
     CLI::App* log = app.add_subcommand("log", "Explain the updater's log: what happened, why, and what to do now.");
-    CLI::Option* file =
-        log->add_option("FILE", logOptions.file, "the log; - for standard input")->capture_default_str();
-    log->add_flag("--journal", logOptions.journal, "read the journal of the service harl-updater")->excludes(file);
-    CLI::Option* follow = log->add_flag("--follow", logOptions.follow, "show the run that goes on, until it ends");
-    log->add_flag("--json", logOptions.json, "print one JSON object; with --follow one for each change");
-    log->add_option("--html", logOptions.htmlFile, "also write a page with each run's timeline")
-        ->type_name("PAGE")
-        ->excludes(follow);
+    log->add_option("FILE", logOptions.files, "the log, or several in their order; - for standard input");
+    log->add_flag("--journal", logOptions.journal, "read the journal of the service harl-updater");
+    log->add_flag("--list", logOptions.list, "print one line for each run");
+    log->add_option("--run", logOptions.run, "explain only the run with this number")
+        ->type_name("N")
+        ->check(CLI::PositiveNumber);
+    log->add_flag("--last", logOptions.last, "explain only the last run");
+    log->add_flag("--strict", logOptions.strict, "a warning is not status 0 either");
+    log->add_flag("--follow", logOptions.follow, "show the run that goes on, until it ends");
+    log->add_flag("--json", json, "print one JSON object; with --follow one for each change");
+    log->add_option("--html", logOptions.htmlFile, "also write a page with each run's timeline")->type_name("PAGE");
     log->footer("Exit status: 0 the last run went well, 1 it failed or did not finish, 2 wrong usage or no log.\n");
 
+    std::string failure;
+    CLI::App* explain = app.add_subcommand("explain", "Explain a failure by its name, or list all of them.");
+    explain->add_option("NAME", failure, "as in brackets in a report, such as mirrors-unreachable");
+    explain->add_flag("--json", json, "print one JSON object");
+    explain->footer("Exit status: 0, 2 wrong usage or no such name.\n");
+
+    if (!arguments.empty() && arguments.front() == "help") { // "help log" is "log --help"
+        arguments.erase(arguments.begin());
+        arguments.resize(std::min<std::size_t>(arguments.size(), 1));
+        arguments.emplace_back("--help");
+    }
+    const bool wantsJson = std::find(arguments.begin(), arguments.end(), "--json") != arguments.end();
+    std::reverse(arguments.begin(), arguments.end()); // as CLI::App takes them
     try {
-        app.parse(argc, argv);
+        app.parse(std::move(arguments));
     } catch (const CLI::ParseError& error) {
-        const bool unknown = error.get_name() == "RequiredError" && app.remaining_size() > 0; // no such subcommand
-        const int status = unknown ? app.exit(CLI::ExtrasError(app.remaining())) : app.exit(error);
-        return status == 0 ? 0 : Report::STATUS_UNCHECKED;
+        if (error.get_exit_code() == 0) {
+            return app.exit(error); // --help, --version
+        }
+        const std::vector<CLI::App*> parsed = app.get_subcommands();
+        return refuse(parsed.empty() ? "" : parsed.front()->get_name(), wantsJson, usageText(app, error));
     }
     if (stick->parsed()) {
         return runStick(stickPath, json, std::cout, std::cerr);
     }
     if (log->parsed()) {
+        logOptions.json = json;
         logOptions.terminal = isatty(STDOUT_FILENO) == 1;
-        return runLog(logOptions, std::cout, std::cerr);
+        const std::string wrong = conflictIn(logOptions);
+        return wrong.empty() ? runLog(logOptions, std::cout, std::cerr) : refuse("log", json, wrong);
     }
+    if (explain->parsed()) {
+        return printCatalogue(failure, json, std::cout)
+                   ? 0
+                   : refuse("explain", json, escaped(failure) + " is not a name of the catalogue.");
+    }
+    unitOptions.json = json;
     return runUnit(unitOptions, thisUnit(), std::cout, std::cerr);
 }
 
@@ -75,16 +158,18 @@ int main(int argc, char** argv)
 {
     try {
         std::cout.exceptions(std::ios::badbit); // a full disk must not pass for a good answer
-        const int status = run(argc, argv);
+        const int status = run({argv + std::min(argc, 1), argv + argc});
         std::cout.flush();
         return status;
     } catch (const std::ios_base::failure&) {
-        std::fprintf(stderr, "harl-updater-tool: the output cannot be written: %s. Make room or name another file.\n",
-                     std::strerror(errno));
+        const char* advice = errno == EPIPE || errno == EBADF ? "Nobody reads it." : "Make room or name another file.";
+        std::fprintf(stderr, "harl-updater-tool: the output cannot be written: %s. %s\n", std::strerror(errno), advice);
     } catch (const std::bad_alloc&) {
         std::fputs("harl-updater-tool: there is not enough memory. End other programs and try again.\n", stderr);
     } catch (const std::exception& error) {
-        std::fprintf(stderr, "harl-updater-tool: gave up: %s. Report this line with the command to the maker.\n",
+        std::fprintf(stderr,
+                     "harl-updater-tool: internal error: %s. Report this line with the command to the "
+                     "manufacturer.\n",
                      error.what());
     }
     return Report::STATUS_UNCHECKED;

@@ -6,7 +6,7 @@
 
 #include "Input.h"
 #include "Printable.h"
-#include "log/explain.h"
+#include "log/catalogue.h"
 #include "log/follow.h"
 #include "log/html.h"
 #include "log/json.h"
@@ -26,7 +26,7 @@ public:
     void record(const ParsedRecord& record) override
     {
         note(record.line, "record");
-        for (const std::string_view text : {record.thread, record.file, record.operation, record.message}) {
+        for (const std::string_view text : {record.thread, record.file, record.operation, record.message.value_or("(none)")}) {
             expect(text.find('\n') == std::string_view::npos, "a record's text in one line");
             mText << '\t' << text;
         }
@@ -82,15 +82,15 @@ void expectFitReports(std::string_view log, std::size_t blockSize)
     std::ostringstream report;
     std::ostringstream pageText;
     std::ostringstream changes;
-    HtmlPage page("log", pageText);
+    HtmlPage page(pageText);
     Follower follower(true, false, changes);
     RunBuilder builder([&](Run& run) {
         follower.runComplete(run);
         explain(run);
         expect(!run.failure || run.stepOf(*run.failure) != nullptr, "a failure has its step");
         printRun(run, "log", report);
-        report << runToJson(run).dump(); // throws when a text is no UTF-8
-        page.writeRun(run);
+        report << runToJson(run, "log").dump(); // throws when a text is no UTF-8
+        page.writeRun(run, "log");
     });
     LogParser parser(builder);
     for (std::size_t begin = 0; begin < log.size(); begin += blockSize) {
@@ -119,7 +119,7 @@ std::string lastRun(std::string_view log)
         run.firstLine = run.number = 1;
         run.tornRecords = run.firstTornLine = 0; // of pieces in front of the first run
         explain(run);
-        said = runToJson(run).dump();
+        said = runToJson(run, "log").dump();
     });
     LogParser parser(builder);
     feed(parser, log, log.size());

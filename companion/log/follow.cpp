@@ -1,6 +1,5 @@
 #include "log/follow.h"
 
-#include "log/explain.h"
 #include "log/json.h"
 #include "log/text.h"
 #include "procedure.h"
@@ -53,7 +52,7 @@ std::string elapsedText(std::int64_t elapsed, const std::optional<std::int64_t>&
 bool nextDependsOnCheck(const Run& run)
 {
     const Step& step = run.steps.back();
-    return !step.end && !run.mainHead && (step.kind == StepKind::CHECK_PACKAGE || step.kind == StepKind::CHECK_BOARD);
+    return !step.took && !run.mainHead && (step.kind == StepKind::CHECK_PACKAGE || step.kind == StepKind::CHECK_BOARD);
 }
 
 std::string nextText(const Run& run)
@@ -62,7 +61,7 @@ std::string nextText(const Run& run)
     if (!next) {
         return "";
     }
-    return std::string("; then: ") + stepTitle(*next) + (nextDependsOnCheck(run) ? ", if they differ" : "");
+    return std::string("; then: ") + factsOf(*next).title + (nextDependsOnCheck(run) ? ", if they differ" : "");
 }
 
 } // namespace
@@ -70,24 +69,16 @@ std::string nextText(const Run& run)
 void ExpectedTimes::learn(const Run& run)
 {
     for (const Step& step : run.steps) {
-        if (step.end && *step.end >= step.start) {
-            mLast.at(static_cast<std::size_t>(step.kind)) = *step.end - step.start;
+        if (step.took) {
+            mLast.at(static_cast<std::size_t>(step.kind)) = *step.took;
         }
     }
 }
 
 std::optional<std::int64_t> ExpectedTimes::of(StepKind kind) const
 {
-    switch (kind) {
-    case StepKind::WAIT_FOR_BOARD:
-        return boardWait;
-    case StepKind::SHOW_TO_OPERATOR:
-        return outcomeWait;
-    case StepKind::GIVE_BACK:
-        return giveBackWait;
-    default:
-        return mLast.at(static_cast<std::size_t>(kind));
-    }
+    const std::int64_t wait = factsOf(kind).wait;
+    return wait > 0 ? wait : mLast.at(static_cast<std::size_t>(kind));
 }
 
 std::optional<StepKind> nextStep(const Run& run)
@@ -108,17 +99,18 @@ std::optional<StepKind> nextStep(const Run& run)
         if (failed) {
             return StepKind::SHOW_OUTCOME;
         }
-        return !run.mainHead && (run.package.differ || !step.end) ? StepKind::INSTALL_PACKAGE : StepKind::CHECK_BOARD;
+        return !run.mainHead && (run.package.differ() || !step.took) ? StepKind::INSTALL_PACKAGE
+                                                                     : StepKind::CHECK_BOARD;
     case StepKind::INSTALL_PACKAGE:
         return failed ? StepKind::SHOW_OUTCOME : StepKind::CHECK_BOARD;
     case StepKind::CHECK_BOARD:
         if (run.mainHead) {
             return StepKind::CHECK_TEAMVIEWER;
         }
-        if (run.board.differ || !step.end) {
+        if (run.board.differ() || !step.took) {
             return StepKind::UPLOAD_BOARD;
         }
-        return run.package.differ && !failed ? StepKind::REMOVE_MARKER : StepKind::SHOW_OUTCOME;
+        return run.package.differ() && !failed ? StepKind::REMOVE_MARKER : StepKind::SHOW_OUTCOME;
     case StepKind::UPLOAD_BOARD:
         return failed ? StepKind::SHOW_OUTCOME : StepKind::RUN_BOARD_SCRIPT;
     case StepKind::RUN_BOARD_SCRIPT:
@@ -179,14 +171,14 @@ void Follower::showChange(const Run* run, std::int64_t now)
             const std::optional<std::int64_t> expected = mExpected.of(step.kind);
             const std::optional<StepKind> next = nextStep(*run);
             object["run"] = run->number;
-            object["step"] = stepName(step.kind);
-            object["title"] = stepTitle(step.kind);
+            object["step"] = factsOf(step.kind).name;
+            object["title"] = factsOf(step.kind).title;
             object["since"] = isoText(step.start);
-            object["elapsed_s"] = std::max<std::int64_t>((step.end ? *step.end : now) - step.start, 0);
+            object["elapsed_s"] = step.took.value_or(std::max<std::int64_t>(now - step.start, 0));
             object["expected_s"] = expected ? nlohmann::ordered_json(*expected) : nlohmann::ordered_json();
-            object["result"] = step.end ? resultText(step) : "";
+            object["result"] = step.took ? resultText(*run, step) : "";
             object["failed_attempts"] = step.failedAttempts;
-            object["next"] = next ? nlohmann::ordered_json(stepName(*next)) : nlohmann::ordered_json();
+            object["next"] = next ? nlohmann::ordered_json(factsOf(*next).name) : nlohmann::ordered_json();
             object["next_if_versions_differ"] = nextDependsOnCheck(*run);
             object["outcome"] = outcomeName(run->outcome);
         }
@@ -209,9 +201,9 @@ void Follower::showChange(const Run* run, std::int64_t now)
         return;
     }
     const Step& step = run->steps.back();
-    mOut << clockText(step.start) << "  " << stepTitle(step.kind) << attemptText(step);
-    if (step.end) {
-        mOut << ": " << resultText(step);
+    mOut << clockText(step.start) << "  " << factsOf(step.kind).title << attemptText(step);
+    if (step.took) {
+        mOut << ": " << resultText(*run, step);
     } else if (const std::optional<std::int64_t> expected = mExpected.of(step.kind)) {
         mOut << ", " << durationText(*expected) << " expected";
     }

@@ -1,7 +1,6 @@
 #include "log/html.h"
 
 #include "findings.h"
-#include "log/explain.h"
 #include "log/text.h"
 
 #include <algorithm>
@@ -27,7 +26,7 @@ table { border-collapse: collapse; } th { text-align: left; padding: .1em 1em .1
 .scale { display: flex; height: 14px; margin: 1em 0 .3em; border: 1px solid #888; }
 .scale div { min-width: 3px; box-sizing: border-box; border-right: 1px solid #fff; }
 .scroll { overflow-x: auto; }
-.lanes { display: grid; gap: 2px; margin: .4em 0 1em; font-size: 12px; min-width: max-content; }
+.lanes { display: grid; gap: 2px; margin: .4em 0 1em; font-size: 12px; }
 .lanes > * { padding: 3px 5px; background: #f1f1f1; overflow-wrap: anywhere; }
 .lanes > .lane { background: none; color: #555; }
 .lanes > .time { background: none; border-left: 1px solid #888; font-variant-numeric: tabular-nums; }
@@ -75,7 +74,7 @@ std::string html(const std::string& text)
 
 bool isWait(const Action& action)
 {
-    return action.text.rfind("wait ", 0) == 0;
+    return *action.command == '\0';
 }
 
 const char* resultClass(const Step& step)
@@ -88,7 +87,7 @@ const char* resultClass(const Step& step)
 
 std::int64_t length(const Run& run, const Step& step)
 {
-    return std::max<std::int64_t>(step.end.value_or(run.end) - step.start, 0);
+    return step.took.value_or(run.elapsed - step.began);
 }
 
 /// The timeline of one run: a grid with a column for each step and a row for each lane.
@@ -115,10 +114,10 @@ private:
     /// Columns grow with the logarithm of a step's length, so that 13 minutes and a second can both be read.
     void writeGrid()
     {
-        mOut << "<div class=\"scroll\"><div class=\"lanes\" style=\"grid-template-columns:110px";
+        mOut << "<div class=\"scroll\"><div class=\"lanes\" style=\"grid-template-columns:80px";
         for (const Step& step : mRun.steps) {
-            mOut << ' ' << static_cast<int>(105 + 40 * std::log10(1.0 + static_cast<double>(length(mRun, step))))
-                 << "px";
+            mOut << ' ' << "minmax(0,"
+                 << static_cast<int>(100 + 40 * std::log10(1.0 + static_cast<double>(length(mRun, step)))) << "fr)";
         }
         mOut << "\">\n";
     }
@@ -167,11 +166,11 @@ private:
             if (step.kind == StepKind::START) {
                 continue;
             }
-            cell(index, index + 1, resultClass(step)) << "<b>" << html(stepTitle(step.kind)) << "</b><br>";
-            if (step.end) {
-                mOut << durationText(*step.end - step.start) << ": ";
+            cell(index, index + 1, resultClass(step)) << "<b>" << html(factsOf(step.kind).title) << "</b><br>";
+            if (step.took) {
+                mOut << durationText(*step.took) << ": ";
             }
-            mOut << html(resultText(step)) << "</div>\n";
+            mOut << html(resultText(mRun, step)) << "</div>\n";
         }
     }
 
@@ -187,11 +186,12 @@ private:
             for (auto action = step.actions.begin(); action != step.actions.end();) {
                 // Attempts that came out alike are one line.
                 const auto next = std::find_if(action, step.actions.end(), [&](const Action& other) {
-                    return other.text != action->text || other.status != action->status;
+                    return actionText(other) != actionText(*action) ||
+                           actionStatusText(other) != actionStatusText(*action);
                 });
                 if (!isWait(*action)) {
-                    mOut << "<div><code>" << html(action->text) << "</code> <span class=\"status\">"
-                         << html(action->status);
+                    mOut << "<div><code>" << html(actionText(*action)) << "</code> <span class=\"status\">"
+                         << html(actionStatusText(*action));
                     mOut << (next - action > 1 ? " (" + std::to_string(next - action) + " times)" : "")
                          << "</span></div>";
                 }
@@ -207,7 +207,7 @@ private:
         for (std::size_t index = 0; index < mRun.steps.size(); ++index) {
             for (const Action& action : mRun.steps[index].actions) {
                 if (isWait(action)) {
-                    cell(index, index + 1, "wait") << html(action.text) << "</div>\n";
+                    cell(index, index + 1, "wait") << html(actionText(action)) << "</div>\n";
                 }
             }
         }
@@ -297,25 +297,19 @@ void writeScale(const Run& run, std::ostream& out)
         const bool waits =
             std::any_of(step.actions.begin(), step.actions.end(), isWait) && step.result == StepResult::DONE;
         out << "<div class=\"" << (waits ? "wait" : resultClass(step)) << "\" style=\"flex:" << length(run, step)
-            << " 0 0\" title=\"" << html(stepTitle(step.kind)) << "\"></div>";
+            << " 0 0\" title=\"" << html(factsOf(step.kind).title) << "\"></div>";
     }
     out << "</div>\n<p>True to scale above; below, a column's width grows with the logarithm of its time.</p>\n";
 }
 
-void writeProblem(const Run& run, const Problem& problem, const std::string& heading, const char* style,
-                  std::ostream& out)
+void writeProblem(const Run& run, const Problem& problem, const char* style, std::ostream& out)
 {
     const Step* step = run.stepOf(problem);
-    out << "<div class=\"problem " << style << "\"><b>" << heading;
-    if (step == nullptr) {
-        out << "a step that is not in this log</b><br>\n";
-    } else {
-        out << html(stepTitle(step->kind)) << "</b> (line " << step->line << ")<br>\n";
-    }
-    out << html(problem.why) << "<br>\n<b>Do now:</b> " << html(problem.remedy) << '\n';
+    out << "<div class=\"problem " << style << "\"><b>" << html(headingOf(run, problem)) << "</b><br>\n"
+        << html(causeOf(run, problem)) << "<br>\n<b>Do now:</b> " << html(remedyOf(run, problem)) << '\n';
     if (step != nullptr && step->said.count > 0) {
         out << "<pre>";
-        for (const std::string& line : step->said.shown()) {
+        for (const std::string& line : shownLines(step->said)) {
             out << html(line) << '\n';
         }
         out << "</pre>\n";
@@ -332,7 +326,7 @@ void writeSummary(const Run& run, std::ostream& out)
         {"Operator", html(view.seen)},
         {"Package", html(packageText(run))},
         {"Board", html(boardText(run))},
-        {"Took", durationText(run.end - run.begin)},
+        {"Took", durationText(run.elapsed)},
     }};
     out << "<table>\n";
     for (const auto& [label, text] : rows) {
@@ -343,30 +337,29 @@ void writeSummary(const Run& run, std::ostream& out)
 
 } // namespace
 
-HtmlPage::HtmlPage(const std::string& source, std::ostream& out) : mSource(source), mOut(out)
+HtmlPage::HtmlPage(std::ostream& out) : mOut(out)
 {
-    mOut << pageHead << "<h1>Updates in " << html(mSource) << "</h1>\n";
+    mOut << pageHead << "<h1>Updates</h1>\n";
 }
 
-void HtmlPage::writeRun(const Run& run)
+void HtmlPage::writeRun(const Run& run, const std::string& source)
 {
-    mOut << "<h2>Run " << run.number << ", " << dateText(run.begin) << "</h2>\n";
+    mOut << "<h2>Run " << run.number << " of " << html(source) << ", " << dateText(run.begin) << "</h2>\n";
     writeSummary(run, mOut);
     if (run.failure) {
-        const bool unfinished = run.failure->name == "unfinished";
-        writeProblem(run, *run.failure, unfinished ? "Ended in: " : "Failed: ", "", mOut);
+        writeProblem(run, *run.failure, "", mOut);
     }
     for (const Problem& problem : run.besides) {
-        writeProblem(run, problem, "Besides: ", "besides", mOut);
+        writeProblem(run, problem, "besides", mOut);
     }
     if (!run.steps.empty()) {
         writeScale(run, mOut);
         Lanes(run, mOut).write();
     }
-    if (!run.untold.empty()) {
-        mOut << "<p>This log cannot tell:</p>\n<ul>\n";
-        for (const std::string& text : run.untold) {
-            mOut << "<li>" << html(text) << "</li>\n";
+    if (!run.gaps.empty()) {
+        mOut << "<p>This log cannot show:</p>\n<ul>\n";
+        for (const Gap gap : run.gaps) {
+            mOut << "<li>" << html(gapText(run, gap)) << "</li>\n";
         }
         mOut << "</ul>\n";
     }

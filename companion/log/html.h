@@ -10,14 +10,13 @@
 class HtmlPage
 {
 public:
-    HtmlPage(const std::string& source, std::ostream& out);
+    explicit HtmlPage(std::ostream& out);
 
-    void writeRun(const Run& run);
+    void writeRun(const Run& run, const std::string& source);
 
     /// Ends the page. Without it, the page is not whole.
     void finish();
 
 private:
-    std::string mSource;
     std::ostream& mOut;
 };

@@ -1,6 +1,5 @@
 #include "log/json.h"
 
-#include "log/explain.h"
 #include "log/text.h"
 
 namespace
@@ -8,33 +7,33 @@ namespace
 
 using Json = nlohmann::ordered_json;
 
-Json duration(std::int64_t start, const std::optional<std::int64_t>& end)
+Json orNull(const std::optional<std::int64_t>& value)
 {
-    return end ? Json(*end - start) : Json();
+    return value ? Json(*value) : Json();
 }
 
 Json linesToJson(const OtherLines& lines)
 {
-    return {{"count", lines.count}, {"shown", lines.shown()}};
+    return {{"count", lines.count}, {"shown", shownLines(lines)}};
 }
 
-Json stepToJson(const Step& step)
+Json stepToJson(const Run& run, const Step& step)
 {
     Json actions = Json::array();
     for (const Action& action : step.actions) {
-        actions.push_back({{"text", action.text},
+        actions.push_back({{"text", actionText(action)},
                            {"start", isoText(action.start)},
-                           {"took_s", duration(action.start, action.end)},
-                           {"status", action.status}});
+                           {"took_s", orNull(action.took)},
+                           {"status", actionStatusText(action)}});
     }
-    return {{"name", stepName(step.kind)},
-            {"title", stepTitle(step.kind)},
+    return {{"name", factsOf(step.kind).name},
+            {"title", factsOf(step.kind).title},
             {"line", step.line},
             {"start", isoText(step.start)},
-            {"took_s", duration(step.start, step.end)},
+            {"took_s", orNull(step.took)},
             {"result", resultName(step.result)},
-            {"detail", resultText(step)},
-            {"status", step.code ? Json(*step.code) : Json()},
+            {"detail", resultText(run, step)},
+            {"status", step.status ? Json(step.status->number) : Json()},
             {"word", step.word},
             {"failed_attempts", step.failedAttempts},
             {"actions", actions},
@@ -44,19 +43,19 @@ Json stepToJson(const Step& step)
 Json problemToJson(const Run& run, const Problem& problem)
 {
     const Step* step = run.stepOf(problem);
-    return {{"name", problem.name},
-            {"step", step == nullptr ? Json() : Json(stepName(step->kind))},
+    return {{"name", problem.failure->name},
+            {"step", step == nullptr ? Json() : Json(factsOf(step->kind).name)},
             {"line", step == nullptr ? Json() : Json(step->line)},
-            {"why", problem.why},
-            {"remedy", problem.remedy}};
+            {"why", causeOf(run, problem)},
+            {"remedy", remedyOf(run, problem)}};
 }
 
 Json versionsToJson(const Versions& versions, const std::string& text)
 {
-    return {{"read", versions.found},
-            {"from", versions.found ? Json(versions.installed) : Json()},
-            {"to", versions.found ? Json(versions.candidate) : Json()},
-            {"differ", versions.differ},
+    return {{"read", versions.found()},
+            {"from", versions.found() ? Json(versions.installed) : Json()},
+            {"to", versions.found() ? Json(versions.candidate) : Json()},
+            {"differ", versions.differ()},
             {"text", text}};
 }
 
@@ -77,40 +76,7 @@ const char* endName(RunEnd end)
 
 } // namespace
 
-const char* outcomeName(Outcome outcome)
-{
-    switch (outcome) {
-    case Outcome::NONE:
-        return "none";
-    case Outcome::NO_UPDATE:
-        return "no-update";
-    case Outcome::UPDATED:
-        return "updated";
-    case Outcome::UPDATE_OFFERED:
-        return "update-offered";
-    case Outcome::CHECK_FAILED:
-        return "check-failed";
-    case Outcome::MIRRORS_FAILED:
-        return "mirrors-failed";
-    case Outcome::PACKAGE_FAILED:
-        return "package-failed";
-    case Outcome::BOARD_FAILED:
-        return "board-failed";
-    case Outcome::TEAMVIEWER_FAILED:
-        return "teamviewer-failed";
-    case Outcome::UNKNOWN_FAILURE:
-        return "unknown-failure";
-    }
-    return "";
-}
-
-std::string isoText(std::int64_t time)
-{
-    const std::string date = dateText(time); // "DD-MM-YYYY HH:MM:SS"
-    return date.substr(6, 4) + '-' + date.substr(3, 2) + '-' + date.substr(0, 2) + 'T' + date.substr(11);
-}
-
-nlohmann::ordered_json runToJson(const Run& run)
+nlohmann::ordered_json runToJson(const Run& run, const std::string& source)
 {
     const OperatorView view = operatorView(run);
     Json leds = Json::object();
@@ -119,23 +85,30 @@ nlohmann::ordered_json runToJson(const Run& run)
     }
     Json steps = Json::array();
     for (const Step& step : run.steps) {
-        steps.push_back(stepToJson(step));
+        steps.push_back(stepToJson(run, step));
+    }
+    Json gaps = Json::array();
+    for (const Gap gap : run.gaps) {
+        gaps.push_back(gapText(run, gap));
     }
     Json besides = Json::array();
     for (const Problem& problem : run.besides) {
         besides.push_back(problemToJson(run, problem));
     }
     return {{"number", run.number},
+            {"source", source},
             {"first_line", run.firstLine},
             {"last_line", run.lastLine},
             {"begin", isoText(run.begin)},
-            {"took_s", run.end - run.begin},
+            {"took_s", run.elapsed},
+            {"clock_jumps", run.clockJumps},
             {"beginning_missing", run.beginningMissing},
             {"head", run.mainHead ? "main" : "remote"},
             {"updater", run.version},
             {"outcome", outcomeName(run.outcome)},
             {"meaning", view.meaning},
             {"went_well", wentWell(run)},
+            {"application_started", run.applicationStarted ? Json(*run.applicationStarted) : Json()},
             {"panel", leds},
             {"sound", view.sound},
             {"operator", view.seen},
@@ -148,5 +121,5 @@ nlohmann::ordered_json runToJson(const Run& run)
             {"service_manager_said", linesToJson(run.serviceManager)},
             {"torn_records", run.tornRecords},
             {"other_lines", run.otherLines},
-            {"cannot_tell", run.untold}};
+            {"cannot_tell", gaps}};
 }

@@ -2,7 +2,8 @@
 
 #include "descriptor.h"
 #include "findings.h"
-#include "log/explain.h"
+#include "log/catalogue.h"
+#include "log/dress.h"
 #include "log/follow.h"
 #include "log/html.h"
 #include "log/json.h"
@@ -11,6 +12,7 @@
 #include "log/source.h"
 #include "log/text.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <csignal>
 #include <cstdio>
@@ -47,9 +49,10 @@ const Magic magics[] = {
     {"\x1f\x8b", "compressed: zcat FILE | harl-updater-tool log"},
     {"\xfd\x37zXZ", "compressed: xzcat FILE | harl-updater-tool log"},
     {"\x28\xb5\x2f\xfd", "compressed: zstdcat FILE | harl-updater-tool log"},
-    {"PK\x03\x04", "an archive: unpack it first"},
-    {"\xff\xfe", "text in UTF-16: save it as UTF-8 first"},
-    {"\xfe\xff", "text in UTF-16: save it as UTF-8 first"},
+    {"BZh", "compressed: bzcat FILE | harl-updater-tool log"},
+    {"PK\x03\x04", "an archive: unzip -p FILE | harl-updater-tool log"},
+    {"\xff\xfe", "text in UTF-16: iconv -f UTF-16 -t UTF-8 FILE | harl-updater-tool log"},
+    {"\xfe\xff", "text in UTF-16: iconv -f UTF-16 -t UTF-8 FILE | harl-updater-tool log"},
 };
 
 /// What to do about an input that begins like this, or null when it may be a log.
@@ -67,7 +70,10 @@ const char* adviceFor(std::string_view start)
 class Reader
 {
 public:
-    Reader(const LogSource& source, LogParser& parser) : mSource(source), mParser(parser), mBlock(blockSize) {}
+    Reader(const LogSource& source, LogParser& parser)
+        : mSource(source), mParser(parser), mDress(parser), mBlock(blockSize)
+    {
+    }
 
     /// Reads one block. False at the source's end for now, and when something is wrong.
     bool readBlock()
@@ -83,18 +89,30 @@ public:
             return false;
         }
         const std::string_view text(mBlock.data(), static_cast<std::size_t>(length));
-        if (const char* advice = mParser.bytes() == 0 ? adviceFor(text) : nullptr; advice != nullptr) {
+        if (const char* advice = mDress.bytes() == 0 ? adviceFor(text) : nullptr; advice != nullptr) {
             mError = position() + "no log but " + advice;
             return false;
         }
-        mParser.feed(text);
+        mDress.feed(text);
+        if (mDress.tooLarge()) {
+            mError =
+                "the newest lines come first and are too many to be turned round: tac FILE | harl-updater-tool log";
+            return false;
+        }
         return true;
     }
+
+    void expectOldestFirst() { mDress.expectOldestFirst(); }
+
+    /// The source has ended.
+    void finish() { mDress.finish(); }
+
+    std::uint64_t bytes() const { return mDress.bytes(); }
 
     /// "byte 17, line 2: ", of what comes next.
     std::string position() const
     {
-        return "byte " + std::to_string(mParser.bytes()) + ", line " + std::to_string(mParser.lines() + 1) + ": ";
+        return "byte " + std::to_string(mDress.bytes()) + ", line " + std::to_string(mParser.lines() + 1) + ": ";
     }
 
     /// What is wrong, in words; empty for nothing.
@@ -103,6 +121,7 @@ public:
 private:
     const LogSource& mSource;
     LogParser& mParser;
+    Dress mDress;
     std::vector<char> mBlock;
     std::string mError;
 };
@@ -131,7 +150,7 @@ public:
             fchmod(part.number(), 0666 & ~withheld);
             mStream.open(mPartPath, std::ios::binary);
             unfinishedFile = mPartPath.c_str();
-            for (const int number : {SIGHUP, SIGINT, SIGTERM}) {
+            for (const int number : {SIGHUP, SIGINT, SIGTERM, SIGPIPE, SIGQUIT}) {
                 if (std::signal(number, removeUnfinished) == SIG_IGN) { // as nohup(1) leaves one
                     std::signal(number, SIG_IGN);
                 }
@@ -171,32 +190,37 @@ private:
     bool mKept = false;
 };
 
-/// Prints explained runs one by one: for people, or as one JSON object.
+/// Prints explained runs one by one: for people, as one line each, or as one JSON object.
 class Printer
 {
 public:
-    Printer(const std::string& source, bool json, std::ostream& out) : mSource(source), mJson(json), mOut(out)
+    Printer(const LogOptions& options, std::ostream& out) : mOptions(options), mOut(out)
     {
-        if (mJson) {
-            mOut << "{\"command\": \"log\", \"source\": " << dumped(mSource) << ", \"runs\": [";
+        if (mOptions.json) {
+            mOut << "{\"command\": \"log\", \"version\": " << jsonVersion << ", \"runs\": [";
         }
     }
 
-    void print(const Run& run)
+    void print(const Run& run, const std::string& source)
     {
-        mOut << (run.number == 1 ? "" : mJson ? "," : "\n");
-        if (mJson) {
-            mOut << '\n' << dumped(runToJson(run));
+        const char* between = mPrinted && !mOptions.list ? "\n" : "";
+        mOut << (mOptions.json && mPrinted ? "," : between);
+        mPrinted = true;
+        if (mOptions.json) {
+            mOut << '\n' << dumped(runToJson(run, source));
+        } else if (mOptions.list) {
+            mOut << run.number << "  " << dateText(run.begin) << "  " << operatorView(run).meaning
+                 << (run.failure ? std::string(" [") + run.failure->failure->name + ']' : "") << '\n';
         } else {
-            printRun(run, mSource, mOut);
+            printRun(run, source, mOut);
         }
     }
 
-    void finish(const LogParser& parser, int status, const std::string& error)
+    void finish(std::uint64_t lines, std::uint64_t bytes, int status, const std::string& error)
     {
-        if (mJson) {
-            mOut << "\n], \"lines\": " << parser.lines() << ", \"bytes\": " << parser.bytes()
-                 << ", \"status\": " << status << ", \"error\": " << (error.empty() ? "null" : dumped(error)) << "}\n";
+        if (mOptions.json) {
+            mOut << "\n], \"lines\": " << lines << ", \"bytes\": " << bytes << ", \"status\": " << status
+                 << ", \"error\": " << (error.empty() ? "null" : dumped(error)) << "}\n";
         }
         mOut.flush();
     }
@@ -204,23 +228,28 @@ public:
 private:
     static std::string dumped(const Json& value) { return value.dump(1, ' ', false, Json::error_handler_t::replace); }
 
-    std::string mSource;
-    bool mJson;
+    const LogOptions& mOptions;
     std::ostream& mOut;
+    bool mPrinted = false;
 };
 
 /// Why the page must not take the place of what is at `path`, in words; empty when it may.
-std::string objectionTo(const std::string& path, const LogSource& source)
+std::string objectionTo(const std::string& path, const LogOptions& options)
 {
     struct stat page = {};
-    struct stat log = {};
     if (lstat(path.c_str(), &page) != 0) {
         return "";
     }
     if (!S_ISREG(page.st_mode)) {
         return "not a plain file; name another one for the page";
     }
-    const bool same = fstat(source.descriptor(), &log) == 0 && page.st_dev == log.st_dev && page.st_ino == log.st_ino;
+    const auto isPage = [&](const std::string& file) {
+        struct stat log = {};
+        const int result = file == "-" ? fstat(STDIN_FILENO, &log) : stat(file.c_str(), &log);
+        return result == 0 && page.st_dev == log.st_dev && page.st_ino == log.st_ino;
+    };
+    const bool same =
+        options.files.empty() ? isPage("-") : std::any_of(options.files.begin(), options.files.end(), isPage);
     return same ? "the log itself; name another file for the page" : "";
 }
 
@@ -228,7 +257,7 @@ std::string objectionTo(const std::string& path, const LogSource& source)
 std::string journalText(int code)
 {
     return "journalctl ended with status " + std::to_string(code) +
-           ". Run it as root; journalctl --unit=harl-updater tells more.";
+           ". Run it as root; journalctl --unit=harl-updater shows why.";
 }
 
 std::string noRecordText(const LogParser& parser, bool journal)
@@ -241,62 +270,141 @@ std::string noRecordText(const LogParser& parser, bool journal)
            ". A record begins with \"Updater | DD-MM-YYYY HH-MM-SS\".";
 }
 
-int explainAll(LogSource& source, const LogOptions& options, std::ostream& out, std::ostream& err)
+/// Opens the source number `index` of the options. What is wrong, in words; empty when it is open.
+std::string openSource(const LogOptions& options, std::size_t index, LogSource& source, std::ostream& err)
 {
-    std::unique_ptr<NewFile> file;
-    std::optional<HtmlPage> page;
-    if (!options.htmlFile.empty()) {
-        if (const std::string objection = objectionTo(options.htmlFile, source); !objection.empty()) {
-            err << "harl-updater-tool: " << escaped(options.htmlFile) << ": " << objection << '\n';
-            return LOG_UNREADABLE;
-        }
-        file = std::make_unique<NewFile>(options.htmlFile);
-        if (!file->stream()) {
-            err << "harl-updater-tool: " << escaped(options.htmlFile) << ": " << std::strerror(errno) << '\n';
-            return LOG_UNREADABLE;
-        }
-        page.emplace(source.name(), file->stream());
+    if (options.journal) {
+        return source.openJournal(options.follow);
     }
-
-    Printer printer(source.name(), options.json, out);
-    LogStatus status = LOG_UNREADABLE;
-    RunBuilder builder([&](Run& run) {
-        explain(run);
-        printer.print(run);
-        if (page) {
-            page->writeRun(run);
-        }
-        status = wentWell(run) ? LOG_WENT_WELL : LOG_WENT_WRONG;
-    });
-    LogParser parser(builder);
-    Reader reader(source, parser);
-    while (reader.readBlock()) {
+    const std::string wrong = source.openFile(options.files.empty() ? "-" : options.files[index]);
+    if (wrong.empty() && isatty(source.descriptor()) == 1) {
+        err << "harl-updater-tool: reading the log from the terminal; end it with Ctrl-D.\n";
     }
-    parser.finish();
-    builder.finish();
-
-    std::string error = reader.error();
-    if (const int code = source.close(error.empty()); error.empty() && code != 0) {
-        error = journalText(code);
-    }
-    if (error.empty() && parser.records() == 0) {
-        error = noRecordText(parser, options.journal);
-    }
-    if (!error.empty()) {
-        status = LOG_UNREADABLE;
-    }
-    printer.finish(parser, status, error);
-    if (!error.empty()) {
-        err << "harl-updater-tool: " << source.name() << ": " << error << '\n';
-    } else if (page) {
-        page->finish();
-        if (const std::string wrong = file->keep(); !wrong.empty()) {
-            err << "harl-updater-tool: " << escaped(options.htmlFile) << ": " << wrong << '\n';
-            return LOG_UNREADABLE;
-        }
-    }
-    return status;
+    return wrong;
 }
+
+/// True when a run leaves nothing to be done.
+bool isClean(const Run& run)
+{
+    return wentWell(run) && run.besides.empty() && run.board.found();
+}
+
+/// Reads all sources and explains their runs.
+class Explanation
+{
+public:
+    Explanation(const LogOptions& options, std::ostream& out, std::ostream& err)
+        : mOptions(options), mErrors(err), mPrinter(options, out), mBuilder([this](Run& run) { take(run); })
+    {
+    }
+
+    int run()
+    {
+        std::string error = openPage();
+        const std::size_t count = std::max<std::size_t>(mOptions.files.size(), 1);
+        for (std::size_t index = 0; index < count && error.empty(); ++index) {
+            error = readSource(index);
+        }
+        mBuilder.finish();
+        if (mLast) {
+            show(*mLast, mLastSource);
+        }
+        if (error.empty() && mOptions.run > mRuns) {
+            error = "there is no run " + std::to_string(mOptions.run) + ": the log has " + counted(mRuns, "run");
+        }
+        mPrinter.finish(mLines, mBytes, error.empty() ? mStatus : LOG_UNREADABLE, error);
+        if (error.empty() && mPage) {
+            mPage->finish();
+            if (const std::string wrong = mFile->keep(); !wrong.empty()) {
+                error = escaped(mOptions.htmlFile) + ": " + wrong;
+            }
+        }
+        if (!error.empty()) {
+            mErrors << "harl-updater-tool: " << error << '\n';
+            return LOG_UNREADABLE;
+        }
+        return mStatus;
+    }
+
+private:
+    std::string openPage()
+    {
+        if (mOptions.htmlFile.empty()) {
+            return "";
+        }
+        std::string wrong = objectionTo(mOptions.htmlFile, mOptions);
+        if (wrong.empty()) {
+            mFile = std::make_unique<NewFile>(mOptions.htmlFile);
+            if (mFile->stream()) {
+                mPage.emplace(mFile->stream());
+                return "";
+            }
+            wrong = std::strerror(errno);
+        }
+        return escaped(mOptions.htmlFile) + ": " + wrong;
+    }
+
+    std::string readSource(std::size_t index)
+    {
+        LogSource source;
+        std::string error = openSource(mOptions, index, source, mErrors);
+        mSource = source.name();
+        if (!error.empty()) {
+            return mSource + ": " + error;
+        }
+        LogParser parser(mBuilder);
+        Reader reader(source, parser);
+        while (reader.readBlock()) {
+        }
+        reader.finish();
+        mBuilder.sourceEnds();
+        mLines += parser.lines();
+        mBytes += reader.bytes();
+        error = reader.error();
+        if (const int code = source.close(error.empty()); error.empty() && code != 0) {
+            error = journalText(code);
+        }
+        if (error.empty() && parser.records() == 0) {
+            error = noRecordText(parser, mOptions.journal);
+        }
+        return error.empty() ? "" : mSource + ": " + error;
+    }
+
+    void take(Run& run)
+    {
+        explain(run);
+        mRuns = run.number;
+        mStatus = (mOptions.strict ? isClean(run) : wentWell(run)) ? LOG_WENT_WELL : LOG_WENT_WRONG;
+        if (mOptions.last) {
+            mLast = run;
+            mLastSource = mSource;
+        } else if (mOptions.run == 0 || mOptions.run == run.number) {
+            show(run, mSource);
+        }
+    }
+
+    void show(const Run& run, const std::string& source)
+    {
+        mPrinter.print(run, source);
+        if (mPage) {
+            mPage->writeRun(run, source);
+        }
+    }
+
+    const LogOptions& mOptions;
+    std::ostream& mErrors;
+    Printer mPrinter;
+    RunBuilder mBuilder;
+    std::unique_ptr<NewFile> mFile;
+    std::optional<HtmlPage> mPage;
+    std::string mSource;
+    std::optional<Run> mLast;
+    std::string mLastSource;
+    std::uint64_t mRuns = 0;
+    std::uint64_t mLines = 0;
+    std::uint64_t mBytes = 0;
+    LogStatus mStatus = LOG_UNREADABLE;
+};
 
 /// Waits for more from a pipe, `time` ms at most; for all of `time` with a file. True when a pipe has more, or has
 /// ended.
@@ -337,11 +445,11 @@ bool readEarlierRuns(Reader& reader, const LogSource& source)
 }
 
 /// What is wrong with a file that others write to, in words; empty for nothing.
-std::string changeOf(const LogSource& source, const Reader& reader, const LogParser& parser)
+std::string changeOf(const LogSource& source, const Reader& reader)
 {
     struct stat state = {};
     if (fstat(source.descriptor(), &state) == 0 && S_ISREG(state.st_mode) &&
-        static_cast<std::uint64_t>(state.st_size) < parser.bytes()) {
+        static_cast<std::uint64_t>(state.st_size) < reader.bytes()) {
         return reader.position() + "the file was made shorter while it was read; start again";
     }
     return reader.error();
@@ -358,13 +466,14 @@ int followLast(LogSource& source, const LogOptions& options, std::ostream& out, 
     });
     LogParser parser(builder);
     Reader reader(source, parser);
+    reader.expectOldestFirst();
     std::string error;
 
     bool open = readEarlierRuns(reader, source);
     while (true) {
-        error = changeOf(source, reader, parser);
+        error = changeOf(source, reader);
         if (!open) {
-            parser.finish();
+            reader.finish();
         }
         follower.show(builder.current(), localNow());
         if (!open || !error.empty() || follower.ended()) {
@@ -389,13 +498,33 @@ int followLast(LogSource& source, const LogOptions& options, std::ostream& out, 
 
 } // namespace
 
+std::string conflictIn(const LogOptions& options)
+{
+    if (options.journal && !options.files.empty()) {
+        return "--journal reads the service's journal: name no FILE with it.";
+    }
+    if (options.follow && options.files.size() > 1) {
+        return "--follow shows one log: name one FILE.";
+    }
+    if (options.follow && (!options.htmlFile.empty() || options.list || options.last || options.run > 0)) {
+        return "--follow shows the run that goes on: neither --html, --list, --last nor --run go with it.";
+    }
+    if (options.last && options.run > 0) {
+        return "--last and --run name one run each: leave one of them out.";
+    }
+    return options.list && options.json ? "--list is for people: --json prints a list anyway." : "";
+}
+
 int runLog(const LogOptions& options, std::ostream& out, std::ostream& err)
 {
+    if (!options.follow) {
+        return Explanation(options, out, err).run();
+    }
     LogSource source;
-    const std::string wrong = options.journal ? source.openJournal(options.follow) : source.openFile(options.file);
+    const std::string wrong = openSource(options, 0, source, err);
     if (!wrong.empty()) {
         err << "harl-updater-tool: " << source.name() << ": " << wrong << '\n';
         return LOG_UNREADABLE;
     }
-    return options.follow ? followLast(source, options, out, err) : explainAll(source, options, out, err);
+    return followLast(source, options, out, err);
 }

@@ -1,5 +1,7 @@
 #include "log/parser.h"
 
+#include "log/vocabulary.h"
+
 #include <algorithm>
 #include <cstring>
 
@@ -8,6 +10,7 @@ namespace
 
 const std::string_view mark = "Updater | ";
 const std::size_t longestPrefix = 200; // bytes of a journal's prefix
+const std::size_t timeLength = 19;
 
 bool startsWith(std::string_view text, std::string_view start)
 {
@@ -41,20 +44,29 @@ std::int64_t daysSinceEpoch(std::int64_t year, int month, int day)
     return year * 365 + year / 4 - year / 100 + year / 400 + dayOfYear - 719468;
 }
 
-/// Takes the text up to the next tab, or up to the eight blanks that a journal makes of one, off `text`.
+bool isBlank(char character)
+{
+    return character == ' ' || character == '\t';
+}
+
+std::string_view withoutBlanks(std::string_view text)
+{
+    while (!text.empty() && isBlank(text.front())) {
+        text.remove_prefix(1);
+    }
+    return text;
+}
+
+/// Takes the text up to the next blanks, of which a journal or a copy through a terminal may make more or fewer, off
+/// `text`.
 bool takeColumn(std::string_view& text, std::string_view& column)
 {
-    std::size_t end = text.find('\t');
-    std::size_t separator = 1;
-    if (end == std::string_view::npos) {
-        end = text.find("        ");
-        separator = 8;
-    }
+    const std::size_t end = text.find_first_of(" \t");
     if (end == std::string_view::npos || end == 0) {
         return false;
     }
     column = text.substr(0, end);
-    text.remove_prefix(end + separator);
+    text = withoutBlanks(text.substr(end));
     return true;
 }
 
@@ -75,18 +87,50 @@ std::size_t indentationOf(std::string_view text)
     return startsWith(text, blanks) ? blanks.size() : 0;
 }
 
-/// True for what a console may put in front of each line: a time, such as "[07:15:33.123] " or "[   12.345678] ".
-bool isConsolePrefix(std::string_view text)
+/// True when `text` holds a time: "07:15" or "12.345".
+bool hasTime(std::string_view text)
 {
-    if (text.empty() || text.size() > longestPrefix || text.back() != ' ') {
-        return false;
-    }
     for (std::size_t index = 1; index + 2 < text.size(); ++index) {
         if ((text[index] == ':' || text[index] == '.') && isDigit(text[index - 1]) && isDigit(text[index + 1])) {
             return true;
         }
     }
     return false;
+}
+
+/// True for what a console may put in front of each line: a time, such as "[07:15:33.123] " or "[   12.345678] ".
+bool isConsolePrefix(std::string_view text)
+{
+    return !text.empty() && text.size() <= longestPrefix && text.back() == ' ' && hasTime(text);
+}
+
+/// `line` without what a terminal's colours or a system logger (a control character as "#" and its octal number) add;
+/// in `buffer` if there was anything.
+std::string_view plain(std::string_view line, std::string& buffer)
+{
+    static const char escape = '\x1b';
+    const bool logged = line.find("#0") != std::string_view::npos;
+    if (!logged && line.find(escape) == std::string_view::npos) {
+        return line;
+    }
+    buffer.clear();
+    while (!line.empty()) {
+        const bool encoded = startsWith(line, "#033");
+        if (line.front() == escape || encoded) {
+            line.remove_prefix(encoded ? 4 : 1);
+            if (startsWith(line, "[")) { // up to the final byte of a control sequence, ECMA-48
+                const std::size_t end = line.find_first_not_of("0123456789;?", 1);
+                line.remove_prefix(std::min(end, line.size() - 1) + 1);
+            }
+        } else if (startsWith(line, "#011")) {
+            buffer += '\t';
+            line.remove_prefix(4);
+        } else {
+            buffer += line.front();
+            line.remove_prefix(1);
+        }
+    }
+    return buffer;
 }
 
 /// True for what journalctl shows instead of a message with characters that do not print.
@@ -109,13 +153,13 @@ std::string_view withoutLineEnd(std::string_view line)
 std::string_view withoutJournalPrefix(std::string_view line, std::string_view& program)
 {
     program = {};
-    // The time comes first; a line of another program seldom begins in these ways and then holds no "[123]: ".
-    const char first = line.empty() ? '\0' : line.front();
-    if (!isDigit(first) && first != '[' && (first < 'A' || first > 'Z')) {
-        return line;
+    // The time comes first, in the words of some locale. Blanks at the line's end may be gone.
+    std::size_t end = line.substr(0, longestPrefix).find("]: ");
+    if (end == std::string_view::npos && !line.empty() && line.size() <= longestPrefix &&
+        line.substr(line.size() - std::min<std::size_t>(line.size(), 2)) == "]:") {
+        end = line.size() - 2;
     }
-    const std::size_t end = line.substr(0, longestPrefix).find("]: ");
-    if (end == std::string_view::npos) {
+    if (end == std::string_view::npos || !hasTime(line.substr(0, end))) {
         return line;
     }
     std::size_t digits = end;
@@ -131,7 +175,7 @@ std::string_view withoutJournalPrefix(std::string_view line, std::string_view& p
         return line;
     }
     program = front.substr(blank + 1);
-    return line.substr(end + 3);
+    return line.substr(std::min(end + 3, line.size()));
 }
 
 void LogParser::feed(std::string_view block)
@@ -157,19 +201,17 @@ void LogParser::feed(std::string_view block)
 void LogParser::finish()
 {
     if (!mPartialLine.empty()) {
+        mCut = true; // what is missing of it may be a digit
         takeLine(mPartialLine);
         mPartialLine.clear();
     }
-    if (mHeadOpen) {
-        mSink.torn(mHead.line);
-        takeMessage({});
-    }
+    closeHead(false);
 }
 
 void LogParser::takeLine(std::string_view line)
 {
     ++mLines;
-    line = withoutLineEnd(line);
+    line = plain(withoutLineEnd(line), mPlain);
 
     std::size_t position = startsWith(line, mark) ? 0 : line.find(mark);
     if (position == std::string_view::npos) {
@@ -184,16 +226,10 @@ void LogParser::takeLine(std::string_view line)
     const std::string_view front = line.substr(0, position);
     const std::string_view before = withoutJournalPrefix(front, program);
     const bool interrupted = before.find(mark) != std::string_view::npos;
-    if (!interrupted && !before.empty() && !isConsolePrefix(before)) {
+    if (!interrupted && !withoutBlanks(before).empty() && !isConsolePrefix(before)) {
         takeText(front, indentationOf(front)); // a line that another program, or a message, has not ended
     }
-    if (mHeadOpen) {
-        // A journal may leave out the line of an empty message.
-        if (program.empty()) {
-            mSink.torn(mHead.line);
-        }
-        takeMessage({});
-    }
+    closeHead(!program.empty());
     if (interrupted) {
         mSink.torn(mLines);
     }
@@ -204,6 +240,7 @@ void LogParser::takeLine(std::string_view line)
     mPrefixLength = position;
     mHead.line = mLines;
     mHeadOpen = true;
+    mEmptySeen = false;
 }
 
 /// A line without a head: a message when one is awaited, else another program's.
@@ -226,24 +263,44 @@ void LogParser::takeText(std::string_view line, std::size_t indentation)
     if (indentation == 0 && program.empty() && mPrefixLength > 0 && isConsolePrefix(line.substr(0, mPrefixLength))) {
         text = line.substr(std::min(mPrefixLength, line.size()));
     }
+    const std::string_view words = withoutBlanks(text);
+    mIndented = mIndented || (indentation != 0 && !words.empty());
     if (mHeadOpen && indentation != 0) {
         takeMessage(text.substr(indentation));
+    } else if (mHeadOpen && words.empty() && !mCut) {
+        mEmptySeen = true; // the message without its blanks, or a line that a copy has put in
+    } else if (mHeadOpen && ((!mIndented && logsOutput(mHead.operation)) || isMessageOf(mHead.operation, words))) {
+        takeMessage(words); // its blanks are gone
+    } else if (mHeadOpen && isHiddenMessage(text)) {
+        closeHead(true);
+    } else { // between a head and its message, a tool's line may come
+        if (indentation != 0 && !words.empty() && (indentation == 3 || mRecords == 0)) {
+            mSink.torn(mLines); // a message whose head is not there
+        } else if (!words.empty()) {
+            mSink.otherLine(mLines, program, text);
+        }
+    }
+}
+
+/// The head's message does not come any more.
+///
+/// @param leftOut  a journal has left it out
+void LogParser::closeHead(bool leftOut)
+{
+    if (!mHeadOpen) {
         return;
     }
-    if (mHeadOpen && isHiddenMessage(text)) {
+    if (mEmptySeen) {
         takeMessage({});
         return;
     }
-    if (mHeadOpen) {
+    if (!leftOut) {
         mSink.torn(mHead.line);
-        takeMessage({});
-    } else if (indentation != 0 && mRecords == 0) {
-        mSink.torn(mLines); // the log begins in the middle of a record
-        return;
     }
-    if (!text.empty()) {
-        mSink.otherLine(mLines, program, text);
-    }
+    mHeadOpen = false;
+    ++mRecords;
+    mHead.message.reset();
+    mSink.record(mHead);
 }
 
 /// The message of mHead has come: the record is complete.
@@ -252,6 +309,7 @@ void LogParser::takeMessage(std::string_view message)
     mHeadOpen = false;
     ++mRecords;
     mHead.message = message;
+    mHead.cut = mCut;
     mSink.record(mHead);
 }
 
@@ -262,9 +320,14 @@ bool LogParser::parseHead(std::string_view text)
     std::string_view rest = mHeadText;
     std::string_view time;
     std::string_view position;
-    rest.remove_prefix(mark.size());
-    if (!takeColumn(rest, time) || !parseTime(time) || !takeColumn(rest, mHead.thread) || !takeColumn(rest, position)) {
+    rest.remove_prefix(std::min(mark.size(), rest.size()));
+    time = rest.substr(0, timeLength);
+    rest = withoutBlanks(rest.substr(time.size()));
+    if (!parseTime(time) || !takeColumn(rest, mHead.thread) || !takeColumn(rest, position)) {
         return false;
+    }
+    while (!rest.empty() && isBlank(rest.back())) {
+        rest.remove_suffix(1);
     }
     const std::size_t colon = position.rfind(':');
     if (colon == std::string_view::npos || rest.empty() || rest.back() != ')') {
@@ -278,7 +341,7 @@ bool LogParser::parseHead(std::string_view text)
 /// Reads "DD-MM-YYYY HH-MM-SS" into mHead.
 bool LogParser::parseTime(std::string_view text)
 {
-    if (text.size() != 19 || text[10] != ' ' || text[13] != '-' || text[16] != '-') {
+    if (text.size() != timeLength || text[10] != ' ' || text[13] != '-' || text[16] != '-') {
         return false;
     }
     const int hour = number(text, 11, 2);

@@ -2,18 +2,20 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <optional>
 #include <string>
 #include <string_view>
 
 /// One record of the updater's log. The texts are valid during the call that hands the record over.
 struct ParsedRecord
 {
-    std::uint64_t line = 0;     ///< of the record's first line, from 1
-    std::int64_t time = 0;      ///< local time in seconds since 1970, as if local time were UTC
-    std::string_view thread;    ///< the thread's id as logged
-    std::string_view file;      ///< source file, such as "UpdateManager.cpp"
-    std::string_view operation; ///< bare name of the function, such as "updateMirrors"
-    std::string_view message;   ///< without indentation and line end
+    std::uint64_t line = 0;                  ///< of the record's first line, from 1
+    std::int64_t time = 0;                   ///< local time in seconds since 1970, as if local time were UTC
+    std::string_view thread;                 ///< the thread's id as logged
+    std::string_view file;                   ///< source file, such as "UpdateManager.cpp"
+    std::string_view operation;              ///< bare name of the function, such as "updateMirrors"
+    std::optional<std::string_view> message; ///< without indentation and line end; none: it is not in the log
+    bool cut = false;                        ///< The log ends in the message, which may lack its end.
 };
 
 /// Takes what a LogParser finds, in the order of the log.
@@ -37,9 +39,10 @@ public:
 /// Finds the updater's records in a text that comes in blocks of any size.
 ///
 /// A record is "Updater | DD-MM-YYYY HH-MM-SS", thread, FILE:LINE and function with tabs between, and on the next line
-/// three tabs and the message (see common/src/Log.h). In front of each line may stand what a journal (journalctl -o
-/// short, short-iso, short-precise and the like, which turn a tab into eight blanks) or a console adds. A record may
-/// begin in the middle of a line, behind the unfinished output of another program.
+/// three tabs and the message (see common/src/Log.h). Each line may begin with what a journal (journalctl -o short,
+/// short-iso, short-precise and the like, in any locale), a system logger or a console adds; colours, other blanks and
+/// empty lines between make no difference. A record may begin in the middle of a line, after the unfinished output of
+/// another program.
 ///
 /// Memory stays below three blocks whatever the text: of a line, the first longestLine bytes count.
 class LogParser
@@ -62,6 +65,7 @@ public:
 private:
     void takeLine(std::string_view line);
     void takeText(std::string_view line, std::size_t indentation);
+    void closeHead(bool leftOut);
     void takeMessage(std::string_view message);
     bool parseHead(std::string_view text);
     bool parseTime(std::string_view text);
@@ -76,6 +80,10 @@ private:
     std::string mHeadText;
     std::size_t mPrefixLength = 0; // bytes in front of the head
     bool mHeadOpen = false;
+    bool mEmptySeen = false; // an empty line after the head
+    bool mCut = false;
+    bool mIndented = false; // some message was
+    std::string mPlain; // what plain() has made of a line
 
     std::string mDate; // of the last head, and the time its day began
     std::int64_t mMidnight = 0;

@@ -1,6 +1,8 @@
 #pragma once
 
+#include "log/catalogue.h"
 #include "log/parser.h"
+#include "log/vocabulary.h"
 
 #include <cstdint>
 #include <deque>
@@ -9,27 +11,6 @@
 #include <string>
 #include <vector>
 
-/// What the updater does in one run, in its order.
-enum class StepKind {
-    START,
-    STOP_APPLICATION,
-    REFRESH_MIRRORS,
-    CHECK_PACKAGE,
-    INSTALL_PACKAGE,
-    CHECK_BOARD,
-    UPLOAD_BOARD,
-    RUN_BOARD_SCRIPT,
-    WAIT_FOR_BOARD,
-    CHECK_TEAMVIEWER,   // main head only
-    INSTALL_TEAMVIEWER, // main head only
-    REMOVE_MARKER,
-    SHOW_OUTCOME,
-    SHOW_TO_OPERATOR,
-    GIVE_BACK,
-    STOP_UPDATER,
-};
-const std::size_t stepKinds = static_cast<std::size_t>(StepKind::STOP_UPDATER) + 1;
-
 enum class StepResult {
     UNFINISHED, ///< The log does not show its end.
     DONE,
@@ -37,13 +18,25 @@ enum class StepResult {
     UNTOLD, ///< It ended, but the record that tells how is missing.
 };
 
+/// How a command ended, as the updater logs it.
+struct CommandStatus
+{
+    long number = 0;
+    bool raw = false; ///< a wait status, -1 when it could not be had; else an exit code
+
+    bool lost() const { return raw && number == -1; }
+};
+
 /// One command, one attempt of it, or one wait.
 struct Action
 {
-    std::string text;
-    std::int64_t start = 0; ///< All times as ParsedRecord::time.
-    std::optional<std::int64_t> end;
-    std::string status; ///< in plain words; empty when the log holds none
+    const char* command = "";         ///< empty: a wait
+    std::int64_t wait = 0;            ///< s
+    std::int64_t start = 0;           ///< as ParsedRecord::time
+    std::int64_t began = 0;           ///< as Run::elapsed
+    std::optional<std::int64_t> took; ///< s
+    std::optional<CommandStatus> status;
+    bool attemptFailed = false; ///< one of several; its status is not logged
 };
 
 /// A line of another program, and how often it came in succession.
@@ -62,48 +55,51 @@ struct OtherLines
     std::uint64_t leftOut = 0; ///< between the first and the last
 
     void add(std::string_view text);
-
-    /// Text for people, a line each: "scp: Connection closed (20 times)".
-    std::vector<std::string> shown() const;
-
-    bool contain(const std::string& part) const;
 };
 
 struct Step
 {
     StepKind kind = StepKind::START;
-    std::uint64_t line = 0; ///< where it begins in the log
-    std::int64_t start = 0;
-    std::optional<std::int64_t> end;
+    std::uint64_t line = 0;           ///< where it begins in the log
+    std::int64_t start = 0;           ///< as ParsedRecord::time
+    std::int64_t began = 0;           ///< as Run::elapsed
+    std::optional<std::int64_t> took; ///< s, without jumps of the clock
     StepResult result = StepResult::UNFINISHED;
-    std::string detail;       ///< the result in a few plain words
-    std::string word;         ///< the record's message that told a failure
-    std::optional<long> code; ///< exit code, or raw wait status for those steps whose command's raw status is logged
+    Event event = Event::NONE; ///< that ended it
+    std::string word;          ///< the record's message that reported a failure
+    std::optional<CommandStatus> status;
     std::vector<Action> actions;
     int failedAttempts = 0; ///< of the upload
     OtherLines said;
+    PhraseSet phrases; ///< in what was said
 };
 
 /// A version check's result.
 struct Versions
 {
+    enum class State { UNKNOWN, NOT_READ, SAME, DIFFER };
+
+    State state = State::UNKNOWN;
     std::string installed;
     std::string candidate;
-    bool found = false;  ///< both
-    bool differ = false; ///< an update is due
+
+    bool unclear = false; ///< Both were shown, but not which is which.
+
+    bool differ() const { return state == State::DIFFER; }
+    bool found() const { return state == State::SAME || state == State::DIFFER; }
 };
 
 enum class Outcome {
-    NONE, ///< The log does not reach it.
+    NONE,   ///< The log does not tell.
+    PASSED, ///< but the log does not tell whether anything was updated, on a main head whether it is offered
     NO_UPDATE,
     UPDATED,
     UPDATE_OFFERED, ///< main head only: a list for its user
+    FAILED,         ///< but the record that tells at what is missing
     CHECK_FAILED,
     MIRRORS_FAILED,
     PACKAGE_FAILED,
     BOARD_FAILED,
-    TEAMVIEWER_FAILED, ///< main head only
-    UNKNOWN_FAILURE,   ///< an error was reported, the record that tells which is missing
 };
 
 enum class RunEnd {
@@ -113,13 +109,35 @@ enum class RunEnd {
     EARLY,              ///< The service manager, or what it runs afterwards, says so.
 };
 
-/// What went wrong in a run and what to do about it.
+/// What the service around the updater says.
+struct ServiceFacts
+{
+    bool failureShown = false; ///< LED_FAIL, lit after the updater had ended without an outcome
+};
+
+/// What went wrong in a run.
 struct Problem
 {
-    std::string name; ///< fixed name in kebab-case, for programs and the documents
-    std::size_t step; ///< index of the run's step; see Run::stepOf()
-    std::string why;
-    std::string remedy;
+    const Failure* failure;
+    std::size_t step;       ///< index of the run's step; see Run::stepOf()
+    bool tolerated = false; ///< The run counts as passed all the same.
+};
+
+/// What a log leaves open.
+enum class Gap {
+    BEGINNING,
+    END,
+    OUTCOME,
+    TORN_RECORDS,
+    STEPS_LEFT_OUT,
+    CLOCK,
+    STATUSES,
+    PACKAGE_INSTALLED,
+    UPLOAD_ATTEMPTS,
+    BOARD_RUNS,
+    MARKER,
+    TOOLS_WORDS,
+    FEEDBACK,
 };
 
 /// One run of the updater, as far as a log tells it.
@@ -130,17 +148,24 @@ struct Run
     std::uint64_t lastLine = 0;
     std::int64_t begin = 0;
     std::int64_t end = 0;
+    std::int64_t elapsed = 0; ///< s, without jumps of the clock
+    std::uint64_t clockJumps = 0;
     bool beginningMissing = false;
     bool mainHead = false;
-    bool clockSetBack = false;
     std::string version; ///< of the updater
     std::vector<Step> steps;
     std::uint64_t stepsLeftOut = 0;
     Versions package;
     Versions board;
-    bool markerReported = false;
-    Outcome outcome = Outcome::NONE;
+    std::optional<bool> teamViewer; ///< requested; main head only
+    bool markerRemoved = false;
+    bool partsInstalled = false; ///< main head only: an installation began
+    bool resultReported = false;
+    bool errorReported = false;
+    Outcome named = Outcome::NONE;   ///< by the procedure's own word
+    Outcome outcome = Outcome::NONE; ///< what follows from all of that
     RunEnd ended = RunEnd::NOT_SEEN;
+    std::optional<bool> applicationStarted;
     bool followedByAnother = false; ///< The log goes on with another run.
     std::uint64_t ledFailures = 0;
     std::uint64_t outcomeLedFailures = 0;
@@ -149,77 +174,65 @@ struct Run
     std::uint64_t tornRecords = 0;
     std::uint64_t firstTornLine = 0;
     std::uint64_t otherLines = 0;
-    OtherLines serviceManager;          ///< its lines, and those of what it runs after the updater
-    bool failureShownByService = false; ///< LED_FAIL, lit after the updater had ended without an outcome
-    std::string mainThread;
-    std::string updateThread;
+    OtherLines serviceManager; ///< its lines, and those of what it runs around the updater
+    ServiceFacts service;
 
     /// Set by explain().
     std::optional<Problem> failure; ///< what decided a bad outcome
     std::vector<Problem> besides;
-    std::vector<std::string> untold; ///< what the log cannot tell
+    std::vector<Gap> gaps;
 
     const Step* find(StepKind kind) const; ///< the last one, or null
 
     /// The step that `problem` is about; null when the log shows none of this run's steps.
     const Step* stepOf(const Problem& problem) const;
+
+    /// True when the outcome was shown, or had been: all that decides it had happened.
+    bool isDecided() const;
 };
 
-/// Name of a step for people, such as "Refresh the package mirrors".
-const char* stepTitle(StepKind kind);
+bool isFailure(Outcome outcome);
 
-/// Name of a step for programs, such as "refresh-mirrors".
-const char* stepName(StepKind kind);
-
-/// Name of a result for programs, such as "failed".
-const char* resultName(StepResult result);
-
-/// Makes runs of records. Memory is bounded: of each run the first steps and a few lines of other programs are kept.
+/// Gathers records into runs and steps. Memory stays bounded for a log of any size: each run is handed over when it is
+/// complete, and of a run only so many steps, actions and lines are kept.
 class RunBuilder : public LogSink
 {
 public:
-    /// @param runComplete  gets each run when the next one begins or the log ends
+    /// @param runComplete  called with each run, in order; it may change it
     explicit RunBuilder(std::function<void(Run&)> runComplete) : mRunComplete(std::move(runComplete)) {}
 
     void record(const ParsedRecord& record) override;
     void otherLine(std::uint64_t line, std::string_view program, std::string_view text) override;
     void torn(std::uint64_t line) override;
 
-    /// The log has ended.
+    /// A file has ended. A run goes on in the next one only if its records are of the same thread.
+    void sourceEnds() { mSourceEnded = true; }
+
+    /// The log has ended: hands over the last run.
     void finish();
 
-    /// The run that is not handed over yet, or null.
+    /// The run that goes on, or null.
     const Run* current() const { return mRun ? &*mRun : nullptr; }
 
-    std::uint64_t runs() const { return mRuns; }
-
 private:
+    bool beginsRun(const Meaning& meaning, bool whole) const;
     void beginRun(const ParsedRecord& record);
     void endRun(bool followedByAnother);
+    void noteTime(const ParsedRecord& record, const Meaning& meaning);
+    void takeRunEvent(const ParsedRecord& record, const Meaning& meaning);
+    void takeStepEvent(Step& step, const ParsedRecord& record, const Meaning& meaning);
+    void takeStatus(Step& step, long number);
 
-    void takeEntry(const ParsedRecord& record);
-    void takeService(const ParsedRecord& record);
-    void takeCheck(const ParsedRecord& record);
-    void takeInstallation(const ParsedRecord& record);
-    void takeBoard(const ParsedRecord& record);
-    void takeCommand(const ParsedRecord& record);
-    void takeProcedure(const ParsedRecord& record);
-    void takeTeamViewer(const ParsedRecord& record);
-    void takeFeedback(const ParsedRecord& record);
-
-    Step& beginStep(StepKind kind, const ParsedRecord& record);
-    void endStepWithoutRecord(const ParsedRecord& record);
-    void endStep(const ParsedRecord& record, StepResult result, std::string detail);
-    void fail(const ParsedRecord& record, std::string detail);
-    void beginAction(const ParsedRecord& record, std::string_view text);
-    void beginWait(const ParsedRecord& record, std::int64_t seconds);
-    void endAction(const ParsedRecord& record, std::string status);
-    void noteRawStatus(long status);
-    Step* openStep(StepKind kind);
+    Step& stepFor(StepKind kind, const ParsedRecord& record);
+    void endStepWithoutRecord(Step& step, StepKind next);
+    void endStep(Step& step, StepResult result, Event event);
+    void beginAction(Step& step, const char* command, std::int64_t wait);
+    void endAction(Step& step, std::optional<CommandStatus> status);
 
     std::function<void(Run&)> mRunComplete;
     std::optional<Run> mRun;
     std::uint64_t mRuns = 0;
-    Outcome mVerdict = Outcome::NONE; // what the procedure said before it reports an error
-    std::uint64_t mTornBefore = 0;    // pieces in front of the next run's first record
+    std::string mThread; // of the last record
+    bool mSourceEnded = false;
+    std::uint64_t mTornBefore = 0; // pieces in front of the next run's first record
 };

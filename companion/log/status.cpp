@@ -1,5 +1,7 @@
 #include "log/status.h"
 
+#include "log/run.h"
+
 #include <csignal>
 #include <cstring>
 
@@ -12,23 +14,6 @@ std::string signalText(int signal)
     const char* name = sigabbrev_np(signal);
     std::string text = "signal " + std::to_string(signal);
     return name == nullptr ? text : text + " (SIG" + name + ')';
-}
-
-} // namespace
-
-std::string rawStatusText(long status)
-{
-    if (status == -1) {
-        return "its status could not be had";
-    }
-    if (status < 0 || status > 0xFFFF) {
-        return std::to_string(status) + " (no wait status)";
-    }
-    const int signal = static_cast<int>(status & 0x7F);
-    if (signal != 0) {
-        return "killed by " + signalText(signal);
-    }
-    return exitCodeText(status >> 8);
 }
 
 std::string exitCodeText(long code)
@@ -44,4 +29,21 @@ std::string exitCodeText(long code)
         return text + " (killed by " + signalText(static_cast<int>(code) - 128) + ')';
     }
     return text;
+}
+
+} // namespace
+
+std::string statusText(const CommandStatus& status)
+{
+    if (!status.raw) {
+        return exitCodeText(status.number);
+    }
+    if (status.lost()) {
+        return "its status is not available";
+    }
+    if (status.number < 0 || status.number > 0xFFFF) {
+        return std::to_string(status.number) + " (no wait status)";
+    }
+    const int signal = static_cast<int>(status.number & 0x7F);
+    return signal != 0 ? "killed by " + signalText(signal) : exitCodeText(status.number >> 8);
 }

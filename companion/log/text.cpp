@@ -1,8 +1,10 @@
 #include "log/text.h"
 
 #include "findings.h"
-#include "log/explain.h"
+#include "log/status.h"
+#include "procedure.h"
 
+#include <algorithm>
 #include <array>
 #include <cstdio>
 #include <ctime>
@@ -14,6 +16,33 @@ namespace
 
 const std::size_t width = 100; // columns
 
+/// What is shown for an outcome.
+struct OutcomeFacts
+{
+    const char* name;
+    const char* meaning;
+    bool bothLeds; ///< REMOTE and MAIN; else PASS or FAIL
+};
+
+// In the order of Outcome.
+const std::array<OutcomeFacts, 10> outcomeTable = {{
+    {"none", "NOT FINISHED, as far as this log goes", false},
+    {"passed", "PASSED; whether anything was updated is not in this log", false},
+    {"no-update", "PASSED: nothing to update", true},
+    {"updated", "PASSED: updated", false},
+    {"update-offered", "an update is offered", false},
+    {"failed", "FAILED: at what is not in this log", false},
+    {"check-failed", "FAILED: a version could not be read", true},
+    {"mirrors-failed", "FAILED: the package mirrors could not be read", true},
+    {"package-failed", "FAILED: the package could not be installed", false},
+    {"board-failed", "FAILED: the board could not be updated", false},
+}};
+
+const OutcomeFacts& factsOf(Outcome outcome)
+{
+    return outcomeTable.at(static_cast<std::size_t>(outcome));
+}
+
 std::string formattedTime(std::int64_t time, const char* format)
 {
     const auto seconds = static_cast<std::time_t>(time);
@@ -23,7 +52,119 @@ std::string formattedTime(std::int64_t time, const char* format)
     return {buffer.data(), std::strftime(buffer.data(), buffer.size(), format, &parts)};
 }
 
-/// Prints `text` behind `label`, its further lines indented as deep.
+void printSteps(const Run& run, std::ostream& out)
+{
+    out << "\nStart     Took          Step                              Result\n";
+    for (const Step& step : run.steps) {
+        const std::string took = step.took ? durationText(*step.took) : "";
+        std::array<char, 256> line{};
+        std::snprintf(line.data(), line.size(), "%s  %-12s  %-32s  ", clockText(step.start).c_str(), took.c_str(),
+                      factsOf(step.kind).title);
+        out << line.data() << resultText(run, step) << '\n';
+    }
+}
+
+void printLines(const OtherLines& lines, std::ostream& out)
+{
+    for (const std::string& line : shownLines(lines)) {
+        out << "    | " << line << '\n';
+    }
+}
+
+void printProblem(const Run& run, const Problem& problem, std::ostream& out)
+{
+    const Step* step = run.stepOf(problem);
+    out << '\n' << headingOf(run, problem) << '\n';
+    printWrapped("  Why:     ", causeOf(run, problem), out);
+    printWrapped("  Do now:  ", remedyOf(run, problem), out);
+    if (step != nullptr && step->said.count > 0) {
+        out << "  The tools said:\n";
+        printLines(step->said, out);
+    }
+}
+
+/// What came out of a step that succeeded.
+std::string doneText(const Run& run, const Step& step)
+{
+    switch (step.event) {
+    case Event::PACKAGE_DIFFERS:
+        return "an update: " + run.package.installed + " -> " + run.package.candidate;
+    case Event::PACKAGE_SAME:
+        return "up to date: " + run.package.installed;
+    case Event::BOARD_DIFFERS:
+        return "an update: " + run.board.installed + " -> " + run.board.candidate;
+    case Event::BOARD_SAME:
+        return "up to date" + (run.board.installed.empty() ? "" : ": " + run.board.installed);
+    case Event::TEAMVIEWER_REQUESTED:
+        return "an installation is requested";
+    case Event::TEAMVIEWER_NOT_REQUESTED:
+        return "no installation is requested";
+    default:
+        break;
+    }
+    if (step.kind == StepKind::UPLOAD_BOARD && step.failedAttempts > 0) {
+        return "done at attempt " + std::to_string(step.failedAttempts + 1) + " of " + std::to_string(uploadAttempts);
+    }
+    const bool told = step.status && step.kind != StepKind::REFRESH_MIRRORS;
+    return told ? statusText(*step.status) : "done";
+}
+
+std::string failedText(const Step& step)
+{
+    if (step.kind == StepKind::GIVE_BACK) {
+        std::string text;
+        for (std::size_t index = 0; index < std::min<std::size_t>(2, step.actions.size()); ++index) {
+            if (const auto& status = step.actions[index].status; status && status->number != 0) {
+                text +=
+                    (text.empty() ? "" : ", ") + std::string(index == 0 ? "stick: " : "harl: ") + statusText(*status);
+            }
+        }
+        return text;
+    }
+    if (step.kind == StepKind::UPLOAD_BOARD) {
+        return std::to_string(uploadAttempts) + " attempts failed";
+    }
+    if (step.event == Event::STICK_NOT_READ) {
+        return "the stick could not be read";
+    }
+    if (step.kind == StepKind::CHECK_TEAMVIEWER) {
+        return "the marker could not be looked for";
+    }
+    if (step.kind == StepKind::CHECK_PACKAGE || step.kind == StepKind::CHECK_BOARD) {
+        return "the versions could not be read";
+    }
+    return step.status ? statusText(*step.status) : "";
+}
+
+/// How far the installation of a part came.
+std::string versionsText(const Run& run, const Versions& versions, StepKind check, const std::string& installation)
+{
+    const Step* step = run.find(check);
+    if (versions.state == Versions::State::NOT_READ || (step != nullptr && step->result == StepResult::FAILED)) {
+        return "versions not read";
+    }
+    if (!versions.found()) {
+        return step == nullptr ? (run.beginningMissing ? "not in this log" : "not checked")
+               : step->took    ? "not in this log"
+                               : "not checked";
+    }
+    if (!versions.differ()) {
+        return (versions.installed.empty() ? "" : versions.installed + ", ") + "up to date";
+    }
+    return versions.installed + " -> " + versions.candidate + ", " + installation;
+}
+
+/// Replaces each `mark` in `text`.
+void replace(std::string& text, const std::string& mark, const std::string& by)
+{
+    for (std::size_t position = text.find(mark); position != std::string::npos;
+         position = text.find(mark, position + by.size())) {
+        text.replace(position, mark.size(), by);
+    }
+}
+
+} // namespace
+
 void printWrapped(const std::string& label, const std::string& text, std::ostream& out)
 {
     std::istringstream words(text);
@@ -44,44 +185,16 @@ void printWrapped(const std::string& label, const std::string& text, std::ostrea
     out << '\n';
 }
 
-void printSteps(const Run& run, std::ostream& out)
+const char* outcomeName(Outcome outcome)
 {
-    out << "\nStart     Took          Step                              Result\n";
-    for (const Step& step : run.steps) {
-        const std::string took = step.end ? durationText(*step.end - step.start) : "";
-        std::array<char, 256> line{};
-        std::snprintf(line.data(), line.size(), "%s  %-12s  %-32s  ", clockText(step.start).c_str(), took.c_str(),
-                      stepTitle(step.kind));
-        out << line.data() << resultText(step) << '\n';
-    }
+    return factsOf(outcome).name;
 }
 
-void printLines(const OtherLines& lines, std::ostream& out)
+const char* resultName(StepResult result)
 {
-    for (const std::string& line : lines.shown()) {
-        out << "    | " << line << '\n';
-    }
+    static const std::array<const char*, 4> names = {"unfinished", "done", "failed", "untold"};
+    return names.at(static_cast<std::size_t>(result));
 }
-
-void printProblem(const Run& run, const Problem& problem, const std::string& heading, std::ostream& out)
-{
-    const Step* step = run.stepOf(problem);
-    out << '\n' << heading;
-    if (step == nullptr) {
-        out << "a step that is not in this log";
-    } else {
-        out << stepTitle(step->kind) << " (line " << step->line << ')';
-    }
-    out << " [" << problem.name << "]\n";
-    printWrapped("  Why:     ", problem.why, out);
-    printWrapped("  Do now:  ", problem.remedy, out);
-    if (step != nullptr && step->said.count > 0) {
-        out << "  The tools said:\n";
-        printLines(step->said, out);
-    }
-}
-
-} // namespace
 
 std::string clockText(std::int64_t time)
 {
@@ -93,11 +206,13 @@ std::string dateText(std::int64_t time)
     return formattedTime(time, "%d-%m-%Y %H:%M:%S");
 }
 
+std::string isoText(std::int64_t time)
+{
+    return formattedTime(time, "%Y-%m-%dT%H:%M:%S");
+}
+
 std::string durationText(std::int64_t seconds)
 {
-    if (seconds < 0) {
-        return "?"; // the clock was set back
-    }
     if (seconds < 60) {
         return std::to_string(seconds) + " s";
     }
@@ -107,76 +222,223 @@ std::string durationText(std::int64_t seconds)
     return std::to_string(seconds / 3600) + " h " + std::to_string(seconds % 3600 / 60) + " min";
 }
 
-std::string resultText(const Step& step)
+std::string resultText(const Run& run, const Step& step)
 {
     switch (step.result) {
     case StepResult::UNFINISHED:
         return step.kind == StepKind::STOP_UPDATER ? "the service ends here" : "NOT FINISHED in this log";
     case StepResult::DONE:
-        return step.detail.empty() ? "done" : step.detail;
-    case StepResult::FAILED:
-        return step.detail.empty() ? "FAILED" : "FAILED: " + step.detail;
+        return doneText(run, step);
+    case StepResult::FAILED: {
+        const std::string text = failedText(step);
+        return text.empty() ? "FAILED" : "FAILED: " + text;
+    }
     case StepResult::UNTOLD:
-        return step.detail;
+        for (const Action& action : step.actions) {
+            if (action.status && action.status->lost()) {
+                return statusText(*action.status);
+            }
+        }
+        return "its end is not in this log";
     }
     return "";
 }
 
+std::string actionText(const Action& action)
+{
+    return *action.command == '\0' ? "wait " + std::to_string(action.wait) + " s" : action.command;
+}
+
+std::string actionStatusText(const Action& action)
+{
+    return action.attemptFailed ? "failed" : action.status ? statusText(*action.status) : "";
+}
+
+std::vector<std::string> shownLines(const OtherLines& lines)
+{
+    std::vector<std::string> texts;
+    const auto show = [&](const OtherLine& line) {
+        texts.push_back(line.text + (line.times > 1 ? " (" + counted(line.times, "time") + ')' : ""));
+    };
+    std::for_each(lines.first.begin(), lines.first.end(), show);
+    if (lines.leftOut > 0) {
+        texts.push_back("... (" + counted(lines.leftOut, "line") + " left out)");
+    }
+    std::for_each(lines.last.begin(), lines.last.end(), show);
+    return texts;
+}
+
 std::string packageText(const Run& run)
 {
-    const Step* check = run.find(StepKind::CHECK_PACKAGE);
-    if (check == nullptr && run.beginningMissing) {
-        return "not in this log";
-    }
-    if (check == nullptr || !check->end) {
-        return "not checked";
-    }
-    if (!run.package.found) {
-        return "versions not read";
-    }
-    if (!run.package.differ) {
-        return run.package.installed + ", up to date";
-    }
-    const std::string versions = run.package.installed + " -> " + run.package.candidate + ", ";
     const Step* install = run.find(StepKind::INSTALL_PACKAGE);
-    if (install == nullptr) {
-        return versions + "not installed";
-    }
-    if (install->result == StepResult::FAILED) {
-        return versions + "installation FAILED";
-    }
-    return versions + (install->result == StepResult::DONE ? "installed" : "its installation's end is not told");
+    return versionsText(run, run.package, StepKind::CHECK_PACKAGE,
+                        install == nullptr                      ? "not installed"
+                        : install->result == StepResult::FAILED ? "installation FAILED"
+                        : install->result == StepResult::DONE   ? "installed"
+                                                                : "its installation's end is not in this log");
 }
 
 std::string boardText(const Run& run)
 {
-    const Step* check = run.find(StepKind::CHECK_BOARD);
-    if (check == nullptr && run.beginningMissing) {
-        return "not in this log";
-    }
-    if (check == nullptr || !check->end) {
-        return "not checked";
-    }
-    if (!run.board.found) {
-        return "versions not read";
-    }
-    if (!run.board.differ) {
-        return run.board.installed + ", up to date";
-    }
-    const std::string versions = run.board.installed + " -> " + run.board.candidate + ", ";
     const Step* upload = run.find(StepKind::UPLOAD_BOARD);
     const Step* script = run.find(StepKind::RUN_BOARD_SCRIPT);
-    if (upload == nullptr) {
-        return versions + "not installed";
+    const auto result = [](const Step* step) { return step == nullptr ? StepResult::UNFINISHED : step->result; };
+    std::string text = "not installed";
+    if (script != nullptr) {
+        text = result(script) == StepResult::DONE     ? "uploaded and its install script run"
+               : result(script) == StepResult::FAILED ? "uploaded, but its install script FAILED"
+                                                      : "uploaded; its install script's end is not in this log";
+    } else if (upload != nullptr) {
+        text = result(upload) == StepResult::FAILED ? "upload FAILED" : "its upload's end is not in this log";
     }
-    if (script == nullptr) {
-        return versions + (upload->result == StepResult::FAILED ? "upload FAILED" : "its upload's end is not told");
+    return versionsText(run, run.board, StepKind::CHECK_BOARD, text);
+}
+
+std::string headingOf(const Run& run, const Problem& problem)
+{
+    const bool decisive = run.failure && &problem == &*run.failure;
+    const Step* step = run.stepOf(problem);
+    std::string text = !decisive ? "Also: " : isFailure(run.outcome) ? "Failed: " : "Ended in: ";
+    text += step == nullptr ? "a step that is not in this log"
+                            : factsOf(step->kind).title + (" (line " + std::to_string(step->line) + ')');
+    return text + " [" + problem.failure->name + ']';
+}
+
+std::string causeOf(const Run& run, const Problem& problem)
+{
+    std::string text = filled(problem.failure->cause, run, run.stepOf(problem), problem.failure->name);
+    if (problem.tolerated) {
+        text += " With an up-to-date package the run counts as nothing to update all the same. The board was neither "
+                "checked nor updated.";
     }
-    if (script->result == StepResult::DONE) {
-        return versions + "uploaded and its install script run";
+    return text;
+}
+
+std::string remedyOf(const Run& run, const Problem& problem)
+{
+    return filled(problem.failure->remedy, run, run.stepOf(problem), problem.failure->name);
+}
+
+std::string filled(std::string text, const Run& run, const Step* step, std::string_view failure)
+{
+    std::optional<CommandStatus> status;
+    if (step != nullptr) {
+        const std::size_t action = failure == "stick-not-released" ? 0 : failure == "application-not-started" ? 1 : 2;
+        status = action < 2 && action < step->actions.size() ? step->actions[action].status : step->status;
     }
-    return versions + (script->result == StepResult::FAILED ? "uploaded, but its install script FAILED"
-                                                            : "uploaded; its install script's end is not told");
+    const bool waits = step != nullptr && step->kind == StepKind::WAIT_FOR_BOARD;
+    replace(text, "{package}", packageOf(run.mainHead));
+    replace(text, "{status}", status ? statusText(*status) : "its status");
+    replace(text, "{afterwards}", step == nullptr ? "run the update again." : factsOf(step->kind).afterwards);
+    replace(text, "{silence}", waits ? "The wait lasts 13 minutes and is silent: it may still be going on. " : "");
+    replace(text, "{panel}",
+            run.mainHead ? "If it does not go on: "
+                         : "See whether the panel still flashes blue in turn. If it does, wait. If not: ");
+    replace(text, "{service}",
+            run.service.failureShown ? " The service then lit FAIL, without a sound, released the stick and started "
+                                       "the application."
+                                     : "");
+    replace(text, "{panelFailures}", run.ledFailures == 0 ? "Commands" : counted(run.ledFailures, "command"));
+    replace(text, "{outcomeDark}", run.outcomeLedFailures > 0 ? ": the outcome was not, or not wholly, lit." : ".");
+    return text;
+}
+
+std::string gapText(const Run& run, Gap gap)
+{
+    switch (gap) {
+    case Gap::BEGINNING:
+        return "What came before: the log begins in the middle of this run.";
+    case Gap::END:
+        return "How this run ended: its last record is missing. What the operator saw is shown up to that point only.";
+    case Gap::OUTCOME:
+        return run.mainHead ? "Whether an update is offered: the records of a check are missing."
+                            : "Whether anything was updated: the records of a check are missing.";
+    case Gap::TORN_RECORDS:
+        return "What " + counted(run.tornRecords, "torn record") + " said (the first at line " +
+               std::to_string(run.firstTornLine) + ").";
+    case Gap::STEPS_LEFT_OUT:
+        return counted(run.stepsLeftOut, "step") + " more than a run has: left out here.";
+    case Gap::CLOCK:
+        return "How long this run took: the clock was set " + counted(run.clockJumps, "time") +
+               " while it went on. Times do not include that.";
+    case Gap::STATUSES:
+        return "Whether commands succeeded, the LEDs lit and the sound was heard: no status is available.";
+    case Gap::PACKAGE_INSTALLED:
+        return "Whether the package is really installed: exit code 0 also means a command that was killed or could not "
+               "be started. On the unit: dpkg -s " +
+               packageOf(run.mainHead) + '.';
+    case Gap::UPLOAD_ATTEMPTS: {
+        const Step* upload = run.find(StepKind::UPLOAD_BOARD);
+        return "Why " + counted(static_cast<std::uint64_t>(upload->failedAttempts), "upload attempt") + " failed" +
+               (upload->said.count > 0 ? ", beyond what scp said." : ".");
+    }
+    case Gap::BOARD_RUNS:
+        return "Whether the board runs the new version: it is not asked again. The next update's check shows it.";
+    case Gap::MARKER:
+        return "Whether the first-boot marker was there: its removal is logged either way.";
+    case Gap::TOOLS_WORDS:
+        return "What the tools themselves said: this log has none of their lines. The service's journal has "
+               "(harl-updater-tool log --journal).";
+    case Gap::FEEDBACK:
+        return "Whether the LEDs lit and the sound was heard: only commands that fail are logged.";
+    }
+    return "";
+}
+
+OperatorView operatorView(const Run& run)
+{
+    OperatorView view;
+    const OutcomeFacts& facts = factsOf(run.outcome);
+    view.meaning = facts.meaning;
+    const bool over = run.isDecided() || run.ended == RunEnd::BY_SERVICE_MANAGER;
+    if (run.outcome == Outcome::NONE && over) {
+        view.meaning = "not in this log: the records of its outcome are missing";
+    }
+    if (run.mainHead) {
+        view.meaning =
+            run.outcome == Outcome::PASSED ? "checked; whether an update is offered is not in this log" : view.meaning;
+        view.seen = "shown by the main head's own program";
+        return view;
+    }
+    const std::string color = isFailure(run.outcome) ? "fail" : "pass";
+    if (run.service.failureShown) {
+        view.meaning = isFailure(run.outcome) ? view.meaning : "FAILED: the updater ended before its outcome was known";
+        view.leds = {{"FAIL", "fail"}};
+        view.seen = "FAIL lit in fail colour; no sound";
+        return view;
+    }
+    if (run.outcome == Outcome::NONE && !over) {
+        if (run.ledFailures > 0) {
+            view.seen = "a panel that fails; no sound";
+        } else {
+            view.leds = {{"any", "blue"}};
+            view.seen = "REMOTE and MAIN flashing blue in turn while it went on; no sound";
+        }
+        return view;
+    }
+    if (run.outcome == Outcome::NONE) {
+        view.seen = "not in this log";
+        return view;
+    }
+    if (run.outcome == Outcome::FAILED || run.outcome == Outcome::PASSED) {
+        view.seen =
+            "REMOTE and MAIN, or " + std::string(color == "pass" ? "PASS" : "FAIL") + ", in " + color + " colour";
+    } else {
+        if (facts.bothLeds) {
+            view.leds = {{"REMOTE", color}, {"MAIN", color}};
+        } else {
+            view.leds = {{color == "pass" ? "PASS" : "FAIL", color}};
+        }
+        view.seen = (facts.bothLeds ? "REMOTE and MAIN" : view.leds.front().first) + " lit in " + color + " colour";
+    }
+    if (run.outcomeLedFailures > 0 && !run.statusesLost) {
+        view.leds.clear();
+        view.seen = "a dark or incomplete panel (meant: " + view.seen + ")";
+    }
+    const bool silent = run.soundFailed && !run.statusesLost;
+    view.sound = silent ? "" : color;
+    view.seen += silent ? "; no sound (meant: " + color + " sound)" : "; " + color + " sound";
+    return view;
 }
 
 void printRun(const Run& run, const std::string& source, std::ostream& out)
@@ -187,26 +449,30 @@ void printRun(const Run& run, const std::string& source, std::ostream& out)
     if (!run.version.empty()) {
         out << ", updater " << run.version;
     }
-    out << ", took " << durationText(run.end - run.begin) << '\n';
+    out << ", took " << durationText(run.elapsed);
+    if (run.clockJumps > 0) {
+        out << " (without what the clock was set by)";
+    }
+    out << '\n';
     out << "Outcome:  " << view.meaning << '\n';
     out << "Operator: " << view.seen << '\n';
     out << "Package:  " << packageText(run) << '\n';
     out << "Board:    " << boardText(run) << '\n';
     printSteps(run, out);
     if (run.failure) {
-        printProblem(run, *run.failure, run.failure->name == "unfinished" ? "Ended in: " : "Failed: ", out);
+        printProblem(run, *run.failure, out);
     }
     for (const Problem& problem : run.besides) {
-        printProblem(run, problem, "Besides: ", out);
+        printProblem(run, problem, out);
     }
     if (run.serviceManager.count > 0) {
         out << "\nThe service manager said:\n";
         printLines(run.serviceManager, out);
     }
-    if (!run.untold.empty()) {
-        out << "\nThis log cannot tell:\n";
-        for (const std::string& text : run.untold) {
-            printWrapped("  - ", text, out);
+    if (!run.gaps.empty()) {
+        out << "\nThis log cannot show:\n";
+        for (const Gap gap : run.gaps) {
+            printWrapped("  - ", gapText(run, gap), out);
         }
     }
 }

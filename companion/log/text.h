@@ -4,11 +4,35 @@
 
 #include <iosfwd>
 #include <string>
+#include <utility>
+#include <vector>
+
+/// The words for what is known of a run.
+
+/// What the operator saw and heard at the end of a run, as far as its log tells.
+struct OperatorView
+{
+    std::vector<std::pair<std::string, std::string>> leds; ///< name and colour: "REMOTE", "pass"; all others are dark
+    std::string sound;                                     ///< "pass", "fail", or empty for none
+    std::string seen;                                      ///< both in words
+    std::string meaning;                                   ///< in words
+};
+
+OperatorView operatorView(const Run& run);
 
 /// Prints a run, explained before, for people.
 ///
 /// @param source  where the log came from
 void printRun(const Run& run, const std::string& source, std::ostream& out);
+
+/// Prints `text` after `label`, its further lines indented as deep.
+void printWrapped(const std::string& label, const std::string& text, std::ostream& out);
+
+/// Name of an outcome for programs, such as "no-update"; "none" when a log does not reach it.
+const char* outcomeName(Outcome outcome);
+
+/// Name of a result for programs, such as "failed".
+const char* resultName(StepResult result);
 
 /// "07:15:33" of a ParsedRecord::time.
 std::string clockText(std::int64_t time);
@@ -16,14 +40,41 @@ std::string clockText(std::int64_t time);
 /// "21-11-2026 07:15:33" of a ParsedRecord::time.
 std::string dateText(std::int64_t time);
 
+/// "2026-11-21T07:15:33" of a ParsedRecord::time.
+std::string isoText(std::int64_t time);
+
 /// "12 s", "13 min 0 s", "1 h 2 min".
 std::string durationText(std::int64_t seconds);
 
 /// How a step came out in a few words, such as "FAILED: exit 100".
-std::string resultText(const Step& step);
+std::string resultText(const Run& run, const Step& step);
+
+/// "apt update", "wait 780 s".
+std::string actionText(const Action& action);
+
+/// "exit 0", "failed"; empty when the log does not tell.
+std::string actionStatusText(const Action& action);
+
+/// What other programs said, a line each: "scp: Connection closed (20 times)".
+std::vector<std::string> shownLines(const OtherLines& lines);
 
 /// "1.2.0 -> 1.3.0, installed": what became of the package in a run.
 std::string packageText(const Run& run);
 
 /// Likewise of the board.
 std::string boardText(const Run& run);
+
+/// "Failed: Refresh the package mirrors (line 23) [mirrors-unreachable]".
+std::string headingOf(const Run& run, const Problem& problem);
+
+std::string causeOf(const Run& run, const Problem& problem);
+std::string remedyOf(const Run& run, const Problem& problem);
+
+/// A text of the catalogue with the names and figures of this run in the place of {package} and the like.
+///
+/// @param step     that it is about, or null
+/// @param failure  the entry's name
+std::string filled(std::string text, const Run& run, const Step* step, std::string_view failure);
+
+/// What the log leaves open, in words.
+std::string gapText(const Run& run, Gap gap);

@@ -62,7 +62,7 @@ TEST_F(ToolProgram, UnreadableStickGivesTwo)
 TEST_F(ToolProgram, WrongUsageGivesTwoAndSaysWhatToDo)
 {
     for (const std::vector<std::string>& arguments : std::vector<std::vector<std::string>>{
-             {}, {"stik"}, {"stick", "--jsn"}, {"stick", "a", "b"}, {"unit", "a"}, {"--json"}}) {
+             {}, {"stik"}, {"stick", "--jsn"}, {"stick", "a", "b"}, {"unit", "a"}, {"--jsn"}, {"log", "--html"}}) {
         const CommandResult result = tool(arguments);
         EXPECT_EQ(result.exitCode, 2) << testing::PrintToString(arguments);
         EXPECT_EQ(result.output, "");
@@ -72,16 +72,42 @@ TEST_F(ToolProgram, WrongUsageGivesTwoAndSaysWhatToDo)
 
 TEST_F(ToolProgram, UnknownSubcommandIsNamed)
 {
-    EXPECT_THAT(tool({"stik"}).errors, HasSubstr("not expected: stik\n"));
-    EXPECT_THAT(tool({}).errors, HasSubstr("A subcommand is required"));
+    EXPECT_THAT(tool({"stik"}).errors, HasSubstr("harl-updater-tool: stik is not a command. Did you mean stick?"));
+    EXPECT_THAT(tool({"nonsense"}).errors, HasSubstr("harl-updater-tool: nonsense is not a command. See: "));
+    EXPECT_THAT(tool({}).errors, HasSubstr("Name a command: stick, unit, log or explain."));
+}
+
+TEST_F(ToolProgram, WrongUsageIsAnObjectForPrograms)
+{
+    const CommandResult result = tool({"log", "--json", "--nonsense"});
+    EXPECT_EQ(result.exitCode, 2);
+    const nlohmann::json object = nlohmann::json::parse(result.output);
+    EXPECT_EQ(object["command"], "log");
+    EXPECT_EQ(object["error"], "--nonsense is not an option of log.");
 }
 
 TEST_F(ToolProgram, VersionIsThatOfTheProject)
 {
-    const CommandResult result = tool({"--version"});
-    EXPECT_EQ(result.exitCode, 0);
-    EXPECT_EQ(result.output, "harl-updater-tool " VERSION "\n");
-    EXPECT_EQ(result.errors, "");
+    for (const char* option : {"--version", "-V"}) {
+        const CommandResult result = tool({option});
+        EXPECT_EQ(result.exitCode, 0);
+        EXPECT_EQ(result.output, "harl-updater-tool " VERSION "\n");
+        EXPECT_EQ(result.errors, "");
+    }
+}
+
+TEST_F(ToolProgram, HelpIsACommandToo)
+{
+    EXPECT_EQ(tool({"help"}).output, tool({"--help"}).output);
+    EXPECT_EQ(tool({"help", "log"}).output, tool({"log", "--help"}).output);
+    EXPECT_THAT(tool({"help", "log"}).output, HasSubstr("--strict"));
+}
+
+TEST_F(ToolProgram, ExplainPrintsAnEntryOrAll)
+{
+    EXPECT_THAT(tool({"explain", "board-host-key"}).output, HasSubstr("\n  Do now:   Make sure that it is the right"));
+    EXPECT_THAT(tool({"explain"}).output, HasSubstr("\n\nboard-host-key\n"));
+    EXPECT_EQ(tool({"explain", "nonsense"}).exitCode, 2);
 }
 
 TEST_F(ToolProgram, HelpNamesThePlaceOfTheStickAndTheExitStatuses)

@@ -95,12 +95,12 @@ class Pieces(Base):
         self.assertEqual(piece.count(b"Updater |"), 1)
         done = run_tool(text=piece)
         self.assertEqual(done.returncode, 1)
-        self.assertIn(b"Besides: a step that is not in this log [sound-failed]", done.stdout)
+        self.assertIn(b"Also: a step that is not in this log [sound-failed]", done.stdout)
         [problem] = json.loads(run_tool("--json", text=piece).stdout)["runs"][0]["besides"]
         self.assertEqual((problem["name"], problem["step"], problem["line"]), ("sound-failed", None, None))
         page = self.folder / "page.html"
         self.assertEqual(run_tool("--html", str(page), text=piece).returncode, 1)
-        self.assertIn("a step that is not in this log</b>", page.read_text())
+        self.assertIn("a step that is not in this log [sound-failed]</b>", page.read_text())
 
     def test_each_record_alone(self) -> None:
         log = (GOLDEN / "journal-short-board-disk-full.log").read_bytes()

@@ -28,12 +28,12 @@ expect() { # EXPECTED WORD...
 
 # The long options in a command's help.
 helped() { # [COMMAND]
-    "$tool" "$@" --help | grep -oE '^ +(-h,)?--[a-z]+' | grep -oE -- '--[a-z]+' | sort | paste -sd ' '
+    "$tool" "$@" --help | grep -oE '^ +(-[hV],)?--[a-z]+' | grep -oE -- '--[a-z]+' | sort | paste -sd ' '
 }
 
 commands=$("$tool" --help | sed -n '/^Subcommands:/,$s/^  \([a-z]*\) .*/\1/p' | sort | paste -sd ' ')
-[[ $commands == 'log stick unit' ]] || { echo "the tool's commands are \"$commands\"" && wrong=1; }
-expect "$(helped) $commands" ''
+[[ $commands == 'explain log stick unit' ]] || { echo "the tool's commands are \"$commands\"" && wrong=1; }
+expect "$(helped | sed 's/$/ explain help log stick unit/')" ''
 for command in $commands; do
     expect "$(helped "$command")" "$command" --
     expect "$(helped "$command")" "$command" --json --
@@ -46,6 +46,7 @@ expect stick s
 expect '' stick --panel
 expect --follow log --journal --f
 expect '--html' log --ht
+expect '--last --list' log --l
 expect '' nonsense --
 
 folder=$(mktemp -d)

@@ -17,7 +17,7 @@ public:
     {
         list.push_back("record " + std::to_string(record.line) + ' ' + std::to_string(record.time) + ' ' +
                        std::string(record.thread) + ' ' + std::string(record.file) + ' ' +
-                       std::string(record.operation) + ": " + std::string(record.message));
+                       std::string(record.operation) + ": " + std::string(record.message.value_or("(none)")));
     }
     void otherLine(std::uint64_t line, std::string_view program, std::string_view text) override
     {
@@ -113,13 +113,13 @@ TEST(LogParser, JournalMayLeaveOutAnEmptyMessage)
 {
     const std::string prefix = "Nov 21 07:35:33 unit harl-updater[123]: ";
     EXPECT_EQ(parsed(prefix + mirrors + prefix + mirrors + prefix + "\t\t\tOK\n"),
-              (List{"record 1" + mirrorsEvent, "record 2" + mirrorsEvent + "OK"}));
+              (List{"record 1" + mirrorsEvent + "(none)", "record 2" + mirrorsEvent + "OK"}));
 }
 
 TEST(LogParser, JournalMayHideAMessage)
 {
     const std::string prefix = "Nov 21 07:35:33 unit harl-updater[123]: ";
-    EXPECT_EQ(parsed(prefix + mirrors + prefix + "[12B blob data]\n"), List{"record 1" + mirrorsEvent});
+    EXPECT_EQ(parsed(prefix + mirrors + prefix + "[12B blob data]\n"), List{"record 1" + mirrorsEvent + "(none)"});
 }
 
 TEST(LogParser, ConsolesPrefixIsTakenOff)
@@ -145,8 +145,9 @@ TEST(LogParser, RecordBehindAnUnfinishedLineIsFound)
 TEST(LogParser, HeadWithoutItsMessageIsTorn)
 {
     EXPECT_EQ(parsed(mirrors + mirrors + "\t\t\tOK\n"),
-              (List{"torn 1", "record 1" + mirrorsEvent, "record 2" + mirrorsEvent + "OK"}));
-    EXPECT_EQ(parsed(mirrors + "E: broken\n"), (List{"torn 1", "record 1" + mirrorsEvent, "other 2 [] E: broken"}));
+              (List{"torn 1", "record 1" + mirrorsEvent + "(none)", "record 2" + mirrorsEvent + "OK"}));
+    EXPECT_EQ(parsed(mirrors + "E: broken\n"),
+              (List{"other 2 [] E: broken", "torn 1", "record 1" + mirrorsEvent + "(none)"}));
 }
 
 TEST(LogParser, HeadInterruptedByAnotherIsTorn)
@@ -158,7 +159,7 @@ TEST(LogParser, HeadInterruptedByAnotherIsTorn)
 TEST(LogParser, OpenRecordComesBeforeTheTornOneOfTheNextLine)
 {
     EXPECT_EQ(parsed(mirrors + "Updater | 02-03-20" + mirrors + "\t\t\tOK\n"),
-              (List{"torn 1", "record 1" + mirrorsEvent, "torn 2", "record 2" + mirrorsEvent + "OK"}));
+              (List{"torn 1", "record 1" + mirrorsEvent + "(none)", "torn 2", "record 2" + mirrorsEvent + "OK"}));
 }
 
 TEST(LogParser, MessageInterruptedByAHeadKeepsWhatIsThere)
@@ -174,7 +175,7 @@ TEST(LogParser, BeginningInTheMiddleOfARecordIsTorn)
 
 TEST(LogParser, EndInTheMiddleOfARecordIsTorn)
 {
-    EXPECT_EQ(parsed(mirrors), (List{"torn 1", "record 1" + mirrorsEvent}));
+    EXPECT_EQ(parsed(mirrors), (List{"torn 1", "record 1" + mirrorsEvent + "(none)"}));
     EXPECT_EQ(parsed(mirrors.substr(0, 25)), List{"torn 1"});
     EXPECT_EQ(parsed(mirrors + "\t\t\tO"), List{"record 1" + mirrorsEvent + "O"});
 }
@@ -197,6 +198,30 @@ TEST(LogParser, BlocksMakeNoDifference)
     for (const std::size_t size : {1, 2, 3, 7, 64, 4096}) {
         EXPECT_EQ(parsed(text, size), whole) << size;
     }
+}
+
+TEST(LogParser, MessageBehindAToolsLineIsItsHeads)
+{
+    EXPECT_EQ(parsed(mirrors + "W: slow\n\t\t\tOK\n"), (List{"other 2 [] W: slow", "record 1" + mirrorsEvent + "OK"}));
+}
+
+TEST(LogParser, BlanksEmptyLinesAndColoursMakeNoDifference)
+{
+    const List expected = {"record 1" + mirrorsEvent + "OK"};
+    const std::string blanks = "Updater | 02-03-2024 04-05-06  77 UpdateManager.cpp:271 static bool "
+                               "UpdateManager::updateMirrors()\n";
+    EXPECT_EQ(parsed(blanks + "OK\n"), expected);
+    EXPECT_EQ(parsed(mirrors + "\n\t\t\tOK\n\n"), expected);
+    EXPECT_EQ(parsed("\x1b[1;31m" + mirrors + "\x1b[0m\t\t\tOK\x1b[0m\n"), expected);
+    EXPECT_EQ(parsed("nov. 21 07:35:33 unit harl-updater[412]: " + mirrors +
+                     "nov. 21 07:35:33 unit harl-updater[412]: #011#011#011OK\n"),
+              expected);
+}
+
+TEST(LogParser, EmptyMessageMayLackItsBlanks)
+{
+    EXPECT_EQ(parsed(mirrors + "\n" + mirrors + "\t\t\tOK\n"),
+              (List{"record 1" + mirrorsEvent, "record 3" + mirrorsEvent + "OK"}));
 }
 
 TEST(LogParser, OverlongLineIsCutAndTheNextOneRead)

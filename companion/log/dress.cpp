@@ -1,0 +1,219 @@
+#include "log/dress.h"
+
+#include "log/vocabulary.h"
+
+#include <algorithm>
+
+#include <nlohmann/json.hpp>
+
+namespace
+{
+
+const std::string_view binaryMessage = "MESSAGE";          // in a line of its own: its bytes follow
+const std::size_t enoughToJudge = std::size_t{128} * 1024; // bytes, to find out the order of the lines
+
+bool startsWith(std::string_view text, std::string_view start)
+{
+    return text.substr(0, start.size()) == start;
+}
+
+/// Counts the records that say something.
+class Counter : public LogSink
+{
+public:
+    void record(const ParsedRecord& record) override
+    {
+        count += record.message && meaningOf(record.operation, record.message).event != Event::NONE ? 1 : 0;
+    }
+    void otherLine(std::uint64_t, std::string_view, std::string_view) override {}
+    void torn(std::uint64_t) override {}
+
+    std::uint64_t count = 0;
+};
+
+std::uint64_t recordsIn(std::string_view text)
+{
+    Counter counter;
+    LogParser parser(counter);
+    parser.feed(text);
+    parser.finish();
+    return counter.count;
+}
+
+/// The lines of `text`, last one first.
+std::string turnedRound(std::string_view text)
+{
+    std::string result;
+    result.reserve(text.size() + 1);
+    while (!text.empty()) {
+        if (text.back() == '\n') {
+            text.remove_suffix(1);
+        }
+        const std::size_t begin = text.rfind('\n') + 1; // 0 without one
+        result.append(text.substr(begin)).append("\n");
+        text = text.substr(0, begin);
+    }
+    return result;
+}
+
+/// A journal field's value; bytes that are no text come as numbers.
+std::string valueOf(const nlohmann::json& entry, const char* name)
+{
+    const auto field = entry.find(name);
+    if (field == entry.end()) {
+        return "";
+    }
+    if (field->is_string()) {
+        return field->get<std::string>();
+    }
+    std::string bytes;
+    for (const auto& byte : field->is_array() ? *field : nlohmann::json::array()) {
+        bytes += byte.is_number_unsigned() ? static_cast<char>(byte.get<unsigned>()) : ' ';
+    }
+    return bytes;
+}
+
+} // namespace
+
+void Dress::feed(std::string_view block)
+{
+    mBytes += block.size();
+    if (mFormat == Format::UNKNOWN) {
+        const std::string_view start = block.substr(0, 300);
+        const bool json = startsWith(start, "{") || startsWith(start, "data: {") || startsWith(start, "\x1e");
+        mFormat = startsWith(start, "__CURSOR=")                                ? Format::FIELDS
+                  : json                                                        ? Format::JSON
+                  : start.substr(0, start.find('\n')).find("[s=") != start.npos ? Format::VERBOSE
+                                                                                : Format::PLAIN;
+    }
+    if (mFormat == Format::PLAIN) {
+        hand(block);
+        return;
+    }
+    while (!block.empty()) {
+        if (mMessage == binaryMessage) {
+            takeBinary(block);
+            continue;
+        }
+        const std::size_t end = block.find('\n');
+        mPartial.append(block.substr(0, end));
+        if (mPartial.size() > 4 * LogParser::longestLine) {
+            mPartial.resize(4 * LogParser::longestLine);
+        }
+        block.remove_prefix(std::min(end == std::string_view::npos ? block.size() : end + 1, block.size()));
+        if (end != std::string_view::npos) {
+            takeEntryLine(mPartial);
+            mPartial.clear();
+        }
+    }
+}
+
+void Dress::finish()
+{
+    if (mFormat != Format::PLAIN) {
+        takeEntryLine(mPartial);
+        endEntry();
+    }
+    const std::string held = std::exchange(mHeld, "");
+    const bool reversed = mReversed || (!mOrderKnown && recordsIn(turnedRound(held)) > recordsIn(held));
+    mParser.feed(reversed ? turnedRound(held) : held);
+    mParser.finish();
+}
+
+/// Takes a line of a journal's entry.
+void Dress::takeEntryLine(std::string_view line)
+{
+    if (mFormat == Format::JSON) {
+        for (const std::string_view mark : {"data: ", "\x1e"}) {
+            line.remove_prefix(startsWith(line, mark) ? mark.size() : 0);
+        }
+        mObject.append(line);
+        if (mObject.size() > 16 * LogParser::longestLine) {
+            mObject.clear();
+        }
+        if (line.empty() || line.back() != '}') {
+            return;
+        }
+        const nlohmann::json entry = nlohmann::json::parse(mObject, nullptr, false);
+        if (entry.is_object()) {
+            mProgram = valueOf(entry, "SYSLOG_IDENTIFIER");
+            mProcess = valueOf(entry, "_PID");
+            mMessage = valueOf(entry, "MESSAGE") + '\n';
+            mObject.clear();
+            endEntry();
+        } else if (startsWith(line, "{")) {
+            mObject.clear(); // one that is cut off
+        }
+        return;
+    }
+    const bool ends = mFormat == Format::VERBOSE ? !line.empty() && line.front() != ' ' : line.empty();
+    if (ends) {
+        endEntry();
+    } else {
+        takeField(line.substr(std::min(line.find_first_not_of(mFormat == Format::VERBOSE ? " " : ""), line.size())));
+    }
+}
+
+/// Takes what `block` has of a message that is no plain text: its length in eight bytes, the lowest first, itself, and
+/// a line end.
+void Dress::takeBinary(std::string_view& block)
+{
+    const std::size_t lengthSize = 8;
+    std::size_t wanted = lengthSize;
+    if (mPartial.size() >= lengthSize) {
+        for (std::size_t byte = 0; byte < 4; ++byte) {
+            wanted += std::size_t{static_cast<unsigned char>(mPartial[byte])} << (8 * byte);
+        }
+        wanted = std::min(wanted, 4 * LogParser::longestLine) + 1;
+    }
+    const std::size_t taken = std::min(wanted - mPartial.size(), block.size());
+    mPartial.append(block.substr(0, taken));
+    block.remove_prefix(taken);
+    if (mPartial.size() == wanted && wanted > lengthSize) {
+        mMessage = mPartial.substr(lengthSize);
+        mPartial.clear();
+    }
+}
+
+void Dress::takeField(std::string_view field)
+{
+    if (field == binaryMessage) {
+        mMessage = field;
+    } else if (startsWith(field, "MESSAGE=")) {
+        mMessage = std::string(field.substr(8)) + '\n';
+    } else if (startsWith(field, "SYSLOG_IDENTIFIER=")) {
+        mProgram = field.substr(18);
+    } else if (startsWith(field, "_PID=")) {
+        mProcess = field.substr(5);
+    }
+}
+
+/// Hands over an entry as journalctl's short formats show it.
+void Dress::endEntry()
+{
+    if (!mMessage.empty()) {
+        hand("0.0 - " + mProgram + '[' + (mProcess.empty() ? "0" : mProcess) + "]: " + mMessage);
+    }
+    mProgram.clear();
+    mProcess.clear();
+    mMessage.clear();
+}
+
+/// Hands text to the parser once the order of its lines is known.
+void Dress::hand(std::string_view text)
+{
+    if (mOrderKnown && !mReversed) {
+        mParser.feed(text);
+        return;
+    }
+    if (!tooLarge()) {
+        mHeld.append(text);
+    }
+    if (!mOrderKnown && mHeld.size() >= enoughToJudge) {
+        mOrderKnown = true;
+        mReversed = recordsIn(turnedRound(mHeld)) > recordsIn(mHeld);
+        if (!mReversed) {
+            mParser.feed(std::exchange(mHeld, ""));
+        }
+    }
+}

@@ -1,0 +1,66 @@
+#pragma once
+
+#include "log/step.h"
+
+#include <optional>
+#include <string_view>
+
+/// What a record of the updater says.
+enum class Event {
+    NONE,  ///< Nothing that matters here, or not the updater's words.
+    NOTED, ///< It belongs to its step and says nothing more.
+    VERSION,
+    RUN_BEGINS,
+    ENDED_BY_ITSELF,
+    MAIN_CHECKS,   ///< the main head's program begins its checks
+    MAIN_INSTALLS, ///< likewise the installation of a part
+    MAIN_FINISHED,
+    COMMAND, ///< a command line; its exit code follows
+    EXIT_CODE,
+    ATTEMPT, ///< a command line that the updater tries several times
+    ATTEMPT_FAILED,
+    RAW_STATUS, ///< of the command that the step runs
+    SUCCEEDED,
+    FAILED,
+    PACKAGE_DIFFERS,
+    PACKAGE_SAME,
+    BOARD_DIFFERS,
+    BOARD_SAME,
+    BOARD_VERSIONS,
+    BOARD_NOT_READ,
+    STICK_NOT_READ,
+    TEAMVIEWER_REQUESTED,
+    TEAMVIEWER_NOT_REQUESTED,
+    MIRRORS_REPORTED, ///< ERROR_UPDATE_MIRRORS comes next
+    CHECK_REPORTED,   ///< ERROR_CHECK_UPDATE
+    PACKAGE_REPORTED, ///< ERROR_INSTALL_PACKAGE
+    BOARD_REPORTED,   ///< ERROR_INSTALL_QUORB
+    MARKER_REMOVED,
+    RESULT,
+    ERROR,
+    OUTCOME_SHOWN,
+    STOPS_UPDATER,
+    SOUND_FAILED,
+    PANEL_FAILED,
+};
+
+/// A record's event and what its message holds besides.
+struct Meaning
+{
+    Event event = Event::NONE;
+    std::optional<StepKind> step; ///< the one that the record belongs to
+    const char* command = "";     ///< that begins with the record, where the message does not name it
+    std::string_view rest;        ///< of the message, after the words that are always the same
+    std::optional<long> number;   ///< at the start of `rest`
+};
+
+/// The meaning of a record.
+///
+/// @param message  empty optional: it is not in the log
+Meaning meaningOf(std::string_view operation, std::optional<std::string_view> message);
+
+/// True when `message` is one that `operation` writes and that says something.
+bool isMessageOf(std::string_view operation, std::string_view message);
+
+/// True for an operation that also logs the lines of a command's output.
+bool logsOutput(std::string_view operation);

@@ -26,7 +26,8 @@ public:
     void record(const ParsedRecord& record) override
     {
         note(record.line, "record");
-        for (const std::string_view text : {record.thread, record.file, record.operation, record.message.value_or("(none)")}) {
+        for (const std::string_view text :
+             {record.thread, record.file, record.operation, record.message.value_or("(none)")}) {
             expect(text.find('\n') == std::string_view::npos, "a record's text in one line");
             mText << '\t' << text;
         }

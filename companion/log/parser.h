@@ -83,7 +83,7 @@ private:
     bool mEmptySeen = false; // an empty line after the head
     bool mCut = false;
     bool mIndented = false; // some message was
-    std::string mPlain; // what plain() has made of a line
+    std::string mPlain;     // what plain() has made of a line
 
     std::string mDate; // of the last head, and the time its day began
     std::int64_t mMidnight = 0;

@@ -1,0 +1,28 @@
+#pragma once
+
+#include <string>
+
+/// What became of one exploration.
+struct Found
+{
+    long schedules = 0;
+    long late = 0;       ///< those in which the stop came before the flashing was started
+    long lost = 0;       ///< those in which the notification came before the wait
+    long hangs = 0;      ///< those in which main() did not return
+    std::string finding; ///< what does not hold in the last schedule; empty when everything held in all
+};
+
+enum class Ending { NothingToUpdate, Updated, ReadFailure, InstallFailure };
+
+/// Explores the program's whole run, up to its first finding. In each schedule the update's thread must start before
+/// the flashing, and notify under the lock.
+///
+/// The update begins with commands that take far longer than the main thread needs from there to its wait. The
+/// schedules in which the update outruns it all the same are known: the flashing is started `late`, and goes on, or the
+/// notification is `lost`, and main() does not return. In every other one main() must return, the panel's last state
+/// must be the outcome, and no other thread may send a byte once the update's thread has begun to show it.
+Found exploreUpdate(Ending ending);
+
+/// Explores two rounds of flashing: started, stopped, waited for. `late` counts the rounds whose thread found itself
+/// stopped before its first look.
+Found exploreFlashing();

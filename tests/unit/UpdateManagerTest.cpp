@@ -201,6 +201,17 @@ TEST_F(Manager, UpdateOfTheMainHeadWaitsForTheCheckAndReturnsBeforeTheInstallati
     platform::waitFor([] { return noted("result:1"); });
 }
 
+TEST_F(Manager, SecondInstallationOfTheMainHeadWaitsForTheFirst)
+{
+    script(teamViewerScriptCommand, {{0, "", true, [] { platform::delay(100); }}});
+    manager->update({{UpdateManager::COMPONENT_TEAMVIEWER, "TV", "1", "2"}}, false);
+    const int before = platform::released(sizeof(std::thread));
+    manager->update({}, false);
+    EXPECT_EQ(platform::released(sizeof(std::thread)) - before, 1) << "the first one's thread object";
+    EXPECT_TRUE(noted("result:1")) << "update() did not wait for the first installation";
+    platform::waitFor([] { return entries("result:").size() == 2; });
+}
+
 TEST_F(Manager, ClosingStepOfTheMainHeadDoesNotWaitForTheInstallation)
 {
     script(mirrorsCommand, {exits(100)});

@@ -230,24 +230,27 @@ TEST_F(Runner, FailedInstallLogsCodeAndOutputInOneRecord)
 
 TEST_F(Runner, RecordsOfManyThreadsStayWhole)
 {
+    const std::size_t speakers = 8;
+    const std::size_t each = 25;
     std::vector<std::thread> threads;
-    for (int i = 0; i < 8; ++i) {
+    threads.reserve(speakers);
+    for (std::size_t i = 0; i < speakers; ++i) {
         threads.emplace_back([i] {
-            for (int j = 0; j < 25; ++j) {
-                LOG() << std::string(static_cast<std::size_t>(i * 1000), 'x') << j;
+            for (std::size_t j = 0; j < each; ++j) {
+                LOG() << std::string(i * 1000, 'x') << j;
                 std::this_thread::sleep_for(std::chrono::milliseconds(1));
             }
         });
     }
     // Read while they speak: the socket holds only so many.
     std::size_t records = 0;
-    while (records < 8 * 25) {
+    while (records < speakers * each) {
         records += log.messages().size();
     }
     for (std::thread& thread : threads) {
         thread.join();
     }
-    EXPECT_EQ(records, 8U * 25U);
+    EXPECT_EQ(records, speakers * each);
 }
 
 TEST(Log, WritesAgainAfterARecordThatCouldNotBeWritten)
@@ -335,11 +338,12 @@ TEST(Pause, IsNotShortenedBySignals)
 
 TEST(Panel, MissingToolIsLoggedForEachLed)
 {
-    const std::string path = std::getenv("PATH");
+    const char* path = std::getenv("PATH");
+    const std::string before = path == nullptr ? "" : path;
     const Output log;
     setenv("PATH", "/nonexistent", 1);
     LedManager::turnOffAll();
-    setenv("PATH", path.c_str(), 1);
+    setenv("PATH", before.c_str(), 1);
     const Messages messages = log.messages();
     ASSERT_EQ(messages.size(), 14U);
     EXPECT_EQ(messages[0], "system returned false: i2cset -y 0 0x07 0x10 c ; i2cset -y 0 0x07 0x0 c");

@@ -154,9 +154,9 @@ Found exploreUpdate(Ending ending)
         const bool returned = scheduler.run([] { updaterMain(0, nullptr); });
         forgetThreads();
         ++found.schedules;
-        found.late += late;
-        found.lost += lost;
-        found.hangs += !returned;
+        found.late += late ? 1 : 0;
+        found.lost += lost ? 1 : 0;
+        found.hangs += returned ? 0 : 1;
         expect(late || returned || lost, "main() does not return");
         expect(late || !returned || !lost, "main() returns without the notification");
         expect(late || panel.lit() == outcomeOf(ending), "the panel does not show the outcome");
@@ -200,7 +200,7 @@ Found exploreFlashing()
                 LedManager::instance()->stopFlashRemoteAndMainInBlue();
                 LedManager::instance()->waitForFlashingEnd();
                 waitedFor = true;
-                found.late += bytes == 4; // both LEDs off, and nothing else
+                found.late += bytes == 4 ? 1 : 0; // both LEDs off, and nothing else
                 if (bytes % 32 != 4 || !panel.lit().empty()) {
                     found.finding = "a round does not end with both LEDs off";
                 }

@@ -91,8 +91,16 @@ const char* severityWord(Severity severity)
     return "";
 }
 
-Report::Report(std::string command, std::string subject) : mCommand(std::move(command)), mSubject(std::move(subject))
+Report::Report(std::string command, std::string subject, std::string good)
+    : mCommand(std::move(command)), mSubject(std::move(subject)), mGood(std::move(good))
 {
+}
+
+std::string Report::fact(const std::string& name) const
+{
+    const auto found =
+        std::find_if(mFacts.begin(), mFacts.end(), [&](const Fact& candidate) { return candidate.name == name; });
+    return found != mFacts.end() && found->value.is_string() ? found->value.get<std::string>() : "";
 }
 
 void Report::addFact(std::string name, std::string label, std::string text, nlohmann::ordered_json value)
@@ -146,22 +154,24 @@ void Report::print(std::ostream& out) const
                 continue;
             }
             out << '\n' << severityWord(severity) << ": " << finding.what << " [" << finding.check << "]\n";
-            out << "  The updater: " << finding.effect << '\n';
+            if (!finding.effect.empty()) {
+                out << "  The updater: " << finding.effect << '\n';
+            }
             if (!finding.remedy.empty()) {
-                out << "  To mend it:  " << finding.remedy << '\n';
+                out << "  Fix:         " << finding.remedy << '\n';
             }
         }
     }
     out << '\n' << mSubject;
     switch (status()) {
     case STATUS_FIT:
-        out << " is fit for an update.\n";
+        out << " is " << mGood << ".\n";
         break;
     case STATUS_NOT_FIT:
-        out << " is NOT fit for an update.\n";
+        out << " is NOT " << mGood << ".\n";
         break;
     case STATUS_UNCHECKED:
-        out << ": not everything could be checked, whether it is fit is open.\n";
+        out << ": not everything could be checked, whether it is " << mGood << " is open.\n";
         break;
     }
 }

@@ -45,7 +45,8 @@ public:
 
     /// @param command  name of the check for programs
     /// @param subject  what was checked, printable
-    Report(std::string command, std::string subject);
+    /// @param good     what it is without an error
+    Report(std::string command, std::string subject, std::string good = "fit for an update");
 
     /// Adds a fact: `name` in snake_case for programs, `label` and `text` for people, `value` for programs.
     void addFact(std::string name, std::string label, std::string text, nlohmann::ordered_json value);
@@ -54,6 +55,9 @@ public:
     void addFact(const std::string& name, const std::string& label, const std::string& text);
 
     void add(Finding finding);
+
+    /// The text of a fact for programs; empty when there is none of this name.
+    std::string fact(const std::string& name) const;
 
     const std::vector<Finding>& findings() const { return mFindings; }
     Status status() const;
@@ -77,6 +81,7 @@ private:
 
     std::string mCommand;
     std::string mSubject;
+    std::string mGood;
     std::vector<Fact> mFacts;
     std::vector<Finding> mFindings;
 };

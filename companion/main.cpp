@@ -1,3 +1,5 @@
+#include "check/check.h"
+#include "check/verify.h"
 #include "findings.h"
 #include "log/catalogue.h"
 #include "log/log_command.h"
@@ -44,7 +46,7 @@ std::string usageText(const CLI::App& app, const CLI::ParseError& error)
     const std::vector<CLI::App*> parsed = app.get_subcommands();
     const std::vector<std::string> rest = app.remaining(true);
     if (parsed.empty() && rest.empty()) {
-        return "Name a command: stick, unit, log or explain.";
+        return "Name a command: stick, unit, check, verify, log or explain.";
     }
     if (parsed.empty()) {
         std::string text = rest.front() + " is not a command.";
@@ -97,6 +99,20 @@ int run(std::vector<std::string> arguments)
     unit->footer("Exit status: 0 fit or test passed, 1 not fit or test failed, 2 wrong usage, test refused or not "
                  "everything could be checked.\n");
 
+    std::string checkPath = stickMountPoint;
+    CLI::App* check = app.add_subcommand("check", "Show what an update would do now: unit and stick. Run it as root.");
+    check->add_option("PATH", checkPath, "the folder that the stick is mounted at")->capture_default_str();
+    check->add_flag("--json", json, "print one JSON object");
+    check->footer(
+        "Exit status: 0 the update will likely succeed, 1 it will not, 2 wrong usage or not everything could be "
+        "checked.\n");
+
+    VerifyOptions verifyOptions;
+    CLI::App* verify = app.add_subcommand("verify", "Show whether this unit is well after an update. Run it as root.");
+    verify->add_flag("--record", verifyOptions.record, "print one line for the service's journal");
+    verify->add_flag("--json", json, "print one JSON object");
+    verify->footer("Exit status: 0 well, 1 not well, 2 wrong usage or not everything could be checked.\n");
+
     LogOptions logOptions;
     CLI::App* log = app.add_subcommand("log", "Explain the updater's log: what happened, why, and what to do now.");
     log->add_option("FILE", logOptions.files, "the log, or several in their order; - for standard input");
@@ -147,6 +163,13 @@ int run(std::vector<std::string> arguments)
         return printCatalogue(failure, json, std::cout)
                    ? 0
                    : refuse("explain", json, escaped(failure) + " is not a name of the catalogue.");
+    }
+    if (check->parsed()) {
+        return runCheck(checkPath, json, thisUnit(), std::cout, std::cerr);
+    }
+    if (verify->parsed()) {
+        verifyOptions.json = json;
+        return runVerify(verifyOptions, thisUnit(), std::cout);
     }
     unitOptions.json = json;
     return runUnit(unitOptions, thisUnit(), std::cout, std::cerr);

@@ -203,6 +203,30 @@ const Failure failures[] = {
      "Get the whole log (harl-updater-tool log --journal)."},
     {"start-missing", "", "The run came to its end, but whether the application was started again is not in this log.",
      "Check the application: systemctl status harl."},
+    {"run-not-allowed", "",
+     "A package's earlier installation was broken off and could not be finished, and no other version of it is offered. "
+     "The updater would have taken it for up to date: the service did not run it.",
+     "On the unit run: dpkg --configure -a, and correct what it names; or offer another version. Then run the update "
+     "again."},
+    {"installation-repaired", "", "An earlier installation was broken off; the service finished it before this run.",
+     "Nothing is to be done; the lines of the service show what it did."},
+    {"repair-failed", "",
+     "An earlier installation was broken off, and the service could not finish it before this run.",
+     "On the unit run: dpkg --configure -a, and correct what it names."},
+    {"time-used-up", "", "A command of this step did not end in its time; the service ended it.",
+     "Read what the service said below; run harl-updater-tool unit and follow its remedies."},
+    {"outcome-shown-again", "",
+     "The panel had not taken the outcome, or not all of it; the service showed it after the run.",
+     "Run harl-updater-tool unit --panel if it happens again."},
+    {"outcome-not-shown", "", "The panel did not take the outcome, neither from the updater nor from the service.",
+     "Run harl-updater-tool unit: it checks whether i2cset is there and the bus answers."},
+    {"stick-in-use", "", "Something still used the stick after the run; the service detached it.",
+     "Pull it out only when nothing uses it: fuser -m /root/USB_MOUNT."},
+    {"tool-still-at-work", "", "A tool was still at work after all waits; the instrument came back beside it.",
+     "Wait until it has ended: ps ax. Then run harl-updater-tool verify."},
+    {"unit-not-well", "", "After the run {unit}.", "Run harl-updater-tool verify and follow its remedies."},
+    {"unit-not-verified", "", "After the run not everything could be checked: {unit}.",
+     "Run harl-updater-tool verify on the unit."},
     {"statuses-lost", "",
      "The updater was started so that no command's status was available (SIGCHLD ignored): the failures and the exit "
      "codes of 0 in this log mean nothing, and no upload counts as done.",
@@ -366,8 +390,21 @@ bool decides(const Step& step, Outcome outcome)
     }
 }
 
+/// What the service's words point to.
+const std::pair<ServiceEvent, const char*> serviceProblems[] = {
+    {ServiceEvent::REPAIRED, "installation-repaired"},      {ServiceEvent::REPAIR_FAILED, "repair-failed"},
+    {ServiceEvent::SHOWN_AGAIN, "outcome-shown-again"},     {ServiceEvent::PANEL_REFUSED, "outcome-not-shown"},
+    {ServiceEvent::STICK_IN_USE, "stick-in-use"},           {ServiceEvent::WENT_ON, "tool-still-at-work"},
+    {ServiceEvent::NOT_STARTED, "application-not-started"}, {ServiceEvent::UNIT_NOT_WELL, "unit-not-well"},
+    {ServiceEvent::UNIT_OPEN, "unit-not-verified"},
+};
+
 void addFailure(Run& run)
 {
+    if (run.service.has(ServiceEvent::NOT_ALLOWED)) {
+        run.failure = {entry("run-not-allowed"), 0};
+        return;
+    }
     if (run.steps.empty()) {
         return;
     }
@@ -395,6 +432,16 @@ void addFailure(Run& run)
 void addBesides(Run& run)
 {
     const bool named = run.failure && run.failure->failure == entry("statuses-lost");
+    for (std::size_t index = 0; index < run.steps.size(); ++index) {
+        if (run.steps[index].timeUsedUp) {
+            run.besides.push_back({entry("time-used-up"), index});
+        }
+    }
+    for (const auto& [event, name] : serviceProblems) {
+        if (run.service.has(event)) {
+            run.besides.push_back({entry(name), run.steps.size()});
+        }
+    }
     if (run.statusesLost) {
         // Every command seems to have failed then, also those that did their work.
         if (!named) {
@@ -526,7 +573,9 @@ void explain(Run& run)
 
 bool wentWell(const Run& run)
 {
-    return run.outcome != Outcome::NONE && !isFailure(run.outcome) && run.applicationStarted.value_or(false) &&
+    const bool bad = run.service.has(ServiceEvent::UNIT_NOT_WELL) || run.service.has(ServiceEvent::NOT_STARTED) ||
+                     run.service.has(ServiceEvent::FAILURE_SHOWN) || run.service.has(ServiceEvent::NOT_ALLOWED);
+    return !bad && run.outcome != Outcome::NONE && !isFailure(run.outcome) && run.applicationStarted.value_or(false) &&
            (run.ended == RunEnd::BY_SERVICE_MANAGER || run.ended == RunEnd::BY_ITSELF);
 }
 

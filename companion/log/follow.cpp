@@ -13,12 +13,18 @@
 namespace
 {
 
-const std::int64_t longSilence = 1800; // s; more than twice the longest wait
-const std::size_t barLength = 30;      // columns
+const std::size_t barLength = 30; // columns
 
 bool isOver(const Run& run)
 {
     return run.ended != RunEnd::NOT_SEEN;
+}
+
+/// True when nothing has come for longer than the step can take.
+bool isOverdue(const Run& run, std::int64_t now)
+{
+    const Step& step = run.steps.back();
+    return now - std::max(run.end, step.start) > factsOf(step.kind).longest;
 }
 
 std::string barText(std::int64_t elapsed, std::int64_t expected)
@@ -42,9 +48,6 @@ std::string attemptText(const Step& step)
 std::string elapsedText(std::int64_t elapsed, const std::optional<std::int64_t>& expected)
 {
     const std::string text = durationText(std::max<std::int64_t>(elapsed, 0));
-    if (elapsed > longSilence) {
-        return text + " without a record: the run has probably ended early";
-    }
     return text + (expected ? " of " + durationText(*expected) : ", no fixed length");
 }
 
@@ -147,13 +150,13 @@ void Follower::show(const Run* run, std::int64_t now)
         const Step& step = run->steps.back();
         state = std::to_string(run->number) + ' ' + std::to_string(run->steps.size()) + ' ' +
                 std::to_string(step.failedAttempts) + ' ' + std::to_string(static_cast<int>(step.result)) + ' ' +
-                std::to_string(static_cast<int>(run->ended));
+                std::to_string(static_cast<int>(run->ended)) + (running && isOverdue(*run, now) ? " overdue" : "");
     }
     if (state != mShown) {
         mShown = state;
         showChange(run, now);
     }
-    if (running && mTerminal && !mJson) {
+    if (running && mTerminal && !mJson && !isOverdue(*run, now)) {
         showBar(*run, now);
     }
     mOut.flush();
@@ -163,7 +166,8 @@ void Follower::showChange(const Run* run, std::int64_t now)
 {
     const bool known = run != nullptr && !run->steps.empty();
     const bool over = known && isOver(*run);
-    const char* state = over && mEnded ? "ended" : known && !over ? "running" : "waiting";
+    const bool overdue = known && !over && isOverdue(*run, now);
+    const char* state = over && mEnded ? "ended" : overdue ? "overdue" : known && !over ? "running" : "waiting";
     if (mJson) {
         nlohmann::ordered_json object = {{"state", state}, {"time", isoText(now)}};
         if (known) {
@@ -181,6 +185,10 @@ void Follower::showChange(const Run* run, std::int64_t now)
             object["next"] = next ? nlohmann::ordered_json(factsOf(*next).name) : nlohmann::ordered_json();
             object["next_if_versions_differ"] = nextDependsOnCheck(*run);
             object["outcome"] = outcomeName(run->outcome);
+            Run explained = *run;
+            explain(explained);
+            object["failure"] =
+                over && explained.failure ? problemToJson(explained, *explained.failure) : nlohmann::ordered_json();
         }
         mOut << object.dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace) << '\n';
         return;
@@ -198,6 +206,15 @@ void Follower::showChange(const Run* run, std::int64_t now)
         mOut << (mEnded ? "Ended at " : "No update is going on. The last one ended at ")
              << (mEnded ? clockText(run->end) : dateText(run->end)) << ": " << view.meaning << " (" << view.seen << ")."
              << (mEnded ? "\n" : " Waiting for the next.\n");
+        if (mEnded) {
+            Run ended = *run;
+            explain(ended);
+            if (ended.failure) {
+                mOut << headingOf(ended, *ended.failure) << '\n';
+                printWrapped("  Why:     ", causeOf(ended, *ended.failure), mOut);
+                printWrapped("  Do now:  ", remedyOf(ended, *ended.failure), mOut);
+            }
+        }
         return;
     }
     const Step& step = run->steps.back();
@@ -206,6 +223,12 @@ void Follower::showChange(const Run* run, std::int64_t now)
         mOut << ": " << resultText(*run, step);
     } else if (const std::optional<std::int64_t> expected = mExpected.of(step.kind)) {
         mOut << ", " << durationText(*expected) << " expected";
+    }
+    if (overdue) {
+        mOut << "; no record for " << durationText(now - run->end)
+             << ", longer than this step takes: the updater has most likely ended. Do now: "
+             << factsOf(step.kind).afterwards << '\n';
+        return;
     }
     mOut << nextText(*run) << '\n';
 }

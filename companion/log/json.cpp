@@ -40,16 +40,6 @@ Json stepToJson(const Run& run, const Step& step)
             {"tools_said", linesToJson(step.said)}};
 }
 
-Json problemToJson(const Run& run, const Problem& problem)
-{
-    const Step* step = run.stepOf(problem);
-    return {{"name", problem.failure->name},
-            {"step", step == nullptr ? Json() : Json(factsOf(step->kind).name)},
-            {"line", step == nullptr ? Json() : Json(step->line)},
-            {"why", causeOf(run, problem)},
-            {"remedy", remedyOf(run, problem)}};
-}
-
 Json versionsToJson(const Versions& versions, const std::string& text)
 {
     return {{"read", versions.found()},
@@ -75,6 +65,16 @@ const char* endName(RunEnd end)
 }
 
 } // namespace
+
+nlohmann::ordered_json problemToJson(const Run& run, const Problem& problem)
+{
+    const Step* step = run.stepOf(problem);
+    return {{"name", problem.failure->name},
+            {"step", step == nullptr ? Json() : Json(factsOf(step->kind).name)},
+            {"line", step == nullptr ? Json() : Json(step->line)},
+            {"why", causeOf(run, problem)},
+            {"remedy", remedyOf(run, problem)}};
+}
 
 nlohmann::ordered_json runToJson(const Run& run, const std::string& source)
 {
@@ -118,7 +118,8 @@ nlohmann::ordered_json runToJson(const Run& run, const std::string& source)
             {"steps", steps},
             {"failure", run.failure ? problemToJson(run, *run.failure) : Json()},
             {"besides", besides},
-            {"service_manager_said", linesToJson(run.serviceManager)},
+            {"unit_after_run", run.service.unit.empty() ? Json() : Json(run.service.unit)},
+            {"service_manager_said", linesToJson(run.service.lines)},
             {"torn_records", run.tornRecords},
             {"other_lines", run.otherLines},
             {"cannot_tell", gaps}};

@@ -265,6 +265,20 @@ bool RunBuilder::beginsRun(const Meaning& meaning, bool whole) const
 
 void RunBuilder::otherLine(std::uint64_t line, std::string_view program, std::string_view text)
 {
+    const std::optional<ServiceEvent> event = serviceEventOf(text);
+    if (event && startsWith(text, "prepare: ")) { // the next run's
+        mBefore.events.set(static_cast<std::size_t>(*event));
+        mBefore.lines.add(text);
+        if (event == ServiceEvent::NOT_ALLOWED) {
+            ParsedRecord none;
+            none.line = line;
+            none.time = mRun ? mRun->end : 0;
+            beginRun(none);
+            mRun->lastLine = line;
+            mRun->ended = RunEnd::EARLY;
+        }
+        return;
+    }
     if (!mRun) {
         return;
     }
@@ -273,12 +287,9 @@ void RunBuilder::otherLine(std::uint64_t line, std::string_view program, std::st
         return; // the next run's
     }
     mRun->lastLine = line;
-    if (manager || startsWith(text, "give-back: ")) { // see service/give-back
-        mRun->serviceManager.add(text);
-        mRun->service.failureShown = mRun->service.failureShown || contains(text, "before it showed an outcome");
-        if (mRun->ended == RunEnd::NOT_SEEN && (mRun->service.failureShown || contains(text, "Main process exited"))) {
-            mRun->ended = RunEnd::EARLY;
-        }
+    if (manager || event) {
+        mRun->service.lines.add(text);
+        takeServiceLine(event.value_or(ServiceEvent::NONE), text);
         return;
     }
     ++mRun->otherLines;
@@ -286,6 +297,22 @@ void RunBuilder::otherLine(std::uint64_t line, std::string_view program, std::st
         Step& step = mRun->steps.back();
         step.said.add(text);
         step.phrases |= phrasesIn(text, step.kind);
+    }
+}
+
+void RunBuilder::takeServiceLine(ServiceEvent event, std::string_view text)
+{
+    ServiceFacts& service = mRun->service;
+    service.events.set(static_cast<std::size_t>(event));
+    if (event == ServiceEvent::UNIT_NOT_WELL || event == ServiceEvent::UNIT_OPEN) {
+        service.unit = kept(serviceWords(text));
+    }
+    if (event == ServiceEvent::TIME_USED_UP && !mRun->steps.empty()) {
+        mRun->steps.back().timeUsedUp = true;
+    }
+    if (mRun->ended == RunEnd::NOT_SEEN &&
+        (event == ServiceEvent::FAILURE_SHOWN || contains(text, "Main process exited"))) {
+        mRun->ended = RunEnd::EARLY;
     }
 }
 
@@ -312,6 +339,7 @@ void RunBuilder::beginRun(const ParsedRecord& record)
     mRun->number = ++mRuns;
     mRun->firstLine = record.line;
     mRun->begin = mRun->end = record.time;
+    mRun->service = std::exchange(mBefore, {});
     mRun->tornRecords = std::exchange(mTornBefore, 0);
     mRun->firstTornLine = mRun->tornRecords > 0 ? 1 : 0;
 }

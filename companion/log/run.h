@@ -4,6 +4,7 @@
 #include "log/parser.h"
 #include "log/vocabulary.h"
 
+#include <bitset>
 #include <cstdint>
 #include <deque>
 #include <functional>
@@ -69,7 +70,8 @@ struct Step
     std::string word;          ///< the record's message that reported a failure
     std::optional<CommandStatus> status;
     std::vector<Action> actions;
-    int failedAttempts = 0; ///< of the upload
+    int failedAttempts = 0;  ///< of the upload
+    bool timeUsedUp = false; ///< The service ended a command of it.
     OtherLines said;
     PhraseSet phrases; ///< in what was said
 };
@@ -112,7 +114,11 @@ enum class RunEnd {
 /// What the service around the updater says.
 struct ServiceFacts
 {
-    bool failureShown = false; ///< LED_FAIL, lit after the updater had ended without an outcome
+    std::bitset<serviceEvents> events;
+    std::string unit; ///< the words on the unit after the run, when it is not well
+    OtherLines lines; ///< of the service manager and of what it runs around the updater
+
+    bool has(ServiceEvent event) const { return events.test(static_cast<std::size_t>(event)); }
 };
 
 /// What went wrong in a run.
@@ -174,7 +180,6 @@ struct Run
     std::uint64_t tornRecords = 0;
     std::uint64_t firstTornLine = 0;
     std::uint64_t otherLines = 0;
-    OtherLines serviceManager; ///< its lines, and those of what it runs around the updater
     ServiceFacts service;
 
     /// Set by explain().
@@ -218,6 +223,7 @@ private:
     bool beginsRun(const Meaning& meaning, bool whole) const;
     void beginRun(const ParsedRecord& record);
     void endRun(bool followedByAnother);
+    void takeServiceLine(ServiceEvent event, std::string_view text);
     void noteTime(const ParsedRecord& record, const Meaning& meaning);
     void takeRunEvent(const ParsedRecord& record, const Meaning& meaning);
     void takeStepEvent(Step& step, const ParsedRecord& record, const Meaning& meaning);
@@ -232,7 +238,8 @@ private:
     std::function<void(Run&)> mRunComplete;
     std::optional<Run> mRun;
     std::uint64_t mRuns = 0;
-    std::string mThread; // of the last record
+    ServiceFacts mBefore; // of the service, before the next run
+    std::string mThread;  // of the last record
     bool mSourceEnded = false;
     std::uint64_t mTornBefore = 0; // pieces in front of the next run's first record
 };

@@ -8,6 +8,7 @@
 #include <csignal>
 #include <cstdlib>
 #include <cstring>
+#include <vector>
 
 #include <fcntl.h>
 #include <spawn.h>
@@ -45,13 +46,13 @@ std::string LogSource::openJournal(bool follow)
     const Descriptor writeEnd(ends[1]);
 
     // All entries, with their times and programs; --all keeps tabs as they are.
-    std::array<const char*, 9> arguments = {
-        "journalctl", "--unit=harl-updater", "--output=short-iso", "--all", "--quiet", "--no-pager", nullptr, nullptr,
-        nullptr};
+    std::vector<const char*> arguments = {
+        "journalctl", "--unit=harl-updater", "--unit=harl-updater-give-back", "--output=short-iso", "--all",
+        "--quiet",    "--no-pager"};
     if (follow) {
-        arguments[6] = "--follow";
-        arguments[7] = "--no-tail";
+        arguments.insert(arguments.end(), {"--follow", "--no-tail"});
     }
+    arguments.push_back(nullptr);
     posix_spawn_file_actions_t actions;
     posix_spawn_file_actions_init(&actions);
     posix_spawn_file_actions_adddup2(&actions, writeEnd.number(), STDOUT_FILENO);

@@ -297,10 +297,14 @@ std::string boardText(const Run& run)
 std::string headingOf(const Run& run, const Problem& problem)
 {
     const bool decisive = run.failure && &problem == &*run.failure;
+    if (run.service.has(ServiceEvent::NOT_ALLOWED) && decisive) {
+        return "Not run [" + std::string(problem.failure->name) + ']';
+    }
     const Step* step = run.stepOf(problem);
     std::string text = !decisive ? "Also: " : isFailure(run.outcome) ? "Failed: " : "Ended in: ";
-    text += step == nullptr ? "a step that is not in this log"
-                            : factsOf(step->kind).title + (" (line " + std::to_string(step->line) + ')');
+    text += step == nullptr && run.service.lines.count > 0 ? "The service, before or after the run"
+            : step == nullptr                              ? "a step that is not in this log"
+                              : factsOf(step->kind).title + (" (line " + std::to_string(step->line) + ')');
     return text + " [" + problem.failure->name + ']';
 }
 
@@ -335,9 +339,11 @@ std::string filled(std::string text, const Run& run, const Step* step, std::stri
             run.mainHead ? "If it does not go on: "
                          : "See whether the panel still flashes blue in turn. If it does, wait. If not: ");
     replace(text, "{service}",
-            run.service.failureShown ? " The service then lit FAIL, without a sound, released the stick and started "
-                                       "the application."
-                                     : "");
+            run.service.has(ServiceEvent::FAILURE_SHOWN)
+                ? " The service then lit FAIL, without a sound, released the stick and started "
+                  "the application."
+                : "");
+    replace(text, "{unit}", run.service.unit.empty() ? "what was found is in brackets" : run.service.unit);
     replace(text, "{panelFailures}", run.ledFailures == 0 ? "Commands" : counted(run.ledFailures, "command"));
     replace(text, "{outcomeDark}", run.outcomeLedFailures > 0 ? ": the outcome was not, or not wholly, lit." : ".");
     return text;
@@ -390,6 +396,12 @@ OperatorView operatorView(const Run& run)
     OperatorView view;
     const OutcomeFacts& facts = factsOf(run.outcome);
     view.meaning = facts.meaning;
+    if (run.service.has(ServiceEvent::NOT_ALLOWED)) {
+        view.meaning = "NOT RUN: the service did not let the updater begin";
+    }
+    if (run.service.has(ServiceEvent::UNIT_NOT_WELL) && !isFailure(run.outcome)) {
+        view.meaning += ", but " + run.service.unit;
+    }
     const bool over = run.isDecided() || run.ended == RunEnd::BY_SERVICE_MANAGER;
     if (run.outcome == Outcome::NONE && over) {
         view.meaning = "not in this log: the records of its outcome are missing";
@@ -401,8 +413,10 @@ OperatorView operatorView(const Run& run)
         return view;
     }
     const std::string color = isFailure(run.outcome) ? "fail" : "pass";
-    if (run.service.failureShown) {
-        view.meaning = isFailure(run.outcome) ? view.meaning : "FAILED: the updater ended before its outcome was known";
+    if (run.service.has(ServiceEvent::FAILURE_SHOWN)) {
+        if (!isFailure(run.outcome) && !run.service.has(ServiceEvent::NOT_ALLOWED)) {
+            view.meaning = "FAILED: the updater ended before its outcome was known";
+        }
         view.leds = {{"FAIL", "fail"}};
         view.seen = "FAIL lit in fail colour; no sound";
         return view;
@@ -445,29 +459,27 @@ void printRun(const Run& run, const std::string& source, std::ostream& out)
 {
     const OperatorView view = operatorView(run);
     out << "Run " << run.number << " of " << source << ", lines " << run.firstLine << " to " << run.lastLine << "\n\n";
-    out << "Began:    " << dateText(run.begin);
-    if (!run.version.empty()) {
-        out << ", updater " << run.version;
+    if (!run.steps.empty()) {
+        out << "Began:    " << dateText(run.begin) << (run.version.empty() ? "" : ", updater ") << run.version
+            << ", took " << durationText(run.elapsed)
+            << (run.clockJumps > 0 ? " (without what the clock was set by)\n" : "\n");
     }
-    out << ", took " << durationText(run.elapsed);
-    if (run.clockJumps > 0) {
-        out << " (without what the clock was set by)";
-    }
-    out << '\n';
     out << "Outcome:  " << view.meaning << '\n';
     out << "Operator: " << view.seen << '\n';
     out << "Package:  " << packageText(run) << '\n';
     out << "Board:    " << boardText(run) << '\n';
-    printSteps(run, out);
+    if (!run.steps.empty()) {
+        printSteps(run, out);
+    }
     if (run.failure) {
         printProblem(run, *run.failure, out);
     }
     for (const Problem& problem : run.besides) {
         printProblem(run, problem, out);
     }
-    if (run.serviceManager.count > 0) {
+    if (run.service.lines.count > 0) {
         out << "\nThe service manager said:\n";
-        printLines(run.serviceManager, out);
+        printLines(run.service.lines, out);
     }
     if (!run.gaps.empty()) {
         out << "\nThis log cannot show:\n";

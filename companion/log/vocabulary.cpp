@@ -132,6 +132,38 @@ const Word words[] = {
     {"turnOn", "system returned false: *", E::PANEL_FAILED},
 };
 
+/// What a part of the service says.
+struct ServiceWord
+{
+    const char* part;
+    const char* words; ///< anywhere in the line
+    ServiceEvent event;
+};
+
+// The first one that fits counts. Each part's name alone: some other line of it.
+const ServiceWord serviceTable[] = {
+    {"prepare: ", "an installation was broken off", ServiceEvent::REPAIR},
+    {"prepare: ", "the updater is not run", ServiceEvent::NOT_ALLOWED},
+    {"prepare: ", "the installation is finished", ServiceEvent::REPAIRED},
+    {"prepare: ", "still unfinished", ServiceEvent::REPAIR_FAILED},
+    {"prepare: ", "", ServiceEvent::NONE},
+    {"hand-over: ", "no end within", ServiceEvent::TIME_USED_UP},
+    {"hand-over: ", "are used up", ServiceEvent::TIME_USED_UP},
+    {"hand-over: ", "", ServiceEvent::NONE},
+    {"give-back: ", "before it had an outcome", ServiceEvent::FAILURE_SHOWN},
+    {"give-back: ", "before it showed an outcome", ServiceEvent::FAILURE_SHOWN},
+    {"give-back: ", "the outcome was not shown", ServiceEvent::SHOWN_AGAIN},
+    {"give-back: ", "the panel does not take", ServiceEvent::PANEL_REFUSED},
+    {"give-back: ", "the stick is in use", ServiceEvent::STICK_IN_USE},
+    {"give-back: ", "the stick stays mounted", ServiceEvent::STICK_IN_USE},
+    {"give-back: ", "going on beside it", ServiceEvent::WENT_ON},
+    {"give-back: ", "harl cannot be started", ServiceEvent::NOT_STARTED},
+    {"give-back: ", "", ServiceEvent::NONE},
+    {"verify: ", "the unit is well", ServiceEvent::UNIT_WELL},
+    {"verify: ", "the unit is not well", ServiceEvent::UNIT_NOT_WELL},
+    {"verify: ", "", ServiceEvent::UNIT_OPEN},
+};
+
 using WordRange = std::pair<const Word*, const Word*>;
 
 /// The words of an operation; they come one after the other.
@@ -196,6 +228,21 @@ Meaning meaningOfAny(const WordRange& range)
 const StepFacts& factsOf(StepKind kind)
 {
     return stepTable.at(static_cast<std::size_t>(kind));
+}
+
+std::optional<ServiceEvent> serviceEventOf(std::string_view line)
+{
+    for (const ServiceWord& word : serviceTable) {
+        if (line.rfind(word.part, 0) == 0 && line.find(word.words) != std::string_view::npos) {
+            return word.event;
+        }
+    }
+    return std::nullopt;
+}
+
+std::string_view serviceWords(std::string_view line)
+{
+    return line.substr(std::min(line.find(": ") + 2, line.size()));
 }
 
 Meaning meaningOf(std::string_view operation, std::optional<std::string_view> message)

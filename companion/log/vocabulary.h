@@ -59,6 +59,32 @@ struct Meaning
 /// @param message  empty optional: it is not in the log
 Meaning meaningOf(std::string_view operation, std::optional<std::string_view> message);
 
+/// What a line of the service around the updater says (see service/).
+enum class ServiceEvent {
+    NONE,   ///< Nothing that matters here.
+    REPAIR, ///< before the run
+    REPAIRED,
+    REPAIR_FAILED,
+    NOT_ALLOWED, ///< The updater is not run.
+    TIME_USED_UP,
+    FAILURE_SHOWN, ///< the updater having ended without an outcome
+    SHOWN_AGAIN,
+    PANEL_REFUSED,
+    STICK_IN_USE,
+    WENT_ON, ///< beside a tool that is still at work
+    NOT_STARTED,
+    UNIT_WELL,
+    UNIT_NOT_WELL,
+    UNIT_OPEN,
+};
+const std::size_t serviceEvents = static_cast<std::size_t>(ServiceEvent::UNIT_OPEN) + 1;
+
+/// Empty when the line is not one of the service's.
+std::optional<ServiceEvent> serviceEventOf(std::string_view line);
+
+/// What follows the name of the part that speaks: "verify: ".
+std::string_view serviceWords(std::string_view line);
+
 /// True when `message` is one that `operation` writes and that says something.
 bool isMessageOf(std::string_view operation, std::string_view message);
 

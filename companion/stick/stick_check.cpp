@@ -410,6 +410,10 @@ int runStick(const std::string& path, bool json, std::ostream& out, std::ostream
 {
     const StickFolder stick(path);
     if (stick.error() != 0) {
+        if (json) {
+            out << refusal("stick", std::string("the stick cannot be read: ") + std::strerror(stick.error())).dump(2)
+                << '\n';
+        }
         errors << "harl-updater-tool: " << shown(path) << " cannot be read: " << std::strerror(stick.error()) << ". "
                << (stick.error() == EACCES ? "Run this check as root.\n"
                                            : "Name the folder that the stick is mounted at, the one that holds "

@@ -61,39 +61,6 @@ bool dpkgWasInterrupted(const Unit& unit)
     });
 }
 
-void checkUnfinishedWork(const Unit& unit, Report& report)
-{
-    const CommandResult packages =
-        unit.run({"dpkg-query", "--show", "--showformat=${db:Status-Abbrev}\\t${binary:Package}\\n"}, quick);
-    if (!packages.succeeded()) {
-        report.add({Severity::UNCHECKED, "packages-unknown",
-                    "The installed packages cannot be listed: " + complaint(packages) + '.',
-                    "installs the head's package.", "Run this check on the unit."});
-        return;
-    }
-    std::vector<std::string> pending;
-    for (const std::string& line : linesOf(packages.output)) {
-        // The second letter is the state: not installed, configuration files, installed; the third an error flag.
-        const bool settled = line.size() > 3 && std::strchr("nci", line[1]) != nullptr && line[2] == ' ';
-        if (!settled) {
-            pending.push_back(line.substr(line.find('\t') + 1));
-        }
-    }
-    const bool interrupted = dpkgWasInterrupted(unit);
-    if (pending.empty() && !interrupted) {
-        return;
-    }
-    report.add({Severity::ERROR, "package-half-configured",
-                "The package manager has unfinished work: " + listed(pending) +
-                    (pending.empty() ? ""
-                     : interrupted   ? " and "
-                                     : "") +
-                    (interrupted ? "an interrupted run." : "."),
-                "may see the version as installed that never got configured, and then finds nothing to update; or its "
-                "installation fails.",
-                "Finish it: dpkg --configure -a"});
-}
-
 /// Checks both versions as the updater will see them, in the words that the service's locale gives.
 void checkPolicy(const Unit& unit, Report& report)
 {
@@ -282,4 +249,37 @@ void checkFreeSpace(const struct statvfs& system, std::uint64_t needed, Report& 
         report.add({Severity::WARNING, "disk-almost-full", "Little space is free: " + byteCount(available) + '.',
                     "may not be able to install what the package depends on.", "Free some: apt-get clean"});
     }
+}
+
+void checkUnfinishedWork(const Unit& unit, Report& report)
+{
+    const CommandResult packages =
+        unit.run({"dpkg-query", "--show", "--showformat=${db:Status-Abbrev}\\t${binary:Package}\\n"}, quick);
+    if (!packages.succeeded()) {
+        report.add({Severity::UNCHECKED, "packages-unknown",
+                    "The installed packages cannot be listed: " + complaint(packages) + '.',
+                    "installs the head's package.", "Run this check on the unit."});
+        return;
+    }
+    std::vector<std::string> pending;
+    for (const std::string& line : linesOf(packages.output)) {
+        // The second letter is the state: not installed, configuration files, installed; the third an error flag.
+        const bool settled = line.size() > 3 && std::strchr("nci", line[1]) != nullptr && line[2] == ' ';
+        if (!settled) {
+            pending.push_back(line.substr(line.find('\t') + 1));
+        }
+    }
+    const bool interrupted = dpkgWasInterrupted(unit);
+    if (pending.empty() && !interrupted) {
+        return;
+    }
+    report.add({Severity::ERROR, "package-half-configured",
+                "The package manager has unfinished work: " + listed(pending) +
+                    (pending.empty() ? ""
+                     : interrupted   ? " and "
+                                     : "") +
+                    (interrupted ? "an interrupted run." : "."),
+                "may see the version as installed that never got configured, and then finds nothing to update; or its "
+                "installation fails.",
+                "Finish it: dpkg --configure -a"});
 }

@@ -1,6 +1,7 @@
 #include "unit/unit_check.h"
 
 #include "findings.h"
+#include "unit/board.h"
 #include "unit/environment.h"
 #include "unit/packages.h"
 #include "unit/selftest.h"
@@ -15,8 +16,6 @@
 
 namespace
 {
-
-const auto boardLimit = 45s; // 2 s to connect, then ten unanswered keep-alives of 4 s
 
 const std::string darkPanel =
     "cannot light the panel (log: \"system returned false: i2cset ...\"). The update itself runs, "
@@ -49,7 +48,7 @@ public:
             checkPanel();
             checkSound();
         }
-        checkBoard();
+        checkBoard(mUnit, mReport);
         checkPackageManager(mUnit, mReport);
     }
 
@@ -204,64 +203,6 @@ private:
         return waveFault(start, static_cast<std::uint64_t>(file.tellg()));
     }
 
-    void checkBoard()
-    {
-        // The updater's own command, which asks nobody here and learns no new host key.
-        const CommandResult answer =
-            mUnit.run({"ssh", "-o", "BatchMode=yes", "-o", "StrictHostKeyChecking=yes", "-o", "UpdateHostKeys=no", "-o",
-                       "ServerAliveInterval=4", "-o", "ServerAliveCountMax=10", "-o", "ConnectTimeout=2", "-o",
-                       "TCPKeepAlive=yes", boardAddress, boardVersionCommand},
-                      boardLimit);
-        if (!answer.started) {
-            return; // reported with the tools
-        }
-        const bool refused = answer.exitCode == 255; // ssh(1): an error of its own
-        const bool forKeys =
-            contains(answer.errors, "Host key verification failed") || contains(answer.errors, "Permission denied");
-        if (refused && forKeys && !mUnit.isRoot()) {
-            add(Severity::UNCHECKED, "board-login", "The board refuses this user: " + complaint(answer) + '.',
-                boardNotRead(), "Run this check as root: root's keys count.");
-        } else if (refused && contains(answer.errors, "HOST IDENTIFICATION HAS CHANGED")) {
-            add(Severity::ERROR, "board-host-key", "The board's host key is not the one that is known.", boardNotRead(),
-                "When the board was replaced: ssh-keygen -R 192.168.9.2, then log in once by hand: ssh 192.168.9.2");
-        } else if (refused && contains(answer.errors, "Host key verification failed")) {
-            add(Severity::ERROR, "board-host-key", "The board's host key is not known.", boardNotRead(),
-                "Log in once by hand and accept the key: ssh 192.168.9.2");
-        } else if (refused && contains(answer.errors, "Permission denied")) {
-            add(Severity::ERROR, "board-login", "The board refuses a login without a password.", boardNotRead(),
-                "Install root's public key on the board: ssh-copy-id 192.168.9.2");
-        } else if (refused || answer.exitCode < 0) {
-            add(Severity::ERROR, "board-unreachable",
-                "The board at 192.168.9.2 cannot be asked: " + complaint(answer) + '.', boardNotRead(),
-                "Check the board's supply and link: ping 192.168.9.2. When it answers: ssh 192.168.9.2");
-        } else {
-            checkBoardVersion(answer);
-        }
-    }
-
-    std::string boardNotRead() const
-    {
-        return mUnit.isMainHead()
-                   ? "logs \"Failed to checkUpdate\", installs nothing and " + mUnit.failure() + '.'
-                   : "logs \"Failed to checkUpdate\" and leaves the board as it is. The panel shows \"nothing to "
-                     "update\" when the head's package is up to date, and a failed check when it has just been "
-                     "installed.";
-    }
-
-    void checkBoardVersion(const CommandResult& answer)
-    {
-        const std::string value = valueAfter(answer.output, boardVersionKey);
-        const std::string version = value.substr(0, value.find('\r'));
-        if (!answer.succeeded() || version.empty()) {
-            add(Severity::ERROR, "board-version",
-                "The board's version file holds no line with \"Brimvale\", a tab and a version: " +
-                    (answer.output.empty() ? complaint(answer) : shown(answer.output)) + '.',
-                boardNotRead(), "Look at it: ssh 192.168.9.2 cat /root/App/AppExe/version.txt");
-            return;
-        }
-        mReport.addFact("board_version", "Board's version", shown(version), escaped(version));
-    }
-
     const Unit& mUnit;
     Report& mReport;
     bool mUpdaterRuns;
@@ -271,11 +212,14 @@ int runSelfTests(const UnitOptions& options, const Unit& unit, const UnitSite& s
                  std::ostream& errors)
 {
     if (unit.updaterRuns()) {
+        if (options.json) {
+            out << refusal("unit", "the updater is running and uses panel and sound itself").dump(2) << '\n';
+        }
         errors << "harl-updater-tool: the updater is running and uses panel and sound itself. Run the test when it has "
                   "ended.\n";
         return Report::STATUS_UNCHECKED;
     }
-    nlohmann::ordered_json results = {{"command", "unit"}};
+    nlohmann::ordered_json results = {{"command", "unit"}, {"version", jsonVersion}};
     int status = Report::STATUS_FIT;
     const auto take = [&](const char* name, const char* tested, const SelfTest& test) {
         results[name] = {{tested, test.tested}, {"failed_commands", test.failedCommands}, {"reason", test.reason}};
@@ -301,6 +245,11 @@ int runSelfTests(const UnitOptions& options, const Unit& unit, const UnitSite& s
 
 } // namespace
 
+void checkUnit(const Unit& unit, Report& report)
+{
+    UnitCheck(unit, report).run();
+}
+
 int runUnit(const UnitOptions& options, const UnitSite& site, std::ostream& out, std::ostream& errors)
 {
     const Unit unit(site);
@@ -308,7 +257,7 @@ int runUnit(const UnitOptions& options, const UnitSite& site, std::ostream& out,
         return runSelfTests(options, unit, site, out, errors);
     }
     Report report("unit", "The unit");
-    UnitCheck(unit, report).run();
+    checkUnit(unit, report);
     report.write(options.json, out);
     return report.status();
 }

@@ -1,5 +1,6 @@
 #pragma once
 
+#include "findings.h"
 #include "unit/environment.h"
 
 #include <iosfwd>
@@ -11,6 +12,9 @@ struct UnitOptions
     bool panel = false; ///< Test the lamps instead of checking.
     bool sound = false; ///< Play both sounds instead of checking.
 };
+
+/// The check itself: adds to `report` what it finds.
+void checkUnit(const Unit& unit, Report& report);
 
 /// Checks whether the unit is fit for an update, and prints the report to `out`.
 ///

@@ -505,7 +505,7 @@ TEST_F(Stick, TextNamesEffectRemedyAndVerdict)
     std::ostringstream errors;
     EXPECT_EQ(runStick(stick.path(), false, out, errors), 1);
     EXPECT_THAT(out.str(), HasSubstr("error: \"debs\" is missing. [no-board-folder]\n  The updater: "));
-    EXPECT_THAT(out.str(), HasSubstr("\n  To mend it:  Put the board's version folder into"));
+    EXPECT_THAT(out.str(), HasSubstr("\n  Fix:         Put the board's version folder into"));
     EXPECT_THAT(out.str(), HasSubstr(" is NOT fit for an update.\n"));
 }
 

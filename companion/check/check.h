@@ -1,0 +1,13 @@
+#pragma once
+
+#include "unit/environment.h"
+
+#include <iosfwd>
+#include <string>
+
+/// Checks before an update what it would do now: the unit, the stick at `path`, and what both together come to.
+///
+/// Changes nothing. On a machine that is no unit, the stick alone is checked.
+///
+/// @return a Report::Status; also STATUS_UNCHECKED, with a message on `errors`, when there is no stick to read
+int runCheck(const std::string& path, bool json, const UnitSite& site, std::ostream& out, std::ostream& errors);

@@ -93,8 +93,8 @@ const Failure failures[] = {
     {"package-not-located", "ERROR_INSTALL_PACKAGE", "Neither the mirrors nor this unit know the package.",
      "Check the unit's package sources, then run the update again."},
     {"package-dependencies", "ERROR_INSTALL_PACKAGE", "The package needs others that the mirrors do not offer.",
-     "On the unit run: apt install {package}, and correct the sources or the package that it names. Then run the update "
-     "again."},
+     "On the unit run: apt install {package}, and correct the sources or the package that it names. Then run the "
+     "update again."},
     {"package-damaged", "ERROR_INSTALL_PACKAGE", "The package arrived damaged: its checksum is not that of the list.",
      "Correct the mirror, then run the update again."},
     {"package-not-fetched", "ERROR_INSTALL_PACKAGE",
@@ -118,8 +118,8 @@ const Failure failures[] = {
     {"board-upload-failed", "ERROR_INSTALL_QUORB",
      "The files could not be copied to the board in 20 attempts: the board or the link went away, its file system is "
      "full, the stick was pulled out or lacks one of the two files.",
-     "Check that the stick is in and that harl-updater-tool stick finds it fit, that the board has power and room, then "
-     "run the update again."},
+     "Check that the stick is in and that harl-updater-tool stick finds it fit, that the board has power and room, "
+     "then run the update again."},
     {"board-host-key", "ERROR_CHECK_UPDATE, ERROR_INSTALL_QUORB",
      "The board showed another host key than the one this head knows: it was replaced or set up anew.",
      "Make sure that it is the right board, then renew its key: ssh-keygen -R 192.168.9.2, log in once, run the update "
@@ -204,8 +204,8 @@ const Failure failures[] = {
     {"start-missing", "", "The run came to its end, but whether the application was started again is not in this log.",
      "Check the application: systemctl status harl."},
     {"run-not-allowed", "",
-     "A package's earlier installation was broken off and could not be finished, and no other version of it is offered. "
-     "The updater would have taken it for up to date: the service did not run it.",
+     "A package's earlier installation was broken off and could not be finished, and no other version of it is "
+     "offered. The updater would have taken it for up to date: the service did not run it.",
      "On the unit run: dpkg --configure -a, and correct what it names; or offer another version. Then run the update "
      "again."},
     {"installation-repaired", "", "An earlier installation was broken off; the service finished it before this run.",

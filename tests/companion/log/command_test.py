@@ -291,8 +291,8 @@ class Follow(Base):
         self.assertEqual(status, 0)
         first, last = shown.decode().splitlines()
         # The golden log's run is long past.
-        self.assertRegex(first, r"^\d\d:\d\d:\d\d  Leave the board 13 minutes, 13 min 0 s expected; no record for .*, longer "
-                                r"than this step takes: the updater has most likely ended. Do now: leave the board 13")
+        self.assertRegex(first, r"^\d\d:\d\d:\d\d  Leave the board 13 minutes, 13 min 0 s expected; no record for .*, "
+                                r"longer than this step takes: the updater has most likely ended. Do now: leave the board 13")
         self.assertRegex(last, r"^Ended at \d\d:\d\d:\d\d: PASSED: updated \(PASS lit in pass colour; pass sound\)\.$")
 
     def test_json_has_an_object_for_each_change(self) -> None:

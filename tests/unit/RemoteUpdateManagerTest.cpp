@@ -154,6 +154,25 @@ TEST_F(ApplicationLock, UnlockWakesTheThreadThatIsLocked)
     EXPECT_EQ(platform::records().at(2).function, "static void RemoteUpdateManager::lockApp()");
 }
 
+TEST_F(ApplicationLock, IsTakenOnlyAfterItsFirstRecord)
+{
+    static std::atomic<bool> first{true};
+    static std::atomic<bool> unlocked{false};
+    platform::afterRecord([] {
+        if (first.exchange(false)) {
+            std::thread([] {
+                RemoteUpdateManager::unlockApp();
+                unlocked = true;
+            }).detach();
+            platform::waitFor([] { return unlocked.load(); });
+        }
+    });
+    std::thread waiting(RemoteUpdateManager::lockApp);
+    untilItIsWaitedFor();
+    RemoteUpdateManager::unlockApp();
+    waiting.join();
+}
+
 TEST_F(ApplicationLock, UnlockWithoutAWaiterIsForgotten)
 {
     RemoteUpdateManager::unlockApp();

@@ -4,11 +4,12 @@ import re
 import shutil
 import subprocess
 import tempfile
+import time
 import unittest
 from pathlib import Path
 
 from bench.makers.files import write_script
-from bench.outcomes import ENDED_EARLY
+from bench.outcomes import CHECK_FAILED, ENDED_EARLY, UP_TO_DATE, UPDATED
 from bench.panel import COLOR_CODES, LED_CODES, Panel
 from tests.command_line import skip
 
@@ -19,11 +20,35 @@ NAMESPACES = ["unshare", "--map-root-user", "--mount", "--pid", "--fork", "--kil
 GIVE_BACK = ROOT / "service/give-back"
 START = "systemctl --no-block start harl"
 TOOLS = {
-    "systemctl": 'for tool in apt dpkg; do ! pgrep -x $tool >/dev/null || echo "beside $tool" >>"$UNIT/calls"; done',
-    "i2cset": '[ -z "$I2CSET_STATUS" ] || exit "$I2CSET_STATUS"',
-    "umount": '[ ! -e "$UNIT/busy" ] || { rm "$UNIT/busy"; exit 32; }; [ -e "$UNIT/stuck" ] || rm "$UNIT/mounted"',
-    "mountpoint": '[ -e "$UNIT/mounted" ]',
+    "systemctl": """
+[ "$1" = show ] || echo "systemctl $*" >>"$UNIT/calls"
+case $* in
+*--value*) echo "$ACTIVE" ;;
+show*) printf 'Result=%s\\nExecMainCode=2\\nExecMainStatus=15\\n' "$RESULT" ;;
+*) for tool in apt dpkg; do ! pgrep -x $tool >/dev/null || echo "beside $tool" >>"$UNIT/calls"; done
+   [ ! -e "$UNIT/no-systemctl" ] || exit 1 ;;
+esac
+""",
+    "i2cset": """
+echo "i2cset $*" >>"$UNIT/calls"
+[ ! -e "$UNIT/lost" ] || { rm "$UNIT/lost"; exit 1; }
+exit "$I2CSET_STATUS"
+""",
+    "umount": """
+echo "umount $*" >>"$UNIT/calls"
+[ ! -e "$UNIT/busy" ] || { rm "$UNIT/busy"; exit 32; }
+[ -e "$UNIT/stuck" ] && [ "$1" != --lazy ] && exit "$UMOUNT_STATUS"
+: >"$UNIT/mounts"
+""",
+    "journalctl": 'echo "journalctl $1" >>"$UNIT/calls"',
     "sleep": "exec /usr/bin/sleep 0.05",
+}
+MOUNT = "/dev/sda1 /root/USB_MOUNT vfat rw 0 0\n"
+# What of the program is this unit's own, and the time of an outcome (s).
+CHANGES = {
+    r"'/harl-updater\(-give-back\)*\.service$'": "''",  # every process here is the updater's
+    "/proc/self/mounts": '"$UNIT/mounts"',
+    "outcome_time=30 ": "outcome_time=0 ",
 }
 
 
@@ -36,33 +61,46 @@ class GiveBack(unittest.TestCase):
         self.unit = Path(folder.name)
         (self.unit / "bin").mkdir()
         (self.unit / "run").mkdir()
-        (self.unit / "mounted").touch()
+        (self.unit / "mounts").write_text(MOUNT)
+        (self.unit / "run/notes").write_text("1.00 prepared\n")
         self.environment = {
             "PATH": f"{self.unit}/bin:/usr/bin:/bin",
             "UNIT": str(self.unit),
+            "ACTIVE": "deactivating",
+            "RESULT": "signal",
             "I2CSET_STATUS": "0",
+            "UMOUNT_STATUS": "32",
             "RUNTIME_DIRECTORY": str(self.unit / "run"),
-            "SERVICE_RESULT": "success",
-            "EXIT_CODE": "killed",
-            "EXIT_STATUS": "TERM",
         }
         for name, text in TOOLS.items():
-            log = '[ "${0##*/}" = sleep ] || [ "${0##*/}" = mountpoint ] || echo "${0##*/} $*" >>"$UNIT/calls"'
-            write_script(self.unit / "bin" / name, f"{log}\n{text}")
+            write_script(self.unit / "bin" / name, text)
         # Copies of sleep(1) under the names of what the updater may leave at work.
         for name in ("apt", "dpkg", "scp", "ssh"):
             shutil.copy("/usr/bin/sleep", self.unit / name)
         shutil.copy(GIVE_BACK, self.unit / "give-back")
+        self.change(CHANGES)
 
-    def give_back(self, beside: str = ":", after: str = ":", at_work: tuple[str, ...] = ()) -> str:
+    def change(self, changes: dict[str, str]) -> None:
+        """Changes lines of the program."""
+        program = self.unit / "give-back"
+        for old, new in changes.items():
+            text = program.read_text()
+            self.assertIn(old, text)
+            program.write_text(text.replace(old, new))
+
+    def note(self, *notes: str) -> None:
+        """What the run has noted, just now."""
+        now = Path("/proc/uptime").read_text().split()[0]
+        with (self.unit / "run/notes").open("a") as file:
+            file.writelines(f"{now} {note}\n" for note in notes)
+
+    def give_back(self, beside: str = ":", after: str = ":", at_work: tuple[str, ...] = (), status: int = 0) -> str:
         """Runs it once what the shell line `beside` starts is `at_work`, and `after` next; what it says."""
         waits = "".join(f"until pgrep -x {name} >/dev/null; do /usr/bin/sleep 0.01; done\n" for name in at_work)
-        line = f'cd "$UNIT"\n{beside}\n{waits}./give-back\n{after}'
+        line = f'cd "$UNIT"\n{beside}\n{waits}./give-back; status=$?\n{after}\nexit $status'
         command = [*NAMESPACES, "sh", "-c", line]
-        done = subprocess.run(
-            command, env=self.environment, capture_output=True, text=True, check=False, timeout=60
-        )
-        self.assertEqual(done.stderr, "")
+        done = subprocess.run(command, env=self.environment, capture_output=True, text=True, check=False, timeout=60)
+        self.assertEqual((done.stderr, done.returncode), ("", status))
         return done.stdout
 
     def calls(self, *tools: str) -> list[str]:
@@ -74,51 +112,119 @@ class GiveBack(unittest.TestCase):
     def panel(self) -> dict[str, str]:
         """The LEDs that are lit after what was sent, had they flashed blue before."""
         panel = Panel()
-        sent = [int(line.split()[4], 16) for line in self.calls("i2cset")]
-        for byte in (LED_CODES["REMOTE"], COLOR_CODES["blue"], *sent):
+        for byte in (LED_CODES["REMOTE"], COLOR_CODES["blue"]):
             panel.send(byte, 0)
+        for line in self.calls("i2cset"):
+            panel.send(int(line.split()[4], 16), 0)
         self.assertEqual(panel.faults, [])
         return panel.pattern(0)
 
+    def assert_instrument_is_given_back(self) -> None:
+        """The stick is released and the application started, in this order."""
+        self.assertEqual((self.unit / "mounts").read_text(), "")
+        last = self.calls("umount", "systemctl")
+        self.assertEqual((last[0].split()[0], last[-1]), ("umount", START))
+
     def test_after_a_normal_end_nothing_is_left_to_do(self) -> None:
-        (self.unit / "run/outcome").touch()
-        (self.unit / "mounted").unlink()
+        self.note("lit 0x13 0x2 0")
+        (self.unit / "mounts").write_text("")
         self.assertEqual(self.give_back(), "")
-        self.assertEqual(self.calls(), [START])
+        self.assertEqual(self.calls(), [START, "journalctl --sync"])
 
     def test_end_before_the_outcome_shows_the_failure(self) -> None:
         said = self.give_back()
-        self.assertIn("ended (success killed TERM) before it showed an outcome", said)
+        ended = "Result=signal ExecMainCode=2 ExecMainStatus=15"
+        self.assertIn(f"give-back: the updater ended ({ended}) before it had an outcome: showing the failure", said)
         self.assertEqual(self.panel(), ENDED_EARLY.panel)
-        self.assertEqual(self.calls("umount", "systemctl"), ["umount /root/USB_MOUNT", START])
-        # The operator sees the failure even if what follows should hang.
-        self.assertEqual(self.calls()[-2:], ["umount /root/USB_MOUNT", START])
+        self.assert_instrument_is_given_back()
 
     def test_end_after_the_outcome_leaves_the_panel_alone(self) -> None:
-        (self.unit / "run/outcome").touch()
-        self.give_back()
-        self.assertEqual(self.calls(), ["umount /root/USB_MOUNT", START])
+        cases: list[list[str]] = [["lit 0x14 0x8 0"], ["lit 0x12 0x2 0", "lit 0x15 0x2 0"]]
+        for notes in cases:
+            self.note(*notes)
+            self.assertEqual(self.give_back(), "")
+            self.assertEqual(self.calls("i2cset"), [])
+            self.setUp()
 
-    def test_outcome_whose_last_byte_is_still_under_way_is_left_alone(self) -> None:
-        write_script(self.unit / "bin/sleep", ': >"$RUNTIME_DIRECTORY/outcome"')
+    def test_outcome_that_was_not_shown_is_shown_again(self) -> None:
+        for outcome, notes in (
+            (UPDATED, ["lit 0x13 0x2 1"]),
+            (ENDED_EARLY, ["lit 0x14 0x8 1"]),
+            (UP_TO_DATE, ["lit 0x12 0x2 1", "lit 0x15 0x2 0"]),
+            (UP_TO_DATE, ["lit 0x12 0x2 0"]),  # the updater ended before the second
+            (CHECK_FAILED, ["lit 0x12 0x8 0", "lit 0x15 0x8 1"]),
+            (UPDATED, ["began installation", "ended installation 0", "sound pass"]),
+            (UPDATED, ["began installation", "sound pass", "lit unknown 0x2 1"]),
+            (UP_TO_DATE, ["sound pass"]),
+            (ENDED_EARLY, ["sound fail"]),
+        ):
+            with self.subTest(notes=notes):
+                self.note(*notes)
+                said = self.give_back()
+                self.assertIn("give-back: the outcome was not shown, or not all of it: showing it", said)
+                self.assertEqual(self.panel(), outcome.panel)
+            self.setUp()
+
+    def test_outcome_stays_readable_before_the_application_starts(self) -> None:
+        cases: list[list[str]] = [[], ["lit 0x13 0x2 0"]]
+        for notes in cases:
+            self.change({"outcome_time=0 ": "outcome_time=3 "})
+            self.note(*notes)
+            begin = time.monotonic()
+            self.give_back()
+            self.assertGreater(time.monotonic() - begin, 2)
+            self.setUp()
+
+    def test_without_notes_the_end_of_the_service_decides(self) -> None:
+        for result, panel in (("success", {}), ("signal", ENDED_EARLY.panel)):
+            (self.unit / "run/notes").unlink()
+            self.environment["RESULT"] = result
+            self.give_back()
+            self.assertEqual({led: color for led, color in self.panel().items() if color != "blue"}, panel)
+            self.setUp()
+
+    def test_second_time_does_nothing(self) -> None:
+        self.give_back()
+        calls = len(self.calls())
         self.assertEqual(self.give_back(), "")
+        self.assertEqual(len(self.calls()), calls)
+
+    def test_one_that_was_killed_goes_on_where_it_was(self) -> None:
+        self.note("give-back", "shown")
+        self.give_back()
         self.assertEqual(self.calls("i2cset"), [])
+        self.assert_instrument_is_given_back()
+
+    def test_it_does_nothing_while_the_updater_is_at_work(self) -> None:
+        self.environment["ACTIVE"] = "active"
+        process = subprocess.run([self.unit / "give-back"], env=self.environment, capture_output=True, check=True)
+        self.assertIn(b"the updater is at work", process.stderr)
+        self.assertEqual(self.calls(), [])
 
     def test_package_tools_are_waited_for(self) -> None:
         for tool in ("apt", "dpkg"):
             said = self.give_back(f"./{tool} 2 &", at_work=(tool,))
-            self.assertIn("still at work", said)
-            self.assertEqual(self.calls()[-1], START)
-            (self.unit / "calls").unlink()
+            self.assertIn("give-back: a package tool is still at work, waiting for it", said)
+            self.assertNotIn(f"beside {tool}", self.calls())
+            self.setUp()
 
     def test_package_tool_that_hangs_does_not_keep_the_instrument(self) -> None:
-        text = GIVE_BACK.read_text()
-        (self.unit / "give-back").write_text(text.replace("package_tools_wait=1800", "package_tools_wait=3"))
-        self.assertNotEqual((self.unit / "give-back").read_text(), text)
+        self.change({"longest_wait=2100 ": "longest_wait=3 "})
         said = self.give_back("./dpkg 30 &", 'kill -0 $! && echo "it lives"', at_work=("dpkg",))
-        self.assertIn("going on beside it", said)
+        self.assertIn("give-back: a package tool is still at work, going on beside it", said)
         self.assertIn("it lives", said)
-        self.assertEqual(self.calls()[-2:], [START, "beside dpkg"])
+        self.assertEqual(self.calls("systemctl", "beside"), [START, "beside dpkg"])
+
+    def test_board_is_waited_for(self) -> None:
+        self.change({"board_time=780 ": "board_time=4 "})
+        self.note("began board-script", "ended board-script 0")
+        begin = time.monotonic()
+        said = self.give_back("./ssh 2 &", at_work=("ssh",))
+        self.assertIn("give-back: the board is still at work, waiting for it", said)
+        self.assertGreater(time.monotonic() - begin, 3)
+        self.setUp()
+        self.note("began board-script", "ended board-script 0", "sound pass", "lit 0x13 0x2 0")
+        self.assertEqual(self.give_back(), "")  # the updater has waited
 
     def test_upload_is_ended_and_the_board_script_is_not(self) -> None:
         said = self.give_back(
@@ -133,41 +239,63 @@ class GiveBack(unittest.TestCase):
         (self.unit / "busy").touch()
         self.give_back()
         self.assertEqual(len(self.calls("umount")), 2)
-        self.assertFalse((self.unit / "mounted").exists())
+        self.assert_instrument_is_given_back()
 
-    def test_stick_that_stays_does_not_keep_the_application(self) -> None:
-        (self.unit / "stuck").touch()
-        self.assertIn("the stick stays mounted", self.give_back())
-        self.assertEqual(self.calls()[-1], START)
+    def test_stick_that_stays_is_detached(self) -> None:
+        for status, attempts in (("32", 5), ("124", 1)):
+            (self.unit / "stuck").touch()
+            self.environment["UMOUNT_STATUS"] = status
+            self.assertIn("give-back: the stick is in use, detaching it", self.give_back())
+            self.assertEqual(len(self.calls("umount")), attempts + 1)
+            self.assert_instrument_is_given_back()
+            self.setUp()
 
-    def test_absent_panel_does_not_keep_the_application(self) -> None:
-        self.environment["I2CSET_STATUS"] = "1"
+    def test_byte_that_is_lost_once(self) -> None:
+        (self.unit / "lost").touch()
+        self.assertNotIn("does not take", self.give_back())
+        self.assertEqual(self.calls("i2cset")[1:3], ["i2cset -y 0 0x07 0x10 c", "i2cset -y 0 0x07 0x0 c"])
+
+    def test_absent_or_hanging_panel_does_not_keep_the_application(self) -> None:
+        for status, bytes_sent in (("1", 3), ("124", 1)):
+            self.environment["I2CSET_STATUS"] = status
+            self.assertIn("give-back: the panel does not take the outcome", self.give_back())
+            self.assertEqual(len(self.calls("i2cset")), bytes_sent)
+            self.assert_instrument_is_given_back()
+            self.setUp()
+
+    def test_application_that_cannot_be_started_is_tried_again_by_the_manager(self) -> None:
+        (self.unit / "no-systemctl").touch()
+        self.assertIn("give-back: harl cannot be started", self.give_back(status=1))
+        (self.unit / "no-systemctl").unlink()
         self.give_back()
-        self.assertEqual(self.calls("umount", "systemctl"), ["umount /root/USB_MOUNT", START])
+        self.assertEqual(self.calls("systemctl"), [START, START])
 
-    def test_hanging_panel_does_not_keep_the_application(self) -> None:
-        text = GIVE_BACK.read_text()
-        (self.unit / "give-back").write_text(text.replace("panel_wait=10 ", "panel_wait=1 "))
-        self.assertNotEqual((self.unit / "give-back").read_text(), text)
-        with (self.unit / "bin/i2cset").open("a") as tool:
-            tool.write("exec /usr/bin/sleep 100\n")
-        self.environment["I2CSET_STATUS"] = ""
-        self.give_back()
-        self.assertEqual(len(self.calls("i2cset")), 1)
-        self.assertEqual(self.calls("umount", "systemctl"), ["umount /root/USB_MOUNT", START])
 
-    def test_service_manager_that_tells_nothing(self) -> None:
-        for name in ("RUNTIME_DIRECTORY", "SERVICE_RESULT", "EXIT_CODE", "EXIT_STATUS"):
-            del self.environment[name]
-        self.give_back()
-        self.assertEqual(self.panel(), ENDED_EARLY.panel)
-        self.assertEqual(self.calls()[-1], START)
+class Units(unittest.TestCase):
+    """What the unit files and the programs must agree on."""
 
-    def test_unit_file_names_the_runtime_directory_for_an_old_service_manager(self) -> None:
-        text = (ROOT / "service/harl-updater.service").read_text()
-        folder = re.findall(r"^RuntimeDirectory=(\S+)$", text, re.MULTILINE)
-        self.assertEqual(re.findall(r"^Environment=RUNTIME_DIRECTORY=/run/(\S+)$", text, re.MULTILINE), folder)
-        self.assertEqual(len(folder), 1)
+    def test_times_make_the_four_hours(self) -> None:
+        found = {}
+        for name in ("harl-updater", "harl-updater-give-back"):
+            text = (ROOT / f"service/{name}.service").read_text()
+            for setting, minutes in re.findall(r"^(\w+)=(\d+)min$", text, re.MULTILINE):
+                found[name, setting] = int(minutes)
+        self.assertEqual(
+            found,
+            {
+                ("harl-updater", "TimeoutStartSec"): 30,
+                ("harl-updater", "RuntimeMaxSec"): 165,
+                ("harl-updater-give-back", "TimeoutStartSec"): 45,
+            },
+        )
+        self.assertLessEqual(sum(found.values()), 240)
+
+    def test_environment_of_both_units_is_the_same(self) -> None:
+        paths = {
+            re.findall(r"^Environment=(PATH=.*)$", (ROOT / f"service/{name}.service").read_text(), re.MULTILINE)[0]
+            for name in ("harl-updater", "harl-updater-give-back")
+        }
+        self.assertEqual(len(paths), 1)
 
 
 if __name__ == "__main__":

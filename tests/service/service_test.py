@@ -6,6 +6,7 @@ stand-ins.
 """
 
 import os
+import re
 import shutil
 import subprocess
 import time
@@ -19,6 +20,7 @@ from bench.makers.i2cset import NEWER
 from bench.makers.packages import DATABASE, SOURCES, Package, build, raise_version, write_index
 from bench.makers.sticks import VERSIONS, version_file_archive, write_stick
 from bench.observation import RECORD
+from bench.outcomes import UP_TO_DATE, UPDATED
 from bench.panel import Panel
 from tests.command_line import skip, take_path, take_word
 
@@ -26,9 +28,11 @@ ROOT = Path(__file__).parents[2]
 
 
 STICK = "/root/USB_MOUNT"
+UNITS = ("harl-updater", "harl-updater-give-back")
 SPEED = 10  # times shorter waits of the updater
+KEEP = 'echo "$4" >>/var/log/panel'  # the panel keeps what it is sent
 TOOLS = {
-    "i2cset": NEWER + 'echo "$4" >>/var/log/panel',  # the panel keeps what it is sent
+    "i2cset": NEWER + KEEP,
     "aplay": 'sleep 0.2; echo "${1##*/}" >>/var/log/sounds',
     "ssh": r"""
 case $* in
@@ -44,10 +48,24 @@ sleep 10
 echo "a script that goes on talking"
 systemctl is-active harl >/run/harl-after || true
 """
+BOARD_SCRIPT = """
+case $* in
+*unzipUpgrade*) touch /run/board-installs; sleep 5; cat /proc/uptime >/run/board-ended ;;
+esac
+"""
+CONTRARY = """
+DPkg::Options { "--force-confnew"; };
+Acquire::Retries "0"; Acquire::http::Timeout "999"; DPkg::Lock::Timeout "0";
+Binary::apt { Acquire::Retries "0"; Acquire::http::Timeout "999"; DPkg::Lock::Timeout "0"; };
+"""
+# The application sees what is on the disk when it starts.
+JOURNAL_AT_START = """[Service]
+ExecStartPre=/bin/sh -c 'journalctl --quiet --directory=/var/log/journal --identifier=harl-updater >/run/harl-journal'
+"""
 # Ordered after the updater: its start must not wait for a service that waits for it.
 HARL = "[Unit]\nAfter=harl-updater.service\n[Service]\nExecStart=/bin/sleep infinity\n"
 
-FOLDERS = [*DATABASE, "opt", "root/RESOURCES/SOUNDS", "root/USB_MOUNT", "srv/repository"]
+FOLDERS = [*DATABASE, "var/log/journal", "opt", "root/RESOURCES/SOUNDS", "root/USB_MOUNT", "srv/repository"]
 
 
 def make_files(unit: Machine, package: Path, programs: Path) -> None:
@@ -65,6 +83,8 @@ def make_files(unit: Machine, package: Path, programs: Path) -> None:
     write(files / "var/lib/dpkg/status", "")
     shutil.copy(package, files / "srv/updater.deb")
     shutil.copy(programs / "bench/call_recorder.so", files / "opt")
+    for name in ("service/hand-over", "tests/service/hand-over-short"):
+        shutil.copy(programs / name, files / "opt")
     shutil.copy(unit.system / "usr/bin/sleep", files / "opt/scp")
 
 
@@ -74,6 +94,16 @@ def install(unit: Machine) -> None:
     names = ", ".join(f"{item.split()[0]} (= 9999)" for item in depends.split(","))
     tools = build(Package("tools", "1.0", {"Provides": names}), unit.root() / "srv")
     unit.run("dpkg", "--install", f"/srv/{tools.name}", "/srv/updater.deb")
+
+
+def shorten(unit: Machine, **times: int) -> None:
+    """Sets times of give-back (s)."""
+    path = unit.root() / "usr/lib/harl-updater/give-back"
+    text = path.read_text()
+    for name, seconds in times.items():
+        text, count = re.subn(rf"^{name}=\d+", f"{name}={seconds}", text, flags=re.MULTILINE)
+        assert count == 1, name
+    path.write_text(text)
 
 
 def wait_for(what: str, condition: Callable[[], bool], seconds: float = 60) -> None:
@@ -94,20 +124,26 @@ class ServiceTest(unittest.TestCase):
     def setUp(self) -> None:
         self.maxDiff = None
         self.inside = self.unit.run
-        self.inside("sh", "-c", "rm -f /run/package-installs /run/uploads /run/harl-* /var/log/panel /var/log/sounds")
+        left = "/run/package-installs /run/uploads /run/board-* /run/harl-[abjlp]* /var/log/panel /var/log/sounds"
+        self.inside("sh", "-c", f"rm -rf {left}")
         self.inside("touch", "/root/RESOURCES/tavren1stboot", "/var/log/panel", "/var/log/sounds")
         self.inside("sh", "-c", "mount -t tmpfs stick /root/USB_MOUNT")
-        write_stick(self.unit.root() / STICK.lstrip("/"), ["quorb2.2.0"], "", version_file_archive)
+        self.fill_stick()
         self.inside("sh", "-c", "echo 2.2.0 >/srv/board; rm -rf /srv/repository/*")
         self.inside("dpkg", "--purge", "solvik4-rh", "solvik4-data")
         self.inside("dpkg", "--install", f"/srv/{build(Package('solvik4-rh', '1.2.0'), self.unit.root() / 'srv').name}")
         self.repository = self.unit.root() / "srv/repository"
+        shorten(self.unit, outcome_time=3, board_time=4)
         self.set_speed(SPEED)
         self.inside("systemctl", "start", "harl")
 
     def tearDown(self) -> None:
         self.unit.status("umount", "-l", "/root/USB_MOUNT")
         self.unit.status("systemctl", "reset-failed")
+
+    def fill_stick(self) -> None:
+        """Writes the board's version 2.2.0 onto the stick."""
+        write_stick(self.unit.root() / STICK.lstrip("/"), ["quorb2.2.0"], "", version_file_archive)
 
     def set_speed(self, speed: int) -> None:
         """Shortens the updater's waits, not those of its children."""
@@ -127,9 +163,13 @@ class ServiceTest(unittest.TestCase):
 
     def start(self) -> None:
         """Starts the service."""
+        self.note_journal()
         self.inside("systemctl", "start", "harl-updater")
         self.main = int(self.show("MainPID"))
-        self.invocation = self.show("InvocationID")
+
+    def note_journal(self) -> None:
+        """The run's part of the journal begins here."""
+        self.cursor = self.inside("journalctl", "--lines=0", "--show-cursor").split("-- cursor: ")[1].strip()
 
     def kill(self, signal: str) -> None:
         """Sends a signal to the updater itself."""
@@ -144,19 +184,23 @@ class ServiceTest(unittest.TestCase):
         wait_for(path, lambda: (self.unit.root() / path.lstrip("/")).exists())
 
     def wait_for_end(self) -> None:
-        """Waits until the service has ended, with what runs after it."""
-        wait_for("end of the service", lambda: self.show("ActiveState") in ("inactive", "failed"), 90)
+        """Waits until the service has ended, and has given the instrument back."""
+        wait_for("end of the service", lambda: self.states() <= {"inactive", "failed"}, 90)
+
+    def states(self) -> set[str]:
+        """What the service and the one that gives the instrument back do."""
+        return set(self.inside("systemctl", "show", "--value", "--property=ActiveState", *UNITS).split())
 
     def ended_as(self) -> tuple[str, str, str]:
         """Result of the service, and how the updater's process ended."""
         return self.show("Result"), self.show("ExecMainCode"), self.show("ExecMainStatus")
 
-    def panel(self) -> dict[str, str]:
-        """The LEDs that are lit."""
+    def panel(self, faults: bool = False) -> dict[str, str]:
+        """The LEDs that are lit, when the panel has understood every byte, or has had `faults`."""
         panel = Panel()
         for byte in self.read("/var/log/panel").split():
             panel.send(int(byte, 16), 0)
-        self.assertEqual(panel.faults, [])
+        self.assertEqual(bool(panel.faults), faults)
         return panel.pattern(0)
 
     def read(self, path: str) -> str:
@@ -166,7 +210,7 @@ class ServiceTest(unittest.TestCase):
     def journal(self) -> str:
         """The messages of the service, of this run."""
         self.inside("journalctl", "--sync")
-        match = [f"_SYSTEMD_INVOCATION_ID={self.invocation}", "SYSLOG_IDENTIFIER=harl-updater"]
+        match = [f"--after-cursor={self.cursor}", "--identifier=harl-updater"]
         return self.inside("journalctl", "--quiet", "--output=cat", *match)
 
     def package_state(self, name: str = "solvik4-rh") -> str:
@@ -231,6 +275,7 @@ class Ends(ServiceTest):
         self.wait_for_file("/run/package-installs")
         self.inside("systemctl", "stop", "harl-updater")
         self.assertEqual(self.ended_as(), ("success", "2", "15"))
+        self.wait_for_end()
         self.assert_installation_ended_well()
         self.assert_given_back()
         self.assertEqual(self.panel(), {"FAIL": "fail"})
@@ -294,8 +339,60 @@ class Ends(ServiceTest):
         self.start()
         self.wait_for_file("/run/uploads")
         self.inside("systemctl", "stop", "harl-updater")
+        self.wait_for_end()
         self.assert_given_back()
         self.assertEqual(self.panel(), {"FAIL": "fail"})
+
+    def test_crash_while_the_board_installs(self) -> None:
+        self.inside("sh", "-c", "echo 2.1.0 >/srv/board")
+        write_script(self.unit.root() / "usr/local/sbin/scp", "exit 0")
+        self.addCleanup(write_script, self.unit.root() / "usr/local/sbin/scp", TOOLS["scp"])
+        write_script(self.unit.root() / "usr/local/sbin/ssh", TOOLS["ssh"] + BOARD_SCRIPT)
+        self.addCleanup(write_script, self.unit.root() / "usr/local/sbin/ssh", TOOLS["ssh"])
+        self.offer()
+        self.start()
+        self.wait_for_file("/run/board-installs")
+        self.kill("SEGV")
+        self.wait_for_end()
+        self.assert_given_back()
+        self.assertIn("give-back: the board is still at work, waiting for it", self.journal())
+        started = float(self.inside("systemctl", "show", "--value", "--property=ActiveEnterTimestampMonotonic", "harl"))
+        self.assertGreater(started / 1e6, float(self.read("/run/board-ended").split()[0]) + 4)
+        self.assertEqual(self.panel(), {"FAIL": "fail"})
+
+    def test_outcome_whose_byte_failed_is_shown_again(self) -> None:
+        for offered, byte in ((True, "0x13"), (True, "0x2"), (False, "0x15")):
+            with self.subTest(byte=byte):
+                # The first time that the byte lights an outcome, after the sound, it does not arrive.
+                broken = f'[ "$4" != {byte} ] || [ ! -s /var/log/sounds ] || [ -e /run/harl-lost ] || '
+                broken += "{ touch /run/harl-lost; exit 1; }\n"
+                write_script(self.unit.root() / "usr/local/sbin/i2cset", NEWER + broken + KEEP)
+                self.addCleanup(write_script, self.unit.root() / "usr/local/sbin/i2cset", TOOLS["i2cset"])
+                if offered:
+                    self.offer()
+                else:
+                    write_index(self.repository)
+                self.start()
+                self.wait_for_end()
+                self.assertTrue((self.unit.root() / "run/harl-lost").exists())
+                self.assert_given_back()
+                outcome = UPDATED if offered else UP_TO_DATE
+                self.assertEqual(self.panel(faults=True), outcome.panel)
+                self.assertIn("give-back: the outcome was not shown, or not all of it: showing it", self.journal())
+                self.setUp()
+
+    def test_notes_that_cannot_be_written_leave_the_panel_alone(self) -> None:
+        # Prepared as ever; then the file system is full, or refuses writing.
+        for fill in ("head -c 100M /dev/zero >/run/harl-updater/fill || true", "mount -o remount,ro /run/harl-updater"):
+            with self.subTest(fill=fill):
+                self.inside("sh", "-c", "mkdir -p /run/harl-updater; mount -t tmpfs -o size=64k run /run/harl-updater")
+                self.addCleanup(self.unit.status, "umount", "-l", "/run/harl-updater")
+                self.offer(fill)
+                self.start()
+                self.wait_for_end()
+                self.assert_given_back()
+                self.assertEqual(self.panel(), {"PASS": "pass"})
+                self.setUp()
 
     def test_installation_that_a_power_cut_left_behind_is_finished(self) -> None:
         self.offer("touch /run/package-installs")
@@ -327,29 +424,156 @@ class Ends(ServiceTest):
         self.inside("systemctl", "start", "--no-block", "harl-updater")
         self.wait_for_file("/run/package-installs")
         self.inside("systemctl", "stop", "harl-updater")
+        self.wait_for_end()
         self.assertTrue((self.unit.root() / "run/harl-after").exists(), "the script was broken off")
         self.assertEqual(self.package_state(), "install ok installed 1.3.0")
         self.assert_given_back()
         self.assertEqual(self.panel(), {"FAIL": "fail"})
 
-    def test_package_that_cannot_be_set_up_does_not_keep_the_updater(self) -> None:
+    def test_broken_package_is_not_shown_as_up_to_date(self) -> None:
         self.offer("exit 1")
         self.inside("dpkg", "--unpack", "/srv/repository/solvik4-rh_1.3.0_all.deb")
+        self.note_journal()
+        self.assertNotEqual(self.unit.status("systemctl", "start", "harl-updater"), 0)
+        self.wait_for_end()
+        self.assertEqual(self.show("Result"), "exit-code")
+        self.assert_given_back()
+        self.assertEqual(self.panel(), {"FAIL": "fail"})
+        self.assertIn("prepare: solvik4-rh cannot be finished and no other version of it is offered", self.journal())
+        self.assertNotIn("TavrenUpdater", self.journal())
+
+    def test_broken_package_of_which_another_version_is_offered(self) -> None:
+        self.offer("exit 1")
+        self.inside("dpkg", "--unpack", "/srv/repository/solvik4-rh_1.3.0_all.deb")
+        build(Package("solvik4-rh", "1.4.0"), self.repository)
+        write_index(self.repository)
+        self.start()
+        self.wait_for_end()
+        self.assert_given_back()
+        self.assertEqual(self.package_state(), "install ok installed 1.4.0")
+        self.assertIn(self.panel(), ({"PASS": "pass"}, {"REMOTE": "pass", "MAIN": "pass"}))
+
+    def test_other_package_that_stays_broken_does_not_keep_the_updater(self) -> None:
+        self.offer()
+        build(Package("solvik4-data", "1.0", scripts={"postinst": "exit 1"}), self.repository)
+        write_index(self.repository)
+        self.inside("dpkg", "--unpack", "/srv/repository/solvik4-data_1.0_all.deb")
         self.start()
         self.wait_for_end()
         self.assertEqual(self.ended_as(), ("success", "2", "15"))
+        self.assertIn("prepare: still unfinished, left to the updater: solvik4-data", self.journal())
         self.assert_given_back()
+
+    def test_missing_dependency_is_installed_first(self) -> None:
+        self.offer(depends="solvik4-data")
+        build(Package("solvik4-data", "1.0"), self.repository)
+        write_index(self.repository)
+        self.unit.status("dpkg", "--unpack", "/srv/repository/solvik4-rh_1.3.0_all.deb")
+        self.start()
+        self.wait_for_end()
+        self.assertEqual(self.package_state(), "install ok installed 1.3.0")
+        self.assertIn("prepare: the installation is finished", self.journal())
+        self.assertEqual(self.panel(), {"REMOTE": "pass", "MAIN": "pass"})
+
+    def test_changed_configuration_file_is_kept(self) -> None:
+        folder = self.unit.root() / "srv"
+        for version, text in (("1.2.1", "old"), ("1.3.0", "new")):
+            tree = folder / "tree"
+            write(tree / "etc/solvik4.conf", f"{text}\n")
+            write(tree / "DEBIAN/conffiles", "/etc/solvik4.conf\n")
+            control = f"Package: solvik4-rh\nVersion: {version}\nArchitecture: all\nMaintainer: T <t@localhost>\n"
+            write(tree / "DEBIAN/control", control + "Description: test\n")
+            write_script(tree / "DEBIAN/postinst", "grep -qx changed /etc/solvik4.conf || [ $2 != 1.2.1 ]")
+            self.inside("dpkg-deb", "--build", "/srv/tree", f"/srv/repository/solvik4-rh_{version}_all.deb")
+        write_index(self.repository)
+        self.inside("dpkg", "--install", "/srv/repository/solvik4-rh_1.2.1_all.deb")
+        self.inside("sh", "-c", "echo changed >/etc/solvik4.conf")
+        write(self.unit.root() / "etc/apt/apt.conf.d/99contrary", 'DPkg::Options { "--force-confnew"; };\n')
+        self.addCleanup(self.inside, "rm", "-f", "/etc/apt/apt.conf.d/99contrary", "/etc/solvik4.conf")
+        self.start()
+        self.wait_for_end()
+        self.assertEqual(self.package_state(), "install ok installed 1.3.0")
+        self.assertEqual(self.read("/etc/solvik4.conf"), "changed\n")
+        self.assertEqual(self.panel(), {"PASS": "pass"})
+
+    def test_settings_of_the_service_win_over_those_in_etc(self) -> None:
+        write(self.unit.root() / "etc/apt/apt.conf.d/99contrary", CONTRARY)
+        write(self.unit.root() / "etc/apt/apt.conf", CONTRARY + 'Test::Own "kept";\n')
+        self.addCleanup(self.inside, "rm", "-f", "/etc/apt/apt.conf.d/99contrary", "/etc/apt/apt.conf")
+        self.offer()
+        self.start()
+        self.wait_for_end()
+        settings = self.inside("env", "APT_CONFIG=/usr/lib/harl-updater/apt-first.conf", "apt-config", "dump")
+        for prefix in ("", "Binary::apt::"):
+            for setting in ('Acquire::Retries "3"', 'Acquire::http::Timeout "20"', 'DPkg::Lock::Timeout "600"'):
+                lines = [line for line in settings.splitlines() if line.startswith(prefix + setting.split()[0] + " ")]
+                self.assertEqual(lines, [f"{prefix}{setting};"])
+        self.assertIn('Test::Own "kept";', settings)
+        options = [line.split('"')[1] for line in settings.splitlines() if line.startswith("DPkg::Options:: ")]
+        self.assertEqual(options[-4:], ["--refuse-confnew", "--refuse-confask", "--force-confdef", "--force-confold"])
+        self.assertEqual(self.panel(), {"PASS": "pass"})
+
+    def test_jobs_of_apts_own_timers_are_waited_for(self) -> None:
+        job = "[Service]\nType=oneshot\nExecStart=/bin/sleep 8\nExecStart=/bin/touch /run/harl-job\n"
+        write(self.unit.root() / "etc/systemd/system/apt-daily.service", job)
+        self.addCleanup(self.inside, "rm", "/etc/systemd/system/apt-daily.service")
+        self.inside("systemctl", "daemon-reload")
+        self.offer()
+        self.inside("systemctl", "start", "--no-block", "apt-daily")
+        self.assertFalse((self.unit.root() / "run/harl-job").exists())
+        self.start()
+        self.assertTrue((self.unit.root() / "run/harl-job").exists())
+        self.wait_for_end()
+        self.assertEqual(self.panel(), {"PASS": "pass"})
+
+    def test_no_package_script_meets_the_private_folder(self) -> None:
+        self.offer('echo "$PATH" >/run/harl-path; command -v systemctl dpkg ls >>/run/harl-path')
+        self.start()
+        self.wait_for_end()
+        self.assertNotIn("harl-updater", self.read("/run/harl-path"))
+        self.assertIn("systemctl\n", self.read("/run/harl-path"))
+
+    def test_journal_is_synced_before_the_application_starts(self) -> None:
+        self.offer()
+        self.inside("systemctl", "stop", "harl")
+        write(self.unit.root() / "etc/systemd/system/harl.service.d/test.conf", JOURNAL_AT_START)
+        self.addCleanup(self.inside, "rm", "-r", "/etc/systemd/system/harl.service.d")
+        self.inside("systemctl", "daemon-reload")
+        self.start()
+        self.wait_for_end()
+        self.assertIn("Running command: apt --assume-yes install", self.read("/run/harl-journal"))
+
+    def test_logs_are_kept_where_the_journal_is_volatile(self) -> None:
+        settings = self.unit.root() / "etc/systemd/journald.conf.d/test.conf"
+        write(settings, "[Journal]\nStorage=volatile\n")
+        self.inside("sh", "-c", "mv /var/log/journal /var/log/journal.kept; systemctl restart systemd-journald")
+        self.addCleanup(self.inside, "systemctl", "restart", "systemd-journald")
+        self.addCleanup(self.inside, "mv", "/var/log/journal.kept", "/var/log/journal")
+        self.addCleanup(settings.unlink)
+        self.inside("mkdir", "-p", "/var/lib/harl-updater")
+        self.inside("bash", "-c", "cd /var/lib/harl-updater; rm -f *; touch 200{0..9}-01-01_00-00-00.log")
+        self.offer()
+        self.start()
+        self.wait_for_end()
+        kept = sorted(path.name for path in (self.unit.root() / "var/lib/harl-updater").iterdir())
+        self.assertEqual(len(kept), 10)
+        self.assertEqual(kept[0], "2001-01-01_00-00-00.log")
+        log = self.read(f"/var/lib/harl-updater/{kept[-1]}")
+        self.assertIn("TavrenUpdater version: ", log)
+        self.assertIn("static void UpdateManager::stopUpdater()", log)
 
     def test_upgrade_of_the_updater_in_its_own_run(self) -> None:
         service = "lib/systemd/system/harl-updater.service"
-        raise_version(self.unit.root() / "srv/updater.deb", "9.0.0", self.repository, {service: "# newer\n"})
-        self.offer("systemctl daemon-reload\ntouch /run/package-installs\n", f"{self.package} (>= 9.0.0)")
+        newer = "[Unit]\nDescription=newer\n"
+        raise_version(self.unit.root() / "srv/updater.deb", "9.0.0", self.repository, {service: newer})
+        self.offer("touch /run/package-installs\n", f"{self.package} (>= 9.0.0)")
         self.start()
         self.wait_for_file("/run/package-installs")
         self.assertEqual(int(self.show("MainPID")), self.main)
         self.wait_for_end()
         self.assertEqual(self.ended_as(), ("success", "2", "15"))
         self.assertEqual(self.package_state(self.package), "install ok installed 9.0.0")
+        self.assertEqual(self.show("Description"), "newer")  # takes effect with the next run
         self.assert_given_back()
         self.assertEqual(self.panel(), {"PASS": "pass"})
         self.inside("dpkg", "--purge", "solvik4-rh")
@@ -369,7 +593,8 @@ class Ends(ServiceTest):
         self.assertNotEqual(self.show("ActiveState"), "active")
 
 
-if __name__ == "__main__":
+def main() -> None:
+    """Runs the tests of the program, as its usage says."""
     programs, package, system = take_path(), take_word(), take_path()
     architecture = subprocess.check_output(["dpkg", "--print-architecture"], text=True).strip()
     found = sorted((ROOT / "build/package").glob(f"{package}_*_{architecture}.deb"))
@@ -386,3 +611,7 @@ if __name__ == "__main__":
         ServiceTest.unit, ServiceTest.package = made, package
         install(made)
         unittest.main(verbosity=2)
+
+
+if __name__ == "__main__":
+    main()

@@ -16,7 +16,7 @@ from bench import scenario
 from bench.expected import COMMANDS, expected_commands, expected_log
 from bench.makers.sticks import write_stick
 from bench.outcomes import CHECK_FAILED, ENDED_EARLY, INSTALLATION_FAILED, UP_TO_DATE, UPDATED, Outcome
-from bench.panel import COLOR_CODES, LED_CODES
+from bench.panel import COLOR_CODES, color_name, led_name
 from tests.command_line import take_path
 
 ROOT = Path(__file__).resolve().parents[3]
@@ -149,9 +149,9 @@ class Patterns(unittest.TestCase):
 
     def test_service_lights_what_is_told(self) -> None:
         script = (ROOT / "service/give-back").read_text()
-        lit = re.findall(r"^    send (0x\w+) (0x\w+)$", script, re.MULTILINE)  # behind the loop that darkens all
-        pairs = [(int(led, 16), int(color, 16)) for led, color in lit]
-        self.assertEqual(pairs, [(LED_CODES[led], COLOR_CODES[color]) for led, color in ENDED_EARLY.panel.items()])
+        [led] = re.findall(r"^        wanted=(0x\w+)$", script, re.MULTILINE)  # without an outcome
+        color = re.findall(r"^            color=(0x\w+)$", script, re.MULTILINE)[-1]
+        self.assertEqual({led_name(int(led, 16)): color_name(int(color, 16))}, ENDED_EARLY.panel)
 
     def test_colour_codes(self) -> None:
         for name in ("blue", "pass", "fail"):

@@ -1,0 +1,41 @@
+#pragma once
+
+/// How long the updater's tools may take. docs/reliability.md says what the operator sees when a limit is reached.
+struct Limit
+{
+    const char* name; ///< calls of one name share a budget
+    const char* tool; ///< as it is called
+    const char* word; ///< what one of its arguments contains; null: any call
+    double call;      ///< s, for one call
+    double budget;    ///< s in one run, for all calls that reach their limit together
+    bool everyCall;   ///< the budget counts the others as well
+    bool noted;       ///< its beginning and its end are noted, for what runs after the updater
+};
+
+#ifdef LIMITS
+#include LIMITS // shorter ones, for tests
+#else
+/// The first that fits counts. The last is for everything that is not named before.
+inline constexpr Limit limits[] = {
+    {"panel", "i2cset", nullptr, 5, 60, false, false},
+    {"sound", "aplay", nullptr, 120, 120, false, false},
+    {"stick", "ls", nullptr, 120, 120, false, false},
+    {"detach", "umount", "--lazy", 20, 20, false, false},
+    {"stick", "umount", nullptr, 120, 120, false, false},
+    {"services", "systemctl", nullptr, 300, 300, false, false},
+    {"mirrors", "apt", "update", 1200, 1200, false, false},
+    {"versions", "apt-cache", nullptr, 180, 180, false, false},
+    {"installation", "apt", nullptr, 5400, 5400, false, true},
+    {"board-version", "ssh", "version.txt", 180, 180, false, false},
+    {"upload", "scp", nullptr, 3600, 3600, true, false}, // 20 attempts of two copies
+    {"board-script", "ssh", nullptr, 1800, 1800, false, true},
+    {"repair", "dpkg", nullptr, 600, 720, true, false},
+    {"repair", "apt-get", nullptr, 600, 720, true, false},
+    {"journal", "journalctl", nullptr, 5, 20, false, false},
+    {"other", nullptr, nullptr, 300, 300, false, false},
+};
+/// From the request to end to the kill, and from the kill until what does not die is left behind.
+inline constexpr double grace = 3; // s
+/// How long output is still waited for that another process holds open when the tool has ended.
+inline constexpr double silence = 1; // s
+#endif

@@ -20,7 +20,7 @@ class Settings:
     """What a file may say beside `summary`, `like` and `expect`."""
 
     # what befalls the updater while the package's maintainer script is at work
-    event: Literal["nothing", "crash", "stop", "out-of-memory", "power-cut"] = "nothing"
+    event: Literal["nothing", "crash", "stop", "out-of-memory", "power-cut", "give-back-killed"] = "nothing"
     script_seconds: int = 0  # that the package's maintainer script takes
     needs_newer_updater: bool = False  # the offered package depends on a newer harl-updater, which is offered too
 

@@ -1,4 +1,5 @@
 /// The limits of service/limits.h, shortened.
+// clang-format off
 inline constexpr Limit limits[] = {
     {"panel", "i2cset", nullptr, 1, 3, false, false},
     {"sound", "aplay", nullptr, 2, 2, false, false},
@@ -7,6 +8,7 @@ inline constexpr Limit limits[] = {
     {"stick", "umount", nullptr, 2, 2, false, false},
     {"services", "systemctl", nullptr, 5, 5, false, false},
     {"mirrors", "apt", "update", 6, 6, false, false},
+    {"versions", "apt-cache", nullptr, 4, 4, false, false},
     {"installation", "apt", nullptr, 20, 20, false, true},
     {"board-version", "ssh", "version.txt", 3, 3, false, false},
     {"upload", "scp", nullptr, 6, 6, true, false}, // 20 attempts of two copies
@@ -16,5 +18,6 @@ inline constexpr Limit limits[] = {
     {"journal", "journalctl", nullptr, 2, 6, false, false},
     {"other", nullptr, nullptr, 3, 3, false, false},
 };
+// clang-format on
 inline constexpr double grace = 0.5;   // s
 inline constexpr double silence = 0.5; // s

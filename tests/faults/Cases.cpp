@@ -11,6 +11,7 @@ namespace
 std::vector<Unit> units()
 {
     std::vector<Unit> all;
+    all.reserve(12);
     for (int bits = 0; bits < 4; ++bits) {
         all.push_back({false, (bits & 1) != 0, (bits & 2) != 0, false});
     }
@@ -32,7 +33,8 @@ std::string Case::name() const
         text += "__" + injection.step + "_" + injection.fault->name;
         text += injection.times == 0 ? "" : "_times" + std::to_string(injection.times);
     }
-    text.erase(std::remove_if(text.begin(), text.end(), [](char c) { return !isalnum(c) && c != '_'; }), text.end());
+    text.erase(std::remove_if(text.begin(), text.end(), [](char c) { return isalnum(c) == 0 && c != '_'; }),
+               text.end());
     return text;
 }
 

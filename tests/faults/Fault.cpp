@@ -27,7 +27,7 @@ std::string afterTenMebibytes(const std::string& healthy)
 
 std::string afterMebibyteLine(const std::string& healthy)
 {
-    return std::string(1024 * 1024, 'x') + '\n' + healthy;
+    return std::string(1 << 20, 'x') + '\n' + healthy;
 }
 
 std::string afterEveryByte(const std::string& healthy)

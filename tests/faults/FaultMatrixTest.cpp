@@ -107,7 +107,9 @@ void expectFailuresLogged()
         if (fails && command.compare(0, 7, "i2cset ") == 0) {
             failed.push_back(command);
         }
-        failedSounds += fails && command.compare(0, 6, "aplay ") == 0;
+        if (fails && command.compare(0, 6, "aplay ") == 0) {
+            ++failedSounds;
+        }
     }
     platform::Lines logged = entries("log:system returned false: ");
     for (platform::Lines* lines : {&failed, &logged}) { // two threads send LED commands

@@ -10,7 +10,7 @@ import tempfile
 import unittest
 from pathlib import Path
 
-import jsonschema  # type: ignore  # of Debian's python3-jsonschema
+import jsonschema  # of Debian's python3-jsonschema
 
 ROOT = Path(__file__).resolve().parents[2]
 GOLDEN = ROOT / "tests/companion/golden/log"

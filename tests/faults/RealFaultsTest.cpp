@@ -7,6 +7,7 @@
 
 #include <gtest/gtest.h>
 
+#include <array>
 #include <algorithm>
 #include <csignal>
 #include <cstdlib>
@@ -176,7 +177,8 @@ void RealRun::start()
     setpgid(0, 0);
     const std::string path = "PATH=" + (mFolder / "bin").string();
     const std::string calls = "BENCH_CALLS=" + (mFolder / "calls").string();
-    const char* environment[] = {path.c_str(), calls.c_str(), "BENCH_SPEED=2000", "LD_PRELOAD=" CALL_RECORDER, nullptr};
+    const std::string recorder = std::string("LD_PRELOAD=") + CALL_RECORDER;
+    const char* environment[] = {path.c_str(), calls.c_str(), "BENCH_SPEED=2000", recorder.c_str(), nullptr};
     const int log = open((mFolder / "log").c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
     dup2(open("/dev/null", O_RDWR), STDIN_FILENO);
     dup2(STDIN_FILENO, STDERR_FILENO);
@@ -207,13 +209,16 @@ void RealRun::expectCalls(const Expected& expected)
     std::ifstream file(mFolder / "calls");
     for (std::string line; std::getline(file, line);) {
         std::istringstream columns(line);
-        std::string time, thread, call, phase, value, text;
-        for (std::string* column : {&time, &thread, &call, &phase, &value}) {
-            std::getline(columns, *column, '\t');
+        std::array<std::string, 5> column;
+        for (std::string& text : column) {
+            std::getline(columns, text, '\t');
         }
+        const auto& [time, thread, call, phase, value] = column;
+        std::string text;
         std::getline(columns, text);
         if (phase == "start") {
-            calls.push_back({thread, call == "nanosleep" ? "sleep:" + value : call + ":" + text});
+            text.insert(0, call + ":");
+            calls.push_back({thread, call == "nanosleep" ? "sleep:" + value : text});
         }
     }
     const auto first =
@@ -244,8 +249,11 @@ void RealRun::expectLog()
         const std::optional<platform::Record> record = platform::parseRecord(text);
         ASSERT_TRUE(record) << text;
         EXPECT_EQ(record->message.find("Updater | "), std::string::npos) << "torn: " << text;
-        reports += record->function.find("Callback(UpdateManager::Result)") != std::string::npos;
-        reports += record->function.find("Callback(UpdateManager::Error)") != std::string::npos;
+        for (const char* callback : {"Callback(UpdateManager::Result)", "Callback(UpdateManager::Error)"}) {
+            if (record->function.find(callback) != std::string::npos) {
+                ++reports;
+            }
+        }
         records.push_back(*record);
     }
     ASSERT_GT(records.size(), 20U);

@@ -24,7 +24,9 @@ std::ptrdiff_t openDescriptors()
 TEST(Resources, TenThousandCommandsLeaveNoDescriptorAndNoProcess)
 {
     std::cout.rdbuf(nullptr);
-    const std::string path = std::getenv("PATH");
+    const char* variable = std::getenv("PATH");
+    ASSERT_NE(variable, nullptr);
+    const std::string path = variable;
     std::string tools = testing::TempDir() + "resources-XXXXXX";
     ASSERT_NE(mkdtemp(tools.data()), nullptr);
     fs::create_symlink("/bin/true", fs::path(tools) / "systemctl"); // the machine's own must not be reached

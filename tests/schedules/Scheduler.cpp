@@ -8,7 +8,7 @@ namespace
 {
 
 const std::size_t stackSize = std::size_t{256} * 1024; // bytes; the updater's runner has a buffer of 64 KiB there
-const int pausesWithoutEnd = 8;           // of a thread that nobody else is left to stop
+const int pausesWithoutEnd = 8;                        // of a thread that nobody else is left to stop
 Scheduler* scheduler = nullptr;
 
 } // namespace

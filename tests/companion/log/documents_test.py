@@ -295,7 +295,7 @@ class Names(unittest.TestCase):
     def test_each_failure_that_is_reported_is_in_the_row_of_its_report(self) -> None:
         rows = table(TECHNICIAN, "LEDs", "Sound", "The updater reported", "Names")
         for name, failure in catalogue().items():
-            for report in filter(None, failure["reported"].split(", ")):
+            for report in [name for name in failure["reported"].split(", ") if name]:
                 cells = [row[3] for row in rows if report in row[2] or (
                     report == "ERROR_CHECK_UPDATE" and "the same" in row[2])]
                 if not name.startswith("teamviewer-"):  # on the main head, whose program has its own panel

@@ -13,7 +13,7 @@ int updaterMain(int, char**); // main() of the remote head's program, renamed fo
 
 /// A race ends the process at once, so that it cannot be overlooked. The main head's workers are left to run out, by
 /// intention: that is no leak to report.
-extern "C" const char* __tsan_default_options()
+extern "C" const char* __tsan_default_options() // NOLINT(bugprone-reserved-identifier): the sanitizer calls it
 {
     return "halt_on_error=1 report_thread_leaks=0";
 }

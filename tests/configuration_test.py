@@ -37,7 +37,7 @@ class ConfigurationTest(unittest.TestCase):
         )
         return done.returncode, re.sub(r"\s+", " ", done.stdout) if done.returncode else done.stdout
 
-    def tests(self, *options: str, **variables: str) -> tuple[set[str], str]:
+    def list_tests(self, *options: str, **variables: str) -> tuple[set[str], str]:
         """The names of the tests, of a whole executable's where it finds them itself, and the output of CMake."""
         status, output = self.configure(*options, **variables)
         self.assertEqual(status, 0, output)
@@ -47,21 +47,21 @@ class ConfigurationTest(unittest.TestCase):
         return {test["name"].removesuffix("_NOT_BUILT") for test in json.loads(shown.stdout)["tests"]}, output
 
     def test_flags_leave_no_test_out(self) -> None:
-        expected, output = self.tests()
+        expected, output = self.list_tests()
         self.assertNotIn("Tests left out", output)
         self.assertIn("Bench.package-and-board", expected)
         flags = {"CPPFLAGS": "-DSOME", "CXXFLAGS": "-g", "LDFLAGS": "-Wl,-O1"}
         (self.folder / "CMakeCache.txt").unlink()
-        seen, output = self.tests("-DCMAKE_BUILD_TYPE=Debug", **flags)
+        seen, output = self.list_tests("-DCMAKE_BUILD_TYPE=Debug", **flags)
         self.assertIn("CMAKE_CXX_FLAGS:STRING=-g", (self.folder / "CMakeCache.txt").read_text())
         self.assertEqual(seen, expected)
         self.assertNotIn("Tests left out", output)
 
     def test_what_is_left_out_is_named(self) -> None:
-        everything, _ = self.tests()
+        everything, _ = self.list_tests()
         for option in ("-DSANITIZER=address", "-DCOMPANION=OFF"):
             with self.subTest(option):
-                seen, output = self.tests("-DSANITIZER=", "-DCOMPANION=ON", option)
+                seen, output = self.list_tests("-DSANITIZER=", "-DCOMPANION=ON", option)
                 named = re.findall("^-- Tests left out: (.*?): ", output, re.MULTILINE)
                 patterns = [pattern for names in named for pattern in names.split(", ")]
                 missing = everything - seen
@@ -74,7 +74,7 @@ class ConfigurationTest(unittest.TestCase):
         status, output = self.configure(without)
         self.assertNotEqual(status, 0)
         self.assertIn("harl-updater-tool needs libcli11-dev: install them, or configure with -DCOMPANION=OFF.", output)
-        _, output = self.tests(without, "-DCOMPANION=AUTO")
+        _, output = self.list_tests(without, "-DCOMPANION=AUTO")
         self.assertIn("CMake Warning", output)
         self.assertIn("libcli11-dev", output)
 

@@ -39,7 +39,7 @@ TEST(Report, TextBeginsWithTheMostSeriousAndEndsWithTheVerdict)
                          "Longer:  text\n"
                          "\nerror: B. [b]\n"
                          "  The updater: fails.\n"
-                         "  To mend it:  Mend it.\n"
+                         "  Fix:         Mend it.\n"
                          "\nnote: A. [a]\n"
                          "  The updater: is fine.\n"
                          "\nThe thing is NOT fit for an update.\n");
@@ -53,7 +53,7 @@ TEST(Report, JsonKeepsTheOrderOfTheChecks)
     report.write(true, out);
     const nlohmann::json json = nlohmann::json::parse(out.str());
     EXPECT_EQ(json, nlohmann::json::parse(R"({
-        "command": "check", "subject": "The thing", "status": 2, "fit": false, "facts": {"some_fact": 3},
+        "command": "check", "version": 1, "subject": "The thing", "status": 2, "fit": false, "facts": {"some_fact": 3},
         "findings": [
             {"severity": "note", "check": "a-check", "what": "Something.", "effect": "does something.", "remedy": ""},
             {"severity": "unchecked", "check": "a-check", "what": "Something.", "effect": "does something.",

@@ -173,7 +173,7 @@ TEST_F(Flashing, SignalDoesNotShortenTheSecond)
             return 0;
         }
         ++calls;
-        *remaining = {0, calls * 1000};
+        *remaining = {0, calls * 1000L};
         errno = EINTR;
         return -1;
     });

@@ -61,11 +61,13 @@ TEST_F(LogTest, RecordIsOnePieceAndFlushed)
 
 TEST_F(LogTest, RecordUnderABraceLessIfBelongsToIt)
 {
+    // NOLINTBEGIN(readability-braces-around-statements)
     for (const bool speak : {false, true})
         if (speak)
             LOG() << "then";
         else
             platform::note("else");
+    // NOLINTEND(readability-braces-around-statements)
     EXPECT_EQ(journal(), (Lines{"else", "log:then"}));
 }
 

@@ -25,7 +25,10 @@ class Events : public LogSink
 public:
     void record(const ParsedRecord& record) override
     {
-        note(record.line, "record");
+        // That a head has no message is known only behind lines of others.
+        expect(record.line > mLastRecord, "records in order");
+        mLastRecord = record.line;
+        mText << '\n' << record.line << " record";
         for (const std::string_view text :
              {record.thread, record.file, record.operation, record.message.value_or("(none)")}) {
             expect(text.find('\n') == std::string_view::npos, "a record's text in one line");
@@ -42,18 +45,19 @@ public:
     void torn(std::uint64_t line) override { note(line, "torn"); }
 
     std::string text() const { return mText.str(); }
-    std::uint64_t lastLine() const { return mLastLine; }
+    std::uint64_t lastLine() const { return std::max(mLastLine, mLastRecord); }
 
 private:
     void note(std::uint64_t line, const char* kind)
     {
-        expect(line >= mLastLine && line > 0, "lines in order");
-        mLastLine = line;
+        expect(line > 0, "lines count from 1");
+        mLastLine = std::max(mLastLine, line);
         mText << '\n' << line << ' ' << kind;
     }
 
     std::ostringstream mText;
     std::uint64_t mLastLine = 0;
+    std::uint64_t mLastRecord = 0;
 };
 
 void feed(LogParser& parser, std::string_view log, std::size_t blockSize)

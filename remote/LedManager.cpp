@@ -19,7 +19,7 @@ __attribute__((format(printf, 1, 2))) std::string formatCommand(const char* form
     char buffer[200] = {};
     va_list arguments;
     va_start(arguments, format);
-    std::vsnprintf(buffer, sizeof buffer, format, arguments);
+    std::vsnprintf(buffer, sizeof buffer, format, arguments); // NOLINT(clang-analyzer-valist.Uninitialized): false
     va_end(arguments);
     return buffer;
 }

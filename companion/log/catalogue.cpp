@@ -13,7 +13,6 @@ namespace
 
 using S = StepKind;
 
-const char updateAgain[] = "Then run the update again.";
 const char unitCheck[] = "Run harl-updater-tool unit and follow its remedies, then run the update again.";
 const char configure[] = "On the unit run: dpkg --configure -a, and correct what it names. Only then run the update "
                          "again: it would take the package for installed.";
@@ -360,7 +359,7 @@ const Failure* failureOf(const Run& run, const Step& step)
         return entry("package-not-read");
     }
     const long code = step.status ? step.status->number : step.word == "NO_INTERNET_ERROR_CODE" ? 100 : 0;
-    const auto rule = std::find_if(std::begin(rules), std::end(rules), [&](const Rule& candidate) {
+    const auto* const rule = std::find_if(std::begin(rules), std::end(rules), [&](const Rule& candidate) {
         return candidate.step == step.kind && (candidate.code == anyCode || candidate.code == code);
     });
     if (rule == std::end(rules)) {
@@ -547,8 +546,8 @@ nlohmann::ordered_json phrasesOf(const Failure& failure)
 
 const Failure* findFailure(std::string_view name)
 {
-    const auto found = std::find_if(std::begin(failures), std::end(failures),
-                                    [&](const Failure& failure) { return failure.name == name; });
+    const auto* const found = std::find_if(std::begin(failures), std::end(failures),
+                                           [&](const Failure& failure) { return failure.name == name; });
     return found == std::end(failures) ? nullptr : found;
 }
 

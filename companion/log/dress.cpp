@@ -81,10 +81,10 @@ void Dress::feed(std::string_view block)
     if (mFormat == Format::UNKNOWN) {
         const std::string_view start = block.substr(0, 300);
         const bool json = startsWith(start, "{") || startsWith(start, "data: {") || startsWith(start, "\x1e");
-        mFormat = startsWith(start, "__CURSOR=")                                ? Format::FIELDS
-                  : json                                                        ? Format::JSON
-                  : start.substr(0, start.find('\n')).find("[s=") != start.npos ? Format::VERBOSE
-                                                                                : Format::PLAIN;
+        mFormat = startsWith(start, "__CURSOR=")                                            ? Format::FIELDS
+                  : json                                                                    ? Format::JSON
+                  : start.substr(0, start.find('\n')).find("[s=") != std::string_view::npos ? Format::VERBOSE
+                                                                                            : Format::PLAIN;
     }
     if (mFormat == Format::PLAIN) {
         hand(block);

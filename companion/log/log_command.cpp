@@ -276,7 +276,7 @@ std::string openSource(const LogOptions& options, std::size_t index, LogSource& 
     if (options.journal) {
         return source.openJournal(options.follow);
     }
-    const std::string wrong = source.openFile(options.files.empty() ? "-" : options.files[index]);
+    std::string wrong = source.openFile(options.files.empty() ? "-" : options.files[index]);
     if (wrong.empty() && isatty(source.descriptor()) == 1) {
         err << "harl-updater-tool: reading the log from the terminal; end it with Ctrl-D.\n";
     }

@@ -212,7 +212,8 @@ Meaning meaningOfAny(const WordRange& range)
 {
     Meaning meaning;
     const auto& [begin, end] = range;
-    const bool oneStep = std::all_of(begin, end, [&](const Word& word) { return word.step == begin->step; });
+    const bool oneStep =
+        std::all_of(begin, end, [front = begin](const Word& word) { return word.step == front->step; });
     if (begin == end || !oneStep) {
         return meaning;
     }

@@ -39,6 +39,8 @@ public:
     void otherLine(std::uint64_t line, std::string_view program, std::string_view text) override
     {
         expect(text.find('\n') == std::string_view::npos, "one line");
+        expect(line >= mLastOther, "lines of others in order");
+        mLastOther = line;
         note(line, "other");
         mText << '\t' << program << '\t' << text;
     }
@@ -58,6 +60,7 @@ private:
     std::ostringstream mText;
     std::uint64_t mLastLine = 0;
     std::uint64_t mLastRecord = 0;
+    std::uint64_t mLastOther = 0;
 };
 
 void feed(LogParser& parser, std::string_view log, std::size_t blockSize)

@@ -13,6 +13,7 @@ import time
 import unittest
 from collections.abc import Callable
 from pathlib import Path
+from typing import Any
 
 from bench.machine.machine import Machine, MachineError, machine
 from bench.makers.files import write, write_script
@@ -188,8 +189,8 @@ class ServiceTest(unittest.TestCase):
         wait_for("end of the service", lambda: self.states() <= {"inactive", "failed"}, 90)
 
     def states(self) -> set[str]:
-        """What the service and the one that gives the instrument back do."""
-        return set(self.inside("systemctl", "show", "--value", "--property=ActiveState", *UNITS).split())
+        """What the service and the one that gives the instrument back do; a number for a start that is still queued."""
+        return set(self.inside("systemctl", "show", "--value", "--property=ActiveState,Job", *UNITS).split())
 
     def ended_as(self) -> tuple[str, str, str]:
         """Result of the service, and how the updater's process ended."""
@@ -593,6 +594,15 @@ class Ends(ServiceTest):
         self.assertNotEqual(self.show("ActiveState"), "active")
 
 
+class Result(unittest.TextTestResult):
+    """Prints the journal of a run that did not end as it should."""
+
+    def addFailure(self, test: unittest.TestCase, err: Any) -> None:  # noqa: N802
+        super().addFailure(test, err)
+        if isinstance(test, ServiceTest):
+            self.stream.write(test.journal())
+
+
 def main() -> None:
     """Runs the tests of the program, as its usage says."""
     programs, package, system = take_path(), take_word(), take_path()
@@ -610,7 +620,7 @@ def main() -> None:
             skip(f"this machine allows no machine of its own: {error}")
         ServiceTest.unit, ServiceTest.package = made, package
         install(made)
-        unittest.main(verbosity=2)
+        unittest.main(verbosity=2, testRunner=unittest.TextTestRunner(resultclass=Result, verbosity=2))
 
 
 if __name__ == "__main__":

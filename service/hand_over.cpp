@@ -31,6 +31,7 @@
 #include <ctime>
 #include <dirent.h>
 #include <fcntl.h>
+#include <iterator>
 #include <poll.h>
 #include <sys/auxv.h>
 #include <sys/prctl.h>
@@ -38,8 +39,6 @@
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
-
-extern char** environ;
 
 namespace
 {
@@ -73,7 +72,7 @@ __attribute__((format(printf, 1, 2))) void say(const char* format, ...)
     char line[1000];
     va_list arguments;
     va_start(arguments, format);
-    std::vsnprintf(line, sizeof line, format, arguments);
+    std::vsnprintf(line, sizeof line, format, arguments); // NOLINT(clang-analyzer-valist.Uninitialized): false
     va_end(arguments);
     dprintf(STDERR_FILENO, "hand-over: %s\n", line);
 }
@@ -101,6 +100,7 @@ __attribute__((format(printf, 1, 2))) void note(const char* format, ...)
     int length = std::snprintf(line, sizeof line, "%.2f ", now());
     va_list arguments;
     va_start(arguments, format);
+    // NOLINTNEXTLINE(clang-analyzer-valist.Uninitialized): false
     length += std::vsnprintf(line + length, sizeof line - static_cast<size_t>(length), format, arguments);
     va_end(arguments);
     length = std::min(length, static_cast<int>(sizeof line) - 1);
@@ -175,8 +175,8 @@ int findReal(const char* tool, char (&path)[PATH_MAX])
     char* search = std::getenv("PATH");
     struct stat own = {};
     struct stat other = {};
-    const char* called =
-        reinterpret_cast<const char*>(getauxval(AT_EXECFN)); // the path that was executed, getauxval(3)
+    // The path that was executed, getauxval(3). NOLINTNEXTLINE(performance-no-int-to-ptr)
+    const char* called = reinterpret_cast<const char*>(getauxval(AT_EXECFN));
     const long calledFolder = called == nullptr ? 0 : baseName(called) - called - 1;
     stat("/proc/self/exe", &own);
     path[0] = '\0';
@@ -282,7 +282,7 @@ public:
     /// What the tool writes to, or -1 for our own output.
     int toolsEnd() const { return mToolsEnd; }
     /// Once the tool runs.
-    void begin()
+    void begin() const
     {
         if (isOpen()) {
             ::close(mToolsEnd);
@@ -320,7 +320,7 @@ private:
     int mSource = -1;
     int mToolsEnd = -1;
     int mSignals = -1;
-    char mBuffer[PIPE_BUF];
+    char mBuffer[PIPE_BUF] = {};
     size_t mLength = 0; // of what is read and not yet written
 };
 
@@ -361,7 +361,7 @@ void signalDescendants(int signal)
         return;
     }
     while (const dirent* entry = readdir(folder)) {
-        if (std::isdigit(static_cast<unsigned char>(entry->d_name[0])) && end != std::end(processes)) {
+        if (std::isdigit(static_cast<unsigned char>(entry->d_name[0])) != 0 && end != std::end(processes)) {
             *end++ = {std::atoi(entry->d_name), parentOf(entry->d_name), false};
         }
     }
@@ -425,7 +425,9 @@ struct Streams
 
 pid_t start(const char* path, char** arguments, const Streams& streams)
 {
-    const pid_t child = vfork(); // a copy of the memory would take longer than all the rest
+    // A copy of the memory would take longer than all the rest. The child has descriptors and signal settings of its
+    // own, vfork(2). NOLINTBEGIN(clang-analyzer-security.insecureAPI.vfork,clang-analyzer-unix.Vfork)
+    const pid_t child = vfork();
     if (child == 0) {
         if (streams.output != -1) {
             dup2(streams.output, STDOUT_FILENO);
@@ -437,6 +439,7 @@ pid_t start(const char* path, char** arguments, const Streams& streams)
         sigprocmask(SIG_SETMASK, &inheritedMask, nullptr);
         execute(path, arguments);
     }
+    // NOLINTEND(clang-analyzer-security.insecureAPI.vfork,clang-analyzer-unix.Vfork)
     return child;
 }
 
@@ -461,7 +464,8 @@ int supervise(const char* path, char** arguments, double seconds, Streams stream
     int status = running;
     double silent = now() + silence;
     while (now() < end) {
-        const double wait = std::min(end, status == running ? end : silent) - now();
+        const double begin = now();
+        const double wait = std::min(end, status == running ? end : silent) - begin;
         const bool relayed = relay.isOpen(); // then it has waited for signals too
         if (relayed && relay.move(wait)) {
             silent = now() + silence;
@@ -479,7 +483,7 @@ int supervise(const char* path, char** arguments, double seconds, Streams stream
         if (!relay.isOpen()) {
             return status;
         }
-        if (!relay.isFull() && now() >= silent) {
+        if (!relay.isFull() && begin >= silent) { // and nothing has come since
             say("%s: its output is held open by another process; cut", name);
             return status;
         }
@@ -627,7 +631,7 @@ int controlServices(int count, char** arguments)
         sigemptyset(&none);
         sigprocmask(SIG_SETMASK, &none, nullptr);
         raise(signal);
-        _exit(128 + signal);
+        _exit(128 + signal); // cppcheck-suppress unreachableCode
     }
     _exit(WEXITSTATUS(status));
 }

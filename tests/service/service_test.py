@@ -230,7 +230,7 @@ class ServiceTest(unittest.TestCase):
 
 
 class Ends(ServiceTest):
-    """One test for each end."""
+    """One test for each end of the updater."""
 
     def test_normal_end(self) -> None:
         self.offer()
@@ -246,15 +246,6 @@ class Ends(ServiceTest):
         last = list(RECORD.finditer(log))[-1]
         self.assertEqual(last["function"], "static void UpdateManager::stopUpdater()")
         self.assertNotIn("give-back", log)
-
-    def test_failure_keeps_its_own_outcome(self) -> None:
-        self.offer("exit 1")
-        self.start()
-        self.wait_for_end()
-        self.assertEqual(self.ended_as(), ("success", "2", "15"))
-        self.assert_given_back()
-        self.assertEqual(self.panel(), {"FAIL": "fail"})
-        self.assertNotIn("give-back", self.journal())
 
     def test_killed_during_the_installation(self) -> None:
         # With the first of two packages not yet unpacked, most of the work is still to be done.
@@ -324,16 +315,6 @@ class Ends(ServiceTest):
         self.assertEqual(self.panel(), {"FAIL": "fail"})
         self.assertEqual(self.package_state(), "install ok installed 1.2.0")
 
-    def test_crash_after_the_outcome_was_shown(self) -> None:
-        self.set_speed(3)  # time to meet it while the outcome is shown
-        self.offer()
-        self.start()
-        wait_for("outcome", lambda: self.panel() == {"PASS": "pass"})
-        self.kill("ABRT")
-        self.wait_for_end()
-        self.assert_given_back()
-        self.assertEqual(self.panel(), {"PASS": "pass"})
-
     def test_stopped_when_the_package_itself_has_started_the_application(self) -> None:
         self.inside("sh", "-c", "echo 2.1.0 >/srv/board")
         self.offer("systemctl start harl")
@@ -360,6 +341,29 @@ class Ends(ServiceTest):
         started = float(self.inside("systemctl", "show", "--value", "--property=ActiveEnterTimestampMonotonic", "harl"))
         self.assertGreater(started / 1e6, float(self.read("/run/board-ended").split()[0]) + 4)
         self.assertEqual(self.panel(), {"FAIL": "fail"})
+
+
+class Outcomes(ServiceTest):
+    """What the panel shows is true."""
+
+    def test_failure_keeps_its_own_outcome(self) -> None:
+        self.offer("exit 1")
+        self.start()
+        self.wait_for_end()
+        self.assertEqual(self.ended_as(), ("success", "2", "15"))
+        self.assert_given_back()
+        self.assertEqual(self.panel(), {"FAIL": "fail"})
+        self.assertNotIn("give-back", self.journal())
+
+    def test_crash_after_the_outcome_was_shown(self) -> None:
+        self.set_speed(3)  # time to meet it while the outcome is shown
+        self.offer()
+        self.start()
+        wait_for("outcome", lambda: self.panel() == {"PASS": "pass"})
+        self.kill("ABRT")
+        self.wait_for_end()
+        self.assert_given_back()
+        self.assertEqual(self.panel(), {"PASS": "pass"})
 
     def test_outcome_whose_byte_failed_is_shown_again(self) -> None:
         for offered, byte in ((True, "0x13"), (True, "0x2"), (False, "0x15")):
@@ -394,6 +398,10 @@ class Ends(ServiceTest):
                 self.assert_given_back()
                 self.assertEqual(self.panel(), {"PASS": "pass"})
                 self.setUp()
+
+
+class Repairs(ServiceTest):
+    """What comes before the updater: other package tools, and an installation that a power cut broke off."""
 
     def test_installation_that_a_power_cut_left_behind_is_finished(self) -> None:
         self.offer("touch /run/package-installs")
@@ -476,6 +484,23 @@ class Ends(ServiceTest):
         self.assertIn("prepare: the installation is finished", self.journal())
         self.assertEqual(self.panel(), {"REMOTE": "pass", "MAIN": "pass"})
 
+    def test_jobs_of_apts_own_timers_are_waited_for(self) -> None:
+        job = "[Service]\nType=oneshot\nExecStart=/bin/sleep 8\nExecStart=/bin/touch /run/harl-job\n"
+        write(self.unit.root() / "etc/systemd/system/apt-daily.service", job)
+        self.addCleanup(self.inside, "rm", "/etc/systemd/system/apt-daily.service")
+        self.inside("systemctl", "daemon-reload")
+        self.offer()
+        self.inside("systemctl", "start", "--no-block", "apt-daily")
+        self.assertFalse((self.unit.root() / "run/harl-job").exists())
+        self.start()
+        self.assertTrue((self.unit.root() / "run/harl-job").exists())
+        self.wait_for_end()
+        self.assertEqual(self.panel(), {"PASS": "pass"})
+
+
+class Surroundings(ServiceTest):
+    """Settings, logs and packages around a run, its own among them."""
+
     def test_changed_configuration_file_is_kept(self) -> None:
         folder = self.unit.root() / "srv"
         for version, text in (("1.2.1", "old"), ("1.3.0", "new")):
@@ -512,19 +537,6 @@ class Ends(ServiceTest):
         self.assertIn('Test::Own "kept";', settings)
         options = [line.split('"')[1] for line in settings.splitlines() if line.startswith("DPkg::Options:: ")]
         self.assertEqual(options[-4:], ["--refuse-confnew", "--refuse-confask", "--force-confdef", "--force-confold"])
-        self.assertEqual(self.panel(), {"PASS": "pass"})
-
-    def test_jobs_of_apts_own_timers_are_waited_for(self) -> None:
-        job = "[Service]\nType=oneshot\nExecStart=/bin/sleep 8\nExecStart=/bin/touch /run/harl-job\n"
-        write(self.unit.root() / "etc/systemd/system/apt-daily.service", job)
-        self.addCleanup(self.inside, "rm", "/etc/systemd/system/apt-daily.service")
-        self.inside("systemctl", "daemon-reload")
-        self.offer()
-        self.inside("systemctl", "start", "--no-block", "apt-daily")
-        self.assertFalse((self.unit.root() / "run/harl-job").exists())
-        self.start()
-        self.assertTrue((self.unit.root() / "run/harl-job").exists())
-        self.wait_for_end()
         self.assertEqual(self.panel(), {"PASS": "pass"})
 
     def test_no_package_script_meets_the_private_folder(self) -> None:

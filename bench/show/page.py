@@ -9,14 +9,14 @@ from string import Template
 from bench.show.text import Summary
 from bench.observation import Call, Run, now
 from bench.panel import STEP_UNIT, Panel, color_name, led_name
+from bench.show.panel import fill_of, panel_picture
 
 WIDTH = 1200  # of the timeline; all lengths are in the drawing's own unit
 LEFT = 90  # of the time axis; before it stand the names of the LEDs
 RIGHT = 16  # margin behind the axis
 ROW = 20
 LETTER = 6.2  # about the width of one
-FILLS = {"off": "#e4e6ea", "blue": "#1f6feb", "pass": "#1a9c3e", "fail": "#d1242f"}
-OTHER_FILL = "#a020a0"
+DARK = "#e4e6ea"
 COMMAND, WAIT = "#57606a", "#c9a227"
 TICKS = [0.1, 0.2, 0.5, 1, 2, 5, 10, 20, 30, 60, 120, 300]  # s
 MOST_TICKS = 16
@@ -31,7 +31,7 @@ body { font: 14px/1.4 sans-serif; margin: 24px auto; max-width: ${width}px; padd
 h1 { font-size: 22px; margin: 0; } h2 { font-size: 16px; margin: 28px 0 8px; }
 table { border-collapse: collapse; } th { text-align: left; font-weight: 600; }
 td, th { padding: 2px 16px 2px 0; vertical-align: top; }
-svg { width: 100%; height: auto; } svg text { font-size: 11px; fill: #1c1f24; }
+svg { max-width: 100%; height: auto; } svg text { font-size: 11px; fill: #1c1f24; }
 code, pre { font: 12px monospace; white-space: pre-wrap; overflow-wrap: anywhere; }
 .number { text-align: right; white-space: nowrap; } .wrong { color: #d1242f; }
 </style>
@@ -69,7 +69,7 @@ def page(summary: Summary, speed: float) -> str:
         unit=escape(summary.unit),
         speed=speeded,
         wrong=wrong,
-        panel=_panel(run.panel.shown(now())),
+        panel=panel_picture(run.panel.shown(now())),
         timeline=_timeline(run, begin, end),
         rows="".join(f"<tr><th>{escape(name)}<td>{escape(value)}\n" for name, value in summary.rows()),
         commands="".join(_command(call, begin) for call in run.commands()),
@@ -103,15 +103,6 @@ def _shown(run: Run, end: float) -> Iterator[tuple[float, float, dict[int, int]]
             moment = stop
 
 
-def _panel(leds: dict[int, int]) -> str:
-    lights = ""
-    for number, (led, color) in enumerate(leds.items()):
-        x = 40 + number * 80
-        lights += f'<circle cx="{x}" cy="24" r="12" fill="{_fill(color)}" stroke="#8a9099"/>'
-        lights += f'<text x="{x}" y="54" text-anchor="middle">{led_name(led).removeprefix("0x")}</text>\n'
-    return f'<svg id="panel" viewBox="0 0 {len(leds) * 80} 64" style="max-width: 900px">{lights}</svg>'
-
-
 def _timeline(run: Run, begin: float, end: float) -> str:
     scale = (WIDTH - LEFT - RIGHT) / (end - begin)
 
@@ -126,10 +117,10 @@ def _timeline(run: Run, begin: float, end: float) -> str:
     drawn, top = "", 4
     for led, spans in lit(run, end).items():
         drawn += f'<text x="{LEFT - 8}" y="{top + 11}" text-anchor="end">{led_name(led).removeprefix("0x")}</text>'
-        drawn += bar(begin, end, top, FILLS["off"], f"{led_name(led)} dark")
+        drawn += bar(begin, end, top, DARK, f"{led_name(led)} dark")
         for start, stop, color in spans:
             title = f"{led_name(led)} {color_name(color)} from {start - begin:.2f} s to {stop - begin:.2f} s"
-            drawn += bar(start, stop, top, _fill(color), title)
+            drawn += bar(start, stop, top, fill_of(color), title)
         top += ROW
     top += 10
     waits = run.waits()
@@ -168,7 +159,3 @@ def _command(call: Call, begin: float) -> str:
     status = "" if call.status is None else str(call.status)
     cells = "".join(f'<td class="number">{value}' for value in (f"{call.start - begin:.2f} s", took, status))
     return f"<tr>{cells}<td><code>{escape(call.text)}</code>\n"
-
-
-def _fill(color: int) -> str:
-    return FILLS.get(color_name(color), OTHER_FILL)

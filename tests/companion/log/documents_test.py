@@ -17,6 +17,7 @@ from bench.expected import COMMANDS, expected_commands, expected_log
 from bench.makers.sticks import write_stick
 from bench.outcomes import CHECK_FAILED, ENDED_EARLY, INSTALLATION_FAILED, UP_TO_DATE, UPDATED, Outcome
 from bench.panel import COLOR_CODES, color_name, led_name
+from bench.show.panel import pictures
 from tests.command_line import take_path
 
 ROOT = Path(__file__).resolve().parents[3]
@@ -113,13 +114,23 @@ class Patterns(unittest.TestCase):
     """What each panel and sound means."""
 
     def test_operator_has_each_pattern_once_with_its_meanings(self) -> None:
-        rows = table(OPERATOR, "LEDs", "Sound", "What it means", "What you do")
-        told = {(pattern(leds), sound): meaning for leds, sound, meaning, _ in rows}
+        rows = table(OPERATOR, "Panel", "LEDs", "Sound", "What it means", "What you do")
+        told = {(pattern(leds), sound): meaning for _, leds, sound, meaning, _ in rows}
         self.assertEqual(len(told), len(rows))
         self.assertEqual(set(told), set(REPORTS.values()) | {BY_SERVICE})
         self.assertEqual(set(REPORTS), set(MEANINGS))
         for report, shown in REPORTS.items():
             self.assertIn(MEANINGS[report], told[shown], report)
+
+    def test_operator_has_the_picture_of_each_pattern(self) -> None:
+        for picture, leds, *_ in table(OPERATOR, "Panel", "LEDs", "Sound", "What it means", "What you do"):
+            drawn = (ROOT / "docs" / picture.partition("](")[2].removesuffix(")")).read_text()
+            lit = {tuple(title.split()) for title in re.findall("<title>(.*?)</title>", drawn)}
+            self.assertEqual({led for led in lit if led[1] != "dark"}, pattern(leds), picture)
+
+    def test_pictures_are_those_of_the_panel_s_model(self) -> None:
+        kept = {file.name: file.read_text() for file in (ROOT / "docs/panel").iterdir()}
+        self.assertEqual(kept, pictures())
 
     def test_golden_logs_show_each_report_like_this(self) -> None:
         seen = set()
@@ -133,8 +144,8 @@ class Patterns(unittest.TestCase):
         self.assertEqual(seen, set(REPORTS))
 
     def test_readme_and_manual_page_say_the_same(self) -> None:
-        rows = table(OPERATOR, "LEDs", "Sound", "What it means", "What you do")
-        expected = {(pattern(leds), sound, meaning) for leds, sound, meaning, _ in rows}
+        rows = table(OPERATOR, "Panel", "LEDs", "Sound", "What it means", "What you do")
+        expected = {(pattern(leds), sound, meaning) for _, leds, sound, meaning, _ in rows}
         readme = table((ROOT / "README.md").read_text(), "LEDs", "Sound", "Outcome")
         self.assertEqual({(short_pattern(leds), *rest) for leds, *rest in readme}, expected)
         manual = (ROOT / "docs/man/harl-updater.8").read_text().partition("\n_\n")[2].partition("\n.TE")[0]

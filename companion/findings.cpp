@@ -6,35 +6,13 @@
 #include <ostream>
 #include <utility>
 
+#include <utf8.h>
+
 namespace
 {
 
 const std::size_t longestShown = 300; // bytes; a file name has at most 255
-
-/// Length in bytes of the well-formed UTF-8 sequence at the start of `text`, 0 if there is none, and its `character`.
-std::size_t decodeUtf8(std::string_view text, char32_t& character)
-{
-    const auto byteAt = [&](std::size_t index) { return static_cast<unsigned char>(text[index]); };
-    const unsigned char first = byteAt(0);
-    if (first < 0x80) {
-        character = first;
-        return 1;
-    }
-    const std::size_t length = first >= 0xF0 ? 4 : first >= 0xE0 ? 3 : 2;
-    if (first < 0xC2 || first > 0xF4 || text.size() < length) {
-        return 0;
-    }
-    character = first & (0x7FU >> length);
-    for (std::size_t index = 1; index < length; ++index) {
-        if ((byteAt(index) & 0xC0U) != 0x80) {
-            return 0;
-        }
-        character = character << 6U | (byteAt(index) & 0x3FU);
-    }
-    const bool overlong = (length == 3 && character < 0x800) || (length == 4 && character < 0x10000);
-    const bool surrogate = character >= 0xD800 && character <= 0xDFFF;
-    return overlong || surrogate || character > 0x10FFFF ? 0 : length;
-}
+const std::array<const char*, 4> severityWords = {"note", "warning", "error", "unchecked"};
 
 /// True for characters beyond ASCII that do not show, or that change how their neighbours show.
 bool isInvisible(char32_t character)
@@ -64,6 +42,22 @@ std::string formatted(const char* format, unsigned value)
     return buffer.data();
 }
 
+/// Appends a character, whose UTF-8 is `bytes`, in its printable form.
+void appendEscaped(std::string& text, char32_t character, std::string_view bytes)
+{
+    static const std::string_view named = "\nn\rr\tt\"\"\\\\"; // a character and what follows its backslash
+    const std::size_t place = character < 0x80 ? named.find(static_cast<char>(character)) : std::string_view::npos;
+    if (place != std::string_view::npos && place % 2 == 0) {
+        text.append("\\").append(1, named[place + 1]);
+    } else if (character < 0x20 || character == 0x7F) {
+        text += formatted("\\x%02x", character);
+    } else if (isInvisible(character)) {
+        text += formatted("\\u{%x}", character);
+    } else {
+        text += bytes;
+    }
+}
+
 std::string withSeparators(std::uint64_t number)
 {
     std::string digits = std::to_string(number);
@@ -78,17 +72,7 @@ std::string withSeparators(std::uint64_t number)
 
 const char* severityWord(Severity severity)
 {
-    switch (severity) {
-    case Severity::NOTE:
-        return "note";
-    case Severity::WARNING:
-        return "warning";
-    case Severity::ERROR:
-        return "error";
-    case Severity::UNCHECKED:
-        return "unchecked";
-    }
-    return "";
+    return severityWords.at(static_cast<std::size_t>(severity));
 }
 
 Report::Report(std::string command, std::string subject, std::string good)
@@ -113,21 +97,34 @@ void Report::addFact(const std::string& name, const std::string& label, const st
     addFact(name, label, text, text);
 }
 
+void Report::define(Values values)
+{
+    mValues.merge(values);
+}
+
 void Report::add(Finding finding)
 {
     mFindings.push_back(std::move(finding));
 }
 
+void Report::add(const std::string& name, Values values)
+{
+    values.insert(mValues.begin(), mValues.end());
+    const nlohmann::ordered_json& entry = catalogue("findings").at(name);
+    const auto* const word = std::find(severityWords.begin(), severityWords.end(), entry.at("severity"));
+    add({static_cast<Severity>(word - severityWords.begin()), name.substr(0, name.find('.')),
+         filled(entry.at("what"), values), filled(entry.at("effect"), values), filled(entry.at("remedy"), values)});
+}
+
+std::size_t Report::count(Severity severity) const
+{
+    return static_cast<std::size_t>(std::count_if(
+        mFindings.begin(), mFindings.end(), [&](const Finding& finding) { return finding.severity == severity; }));
+}
+
 Report::Status Report::status() const
 {
-    const auto has = [&](Severity severity) {
-        return std::any_of(mFindings.begin(), mFindings.end(),
-                           [&](const Finding& finding) { return finding.severity == severity; });
-    };
-    if (has(Severity::ERROR)) {
-        return STATUS_NOT_FIT;
-    }
-    return has(Severity::UNCHECKED) ? STATUS_UNCHECKED : STATUS_FIT;
+    return count(Severity::ERROR) > 0 ? STATUS_NOT_FIT : count(Severity::UNCHECKED) > 0 ? STATUS_UNCHECKED : STATUS_FIT;
 }
 
 void Report::write(bool json, std::ostream& out) const
@@ -162,18 +159,11 @@ void Report::print(std::ostream& out) const
             }
         }
     }
-    out << '\n' << mSubject;
-    switch (status()) {
-    case STATUS_FIT:
-        out << " is " << mGood << ".\n";
-        break;
-    case STATUS_NOT_FIT:
-        out << " is NOT " << mGood << ".\n";
-        break;
-    case STATUS_UNCHECKED:
-        out << ": not everything could be checked, whether it is " << mGood << " is open.\n";
-        break;
-    }
+    const std::size_t warnings = count(Severity::WARNING);
+    const std::array<std::string, 3> verdicts = {
+        " is " + mGood, " is NOT " + mGood, ": not everything could be checked, whether it is " + mGood + " is open"};
+    out << '\n'
+        << mSubject << verdicts.at(status()) << (warnings > 0 ? ", with " + counted(warnings, "warning") : "") << ".\n";
 }
 
 nlohmann::ordered_json Report::toJson() const
@@ -205,27 +195,17 @@ std::string escaped(std::string_view text)
 {
     std::string result;
     while (!text.empty()) {
-        char32_t character = 0;
-        const std::size_t length = decodeUtf8(text, character);
-        if (length == 0) {
-            result += formatted("\\x%02x", static_cast<unsigned char>(text.front()));
-        } else if (character == '\n') {
-            result += "\\n";
-        } else if (character == '\r') {
-            result += "\\r";
-        } else if (character == '\t') {
-            result += "\\t";
-        } else if (character < 0x20 || character == 0x7F) {
-            result += formatted("\\x%02x", character);
-        } else if (isInvisible(character)) {
-            result += formatted("\\u{%x}", character);
-        } else {
-            if (character == '"' || character == '\\') {
-                result += '\\';
-            }
-            result += text.substr(0, length);
+        const char* const invalid = utf8::find_invalid(text.begin(), text.end());
+        for (const char* next = text.begin(); next < invalid;) {
+            const char* const begin = next;
+            const char32_t character = utf8::unchecked::next(next);
+            appendEscaped(result, character, {begin, static_cast<std::size_t>(next - begin)});
         }
-        text.remove_prefix(std::max<std::size_t>(length, 1));
+        text.remove_prefix(static_cast<std::size_t>(invalid - text.begin()));
+        if (!text.empty()) {
+            result += formatted("\\x%02x", static_cast<unsigned char>(text.front()));
+            text.remove_prefix(1);
+        }
     }
     return result;
 }

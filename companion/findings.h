@@ -1,5 +1,7 @@
 #pragma once
 
+#include "texts.h"
+
 #include <cstddef>
 #include <cstdint>
 #include <iosfwd>
@@ -54,7 +56,15 @@ public:
     /// Adds a fact whose value for programs is its text.
     void addFact(const std::string& name, const std::string& label, const std::string& text);
 
+    /// Gives the catalogue's texts values for all findings that are added from now on.
+    void define(Values values);
+
     void add(Finding finding);
+
+    /// Adds a finding of the catalogue.
+    ///
+    /// @param name  as there: the check's name, and behind a dot the form of it where it has several
+    void add(const std::string& name, Values values = {});
 
     /// The text of a fact for programs; empty when there is none of this name.
     std::string fact(const std::string& name) const;
@@ -70,6 +80,7 @@ public:
 
 private:
     void print(std::ostream& out) const;
+    std::size_t count(Severity severity) const;
 
     struct Fact
     {
@@ -84,6 +95,7 @@ private:
     std::string mGood;
     std::vector<Fact> mFacts;
     std::vector<Finding> mFindings;
+    Values mValues;
 };
 
 /// Version of the JSON that every command prints: docs/harl-updater-tool.schema.json.

@@ -33,7 +33,7 @@ void addPlans(const Unit& unit, Report& report)
     report.addFact("shortest_s", "Takes at least",
                    std::to_string((seconds + 59) / 60) + " min, and what downloading and copying take", seconds);
     if (unit.isMainHead() && installs) {
-        report.add({Severity::NOTE, "update-offered", "A main head offers an update; its user decides.", "", ""});
+        report.add("update-offered");
     }
 }
 
@@ -61,9 +61,7 @@ int runCheck(const std::string& path, bool json, const UnitSite& site, std::ostr
     if (isUnit) {
         addPlans(unit, report);
     } else {
-        report.add({Severity::UNCHECKED, "not-a-unit",
-                    "This machine is no unit: its package, board, panel, mirrors and space are not known.", "",
-                    "Run this check on the unit, with the stick plugged in."});
+        report.add("not-a-unit");
     }
     report.write(json, out);
     return report.status();

@@ -19,9 +19,7 @@ void checkFiles(const Unit& unit, Report& report)
 {
     const CommandResult files = unit.run({"dpkg", "--verify", unit.package()}, filesLimit);
     if (!files.started || files.timedOut || (files.exitCode != 0 && files.output.empty())) {
-        report.add({Severity::UNCHECKED, "package-files",
-                    "The package's files cannot be compared with the database: " + complaint(files) + '.', "",
-                    "On the unit run: dpkg --verify " + unit.package()});
+        report.add("package-files.unknown", {{"complaint", complaint(files)}});
         return;
     }
     std::vector<std::string> wrong;
@@ -32,9 +30,7 @@ void checkFiles(const Unit& unit, Report& report)
         }
     }
     if (!wrong.empty()) {
-        report.add({Severity::ERROR, "package-files",
-                    "Files of the package are missing or damaged: " + listed(wrong) + '.', "",
-                    "Install it again: apt install --reinstall " + unit.package()});
+        report.add("package-files", {{"files", listed(wrong)}});
     }
 }
 
@@ -52,10 +48,7 @@ void checkConfiguration(const Unit& unit, Report& report)
         }
     }
     if (!kept.empty()) {
-        report.add({Severity::WARNING, "configuration-kept",
-                    "Changed configuration files were kept; the package's own are beside them, with .dpkg-dist: " +
-                        listed(kept) + '.',
-                    "", "Compare both, and remove the one that is not needed."});
+        report.add("configuration-kept", {{"files", listed(kept)}});
     }
 }
 
@@ -75,15 +68,11 @@ Run lastRun(const Unit& unit)
 }
 
 /// Compares a version with the one that the last run was to leave.
-void checkVersion(const std::string& what, const char* check, const std::string& found, const Versions& versions,
-                  Report& report)
+void checkVersion(const char* check, const std::string& found, const Versions& versions, Report& report)
 {
     const std::string& wanted = versions.differ() ? versions.candidate : versions.installed;
     if (!found.empty() && versions.found() && !wanted.empty() && found != wanted) {
-        report.add({Severity::ERROR, check,
-                    what + " has the version " + shown(found) + ", not " + shown(wanted) +
-                        ", which the last run was to leave.",
-                    "", "Run the update again; harl-updater-tool log --journal --last shows what the run did."});
+        report.add(check, {{"found", shown(found)}, {"wanted", shown(wanted)}});
     }
 }
 
@@ -97,23 +86,18 @@ void checkVersions(const Unit& unit, Report& report)
     }
     checkBoard(unit, report);
     if (run.steps.empty()) {
-        report.add({Severity::UNCHECKED, "last-run", "The journal holds no run: what was to be installed is not known.",
-                    "", "Run this check as root, before the journal is lost with a restart."});
+        report.add("last-run");
         return;
     }
-    checkVersion("The package", "package-version", installed, run.package, report);
-    checkVersion("The board", "board-version-old", report.fact("board_version"), run.board, report);
+    checkVersion("package-version", installed, run.package, report);
+    checkVersion("board-version-old", report.fact("board_version"), run.board, report);
 }
 
 void checkApplication(const Unit& unit, Report& report)
 {
     const std::string state = unit.property("harl", "ActiveState");
-    if (state.empty()) {
-        report.add({Severity::UNCHECKED, "application", "The service manager cannot be asked for the application.", "",
-                    "Run this check on the unit."});
-    } else if (state != "active") {
-        report.add({Severity::ERROR, "application", "The application harl is " + shown(state) + '.', "",
-                    "Start it: systemctl start harl, and see systemctl status harl."});
+    if (state != "active") {
+        report.add(state.empty() ? "application.unknown" : "application", {{"state", shown(state)}});
     }
 }
 
@@ -138,6 +122,7 @@ int runVerify(const VerifyOptions& options, const UnitSite& site, std::ostream& 
 {
     const Unit unit(site);
     Report report("verify", "The unit", "well");
+    unit.defineTexts(report);
     checkApplication(unit, report);
     checkUnfinishedWork(unit, report);
     checkFiles(unit, report);

@@ -2,30 +2,40 @@
 
 #include "log/step.h"
 
-#include <bitset>
 #include <iosfwd>
 #include <string>
 #include <string_view>
+#include <vector>
 
 struct Run;
+
+/// What a tool says, on standard error most often, in the spelling of Debian 11 to 13, and in which steps it does.
+struct Phrase
+{
+    std::string tool;
+    std::string words;
+    std::vector<StepKind> steps;
+};
 
 /// An entry of the catalogue of failures.
 struct Failure
 {
-    const char* name;     ///< fixed name in kebab-case, for programs and the documents
-    const char* reported; ///< by the updater; empty when it reports nothing
-    const char* cause;    ///< in sentences, which may hold {package}, {status} and {afterwards}
-    const char* remedy;   ///< likewise
+    std::string name;            ///< fixed name in kebab-case, for programs and the documents
+    std::string reported;        ///< by the updater; empty when it reports nothing
+    std::vector<StepKind> steps; ///< in which it can occur
+    std::string code;            ///< explains a step whose command ended with this code, or "any"; empty: neither
+    bool general = false;        ///< A tool's phrase makes it more specific.
+    std::string cause;           ///< in sentences, with names in braces; see texts.h
+    std::string remedy;          ///< likewise
+    std::vector<Phrase> phrases; ///< that point to it
 };
 
 /// The entry of this name, or null.
 const Failure* findFailure(std::string_view name);
 
-/// The phrases of other tools that a step's lines hold, as indexes of the catalogue's.
-using PhraseSet = std::bitset<64>;
-
-/// The phrases in a line that a tool printed in a step of this kind.
-PhraseSet phrasesIn(std::string_view line, StepKind kind);
+/// The entry that a line points to which a tool printed in a step of this kind, or null. Of several lines in a step the
+/// one with the lowest entry counts.
+const Failure* failureSaid(std::string_view line, StepKind kind);
 
 /// Fills in what went wrong in a run, and what its log leaves open.
 void explain(Run& run);

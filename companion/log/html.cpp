@@ -1,371 +1,249 @@
 #include "log/html.h"
 
-#include "findings.h"
+#include "embedded.h"
+#include "log/json.h"
 #include "log/text.h"
 
 #include <algorithm>
-#include <array>
 #include <cmath>
 #include <ostream>
+
+#include <kainjow/mustache.hpp>
 
 namespace
 {
 
-const char pageHead[] = R"(<!DOCTYPE html>
-<html lang="en">
-<head>
-<meta charset="utf-8">
-<meta name="viewport" content="width=device-width">
-<meta http-equiv="Content-Security-Policy" content="default-src 'none'; style-src 'unsafe-inline'">
-<title>Update log</title>
-<style>
-body { font: 14px/1.4 sans-serif; margin: 1.5em; color: #222; background: #fff; }
-h1 { font-size: 1.3em; } h2 { font-size: 1.15em; margin-top: 2em; border-top: 2px solid #888; padding-top: .6em; }
-table { border-collapse: collapse; } th { text-align: left; padding: .1em 1em .1em 0; font-weight: normal; color: #555; }
-.good { color: #176b2c; font-weight: bold; } .bad { color: #a31515; font-weight: bold; }
-.scale { display: flex; height: 14px; margin: 1em 0 .3em; border: 1px solid #888; }
-.scale div { min-width: 3px; box-sizing: border-box; border-right: 1px solid #fff; }
-.scroll { overflow-x: auto; }
-.lanes { display: grid; gap: 2px; margin: .4em 0 1em; font-size: 12px; }
-.lanes > * { padding: 3px 5px; background: #f1f1f1; overflow-wrap: anywhere; }
-.lanes > .lane { background: none; color: #555; }
-.lanes > .time { background: none; border-left: 1px solid #888; font-variant-numeric: tabular-nums; }
-.lanes > .done { background: #d4ead8; } .lanes > .failed { background: #f3c9c9; }
-.lanes > .unfinished { background: #fbe6bf; } .lanes > .untold { background: #e2e2e2; }
-.lanes > .wait { background: #dfe6f5; } .lanes > .flash { background: #bcd0fa; }
-.scale .done { background: #8cc79a; } .scale .failed { background: #d96a6a; }
-.scale .unfinished { background: #efb84c; } .scale .untold { background: #aaa; } .scale .wait { background: #9db4e4; }
-code { font-size: 11px; } .status { color: #555; }
-.led { display: inline-block; width: 11px; height: 11px; border-radius: 50%; border: 1px solid #555; background: #333;
-  vertical-align: -1px; margin-right: 3px; }
-.led.blue { background: #3b6ff5; } .led.pass { background: #2fb34f; } .led.fail { background: #e03131; }
-.led.half { background: linear-gradient(90deg, #3b6ff5 50%, #333 50%); }
-.problem { border-left: 4px solid #d96a6a; padding: .2em 0 .2em .8em; margin: .8em 0; } .besides { border-color: #efb84c; }
-pre { background: #f6f6f6; padding: .4em; margin: .3em 0; white-space: pre-wrap; overflow-wrap: anywhere; }
-@media print { .scroll { overflow: visible; } .lanes { zoom: .6; } }
-</style>
-</head>
-<body>
-)";
-
-std::string html(const std::string& text)
-{
-    std::string result;
-    for (const char character : text) {
-        switch (character) {
-        case '&':
-            result += "&amp;";
-            break;
-        case '<':
-            result += "&lt;";
-            break;
-        case '>':
-            result += "&gt;";
-            break;
-        case '"':
-            result += "&quot;";
-            break;
-        default:
-            result += character;
-        }
-    }
-    return result;
-}
+using Json = nlohmann::ordered_json;
+using kainjow::mustache::data;
 
 bool isWait(const Action& action)
 {
     return *action.command == '\0';
 }
 
-const char* resultClass(const Step& step)
+std::string resultClass(const Step& step)
 {
-    if (step.kind == StepKind::STOP_UPDATER && step.result == StepResult::UNFINISHED) {
-        return "done";
+    const bool ends = step.kind == StepKind::STOP_UPDATER && step.result == StepResult::UNFINISHED;
+    return ends ? "done" : resultName(step.result);
+}
+
+/// What the template takes, of what runs are made of for programs.
+data toData(const Json& value)
+{
+    if (value.is_object()) {
+        data result;
+        for (const auto& [name, item] : value.items()) {
+            result.set(name, toData(item));
+        }
+        return result;
     }
-    return resultName(step.result);
+    if (value.is_array()) {
+        data result(data::type::list);
+        for (const Json& item : value) {
+            result.push_back(toData(item));
+        }
+        return result;
+    }
+    if (value.is_null() || value.is_boolean()) {
+        return data(value == true);
+    }
+    return data(value.is_string() ? value.get<std::string>() : value.dump());
 }
 
-std::int64_t length(const Run& run, const Step& step)
+/// Writes the part of the page's template that shows the data of this name.
+void render(const char* part, const Json& content, std::ostream& out)
 {
-    return step.took.value_or(run.elapsed - step.began);
+    static kainjow::mustache::mustache page(embeddedPage);
+    page.render(data(part, toData(content)), out);
 }
 
-/// The timeline of one run: a grid with a column for each step and a row for each lane.
-class Lanes
+/// The timeline of one run: a grid with a column for each step and a row for each lane. Of the remote head's program
+/// its threads and feedback are shown too.
+class Timeline
 {
 public:
-    Lanes(const Run& run, std::ostream& out) : mRun(run), mOut(out) {}
-
-    void write()
+    explicit Timeline(const Run& run)
+        : mRun(run), mEnd(run.steps.size()), mBegin(run.steps.front().kind == StepKind::START ? 1 : 0)
     {
-        writeGrid();
-        writeTimes();
-        writeMainThread();
-        writeUpdateThread();
-        writeCommands();
-        writeWaits();
-        writeFlashing();
-        writePanel();
-        writeSound();
-        mOut << "</div></div>\n";
+        const auto shown = std::find_if(run.steps.begin(), run.steps.end(),
+                                        [](const Step& step) { return step.kind == StepKind::SHOW_OUTCOME; });
+        mShown = static_cast<std::size_t>(shown - run.steps.begin());
+    }
+
+    Json content()
+    {
+        Json scale = Json::array();
+        std::string columns;
+        for (const Step& step : mRun.steps) {
+            const bool waits =
+                std::any_of(step.actions.begin(), step.actions.end(), isWait) && step.result == StepResult::DONE;
+            const std::int64_t length = step.took.value_or(mRun.elapsed - step.began);
+            scale.push_back({{"style", waits ? "wait" : resultClass(step)},
+                             {"length", length},
+                             {"title", factsOf(step.kind).title}});
+            // 13 minutes and a second can both be read.
+            const double width = 100 + 40 * std::log10(1.0 + static_cast<double>(length));
+            columns += " minmax(0," + std::to_string(static_cast<int>(width)) + "fr)";
+        }
+        addLanes();
+        return {{"scale", scale}, {"columns", columns}, {"lanes", mLanes}};
     }
 
 private:
-    /// Columns grow with the logarithm of a step's length, so that 13 minutes and a second can both be read.
-    void writeGrid()
+    /// Begins a lane; its cells follow.
+    void addLane(const char* name)
     {
-        mOut << "<div class=\"scroll\"><div class=\"lanes\" style=\"grid-template-columns:80px";
-        for (const Step& step : mRun.steps) {
-            mOut << ' ' << "minmax(0,"
-                 << static_cast<int>(100 + 40 * std::log10(1.0 + static_cast<double>(length(mRun, step)))) << "fr)";
-        }
-        mOut << "\">\n";
+        mLanes.push_back({{"name", name}, {"row", mLanes.size() + 1}, {"cells", Json::array()}});
     }
 
-    void beginLane(const char* name)
+    /// Adds a cell from column `begin` to before column `end`, counted in steps, unless it has no width.
+    void addCell(std::size_t begin, std::size_t end, const std::string& style, const std::string& text,
+                 const Json& more = {})
     {
-        ++mRow;
-        mOut << "<div class=\"lane\" style=\"grid-row:" << mRow << ";grid-column:1\">" << name << "</div>\n";
-    }
-
-    /// Opens a cell of the lane from column `first` to before column `end`, counted in steps.
-    std::ostream& cell(std::size_t first, std::size_t end, const std::string& style)
-    {
-        return mOut << "<div class=\"" << style << "\" style=\"grid-row:" << mRow << ";grid-column:" << first + 2 << '/'
-                    << end + 2 << "\">";
-    }
-
-    void writeTimes()
-    {
-        beginLane("Time");
-        for (std::size_t index = 0; index < mRun.steps.size(); ++index) {
-            cell(index, index + 1, "time") << clockText(mRun.steps[index].start) << "</div>\n";
+        if (begin < std::min(end, mEnd)) {
+            Json cell = {{"style", style},
+                         {"begin", begin + 2}, // the lanes' names are in front
+                         {"end", end + 2},
+                         {"text", text},
+                         {"row", mLanes.size()}};
+            cell.update(more.is_null() ? Json::object() : more);
+            mLanes.back()["cells"].push_back(cell);
         }
     }
 
-    void writeMainThread()
+    void addLanes()
     {
+        const OperatorView view = operatorView(mRun);
+        addLane("Time");
+        forEachStep([&](const Step& step, std::size_t at) { addCell(at, at + 1, "time", clockText(step.start)); });
+        if (!mRun.mainHead) {
+            addLane("Main thread");
+            addCell(0, mBegin, "done", "starts, darkens the panel");
+            addCell(mBegin, mEnd, "", "waits for the update's thread");
+        }
+        addLane("Update thread");
+        forEachStep([&](const Step& step, std::size_t at) {
+            const std::string took = step.took ? durationText(*step.took) + ": " : "";
+            if (step.kind != StepKind::START) {
+                addCell(at, at + 1, resultClass(step), took + resultText(mRun, step),
+                        {{"title", factsOf(step.kind).title}});
+            }
+        });
+        addLane("Commands");
+        forEachStep([&](const Step& step, std::size_t at) {
+            if (!std::all_of(step.actions.begin(), step.actions.end(), isWait)) {
+                addCell(at, at + 1, "", "", {{"commands", commandsOf(step)}});
+            }
+        });
+        addLane("Waits");
+        forEachStep([&](const Step& step, std::size_t at) {
+            for (const Action& action : step.actions) {
+                addCell(at, isWait(action) ? at + 1 : at, "wait", actionText(action));
+            }
+        });
         if (mRun.mainHead) {
             return;
         }
-        beginLane("Main thread");
-        const std::size_t started = mRun.steps.front().kind == StepKind::START ? 1 : 0;
-        if (started == 1) {
-            cell(0, 1, "done") << "starts, darkens the panel</div>\n";
+        if (mBegin < mShown) {
+            addLane("Flashing thread");
+            addCell(mBegin, mShown, "flash", "lights REMOTE and MAIN in blue in turn, a second each");
         }
-        if (started < mRun.steps.size()) {
-            cell(started, mRun.steps.size(), "") << "waits for the update's thread</div>\n";
+        addLane("LED pattern");
+        addCell(0, mBegin, "", "", ledsOf({}));
+        addCell(mBegin, mShown, "flash",
+                mRun.ledFailures > 0 ? "flashing as far as the panel works" : "flashing in turn",
+                ledsOf({{"REMOTE", "half"}, {"MAIN", "half"}}));
+        addCell(mShown, mShown + 1, "", "dark, then the outcome");
+        addCell(mShown + 1, mEnd, "", view.seen, ledsOf(view.leds));
+        if (mShown < mEnd) {
+            addLane("Sound");
+            addCell(mShown, mShown + 1, "", view.sound.empty() ? "none" : view.sound + " sound");
         }
     }
 
-    void writeUpdateThread()
+    template <typename Visit>
+    void forEachStep(Visit visit)
     {
-        beginLane("Update thread");
-        for (std::size_t index = 0; index < mRun.steps.size(); ++index) {
-            const Step& step = mRun.steps[index];
-            if (step.kind == StepKind::START) {
-                continue;
+        for (std::size_t index = 0; index < mEnd; ++index) {
+            visit(mRun.steps[index], index);
+        }
+    }
+
+    /// A step's commands; attempts that came out alike are one line.
+    static Json commandsOf(const Step& step)
+    {
+        Json commands = Json::array();
+        for (auto action = step.actions.begin(); action != step.actions.end();) {
+            const auto next = std::find_if(action, step.actions.end(), [&](const Action& other) {
+                return actionText(other) != actionText(*action) || actionStatusText(other) != actionStatusText(*action);
+            });
+            if (!isWait(*action)) {
+                const std::string times = next - action > 1 ? " (" + std::to_string(next - action) + " times)" : "";
+                commands.push_back({{"command", actionText(*action)}, {"status", actionStatusText(*action) + times}});
             }
-            cell(index, index + 1, resultClass(step)) << "<b>" << html(factsOf(step.kind).title) << "</b><br>";
-            if (step.took) {
-                mOut << durationText(*step.took) << ": ";
-            }
-            mOut << html(resultText(mRun, step)) << "</div>\n";
+            action = next;
         }
+        return commands;
     }
 
-    void writeCommands()
+    /// All LEDs that the updater uses; those that `lit` does not name are dark.
+    static Json ledsOf(const std::vector<std::pair<std::string, std::string>>& lit)
     {
-        beginLane("Commands");
-        for (std::size_t index = 0; index < mRun.steps.size(); ++index) {
-            const Step& step = mRun.steps[index];
-            if (std::all_of(step.actions.begin(), step.actions.end(), isWait)) {
-                continue;
-            }
-            cell(index, index + 1, "");
-            for (auto action = step.actions.begin(); action != step.actions.end();) {
-                // Attempts that came out alike are one line.
-                const auto next = std::find_if(action, step.actions.end(), [&](const Action& other) {
-                    return actionText(other) != actionText(*action) ||
-                           actionStatusText(other) != actionStatusText(*action);
-                });
-                if (!isWait(*action)) {
-                    mOut << "<div><code>" << html(actionText(*action)) << "</code> <span class=\"status\">"
-                         << html(actionStatusText(*action));
-                    mOut << (next - action > 1 ? " (" + std::to_string(next - action) + " times)" : "")
-                         << "</span></div>";
-                }
-                action = next;
-            }
-            mOut << "</div>\n";
-        }
-    }
-
-    void writeWaits()
-    {
-        beginLane("Waits");
-        for (std::size_t index = 0; index < mRun.steps.size(); ++index) {
-            for (const Action& action : mRun.steps[index].actions) {
-                if (isWait(action)) {
-                    cell(index, index + 1, "wait") << html(actionText(action)) << "</div>\n";
-                }
-            }
-        }
-    }
-
-    /// The first step that no longer flashes.
-    std::size_t flashingEnd() const
-    {
-        const auto shown = std::find_if(mRun.steps.begin(), mRun.steps.end(),
-                                        [](const Step& step) { return step.kind == StepKind::SHOW_OUTCOME; });
-        return static_cast<std::size_t>(shown - mRun.steps.begin());
-    }
-
-    std::size_t flashingBegin() const { return mRun.steps.front().kind == StepKind::START ? 1 : 0; }
-
-    void writeFlashing()
-    {
-        if (mRun.mainHead || flashingBegin() >= flashingEnd()) {
-            return;
-        }
-        beginLane("Flashing thread");
-        cell(flashingBegin(), flashingEnd(), "flash")
-            << "lights REMOTE and MAIN in blue in turn, a second each</div>\n";
-    }
-
-    void led(const char* name, const std::string& color)
-    {
-        mOut << "<span class=\"led " << color << "\"></span>" << name << ' ';
-    }
-
-    void leds(const OperatorView& view)
-    {
+        Json leds = Json::array();
         for (const char* name : {"REMOTE", "MAIN", "PASS", "FAIL"}) {
-            const auto found =
-                std::find_if(view.leds.begin(), view.leds.end(), [&](const auto& lit) { return lit.first == name; });
-            led(name, found == view.leds.end() ? "" : found->second);
+            const auto found = std::find_if(lit.begin(), lit.end(), [&](const auto& led) { return led.first == name; });
+            leds.push_back({{"name", name}, {"color", found == lit.end() ? "" : found->second}});
         }
-    }
-
-    void writePanel()
-    {
-        if (mRun.mainHead) {
-            return;
-        }
-        beginLane("LED pattern");
-        if (flashingBegin() == 1) {
-            cell(0, 1, "");
-            leds(OperatorView());
-            mOut << "</div>\n";
-        }
-        if (flashingBegin() < flashingEnd()) {
-            cell(flashingBegin(), flashingEnd(), "flash");
-            led("REMOTE", "half");
-            led("MAIN", "half");
-            mOut << (mRun.ledFailures > 0 ? "flashing as far as the panel works" : "flashing in turn") << "</div>\n";
-        }
-        if (flashingEnd() < mRun.steps.size()) {
-            cell(flashingEnd(), flashingEnd() + 1, "") << "dark, then the outcome</div>\n";
-        }
-        if (flashingEnd() + 1 < mRun.steps.size()) {
-            const OperatorView view = operatorView(mRun);
-            cell(flashingEnd() + 1, mRun.steps.size(), "");
-            leds(view);
-            mOut << "<br>" << html(view.seen) << "</div>\n";
-        }
-    }
-
-    void writeSound()
-    {
-        if (mRun.mainHead || flashingEnd() >= mRun.steps.size()) {
-            return;
-        }
-        beginLane("Sound");
-        const std::string sound = operatorView(mRun).sound;
-        cell(flashingEnd(), flashingEnd() + 1, "") << (sound.empty() ? "none" : sound + " sound") << "</div>\n";
+        return {{"leds", leds}};
     }
 
     const Run& mRun;
-    std::ostream& mOut;
-    int mRow = 0;
+    std::size_t mEnd;   // of the steps
+    std::size_t mBegin; // the first step that flashes
+    std::size_t mShown; // the first one that no longer does
+    Json mLanes = Json::array();
 };
 
-void writeScale(const Run& run, std::ostream& out)
-{
-    out << "<div class=\"scale\">";
-    for (const Step& step : run.steps) {
-        const bool waits =
-            std::any_of(step.actions.begin(), step.actions.end(), isWait) && step.result == StepResult::DONE;
-        out << "<div class=\"" << (waits ? "wait" : resultClass(step)) << "\" style=\"flex:" << length(run, step)
-            << " 0 0\" title=\"" << html(factsOf(step.kind).title) << "\"></div>";
-    }
-    out << "</div>\n<p>True to scale above; below, a column's width grows with the logarithm of its time.</p>\n";
-}
-
-void writeProblem(const Run& run, const Problem& problem, const char* style, std::ostream& out)
+Json problemData(const Run& run, const Problem& problem, const char* style)
 {
     const Step* step = run.stepOf(problem);
-    out << "<div class=\"problem " << style << "\"><b>" << html(headingOf(run, problem)) << "</b><br>\n"
-        << html(causeOf(run, problem)) << "<br>\n<b>Do now:</b> " << html(remedyOf(run, problem)) << '\n';
-    if (step != nullptr && step->said.count > 0) {
-        out << "<pre>";
-        for (const std::string& line : shownLines(step->said)) {
-            out << html(line) << '\n';
-        }
-        out << "</pre>\n";
+    Json said;
+    for (const std::string& line : step == nullptr ? std::vector<std::string>() : shownLines(step->said)) {
+        said["lines"].push_back(line);
     }
-    out << "</div>\n";
-}
-
-void writeSummary(const Run& run, std::ostream& out)
-{
-    const OperatorView view = operatorView(run);
-    const std::array<std::pair<const char*, std::string>, 5> rows = {{
-        {"Outcome",
-         "<span class=\"" + std::string(wentWell(run) ? "good" : "bad") + "\">" + html(view.meaning) + "</span>"},
-        {"Operator", html(view.seen)},
-        {"Package", html(packageText(run))},
-        {"Board", html(boardText(run))},
-        {"Took", durationText(run.elapsed)},
-    }};
-    out << "<table>\n";
-    for (const auto& [label, text] : rows) {
-        out << "<tr><th>" << label << "</th><td>" << text << "</td></tr>\n";
-    }
-    out << "</table>\n";
+    return {{"style", style},
+            {"heading", headingOf(run, problem)},
+            {"cause", causeOf(run, problem)},
+            {"remedy", remedyOf(run, problem)},
+            {"said", said}};
 }
 
 } // namespace
 
 HtmlPage::HtmlPage(std::ostream& out) : mOut(out)
 {
-    mOut << pageHead << "<h1>Updates</h1>\n";
+    render("begin", true, mOut);
 }
 
 void HtmlPage::writeRun(const Run& run, const std::string& source)
 {
-    mOut << "<h2>Run " << run.number << " of " << html(source) << ", " << dateText(run.begin) << "</h2>\n";
-    writeSummary(run, mOut);
+    Json content = runToJson(run, source);
+    content["date"] = dateText(run.begin);
+    content["took"] = durationText(run.elapsed);
+    content["problems"] = Json::array();
     if (run.failure) {
-        writeProblem(run, *run.failure, "", mOut);
+        content["problems"].push_back(problemData(run, *run.failure, ""));
     }
     for (const Problem& problem : run.besides) {
-        writeProblem(run, problem, "besides", mOut);
+        content["problems"].push_back(problemData(run, problem, "besides"));
     }
-    if (!run.steps.empty()) {
-        writeScale(run, mOut);
-        Lanes(run, mOut).write();
-    }
-    if (!run.gaps.empty()) {
-        mOut << "<p>This log cannot show:</p>\n<ul>\n";
-        for (const Gap gap : run.gaps) {
-            mOut << "<li>" << html(gapText(run, gap)) << "</li>\n";
-        }
-        mOut << "</ul>\n";
-    }
+    content["timeline"] = run.steps.empty() ? Json() : Timeline(run).content();
+    content["open"] = !run.gaps.empty();
+    render("run", content, mOut);
 }
 
 void HtmlPage::finish()
 {
-    mOut << "</body>\n</html>\n" << std::flush;
+    render("end", true, mOut);
+    mOut.flush();
 }

@@ -87,10 +87,6 @@ nlohmann::ordered_json runToJson(const Run& run, const std::string& source)
     for (const Step& step : run.steps) {
         steps.push_back(stepToJson(run, step));
     }
-    Json gaps = Json::array();
-    for (const Gap gap : run.gaps) {
-        gaps.push_back(gapText(run, gap));
-    }
     Json besides = Json::array();
     for (const Problem& problem : run.besides) {
         besides.push_back(problemToJson(run, problem));
@@ -122,5 +118,5 @@ nlohmann::ordered_json runToJson(const Run& run, const std::string& source)
             {"service_manager_said", linesToJson(run.service.lines)},
             {"torn_records", run.tornRecords},
             {"other_lines", run.otherLines},
-            {"cannot_tell", gaps}};
+            {"cannot_tell", gapTexts(run)}};
 }

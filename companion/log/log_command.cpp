@@ -210,7 +210,7 @@ public:
             mOut << '\n' << dumped(runToJson(run, source));
         } else if (mOptions.list) {
             mOut << run.number << "  " << dateText(run.begin) << "  " << operatorView(run).meaning
-                 << (run.failure ? std::string(" [") + run.failure->failure->name + ']' : "") << '\n';
+                 << (run.failure ? " [" + run.failure->failure->name + ']' : "") << '\n';
         } else {
             printRun(run, source, mOut);
         }

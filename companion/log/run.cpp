@@ -296,7 +296,8 @@ void RunBuilder::otherLine(std::uint64_t line, std::string_view program, std::st
     if (!mRun->steps.empty()) {
         Step& step = mRun->steps.back();
         step.said.add(text);
-        step.phrases |= phrasesIn(text, step.kind);
+        const Failure* said = failureSaid(text, step.kind);
+        step.pointsTo = said != nullptr && (step.pointsTo == nullptr || said < step.pointsTo) ? said : step.pointsTo;
     }
 }
 

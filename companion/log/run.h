@@ -73,7 +73,7 @@ struct Step
     int failedAttempts = 0;  ///< of the upload
     bool timeUsedUp = false; ///< The service ended a command of it.
     OtherLines said;
-    PhraseSet phrases; ///< in what was said
+    const Failure* pointsTo = nullptr; ///< the entry that a tool's words point to
 };
 
 /// A version check's result.
@@ -129,23 +129,6 @@ struct Problem
     bool tolerated = false; ///< The run counts as passed all the same.
 };
 
-/// What a log leaves open.
-enum class Gap {
-    BEGINNING,
-    END,
-    OUTCOME,
-    TORN_RECORDS,
-    STEPS_LEFT_OUT,
-    CLOCK,
-    STATUSES,
-    PACKAGE_INSTALLED,
-    UPLOAD_ATTEMPTS,
-    BOARD_RUNS,
-    MARKER,
-    TOOLS_WORDS,
-    FEEDBACK,
-};
-
 /// One run of the updater, as far as a log tells it.
 struct Run
 {
@@ -185,7 +168,7 @@ struct Run
     /// Set by explain().
     std::optional<Problem> failure; ///< what decided a bad outcome
     std::vector<Problem> besides;
-    std::vector<Gap> gaps;
+    std::vector<std::string> gaps; ///< what its log leaves open, as names of the catalogue's gaps
 
     const Step* find(StepKind kind) const; ///< the last one, or null
 

@@ -154,15 +154,6 @@ std::string versionsText(const Run& run, const Versions& versions, StepKind chec
     return versions.installed + " -> " + versions.candidate + ", " + installation;
 }
 
-/// Replaces each `mark` in `text`.
-void replace(std::string& text, const std::string& mark, const std::string& by)
-{
-    for (std::size_t position = text.find(mark); position != std::string::npos;
-         position = text.find(mark, position + by.size())) {
-        text.replace(position, mark.size(), by);
-    }
-}
-
 } // namespace
 
 void printWrapped(const std::string& label, const std::string& text, std::ostream& out)
@@ -298,7 +289,7 @@ std::string headingOf(const Run& run, const Problem& problem)
 {
     const bool decisive = run.failure && &problem == &*run.failure;
     if (run.service.has(ServiceEvent::NOT_ALLOWED) && decisive) {
-        return "Not run [" + std::string(problem.failure->name) + ']';
+        return "Not run [" + problem.failure->name + ']';
     }
     const Step* step = run.stepOf(problem);
     std::string text = !decisive ? "Also: " : isFailure(run.outcome) ? "Failed: " : "Ended in: ";
@@ -310,20 +301,17 @@ std::string headingOf(const Run& run, const Problem& problem)
 
 std::string causeOf(const Run& run, const Problem& problem)
 {
-    std::string text = filled(problem.failure->cause, run, run.stepOf(problem), problem.failure->name);
-    if (problem.tolerated) {
-        text += " With an up-to-date package the run counts as nothing to update all the same. The board was neither "
-                "checked nor updated.";
-    }
-    return text;
+    const std::string& name = problem.failure->name;
+    return filled(problem.failure->cause, valuesOf(run, run.stepOf(problem), name)) +
+           (problem.tolerated ? ' ' + sharedText("tolerated") : "");
 }
 
 std::string remedyOf(const Run& run, const Problem& problem)
 {
-    return filled(problem.failure->remedy, run, run.stepOf(problem), problem.failure->name);
+    return filled(problem.failure->remedy, valuesOf(run, run.stepOf(problem), problem.failure->name));
 }
 
-std::string filled(std::string text, const Run& run, const Step* step, std::string_view failure)
+Values valuesOf(const Run& run, const Step* step, std::string_view failure)
 {
     std::optional<CommandStatus> status;
     if (step != nullptr) {
@@ -331,64 +319,35 @@ std::string filled(std::string text, const Run& run, const Step* step, std::stri
         status = action < 2 && action < step->actions.size() ? step->actions[action].status : step->status;
     }
     const bool waits = step != nullptr && step->kind == StepKind::WAIT_FOR_BOARD;
-    replace(text, "{package}", packageOf(run.mainHead));
-    replace(text, "{status}", status ? statusText(*status) : "its status");
-    replace(text, "{afterwards}", step == nullptr ? "run the update again." : factsOf(step->kind).afterwards);
-    replace(text, "{silence}", waits ? "The wait lasts 13 minutes and is silent: it may still be going on. " : "");
-    replace(text, "{panel}",
-            run.mainHead ? "If it does not go on: "
-                         : "See whether the panel still flashes blue in turn. If it does, wait. If not: ");
-    replace(text, "{service}",
-            run.service.has(ServiceEvent::FAILURE_SHOWN)
-                ? " The service then lit FAIL, without a sound, released the stick and started "
-                  "the application."
-                : "");
-    replace(text, "{unit}", run.service.unit.empty() ? "what was found is in brackets" : run.service.unit);
-    replace(text, "{panelFailures}", run.ledFailures == 0 ? "Commands" : counted(run.ledFailures, "command"));
-    replace(text, "{outcomeDark}", run.outcomeLedFailures > 0 ? ": the outcome was not, or not wholly, lit." : ".");
-    return text;
+    const Step* upload = run.find(StepKind::UPLOAD_BOARD);
+    const auto attempts = static_cast<std::uint64_t>(upload == nullptr ? 0 : upload->failedAttempts);
+    return {
+        {"package", packageOf(run.mainHead)},
+        {"status", status ? statusText(*status) : "its status"},
+        {"afterwards", step == nullptr ? "run the update again." : factsOf(step->kind).afterwards},
+        {"silence", waits ? sharedText("silent-wait") : ""},
+        {"panel", sharedText(run.mainHead ? "if-it-stays" : "if-it-flashes")},
+        {"service", run.service.has(ServiceEvent::FAILURE_SHOWN) ? sharedText("service-lit-fail") : ""},
+        {"unit", run.service.unit.empty() ? "what was found is in brackets" : run.service.unit},
+        {"panel-failures", run.ledFailures == 0 ? "Commands" : counted(run.ledFailures, "command")},
+        {"outcome-dark", run.outcomeLedFailures > 0 ? ": the outcome was not, or not wholly, lit." : "."},
+        {"torn-records", counted(run.tornRecords, "torn record")},
+        {"first-torn-line", std::to_string(run.firstTornLine)},
+        {"steps-left-out", counted(run.stepsLeftOut, "step")},
+        {"clock-jumps", counted(run.clockJumps, "time")},
+        {"failed-attempts", counted(attempts, "upload attempt")},
+        {"beyond-scp", upload != nullptr && upload->said.count > 0 ? ", beyond what scp said" : ""},
+    };
 }
 
-std::string gapText(const Run& run, Gap gap)
+std::vector<std::string> gapTexts(const Run& run)
 {
-    switch (gap) {
-    case Gap::BEGINNING:
-        return "What came before: the log begins in the middle of this run.";
-    case Gap::END:
-        return "How this run ended: its last record is missing. What the operator saw is shown up to that point only.";
-    case Gap::OUTCOME:
-        return run.mainHead ? "Whether an update is offered: the records of a check are missing."
-                            : "Whether anything was updated: the records of a check are missing.";
-    case Gap::TORN_RECORDS:
-        return "What " + counted(run.tornRecords, "torn record") + " said (the first at line " +
-               std::to_string(run.firstTornLine) + ").";
-    case Gap::STEPS_LEFT_OUT:
-        return counted(run.stepsLeftOut, "step") + " more than a run has: left out here.";
-    case Gap::CLOCK:
-        return "How long this run took: the clock was set " + counted(run.clockJumps, "time") +
-               " while it went on. Times do not include that.";
-    case Gap::STATUSES:
-        return "Whether commands succeeded, the LEDs lit and the sound was heard: no status is available.";
-    case Gap::PACKAGE_INSTALLED:
-        return "Whether the package is really installed: exit code 0 also means a command that was killed or could not "
-               "be started. On the unit: dpkg -s " +
-               packageOf(run.mainHead) + '.';
-    case Gap::UPLOAD_ATTEMPTS: {
-        const Step* upload = run.find(StepKind::UPLOAD_BOARD);
-        return "Why " + counted(static_cast<std::uint64_t>(upload->failedAttempts), "upload attempt") + " failed" +
-               (upload->said.count > 0 ? ", beyond what scp said." : ".");
+    std::vector<std::string> texts;
+    const Values values = run.gaps.empty() ? Values() : valuesOf(run, nullptr, {});
+    for (const std::string& gap : run.gaps) {
+        texts.push_back(filled(catalogue("gaps").at(gap), values));
     }
-    case Gap::BOARD_RUNS:
-        return "Whether the board runs the new version: it is not asked again. The next update's check shows it.";
-    case Gap::MARKER:
-        return "Whether the first-boot marker was there: its removal is logged either way.";
-    case Gap::TOOLS_WORDS:
-        return "What the tools themselves said: this log has none of their lines. The service's journal has "
-               "(harl-updater-tool log --journal).";
-    case Gap::FEEDBACK:
-        return "Whether the LEDs lit and the sound was heard: only commands that fail are logged.";
-    }
-    return "";
+    return texts;
 }
 
 OperatorView operatorView(const Run& run)
@@ -483,8 +442,8 @@ void printRun(const Run& run, const std::string& source, std::ostream& out)
     }
     if (!run.gaps.empty()) {
         out << "\nThis log cannot show:\n";
-        for (const Gap gap : run.gaps) {
-            printWrapped("  - ", gapText(run, gap), out);
+        for (const std::string& text : gapTexts(run)) {
+            printWrapped("  - ", text, out);
         }
     }
 }

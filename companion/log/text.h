@@ -1,6 +1,7 @@
 #pragma once
 
 #include "log/run.h"
+#include "texts.h"
 
 #include <iosfwd>
 #include <string>
@@ -70,11 +71,11 @@ std::string headingOf(const Run& run, const Problem& problem);
 std::string causeOf(const Run& run, const Problem& problem);
 std::string remedyOf(const Run& run, const Problem& problem);
 
-/// A text of the catalogue with the names and figures of this run in the place of {package} and the like.
+/// What the catalogue's texts get of a run.
 ///
-/// @param step     that it is about, or null
-/// @param failure  the entry's name
-std::string filled(std::string text, const Run& run, const Step* step, std::string_view failure);
+/// @param step     that the text is about, or null
+/// @param failure  the entry's name; empty for a gap
+Values valuesOf(const Run& run, const Step* step, std::string_view failure);
 
-/// What the log leaves open, in words.
-std::string gapText(const Run& run, Gap gap);
+/// What the log leaves open, a sentence for each.
+std::vector<std::string> gapTexts(const Run& run);

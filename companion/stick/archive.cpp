@@ -3,12 +3,13 @@
 #include <algorithm>
 #include <array>
 #include <cstdio>
-#include <cstring>
 #include <memory>
 #include <optional>
+#include <set>
 #include <vector>
 
 #include <minizip/unzip.h>
+#include <sys/stat.h>
 #include <zlib.h>
 
 namespace
@@ -17,87 +18,58 @@ namespace
 const std::size_t blockSize = std::size_t{64} * 1024; // bytes
 const std::uint64_t largestArchive = 4ULL << 30U;     // bytes; a file on a FAT stick is smaller
 const std::uint64_t mostEntries = 100'000;
+const std::size_t mostName = 1024;                // bytes of an entry's name that are looked at
+const std::uint64_t localHeader = 30;             // bytes of an entry's header in front of its name, APPNOTE 4.3.7
 const std::uint64_t suspiciousRatio = 100;        // unpacked to packed; software packs to a half or a tenth
 const std::uint64_t suspiciousSize = 100'000'000; // bytes
 
-const char* const damagedEffect =
-    "copies the archive without looking into it. The board then fails to unpack it: only the script's status in the "
-    "log tells so, and after 13 minutes the update counts as done.";
-const char* const copyAgain =
-    "Copy the archive to the stick again, release the stick before pulling it out, and run this check again.";
-const char* const anotherArchive = "Put the board's own upgrade archive on the stick.";
-const char* const bombEffect = "copies it without looking into it; unpacking it would fill the board.";
-
-/// Hands `source` to the zip library, with a window that spares the medium its reads of single bytes.
-class Window
+/// The source as a stream, whose buffer spares the medium the zip library's reads of single bytes.
+struct Stream
 {
-public:
-    explicit Window(const ArchiveSource& source) : mSource(source), mBytes(blockSize) {}
+    const ArchiveSource& source;
+    std::uint64_t position = 0;
+    std::optional<std::uint64_t> failedAt; ///< the offset of the first byte that could not be read
 
-    std::size_t read(char* buffer, std::size_t length)
+    static ssize_t read(void* cookie, char* buffer, std::size_t length)
     {
-        std::size_t done = 0;
-        while (done < length && mPosition < mSource.size) {
-            if (mPosition < mStart || mPosition >= mStart + mLength) {
-                mStart = mPosition;
-                const auto wanted = std::min<std::uint64_t>(mBytes.size(), mSource.size - mStart);
-                mLength = mSource.read(mStart, mBytes.data(), static_cast<std::size_t>(wanted));
-                if (mLength == 0) {
-                    mFailedAt = mStart;
-                    break;
-                }
-            }
-            const auto from = static_cast<std::size_t>(mPosition - mStart);
-            const std::size_t count = std::min(length - done, mLength - from);
-            std::memcpy(buffer + done, mBytes.data() + from, count);
-            done += count;
-            mPosition += count;
+        auto& stream = *static_cast<Stream*>(cookie);
+        const std::uint64_t rest = stream.source.size - stream.position;
+        const auto wanted = static_cast<std::size_t>(std::min<std::uint64_t>(length, rest));
+        const std::size_t count = stream.source.read(stream.position, buffer, wanted);
+        stream.position += count;
+        if (count == 0 && wanted > 0) {
+            stream.failedAt = stream.position;
+            return -1;
         }
-        return done;
+        return static_cast<ssize_t>(count);
     }
 
-    bool seek(std::uint64_t offset, int origin)
+    static int seek(void* cookie, off64_t* offset, int origin)
     {
-        const std::uint64_t base = origin == ZLIB_FILEFUNC_SEEK_CUR   ? mPosition
-                                   : origin == ZLIB_FILEFUNC_SEEK_END ? mSource.size
-                                                                      : 0;
-        if (offset > mSource.size - std::min(base, mSource.size)) {
-            return false;
+        auto& stream = *static_cast<Stream*>(cookie);
+        const std::uint64_t base = origin == SEEK_CUR ? stream.position : origin == SEEK_END ? stream.source.size : 0;
+        const auto target = static_cast<off64_t>(base) + *offset;
+        if (target < 0 || static_cast<std::uint64_t>(target) > stream.source.size) {
+            return -1;
         }
-        mPosition = base + offset;
-        return true;
+        *offset = target;
+        stream.position = static_cast<std::uint64_t>(target);
+        return 0;
     }
-
-    std::uint64_t position() const { return mPosition; }
-
-    /// The offset of the first byte that could not be read, if any.
-    std::optional<std::uint64_t> failedAt() const { return mFailedAt; }
-
-private:
-    const ArchiveSource& mSource;
-    std::vector<char> mBytes;
-    std::uint64_t mStart = 0;
-    std::size_t mLength = 0;
-    std::uint64_t mPosition = 0;
-    std::optional<std::uint64_t> mFailedAt;
 };
 
-zlib_filefunc64_def libraryFunctions(Window& window)
+/// The zip library's own functions for files, but for opening one: that is the Stream at `opaque`.
+zlib_filefunc64_def libraryFunctions(Stream& stream)
 {
     zlib_filefunc64_def functions = {};
-    functions.opaque = &window;
-    functions.zopen64_file = [](voidpf opaque, const void*, int) -> voidpf { return opaque; };
-    functions.zread_file = [](voidpf opaque, voidpf, void* buffer, uLong size) -> uLong {
-        return static_cast<uLong>(static_cast<Window*>(opaque)->read(static_cast<char*>(buffer), size));
-    };
-    functions.zwrite_file = [](voidpf, voidpf, const void*, uLong) -> uLong { return 0; };
-    functions.ztell64_file = [](voidpf opaque, voidpf) -> ZPOS64_T { return static_cast<Window*>(opaque)->position(); };
-    functions.zseek64_file = [](voidpf opaque, voidpf, ZPOS64_T offset, int origin) -> long {
-        return static_cast<Window*>(opaque)->seek(offset, origin) ? 0 : -1;
-    };
-    functions.zclose_file = [](voidpf, voidpf) -> int { return 0; };
-    functions.zerror_file = [](voidpf opaque, voidpf) -> int {
-        return static_cast<Window*>(opaque)->failedAt() ? 1 : 0;
+    fill_fopen64_filefunc(&functions);
+    functions.opaque = &stream;
+    functions.zopen64_file = [](voidpf opaque, const void*, int) -> voidpf {
+        std::FILE* const file = fopencookie(opaque, "rb", {Stream::read, nullptr, Stream::seek, nullptr});
+        if (file != nullptr) {
+            std::setvbuf(file, nullptr, _IOFBF, blockSize);
+        }
+        return file;
     };
     return functions;
 }
@@ -128,32 +100,21 @@ struct Entry
     unz_file_info64 info = {};
 };
 
-/// The archive's current entry; nothing when its record is damaged.
-std::optional<Entry> currentEntry(unzFile archive)
-{
-    Entry entry;
-    std::array<char, 1024> name{};
-    if (unzGetCurrentFileInfo64(archive, &entry.info, name.data(), name.size(), nullptr, 0, nullptr, 0) != UNZ_OK) {
-        return std::nullopt;
-    }
-    entry.name.assign(name.data(), std::min<std::size_t>(entry.info.size_filename, name.size()));
-    return entry;
-}
-
 /// Calls `visit` with every entry until it returns false. False when the directory is damaged.
 template <typename Visit>
 bool forEachEntry(unzFile archive, Visit visit)
 {
     int status = unzGoToFirstFile(archive);
-    while (status == UNZ_OK) {
-        const std::optional<Entry> entry = currentEntry(archive);
-        if (!entry) {
+    for (; status == UNZ_OK; status = unzGoToNextFile(archive)) {
+        Entry entry;
+        std::array<char, mostName> name{};
+        if (unzGetCurrentFileInfo64(archive, &entry.info, name.data(), name.size(), nullptr, 0, nullptr, 0) != UNZ_OK) {
             return false;
         }
-        if (!visit(*entry)) {
+        entry.name.assign(name.data(), std::min<std::size_t>(entry.info.size_filename, name.size()));
+        if (!visit(entry)) {
             return true;
         }
-        status = unzGoToNextFile(archive);
     }
     return status == UNZ_END_OF_LIST_OF_FILE;
 }
@@ -165,6 +126,17 @@ bool leavesFolder(const std::string& name)
     std::replace(slashed.begin(), slashed.end(), '\\', '/');
     const bool drive = name.size() > 1 && name[1] == ':';
     return drive || slashed.rfind("//", 0) == 0 || slashed.find("/../") != std::string::npos;
+}
+
+/// True when `name` is below one of `folders`.
+bool liesBelow(const std::set<std::string>& folders, const std::string& name)
+{
+    for (std::size_t slash = name.find('/'); slash != std::string::npos; slash = name.find('/', slash + 1)) {
+        if (folders.count(name.substr(0, slash)) > 0) {
+            return true;
+        }
+    }
+    return false;
 }
 
 std::string hexadecimal(uLong value)
@@ -246,18 +218,16 @@ class ArchiveCheck
 {
 public:
     ArchiveCheck(const ArchiveSource& source, const std::string& name, Report& report, std::uint64_t mostUnpacked)
-        : mSource(source), mName(name), mReport(report), mMostUnpacked(mostUnpacked), mWindow(source)
+        : mSource(source), mName(name), mReport(report), mMostUnpacked(mostUnpacked), mStream{source, 0, {}}
     {
     }
 
     void run()
     {
         mReport.addFact("archive_bytes", "Archive", mName + ", " + byteCount(mSource.size), mSource.size);
+        mReport.define({{"archive", mName}, {"size", byteCount(mSource.size)}});
         if (mSource.size > largestArchive) {
-            add(Severity::ERROR, "archive-too-large",
-                " has " + byteCount(mSource.size) + ", more than the " + byteCount(largestArchive) +
-                    " that are tested.",
-                "tries to copy all of it to the board, 20 times when that fails.", anotherArchive);
+            mReport.add("archive-too-large", {{"most", byteCount(largestArchive)}});
             return;
         }
         if (open() && checkDirectory() && checkClaims() && readWhole()) {
@@ -267,51 +237,31 @@ public:
     }
 
 private:
-    void add(Severity severity, const char* check, const std::string& what, const char* effect, const char* remedy)
-    {
-        mReport.add({severity, check, mName + what, effect, remedy});
-    }
-
     void addUnreadable(std::uint64_t offset)
     {
-        add(Severity::ERROR, "archive-unreadable",
-            " cannot be read at offset " + std::to_string(offset) + ": the stick is damaged.",
-            "tries the upload 20 times when the board has another version, gives up and shows the fail pattern; the "
-            "board stays as it is.",
-            "Use another stick.");
-    }
-
-    void addEmpty()
-    {
-        add(Severity::ERROR, "archive-empty", " has no entries.",
-            "copies it; nothing is installed on the board, and after 13 minutes the update counts as done.",
-            anotherArchive);
+        mReport.add("archive-unreadable", {{"offset", std::to_string(offset)}});
     }
 
     /// Opens the archive. False when it is none or an empty one.
     bool open()
     {
-        zlib_filefunc64_def functions = libraryFunctions(mWindow);
+        zlib_filefunc64_def functions = libraryFunctions(mStream);
         mArchive.reset(unzOpen2_64(mName.c_str(), &functions));
         unz_global_info64 info = {};
         if (mArchive && unzGetGlobalInfo64(mArchive.get(), &info) == UNZ_OK) {
             if (info.number_entry == 0) {
-                addEmpty();
+                mReport.add("archive-empty");
             }
             return info.number_entry > 0;
         }
         std::string magic(static_cast<std::size_t>(std::min<std::uint64_t>(mSource.size, 4)), '\0');
         magic.resize(mSource.read(0, magic.data(), magic.size()));
-        if (const auto offset = mWindow.failedAt()) {
-            addUnreadable(*offset);
-        } else if (magic == "PK\x05\x06") {
-            addEmpty(); // the library takes the end record at offset 0 for none
-        } else if (magic == "PK\x03\x04") {
-            add(Severity::ERROR, "archive-not-zip",
-                " begins like a zip archive but its end is missing or damaged: the copy is incomplete.", damagedEffect,
-                copyAgain);
-        } else {
-            add(Severity::ERROR, "archive-not-zip", " is no zip archive.", damagedEffect, anotherArchive);
+        if (mStream.failedAt) {
+            addUnreadable(*mStream.failedAt);
+        } else { // the library takes an end record at offset 0 for none
+            mReport.add(magic == "PK\x05\x06"   ? "archive-empty"
+                        : magic == "PK\x03\x04" ? "archive-not-zip.cut"
+                                                : "archive-not-zip");
         }
         return false;
     }
@@ -320,11 +270,17 @@ private:
     bool checkDirectory()
     {
         Faults leaving;
+        std::set<std::string> links;
         const bool intact = forEachEntry(mArchive.get(), [&](const Entry& entry) {
             addUp(mPackedBytes, entry.info.compressed_size);
             addUp(mDeclaredBytes, entry.info.uncompressed_size);
             if (leavesFolder(entry.name)) {
                 leaving.add(entry.name, unzGetOffset64(mArchive.get()), "lies outside the folder it is unpacked into");
+            } else if (liesBelow(links, entry.name)) {
+                leaving.add(entry.name, unzGetOffset64(mArchive.get()), "lies below a symbolic link of the archive");
+            }
+            if (S_ISLNK(entry.info.external_fa >> 16U)) { // where Info-ZIP keeps stat(2)'s mode
+                links.insert(entry.name);
             }
             return ++mEntries <= mostEntries;
         });
@@ -332,19 +288,16 @@ private:
         mReport.addFact("archive_declared_bytes", "Declared size", byteCount(mDeclaredBytes) + " unpacked",
                         mDeclaredBytes);
         if (leaving.count > 0) {
-            add(Severity::ERROR, "archive-entry-path", ": " + leaving.text() + '.',
-                "copies the archive without looking into it; the board may unpack over files of its system.",
-                anotherArchive);
+            mReport.add("archive-entry-path", {{"entries", leaving.text()}});
         }
-        if (const auto offset = mWindow.failedAt()) {
-            addUnreadable(*offset);
+        if (mStream.failedAt) {
+            addUnreadable(*mStream.failedAt);
             return false;
         }
         if (!intact) {
-            add(Severity::ERROR, "archive-damaged",
-                ": its directory is damaged at offset " + std::to_string(unzGetOffset64(mArchive.get())) + ", behind " +
-                    counted(mEntries, "entry", "entries") + '.',
-                damagedEffect, copyAgain);
+            mReport.add("archive-damaged", {{"entries", "its directory is damaged at offset " +
+                                                            std::to_string(unzGetOffset64(mArchive.get())) +
+                                                            ", behind " + counted(mEntries, "entry", "entries")}});
         }
         return intact;
     }
@@ -353,16 +306,12 @@ private:
     bool checkClaims()
     {
         if (mEntries > mostEntries) {
-            add(Severity::ERROR, "archive-bomb",
-                " has more than " + counted(mostEntries, "entry", "entries") + ": its contents were not tested.",
-                "copies it without looking into it.", anotherArchive);
+            mReport.add("archive-bomb.entries", {{"most", counted(mostEntries, "entry", "entries")}});
             return false;
         }
         if (mDeclaredBytes > mMostUnpacked || mPackedBytes > mSource.size) {
-            add(Severity::ERROR, "archive-bomb",
-                " declares " + byteCount(mDeclaredBytes) + " unpacked, " + byteCount(mPackedBytes) +
-                    " packed, in an archive of " + byteCount(mSource.size) + ": its contents were not tested.",
-                bombEffect, anotherArchive);
+            mReport.add("archive-bomb.declared",
+                        {{"declared", byteCount(mDeclaredBytes)}, {"packed", byteCount(mPackedBytes)}});
             return false;
         }
         return true;
@@ -413,11 +362,14 @@ private:
             return;
         }
         const std::uint64_t data = unzGetCurrentFileZStreamPos64(archive);
+        const std::string local = localName(entry, data);
         const std::uint64_t limit = mMostUnpacked - mUnpackedBytes;
         const Unpacked unpacked = deflated ? inflateEntry(archive, limit) : readStored(archive, limit);
         unzCloseCurrentFile(archive);
         mUnpackedBytes += unpacked.bytes;
-        if (unpacked.bytes != entry.info.uncompressed_size) {
+        if (local != entry.name && entry.info.size_filename <= mostName) {
+            mDamaged.add(entry.name, data, "is named " + shown(local) + " in front of its data");
+        } else if (unpacked.bytes != entry.info.uncompressed_size) {
             mDamaged.add(entry.name, data,
                          "declares " + byteCount(entry.info.uncompressed_size) + " but holds " +
                              byteCount(unpacked.bytes));
@@ -430,34 +382,41 @@ private:
         }
     }
 
+    /// The name in the header of the archive's open entry, in front of its data; notes where the first one begins.
+    std::string localName(const Entry& entry, std::uint64_t data)
+    {
+        const std::uint64_t length = std::min<std::uint64_t>(entry.info.size_filename, mostName);
+        const int extra = unzGetLocalExtrafield(mArchive.get(), nullptr, 0);
+        const std::uint64_t behind = entry.info.size_filename + static_cast<std::uint64_t>(std::max(extra, 0));
+        mFirstEntry = std::min(mFirstEntry, data - std::min(data, behind + localHeader));
+        std::string name(static_cast<std::size_t>(length), '\0');
+        name.resize(mSource.read(data - std::min(data, behind), name.data(), name.size()));
+        return name;
+    }
+
     void reportContents()
     {
         mReport.addFact("archive_unpacked_bytes", "Real size", byteCount(mUnpackedBytes) + " unpacked", mUnpackedBytes);
         if (mUnpackedBytes > mMostUnpacked) {
-            add(Severity::ERROR, "archive-bomb",
-                " declares " + byteCount(mDeclaredBytes) + " unpacked but holds more than " + byteCount(mMostUnpacked) +
-                    ": the test ended there.",
-                bombEffect, anotherArchive);
+            mReport.add("archive-bomb.real",
+                        {{"declared", byteCount(mDeclaredBytes)}, {"most", byteCount(mMostUnpacked)}});
             return;
         }
         if (mDamaged.count > 0) {
-            add(Severity::ERROR, "archive-damaged", ": " + mDamaged.text() + '.', damagedEffect, copyAgain);
+            mReport.add("archive-damaged", {{"entries", mDamaged.text()}});
         }
         if (mUntested.count > 0) {
-            add(Severity::UNCHECKED, "archive-untested", ": " + mUntested.text() + ", and cannot be tested.",
-                "copies it without looking into it.",
-                "Pack the archive without encryption, by the method deflate, or test it where it was made.");
+            mReport.add("archive-untested", {{"entries", mUntested.text()}});
         }
         if (mUnpackedBytes > suspiciousSize && mUnpackedBytes / suspiciousRatio > mSource.size) {
-            add(Severity::WARNING, "archive-ratio",
-                " unpacks to " + std::to_string(mUnpackedBytes / mSource.size) + " times its size.",
-                "copies it without looking into it; unpacking it may fill the board.",
-                "Make sure that this is the board's own upgrade archive.");
+            mReport.add("archive-ratio", {{"ratio", std::to_string(mUnpackedBytes / mSource.size)}});
         }
         const std::uint64_t padding = mSource.size - mPackedBytes;
         if (padding > suspiciousSize) {
-            add(Severity::WARNING, "archive-padding", " holds " + byteCount(padding) + " that belong to no entry.",
-                "copies all of it, which takes its time and may fill the board.", anotherArchive);
+            mReport.add("archive-padding", {{"padding", byteCount(padding)}});
+        }
+        if (mFirstEntry > 0 && mFirstEntry < mSource.size) {
+            mReport.add("archive-prefix", {{"prefix", byteCount(mFirstEntry)}});
         }
         const std::uint64_t boardBytes = mSource.size + mUnpackedBytes;
         mReport.addFact("board_bytes", "Needed on the board",
@@ -468,12 +427,13 @@ private:
     const std::string& mName;
     Report& mReport;
     std::uint64_t mMostUnpacked;
-    Window mWindow;
+    Stream mStream;
     std::unique_ptr<void, int (*)(unzFile)> mArchive{nullptr, unzClose};
     std::uint64_t mEntries = 0;
     std::uint64_t mPackedBytes = 0;
     std::uint64_t mDeclaredBytes = 0;
     std::uint64_t mUnpackedBytes = 0;
+    std::uint64_t mFirstEntry = UINT64_MAX; // offset of its header
     Faults mDamaged;
     Faults mUntested;
 };

@@ -1,5 +1,7 @@
 #include "stick/folder.h"
 
+#include "procedure.h"
+
 #include <algorithm>
 #include <array>
 #include <cerrno>
@@ -15,6 +17,7 @@ namespace
 {
 
 const int mostLinks = 40; // on the way to a file, as the kernel has it: path_resolution(7)
+const std::string onUnit = std::string(stickMountPoint) + '/';
 
 /// Where the symbolic link leads; empty for anything else.
 std::string targetOf(const Descriptor& node)
@@ -136,9 +139,12 @@ Descriptor StickFolder::open(const std::string& path, int flags) const
         const char* const step = stays ? "." : name.c_str();
         const int here = folders.back().number();
 
-        const std::string target = targetOf(Descriptor(openat(here, step, O_PATH | O_NOFOLLOW | O_CLOEXEC)));
+        std::string target = targetOf(Descriptor(openat(here, step, O_PATH | O_NOFOLLOW | O_CLOEXEC)));
         if (!target.empty() && (!last || (flags & O_NOFOLLOW) == 0)) {
-            if (target.front() == '/') {
+            if (target.rfind(onUnit, 0) == 0) { // the stick itself, on the unit
+                folders.resize(1);
+                target.erase(0, onUnit.size());
+            } else if (target.front() == '/') {
                 errno = EXDEV;
                 return Descriptor();
             }

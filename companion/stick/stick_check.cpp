@@ -21,15 +21,6 @@ const char scriptName[] = "unzipUpgrade.sh";
 const char markerFolder[] = "debs";
 const char markerName[] = "installTV";
 
-const std::string noVersionEffect =
-    "finds no version on the stick (log: \"Failed to check candidate QUORB version\" or \"Failed to checkUpdate\") and "
-    "leaves the board as it is. The panel shows \"nothing to update\" when the head's package is up to date, and a "
-    "failed check when it has just been installed.";
-const std::string uploadFailsEffect =
-    "tries the upload 20 times when the board has another version, gives up and shows the fail pattern; the board "
-    "stays as it is.";
-const std::string nameFolderRemedy = "Name the folder with its five-character prefix and the version behind it.";
-
 std::string lowerCase(std::string text)
 {
     std::transform(text.begin(), text.end(), text.begin(), [](char letter) {
@@ -94,10 +85,7 @@ public:
     void run()
     {
         if (mOnUnit && !mStick.isMounted()) {
-            add(Severity::WARNING, "stick-not-mounted",
-                "No stick is mounted here: this is a folder of the unit's own disk.",
-                "reads this folder, and cannot release it at the end (status 8192 of \"umount\" in the log).",
-                "Plug the stick in and wait until it is mounted.");
+            mReport.add("stick-not-mounted");
         }
         if (checkFolders()) {
             checkBoardFolder();
@@ -106,45 +94,32 @@ public:
     }
 
 private:
-    void add(Severity severity, const char* check, std::string what, std::string effect, std::string remedy)
-    {
-        mReport.add({severity, check, std::move(what), std::move(effect), std::move(remedy)});
-    }
-
-    void addUnreadable(const std::string& path, int error, const std::string& effect)
+    /// @param effect  name of a text of the catalogue
+    void addUnreadable(const std::string& path, int error, const char* effect)
     {
         const bool denied = error == EACCES || error == EPERM;
-        add(denied ? Severity::UNCHECKED : Severity::ERROR, "stick-unreadable",
-            shown(path) + " cannot be read: " + std::strerror(error) + '.', denied ? "reads it as root." : effect,
-            denied ? "Run this check as root." : "Use another stick.");
+        mReport.add(denied ? "stick-unreadable.denied" : "stick-unreadable",
+                    {{"path", shown(path)}, {"error", std::strerror(error)}, {"effect", sharedText(effect)}});
     }
 
     /// Reports a link that leads out or nowhere, and a node that cannot be read. False when it is none of these.
-    bool reportUnusable(const std::string& path, const Node& node, const std::string& effect)
+    bool reportUnusable(const std::string& path, const Node& node, const char* effect)
     {
-        const std::string link = shown(path) + " is a symbolic link to " + shown(node.target);
-        switch (node.kind) {
-        case Node::LEADS_OUT:
-            add(Severity::ERROR, "link-leaves-stick", link + ", out of the stick. It was not followed.",
-                "follows it on the unit and takes what it finds there, not what is on the stick.",
-                "Put the file or folder itself in its place.");
-            return true;
-        case Node::LEADS_NOWHERE:
-            add(Severity::ERROR, "link-broken", link + ", where there is nothing.", effect,
-                "Put the file or folder itself in its place.");
-            return true;
-        case Node::UNREADABLE:
+        if (node.kind == Node::UNREADABLE) {
             addUnreadable(path, node.error, effect);
-            return true;
-        default:
+        } else if (node.kind == Node::LEADS_OUT || node.kind == Node::LEADS_NOWHERE) {
+            mReport.add(node.kind == Node::LEADS_OUT ? "link-leaves-stick" : "link-broken",
+                        {{"path", shown(path)}, {"target", shown(node.target)}, {"effect", sharedText(effect)}});
+        } else {
             return false;
         }
+        return true;
     }
 
     /// Reports a name in `folder` that differs from `wanted` in upper and lower case only; as a warning when the file
     /// system finds the wanted name all the same. False when there is none.
-    bool reportCase(const std::string& folder, const std::string& wanted, bool found, Severity severity,
-                    const std::string& effect)
+    bool reportCase(const std::string& folder, const std::string& wanted, bool found, const char* finding,
+                    const char* effect)
     {
         const std::vector<std::string> names = mStick.names(folder).names;
         if (std::find(names.begin(), names.end(), wanted) != names.end()) {
@@ -155,11 +130,10 @@ private:
         if (other == names.end()) {
             return false;
         }
-        add(found ? Severity::WARNING : severity, "name-case",
-            shown(*other) + " in " + shown(folder) + " must be named " + shown(wanted) +
-                ", with these upper and lower case letters.",
-            found ? "finds it, but only because this file system takes upper and lower case for the same." : effect,
-            "Rename it to " + shown(wanted) + '.');
+        mReport.add(found ? "name-case.found" : finding, {{"name", shown(*other)},
+                                                          {"folder", shown(folder)},
+                                                          {"wanted", shown(wanted)},
+                                                          {"effect", sharedText(effect)}});
         return true;
     }
 
@@ -183,12 +157,15 @@ private:
         for (const std::string path : {"debs", "debs/QUORB", "debs/QUORB/armhf"}) {
             const Node node = mStick.node(path);
             const bool misspelled = reportCase(parent, path.substr(path.rfind('/') + 1), node.kind != Node::MISSING,
-                                               Severity::ERROR, noVersionEffect);
+                                               "name-case", "no-version");
             if (node.kind != Node::FOLDER) {
-                if (!reportUnusable(path, node, noVersionEffect) && !misspelled) {
-                    add(Severity::ERROR, "no-board-folder",
-                        shown(path) + (node.kind == Node::MISSING ? " is missing." : " is no folder."), noVersionEffect,
-                        "Put the board's version folder into " + shown(boardFolder) + " on the stick.");
+                if (!reportUnusable(path, node, "no-version") && !misspelled) {
+                    const std::string deeper = node.kind == Node::MISSING ? oneLevelDeeper(path) : "";
+                    mReport.add(deeper.empty() ? "no-board-folder" : "no-board-folder.deeper",
+                                {{"path", shown(path)},
+                                 {"state", node.kind == Node::MISSING ? "is missing" : "is no folder"},
+                                 {"found", shown(deeper)},
+                                 {"board-folder", shown(boardFolder)}});
                 }
                 return false;
             }
@@ -197,17 +174,28 @@ private:
         return true;
     }
 
+    /// Where `path` is in a folder that should not be there, as when an archive was unpacked into a folder of its own;
+    /// empty when it is not.
+    std::string oneLevelDeeper(const std::string& path) const
+    {
+        for (const std::string& name : mStick.names(".").names) {
+            if (mStick.node(inFolder(name, path)).kind == Node::FOLDER) {
+                return inFolder(name, path);
+            }
+        }
+        return "";
+    }
+
     void checkBoardFolder()
     {
         const Names all = mStick.names(boardFolder);
+        mReport.define({{"folder", shown(boardFolder)}});
         if (all.error != 0) {
-            addUnreadable(boardFolder, all.error, noVersionEffect);
+            addUnreadable(boardFolder, all.error, "no-version");
             return;
         }
         if (all.tooMany) {
-            add(Severity::ERROR, "too-many-names",
-                shown(boardFolder) + " holds more than " + counted(Names::most, "name") + ": they were not looked at.",
-                "takes the first of them for the version folder.", "Leave nothing but the version folder in it.");
+            mReport.add("too-many-names", {{"names", counted(Names::most, "name")}});
             return;
         }
         // Neither ls(1) nor a `*` of the shell shows a name that begins with a dot.
@@ -215,12 +203,8 @@ private:
         names.erase(std::remove_if(names.begin(), names.end(), [](const auto& name) { return name.front() == '.'; }),
                     names.end());
         if (names.empty()) {
-            const bool hidden = !all.names.empty();
-            add(Severity::ERROR, "no-version-folder",
-                shown(boardFolder) + (hidden ? " holds only hidden names: " + listed(all.names) + '.' : " is empty."),
-                noVersionEffect,
-                hidden ? "Give the version folder a name that does not begin with a dot."
-                       : "Put the board's version folder into it.");
+            mReport.add(all.names.empty() ? "no-version-folder.empty" : "no-version-folder.hidden",
+                        {{"names", listed(all.names)}});
             return;
         }
 
@@ -237,7 +221,8 @@ private:
         }
     }
 
-    /// Checks that the version check and the upload mean the same folder. False when there is none at all.
+    /// Checks that the version check and the upload mean the same folder. False when there is none at all, or none that
+    /// this user may look into.
     bool checkOrder(const std::vector<std::string>& names)
     {
         std::vector<std::string> folders;
@@ -245,39 +230,30 @@ private:
         for (const std::string& name : names) {
             const std::string path = inFolder(boardFolder, name);
             const Node node = mStick.node(path);
-            reportUnusable(path, node, "may take its name for the version folder.");
+            const Node inside = node.kind == Node::FOLDER ? mStick.node(inFolder(path, ".")) : node;
+            if (reportUnusable(path, inside, "takes-name") && inside.kind == Node::UNREADABLE) {
+                return false;
+            }
             (node.kind == Node::FOLDER ? folders : others).push_back(name);
         }
         if (folders.empty()) {
-            add(Severity::ERROR, "no-version-folder",
-                shown(boardFolder) + " holds no folder, only " + listed(others) + '.',
-                "takes the name " + shown(names.front()) + " for the version folder and " + uploadFailsEffect,
-                "Put the board's version folder into it, and nothing else.");
+            mReport.add("no-version-folder.files", {{"names", listed(others)}, {"first", shown(names.front())}});
             return false;
         }
         if (folders.size() > 1) {
-            add(Severity::ERROR, "several-version-folders",
-                shown(boardFolder) + " holds " + std::to_string(folders.size()) + " folders: " + listed(folders) + '.',
-                "reads the version from the first name in byte order, " + shown(names.front()) +
-                    ", but its upload takes the files of every one of them, one over the other: the board gets those of "
-                    "the last. It may install another version than it compared with, and do so at every run.",
-                "Leave only the folder of the version that is to be installed.");
+            mReport.add("several-version-folders", {{"number", std::to_string(folders.size())},
+                                                    {"names", listed(folders)},
+                                                    {"first", shown(names.front())}});
         }
         const auto first = std::find_if(others.begin(), others.end(),
                                         [&](const auto& name) { return !surelyBehind(name, folders[0]); });
         if (first != others.end()) {
-            add(Severity::ERROR, "name-before-version-folder",
-                shown(*first) + " is no folder but comes before the version folder " + shown(folders.front()) +
-                    (*first < folders.front() ? " in byte order." : " in the order of some locales."),
-                "takes the name that its \"ls\" lists first for the version folder, and the text behind its first five "
-                "bytes for the version. The board never has that one: it installs at every run, 13 minutes each, or never "
-                "when the name is too short.",
-                "Leave nothing but the version folder in " + shown(boardFolder) + '.');
+            mReport.add("name-before-version-folder",
+                        {{"name", shown(*first)},
+                         {"version-folder", shown(folders.front())},
+                         {"order", *first < folders.front() ? "byte order" : "the order of some locales"}});
         } else if (!others.empty()) {
-            add(Severity::NOTE, "name-beside-version-folder",
-                shown(boardFolder) + " also holds " + listed(others) + '.',
-                "does not look at it, because it comes behind the version folder.",
-                "Leave nothing but the version folder in it.");
+            mReport.add("name-beside-version-folder", {{"names", listed(others)}});
         }
         return true;
     }
@@ -305,7 +281,7 @@ private:
         }
         std::string start(static_cast<std::size_t>(std::min<std::uint64_t>(node.size, scriptBytesChecked)), '\0');
         if (readAt(file.number(), 0, start.data(), start.size()) != start.size()) {
-            addUnreadable(path, EIO, uploadFailsEffect);
+            addUnreadable(path, EIO, "upload-fails");
             return;
         }
         checkScript(start, node.size, shown(path), mReport);
@@ -323,7 +299,7 @@ private:
             const std::string folder = inFolder(boardFolder, name);
             const std::string path = inFolder(folder, file);
             const bool found = mStick.node(path).present;
-            misspelled = reportCase(folder, file, found, Severity::ERROR, uploadFailsEffect) || misspelled;
+            misspelled = reportCase(folder, file, found, "name-case", "upload-fails") || misspelled;
             if (found) {
                 last = path;
                 continue;
@@ -332,11 +308,8 @@ private:
             similar.insert(similar.end(), likes.begin(), likes.end());
         }
         if (last.empty() && !misspelled) {
-            add(Severity::ERROR, "file-missing",
-                shown(file) + " is missing in the version folder" +
-                    (similar.empty() ? "." : ", which holds " + listed(similar) + '.'),
-                uploadFailsEffect,
-                similar.empty() ? "Copy it into the version folder." : "Rename it to " + shown(file) + '.');
+            mReport.add(similar.empty() ? "file-missing" : "file-missing.similar",
+                        {{"file", shown(file)}, {"names", listed(similar)}});
         }
         return last;
     }
@@ -345,50 +318,45 @@ private:
     /// been reported before.
     Descriptor openFile(const std::string& path, const Node& node)
     {
-        if (path.empty() || reportUnusable(path, node, uploadFailsEffect)) {
+        if (path.empty() || reportUnusable(path, node, "upload-fails")) {
             return Descriptor();
         }
-        if (node.kind != Node::FILE) {
-            add(Severity::ERROR, "no-plain-file",
-                shown(path) + (node.kind == Node::FOLDER ? " is a folder, no file." : " is no plain file."),
-                uploadFailsEffect, "Put the file itself in its place.");
-            return Descriptor();
-        }
-        if (node.size == 0) {
-            add(Severity::ERROR, "file-empty", shown(path) + " is empty.",
-                "copies it. Nothing is installed on the board, and after 13 minutes the update counts as done.",
-                "Copy the file to the stick again, and release the stick before pulling it out.");
+        if (node.kind != Node::FILE || node.size == 0) {
+            mReport.add(node.kind == Node::FILE ? "file-empty" : "no-plain-file",
+                        {{"path", shown(path)},
+                         {"state", node.kind == Node::FOLDER ? "is a folder, no file" : "is no plain file"}});
             return Descriptor();
         }
         Descriptor file = mStick.openFile(path);
         if (!file) {
-            addUnreadable(path, errno, uploadFailsEffect);
+            addUnreadable(path, errno, "upload-fails");
         }
         return file;
     }
 
-    /// ls(1) prints the path of anything but a folder, and only its path requests TeamViewer.
+    /// ls(1) prints the path of anything but a folder, and only its path requests TeamViewer. It prints nothing of a
+    /// link that leads to itself.
     void checkMarker()
     {
-        const std::string effect = "installs no TeamViewer.";
         const std::string path = inFolder(markerFolder, markerName);
         const Node node = mStick.node(path);
-        const bool requested = node.present && node.kind != Node::FOLDER;
+        const bool loops = node.kind == Node::LEADS_NOWHERE && node.error == ELOOP;
+        const bool requested = node.present && node.kind != Node::FOLDER && !loops;
         mReport.addFact("teamviewer_requested", "TeamViewer",
                         requested ? "requested; only the main head installs it" : "not requested", requested);
 
-        const bool misspelled = reportCase(markerFolder, markerName, node.present, Severity::WARNING, effect);
+        const bool misspelled = reportCase(markerFolder, markerName, node.present, "name-case.marker", "no-teamviewer");
         if (node.kind == Node::FOLDER) {
-            add(Severity::WARNING, "marker-is-folder",
-                shown(path) + " is a folder. Only a plain file requests TeamViewer.", effect,
-                "Replace the folder by an empty file of this name, or remove it.");
-        } else if (node.kind == Node::UNREADABLE || (node.present && node.kind == Node::LEADS_OUT)) {
-            reportUnusable(path, node, effect);
+            mReport.add("marker-is-folder", {{"path", shown(path)}});
+        } else if (node.kind == Node::UNREADABLE || (node.present && node.kind == Node::LEADS_OUT) || loops) {
+            reportUnusable(path, node, "no-teamviewer");
         } else if (!node.present && !misspelled) {
             // A text editor or Windows adds an extension to the marker's name.
             for (const std::string& name : lookalikes(markerFolder, markerName)) {
-                add(Severity::WARNING, "marker-name", shown(name) + " is not the name that requests TeamViewer.",
-                    effect, "Rename it to " + shown(markerName) + ", or remove it.");
+                mReport.add("marker-name", {{"name", shown(name)}, {"wanted", shown(markerName)}});
+            }
+            if (mStick.node(markerName).present) {
+                mReport.add("marker-name.place", {{"wanted", shown(markerName)}, {"folder", shown(markerFolder)}});
             }
         }
     }
@@ -436,35 +404,22 @@ std::string checkVersionName(const std::string& name, Report& report)
     const std::string line = name.substr(0, name.find('\n'));
     std::string version = line.size() > versionPrefixLength ? line.substr(versionPrefixLength) : "";
     if (version.empty()) {
-        report.add({Severity::ERROR, "version-missing",
-                    shown(line) + " is too short: five bytes are the prefix, and behind them is no version.",
-                    noVersionEffect, nameFolderRemedy});
+        report.add("version-missing", {{"name", shown(line)}});
         return version;
     }
     if (line != name || version.find('\r') != std::string::npos) {
-        report.add({Severity::ERROR, "version-line-break", "The name " + shown(name) + " holds a line break.",
-                    "reads the version only up to a line feed, and never finds a board's version equal to one with a "
-                    "carriage return: it installs at every run.",
-                    nameFolderRemedy});
+        report.add("version-line-break", {{"name", shown(name)}});
         return version;
     }
     const bool usual = version.find_first_not_of(
                            "0123456789abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ.+~_-") == std::string::npos;
     if (!usual) {
-        report.add(
-            {Severity::WARNING, "version-unusual", "The version " + shown(version) + " holds unusual characters.",
-             "compares it with the board's byte for byte. Unless the board reports exactly this text afterwards, it "
-             "installs again at every run, 13 minutes each.",
-             "Compare the folder's name with the maker's, blanks at its end included."});
+        report.add("version-unusual", {{"version", shown(version)}});
     }
     const char lastOfPrefix = line[versionPrefixLength - 1];
     if (!isDigit(version.front()) || isDigit(lastOfPrefix) || lastOfPrefix == '.') {
-        report.add({Severity::WARNING, "version-start",
-                    "The prefix would be " + shown(line.substr(0, versionPrefixLength)) + " and the version " +
-                        shown(version) + ": the prefix seems to have more or fewer than five bytes.",
-                    "drops the first five bytes whatever they are and compares the rest with the board's version. It "
-                    "installs at every run, 13 minutes each, when the two never become equal.",
-                    nameFolderRemedy});
+        report.add("version-start",
+                   {{"prefix", shown(line.substr(0, versionPrefixLength))}, {"version", shown(version)}});
     }
     return version;
 }

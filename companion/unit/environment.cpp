@@ -64,6 +64,16 @@ std::string Unit::locale() const
     return result;
 }
 
+void Unit::defineTexts(Report& report) const
+{
+    const auto& notRead = catalogue("texts").at(mMainHead ? "board-not-read-main" : "board-not-read-remote");
+    report.define({{"failure", failure()},
+                   {"package", shown(package())},
+                   {"package-name", package()},
+                   {"board-not-read", filled(notRead, {{"failure", failure()}})},
+                   {"without-version", mMainHead ? "installs nothing" : "leaves the board as it is"}});
+}
+
 std::string Unit::property(const std::string& service, const std::string& name) const
 {
     const auto properties = mServices.find(service + ".service");

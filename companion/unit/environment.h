@@ -1,6 +1,7 @@
 #pragma once
 
 #include "command.h"
+#include "findings.h"
 #include "procedure.h"
 
 #include <chrono>
@@ -60,6 +61,9 @@ public:
     {
         return mMainHead ? "reports a failure to the main head's program" : "shows the fail pattern";
     }
+
+    /// Gives the catalogue's texts what depends on the unit.
+    void defineTexts(Report& report) const;
 
     /// False when the service manager cannot be asked.
     bool servicesKnown() const { return mServicesKnown; }

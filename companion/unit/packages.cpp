@@ -7,6 +7,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
+#include <set>
 #include <system_error>
 #include <utility>
 
@@ -16,26 +17,50 @@ namespace
 {
 
 const auto mirrorLimit = 15s; // for all mirrors together
-const std::size_t mostMirrors = 32;
+const std::size_t mostAddresses = 32;
 const std::uint64_t littleSpace = 100'000'000; // bytes
+
+/// A folder for a while; nothing is left of it when the program is ended before.
+class TemporaryFolder
+{
+public:
+    explicit TemporaryFolder(const Unit& unit) : mPath(unit.path("/tmp/harl-updater-tool-XXXXXX"))
+    {
+        if (mkdtemp(mPath.data()) == nullptr) {
+            mPath.clear();
+        }
+    }
+    ~TemporaryFolder()
+    {
+        std::error_code error;
+        std::filesystem::remove_all(mPath, error);
+    }
+    TemporaryFolder(const TemporaryFolder&) = delete;
+    TemporaryFolder& operator=(const TemporaryFolder&) = delete;
+
+    /// Empty, and errno tells why, when it cannot be made.
+    const std::string& path() const { return mPath; }
+
+private:
+    HeldSignals mSignals;
+    std::string mPath;
+};
 
 void checkLocks(const Unit& unit, Report& report)
 {
-    const std::string waits = "waits with its installation until the other one has ended.";
-    const std::pair<const char*, std::string> locks[] = {
-        {"/var/lib/apt/lists/lock",
-         "cannot refresh the mirrors (log: \"NO_INTERNET_ERROR_CODE\") and " + unit.failure() + '.'},
-        {"/var/lib/dpkg/lock-frontend", waits},
-        {"/var/lib/dpkg/lock", waits},
-        {"/var/cache/apt/archives/lock", "cannot install the package and " + unit.failure() + '.'},
+    const std::pair<const char*, const char*> locks[] = {
+        {"/var/lib/apt/lists/lock", "lists-locked"},
+        {"/var/lib/dpkg/lock-frontend", "waits-for-lock"},
+        {"/var/lib/dpkg/lock", "waits-for-lock"},
+        {"/var/cache/apt/archives/lock", "archives-locked"},
     };
-    for (const auto& [path, effect] : locks) {
+    for (const auto& [path, name] : locks) {
+        const std::string effect = filled(catalogue("texts").at(name), {{"failure", unit.failure()}});
         const Descriptor file(open(unit.path(path).c_str(), O_RDONLY | O_CLOEXEC));
         if (!file) {
             if (errno != ENOENT) {
-                report.add({Severity::UNCHECKED, "package-lock",
-                            shown(path) + " cannot be read: " + errorText(errno) + '.', effect,
-                            "Run this check as root."});
+                report.add("package-lock.unknown",
+                           {{"path", shown(path)}, {"error", errorText(errno)}, {"effect", effect}});
             }
             continue;
         }
@@ -43,10 +68,8 @@ void checkLocks(const Unit& unit, Report& report)
         lock.l_type = F_WRLCK;
         lock.l_whence = SEEK_SET;
         if (fcntl(file.number(), F_GETLK, &lock) == 0 && lock.l_type != F_UNLCK) {
-            report.add(
-                {Severity::ERROR, "package-lock",
-                 "Process " + std::to_string(lock.l_pid) + " holds the package manager's lock " + shown(path) + '.',
-                 effect, "Wait until it has ended: ps " + std::to_string(lock.l_pid)});
+            report.add("package-lock",
+                       {{"path", shown(path)}, {"process", std::to_string(lock.l_pid)}, {"effect", effect}});
         }
     }
 }
@@ -74,20 +97,12 @@ void checkPolicy(const Unit& unit, Report& report)
     }
     const std::string& text = policy.output;
     if (!text.empty() && !(contains(text, "Installed: ") && contains(text, "Candidate: "))) {
-        report.add({Severity::ERROR, "policy-words",
-                    "apt-cache does not print \"Installed: \" and \"Candidate: \" under the service's locale " +
-                        shown(locale) + '.',
-                    "finds no versions (log: \"NWM_UM_CHECK_UPDATE_FAILED\") and " + unit.failure() + '.',
-                    "Set LC_ALL=C in the service's unit file."});
+        report.add("policy-words", {{"locale", shown(locale)}});
         return;
     }
     const std::size_t own = text.find(unit.package() + ":\n");
     if (own == std::string::npos) {
-        report.add({text.empty() ? Severity::UNCHECKED : Severity::WARNING, "package-unknown",
-                    "The package manager does not know the package " + shown(unit.package()) +
-                        " before its mirrors are refreshed.",
-                    unit.failure() + " (log: \"NWM_UM_CHECK_UPDATE_FAILED\") unless the mirrors bring it.",
-                    "Check the sources: apt-cache policy solvik4-rh, on a main head solvik4-dh"});
+        report.add(text.empty() ? "package-unknown.silent" : "package-unknown");
         return;
     }
     const std::string block = text.substr(own, text.find("\napt:", own) - own);
@@ -97,11 +112,7 @@ void checkPolicy(const Unit& unit, Report& report)
     report.addFact("package_candidate", "Package offered", shown(candidate) + " as of the last refresh",
                    escaped(candidate));
     if (candidate == "(none)") {
-        report.add({Severity::WARNING, "package-not-offered",
-                    "No source offers the package " + shown(unit.package()) + '.',
-                    "compares \"(none)\" with the installed version like any other text unless the mirrors bring the "
-                    "package: equal means nothing to update, different an installation that fails.",
-                    "Check the sources: apt-cache policy " + unit.package()});
+        report.add("package-not-offered");
     }
 }
 
@@ -123,43 +134,39 @@ void checkSpace(const Unit& unit, Report& report)
                                  numberField(record.output, "Installed-Size") * 1024;
     struct statvfs system = {};
     if (statvfs(unit.path("/").c_str(), &system) != 0) {
-        report.add({Severity::UNCHECKED, "space-unknown", "The free space cannot be read: " + errorText(errno) + '.',
-                    "installs the package there.", "Check it: df /"});
+        report.add("space-unknown", {{"error", errorText(errno)}});
         return;
     }
     checkFreeSpace(system, needed, report);
 }
 
-void reportMirror(const std::string& address, const CommandResult& fetch, Report& report)
+/// "mirror.example" of "http://mirror.example/dists/stable/InRelease".
+std::string hostOf(const std::string& address)
+{
+    const std::size_t begin = address.find("//");
+    return begin == std::string::npos ? address : address.substr(begin + 2, address.find('/', begin + 2) - begin - 2);
+}
+
+void reportAddress(const std::string& address, bool hostAnswers, const CommandResult& fetch, Report& report)
 {
     std::string reason = valueAfter(fetch.errors, "Failed to fetch " + address + ' ');
     reason.erase(0, reason.find_first_not_of(' '));
-    if (contains(reason, "404") || contains(reason, "not found") || contains(reason, "Not Found")) {
-        report.add({Severity::WARNING, "mirror-index",
-                    "The mirror answers, but has no " + shown(address) + ": " + shown(reason) + '.',
-                    "may fail to refresh (log: \"NO_INTERNET_ERROR_CODE\") although the connection is fine.",
-                    "Check the release's name in the source."});
-        return;
+    const bool none = contains(reason, "404") || contains(reason, "not found") || contains(reason, "Not Found");
+    if (none || !hostAnswers) {
+        report.add(none ? "mirror-index" : "mirror-silent",
+                   {{"address", shown(address)},
+                    {"host", shown(hostOf(address))},
+                    {"reason", reason.empty() ? complaint(fetch) : shown(reason)}});
     }
-    report.add(
-        {Severity::ERROR, "mirror-silent",
-         "The mirror of " + shown(address) +
-             " does not answer: " + (reason.empty() ? complaint(fetch) : shown(reason)) + '.',
-         "does not notice: \"apt update\" ends with 0 when a name is not resolved or a connection refused, and "
-         "with 100 for other faults. After a 0 the log says \"OK\", and the comparison uses the list of the last "
-         "refresh: \"nothing to update\" then only means that nothing newer was known.",
-         "Check the unit's network: getent hosts, ping."});
 }
 
-/// Fetches the sources' index files with the package manager's own fetcher, proxies and certificates.
-void fetchIndexes(const std::vector<std::string>& indexes, const Unit& unit, Report& report)
+/// Fetches the sources' release files with the package manager's own fetcher, proxies and certificates. The first bytes
+/// of one are an answer of its host.
+void fetchReleases(const std::vector<std::string>& addresses, const Unit& unit, Report& report)
 {
-    const HeldSignals signals; // until the folder is gone
-    std::string folder = unit.path("/tmp/harl-updater-tool-XXXXXX");
-    if (mkdtemp(folder.data()) == nullptr) {
-        report.add({Severity::UNCHECKED, "mirrors-unknown",
-                    "No temporary folder can be made: " + errorText(errno) + '.', "refreshes the mirrors.",
-                    "Check the space in /tmp: df /tmp"});
+    const TemporaryFolder folder(unit);
+    if (folder.path().empty()) {
+        report.add("mirrors-unknown.folder", {{"error", errorText(errno)}});
         return;
     }
     std::vector<std::string> arguments = {unit.path("/usr/lib/apt/apt-helper"), "-o", "APT::Sandbox::User=root"};
@@ -167,50 +174,52 @@ void fetchIndexes(const std::vector<std::string>& indexes, const Unit& unit, Rep
         arguments.insert(arguments.end(), {"-o", option});
     }
     arguments.push_back("download-file");
-    const auto target = [&](std::size_t number) { return folder + '/' + std::to_string(number); };
-    for (std::size_t number = 0; number < indexes.size(); ++number) {
-        arguments.insert(arguments.end(), {indexes[number], target(number), ""}); // no checksum is known
+    const auto target = [&](std::size_t number) { return folder.path() + '/' + std::to_string(number); };
+    for (std::size_t number = 0; number < addresses.size(); ++number) {
+        arguments.insert(arguments.end(), {addresses[number], target(number), ""}); // no checksum is known
     }
     const CommandResult fetch = unit.run(arguments, mirrorLimit);
-    for (std::size_t number = 0; fetch.started && number < indexes.size(); ++number) {
-        if (!std::filesystem::exists(target(number))) {
-            reportMirror(indexes[number], fetch, report);
+    if (!fetch.started) {
+        report.add("mirrors-unknown.fetcher");
+        return;
+    }
+    std::set<std::string> answering;
+    for (std::size_t number = 0; number < addresses.size(); ++number) {
+        if (std::filesystem::exists(target(number))) {
+            answering.insert(hostOf(addresses[number]));
         }
     }
-    if (!fetch.started) {
-        report.add({Severity::UNCHECKED, "mirrors-unknown",
-                    "The package manager's fetcher apt-helper cannot be started.", "refreshes the mirrors.",
-                    "Run this check on the unit."});
+    std::set<std::string> told = answering;
+    for (std::size_t number = 0; number < addresses.size(); ++number) {
+        const std::string host = hostOf(addresses[number]);
+        if (!std::filesystem::exists(target(number)) && (answering.count(host) > 0 || told.insert(host).second)) {
+            reportAddress(addresses[number], answering.count(host) > 0, fetch, report);
+        }
     }
-    std::error_code error;
-    std::filesystem::remove_all(folder, error);
 }
 
 void checkMirrors(const Unit& unit, Report& report)
 {
     const CommandResult list = unit.run({"apt-get", "update", "--print-uris"}, quick);
     if (!list.succeeded()) {
-        report.add(
-            {list.started ? Severity::ERROR : Severity::UNCHECKED, "mirrors-unreadable",
-             "The package manager cannot tell its sources: " + complaint(list) + '.',
-             "cannot refresh the mirrors (log: \"NO_INTERNET_ERROR_CODE\" or \"NOT OK\") and " + unit.failure() + '.',
-             "Mend the sources: apt-get update --print-uris"});
+        report.add(list.started ? "mirrors-unreadable" : "mirrors-unreadable.unknown",
+                   {{"complaint", complaint(list)}});
         return;
     }
-    std::vector<std::string> indexes;
+    std::vector<std::string> addresses;
+    std::set<std::string> hosts;
     for (const std::string& line : linesOf(list.output)) {
-        if (!line.empty() && line.front() == '\'' && indexes.size() < mostMirrors) {
-            indexes.push_back(line.substr(1, line.find('\'', 1) - 1));
+        if (!line.empty() && line.front() == '\'' && addresses.size() < mostAddresses) {
+            addresses.push_back(line.substr(1, line.find('\'', 1) - 1));
+            hosts.insert(hostOf(addresses.back()));
         }
     }
-    report.addFact("mirrors", "Mirrors", std::to_string(indexes.size()), indexes.size());
-    if (indexes.empty()) {
-        report.add({Severity::ERROR, "mirrors-none", "The package manager has no sources.",
-                    "refreshes nothing and never finds an update.",
-                    "Enter the maker's source in /etc/apt/sources.list.d."});
+    report.addFact("mirrors", "Mirrors", std::to_string(hosts.size()), hosts.size());
+    if (addresses.empty()) {
+        report.add("mirrors-none");
         return;
     }
-    fetchIndexes(indexes, unit, report);
+    fetchReleases(addresses, unit, report);
 }
 
 } // namespace
@@ -231,23 +240,13 @@ void checkFreeSpace(const struct statvfs& system, std::uint64_t needed, Report& 
     if (needed > 0) {
         report.addFact("needed_bytes", "Package needs", byteCount(needed) + " without what it depends on", needed);
     }
-    if ((system.f_flag & ST_RDONLY) != 0) {
-        report.add({Severity::ERROR, "disk-read-only", "The unit's disk is mounted read-only.",
-                    "cannot refresh the mirrors nor install anything: the update fails.",
-                    "Look for the reason in the kernel's log: dmesg"});
-        return;
-    }
     const bool noFiles = system.f_files > 0 && system.f_favail == 0; // some file systems do not count them
-    if (available < needed || noFiles) {
-        report.add(
-            {Severity::ERROR, "disk-full",
-             noFiles ? "The unit's disk has no room for another file." : "The package needs more space than is free.",
-             "cannot install the package: the update fails, and the package may be left "
-             "half-installed.",
-             "Free some: apt-get clean"});
+    if ((system.f_flag & ST_RDONLY) != 0) {
+        report.add("disk-read-only");
+    } else if (available < needed || noFiles) {
+        report.add(noFiles ? "disk-full.files" : "disk-full");
     } else if (available < littleSpace) {
-        report.add({Severity::WARNING, "disk-almost-full", "Little space is free: " + byteCount(available) + '.',
-                    "may not be able to install what the package depends on.", "Free some: apt-get clean"});
+        report.add("disk-almost-full", {{"size", byteCount(available)}});
     }
 }
 
@@ -256,9 +255,7 @@ void checkUnfinishedWork(const Unit& unit, Report& report)
     const CommandResult packages =
         unit.run({"dpkg-query", "--show", "--showformat=${db:Status-Abbrev}\\t${binary:Package}\\n"}, quick);
     if (!packages.succeeded()) {
-        report.add({Severity::UNCHECKED, "packages-unknown",
-                    "The installed packages cannot be listed: " + complaint(packages) + '.',
-                    "installs the head's package.", "Run this check on the unit."});
+        report.add("packages-unknown", {{"complaint", complaint(packages)}});
         return;
     }
     std::vector<std::string> pending;
@@ -269,17 +266,10 @@ void checkUnfinishedWork(const Unit& unit, Report& report)
             pending.push_back(line.substr(line.find('\t') + 1));
         }
     }
-    const bool interrupted = dpkgWasInterrupted(unit);
-    if (pending.empty() && !interrupted) {
-        return;
+    const char* const interrupted = dpkgWasInterrupted(unit) ? "an interrupted run" : "";
+    const char* const between = !pending.empty() && *interrupted != '\0' ? " and " : "";
+    const std::string work = listed(pending) + between + interrupted;
+    if (!work.empty()) {
+        report.add("package-half-configured", {{"work", work}});
     }
-    report.add({Severity::ERROR, "package-half-configured",
-                "The package manager has unfinished work: " + listed(pending) +
-                    (pending.empty() ? ""
-                     : interrupted   ? " and "
-                                     : "") +
-                    (interrupted ? "an interrupted run." : "."),
-                "may see the version as installed that never got configured, and then finds nothing to update; or its "
-                "installation fails.",
-                "Finish it: dpkg --configure -a"});
 }

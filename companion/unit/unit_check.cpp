@@ -17,12 +17,6 @@
 namespace
 {
 
-const std::string darkPanel =
-    "cannot light the panel (log: \"system returned false: i2cset ...\"). The update itself runs, "
-    "but the operator sees neither its progress nor its outcome.";
-const std::string noSound =
-    "plays no sound (log: \"Failed to play a sound\"); the panel shows the outcome all the same.";
-
 /// The unit check: each operation adds to the report what it finds.
 class UnitCheck
 {
@@ -32,12 +26,10 @@ public:
     void run()
     {
         if (mUpdaterRuns) {
-            add(Severity::WARNING, "updater-runs", "The updater is running.", "goes on undisturbed.",
-                "Check again when it has ended: what it holds or changes shows up here as a fault.");
+            mReport.add("updater-runs");
         }
         if (!mUnit.isRoot()) {
-            add(Severity::UNCHECKED, "not-root", "This check does not run as root.",
-                "runs as root, with root's keys and rights.", "Run it as root.");
+            mReport.add("not-root");
         }
         mReport.addFact("head", "Head",
                         (mUnit.isMainHead() ? "main head, package " : "remote head, package ") + shown(mUnit.package()),
@@ -53,76 +45,52 @@ public:
     }
 
 private:
-    void add(Severity severity, const char* check, std::string what, std::string effect, std::string remedy)
-    {
-        mReport.add({severity, check, std::move(what), std::move(effect), std::move(remedy)});
-    }
-
     void checkServices()
     {
         if (!mUnit.servicesKnown()) {
-            add(Severity::UNCHECKED, "services-unknown", "The service manager cannot be asked.",
-                "stops and starts the application through it.", "Run this check on the unit.");
+            mReport.add("services-unknown");
             return;
         }
-        // systemctl(1) exits with 5 for a unit that is not loaded.
-        checkService("harl", "service_harl",
-                     "can neither stop the application before the update nor start it afterwards (log: status 1280).");
-        checkService("harl-updater", "service_harl_updater",
-                     "is not started as a service, and its last command fails (log: status 1280).");
+        checkService("harl", "service_harl");
+        checkService("harl-updater", "service_harl_updater");
     }
 
-    void checkService(const std::string& service, const std::string& fact, const std::string& effect)
+    /// systemctl(1) exits with 5 for a unit that is not loaded.
+    void checkService(const std::string& service, const std::string& fact)
     {
         const std::string state = mUnit.property(service, "LoadState");
         if (state != "loaded") {
-            add(Severity::ERROR, "service-not-loaded",
-                "The service " + shown(service) + " cannot be used: " + shown(state) + '.', effect,
-                "Install its unit file: systemctl status " + service);
+            mReport.add("service-not-loaded." + service, {{"state", shown(state)}});
         }
         mReport.addFact(fact, "Service " + service, escaped(mUnit.property(service, "ActiveState")));
     }
 
     void checkTools()
     {
-        const std::string failure = mUnit.failure() + '.';
-        const std::string noVersion = mUnit.isMainHead() ? "installs nothing." : "leaves the board as it is.";
         mReport.addFact("search_path", "Search path", escaped(mUnit.searchPath()));
-        findTool("systemctl", "cannot stop and start the application (log: status 32512).");
-        findTool("umount", "cannot release the stick (log: status 32512).");
-        findTool("rm", "cannot remove the first-boot marker, although the log says \"removed\".");
-        findTool("ls",
-                 "finds no version on the stick (log: \"Failed to check candidate QUORB version\") and " + noVersion);
-        findTool("apt", "cannot refresh the mirrors (log: \"NOT OK 127\") and " + failure);
-        findTool("apt-cache", "finds no versions (log: \"NWM_UM_CHECK_UPDATE_FAILED\") and " + failure);
-        findTool("ssh", "cannot ask the board for its version (log: \"Exit code:127\") and " + noVersion);
-        findTool("scp",
-                 "cannot upload the board's files (log: \"Uploading failed. Trying again. \"), gives up after 20 "
-                 "attempts and " +
-                     failure);
+        for (const char* tool : {"systemctl", "umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp"}) {
+            findTool(tool);
+        }
     }
 
     /// False, and reported, when the service's search path does not lead to the tool.
-    bool findTool(const char* name, const std::string& effect, Severity severity = Severity::ERROR)
+    bool findTool(const std::string& name)
     {
-        if (!mUnit.program(name).empty()) {
-            return true;
+        const bool found = !mUnit.program(name).empty();
+        if (!found) {
+            mReport.add("tool-missing." + name, {{"tool", shown(name)}, {"search-path", shown(mUnit.searchPath())}});
         }
-        add(severity, "tool-missing",
-            "The command " + shown(name) + " is not on the service's search path " + shown(mUnit.searchPath()) + '.',
-            effect, "Install it, or set PATH in the service's unit file.");
-        return false;
+        return found;
     }
 
     void checkPanel()
     {
-        if (!findTool("i2cset", darkPanel)) {
+        if (!findTool("i2cset")) {
             return;
         }
         checkPanelAddress();
         if (!std::filesystem::exists(mUnit.path("/dev/i2c-0"))) {
-            add(Severity::ERROR, "panel-bus-missing", "There is no bus device \"/dev/i2c-0\".", darkPanel,
-                "Load the kernel's driver: modprobe i2c-dev");
+            mReport.add("panel-bus-missing");
         } else if (!mUpdaterRuns) { // a read could come between the two bytes of a LED's command
             checkPanelAnswer();
         }
@@ -132,17 +100,10 @@ private:
     {
         // A register number out of range: i2cset(8) judges the chip address before it and opens no bus.
         const CommandResult address = mUnit.run({"i2cset", "-y", "0", "0x07", "0x100", "c"}, quick);
-        if (contains(address.errors, "hip address")) {
-            add(Severity::ERROR, "panel-address-refused",
-                shown(mUnit.program("i2cset")) + " refuses the panel's address 0x07: " + complaint(address) + '.',
-                darkPanel,
-                "i2c-tools since 4.2 needs the option -a. Put a command i2cset that adds it before it on the service's "
-                "search path, or install an older i2c-tools.");
-        } else if (!contains(address.errors, "ata address")) {
-            add(Severity::UNCHECKED, "panel-address-unknown",
-                shown(mUnit.program("i2cset")) +
-                    " does not tell whether it takes the panel's address 0x07: " + complaint(address) + '.',
-                "lights the panel with it.", "Run the lamp test: harl-updater-tool unit --panel");
+        const bool refused = contains(address.errors, "hip address");
+        if (refused || !contains(address.errors, "ata address")) {
+            mReport.add(refused ? "panel-address-refused" : "panel-address-unknown",
+                        {{"program", shown(mUnit.program("i2cset"))}, {"complaint", complaint(address)}});
         }
     }
 
@@ -150,46 +111,36 @@ private:
     {
         const CommandResult answer = mUnit.run({"i2cdetect", "-y", "-a", "-r", "0", "0x07", "0x07"}, quick);
         const std::string row = valueAfter(answer.output, "00:");
-        if (contains(row, "UU")) {
-            add(Severity::ERROR, "panel-busy", "A kernel driver has taken the panel's address 0x07 on bus 0.",
-                darkPanel, "Remove the driver.");
-        } else if (contains(row, "--")) {
-            add(Severity::ERROR, "panel-silent", "Nothing answers at the panel's address 0x07 on bus 0.", darkPanel,
-                "Check the panel's cable and supply.");
+        if (contains(row, "UU") || contains(row, "--")) {
+            mReport.add(contains(row, "UU") ? "panel-busy" : "panel-silent");
         } else if (!contains(row, "07")) {
-            add(Severity::UNCHECKED, "panel-unknown", "The panel's bus could not be asked: " + complaint(answer) + '.',
-                "lights the panel over it.", "Run the lamp test: harl-updater-tool unit --panel");
+            mReport.add("panel-unknown", {{"complaint", complaint(answer)}});
         }
     }
 
     void checkSound()
     {
-        findTool("aplay", noSound, Severity::WARNING);
+        findTool("aplay");
         for (const char* sound : {passSound, failSound}) {
             checkSoundFile(sound);
         }
         std::ifstream devices(mUnit.path("/proc/asound/pcm")); // one line for each, snd(4) of the kernel
         const std::string text(std::istreambuf_iterator<char>(devices), {});
         if (!contains(text, "playback")) {
-            add(Severity::WARNING, "sound-device", "There is no sound device.", noSound,
-                "Check the sound driver: aplay -l");
+            mReport.add("sound-device");
         }
     }
 
     void checkSoundFile(const char* sound)
     {
-        const std::string effect = "plays nothing or a noise in its place; the panel shows the outcome all the same.";
         std::ifstream file(mUnit.path(sound), std::ios::binary);
         if (!file && errno != ENOENT) {
-            add(Severity::UNCHECKED, "sound-file",
-                "The sound " + shown(sound) + " cannot be read: " + errorText(errno) + '.', effect,
-                "Run this check as root.");
+            mReport.add("sound-file.unknown", {{"path", shown(sound)}, {"error", errorText(errno)}});
             return;
         }
         const std::string fault = file ? soundFault(file) : "it is not there";
         if (!fault.empty()) {
-            add(Severity::WARNING, "sound-file", "The sound " + shown(sound) + " cannot be played: " + fault + '.',
-                effect, "Install the sound file again.");
+            mReport.add("sound-file", {{"path", shown(sound)}, {"fault", fault}});
         }
     }
 
@@ -247,6 +198,7 @@ int runSelfTests(const UnitOptions& options, const Unit& unit, const UnitSite& s
 
 void checkUnit(const Unit& unit, Report& report)
 {
+    unit.defineTexts(report);
     UnitCheck(unit, report).run();
 }
 

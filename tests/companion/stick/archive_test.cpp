@@ -262,5 +262,31 @@ TEST(StickArchive, ContentsOfAHundredTimesTheSizeAreAWarning)
 TEST(StickArchive, MuchInFrontOfTheArchiveIsAWarning)
 {
     EXPECT_EQ(findingsOf(check(std::string(101'000'000, '\0') + zipArchive({{"a", "abc"}}))),
-              Lines{"warning archive-padding"});
+              (Lines{"warning archive-padding", "warning archive-prefix"}));
+}
+
+TEST(StickArchive, AFewBytesInFrontOfTheFirstEntryAreAWarning)
+{
+    const Report report = check("MZ" + zipArchive({{"a", "abc"}}));
+    EXPECT_EQ(findingsOf(report), Lines{"warning archive-prefix"});
+    EXPECT_THAT(whatOf(report, "archive-prefix"), HasSubstr("2 bytes in front of its first entry"));
+}
+
+TEST(StickArchive, EntryBelowASymbolicLinkOfTheArchiveIsAnError)
+{
+    ZipEntry link{"App", "/etc"};
+    link.attributes = 0120777U << 16U;
+    EXPECT_EQ(findingsOf(check(zipArchive({link, {"Appendix", "abc"}}))), Lines());
+    const Report report = check(zipArchive({link, {"App/passwd", "abc"}}));
+    EXPECT_EQ(findingsOf(report), Lines{"error archive-entry-path"});
+    EXPECT_THAT(whatOf(report, "archive-entry-path"), HasSubstr("\"App/passwd\" at offset"));
+}
+
+TEST(StickArchive, EntryOfAnotherNameInFrontOfItsDataIsDamaged)
+{
+    ZipEntry entry{"version", "abc"};
+    entry.localName = "etc.txt";
+    const Report report = check(zipArchive({entry}));
+    EXPECT_EQ(findingsOf(report), Lines{"error archive-damaged"});
+    EXPECT_THAT(whatOf(report, "archive-damaged"), HasSubstr("is named \"etc.txt\" in front of its data"));
 }

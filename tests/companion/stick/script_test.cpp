@@ -44,11 +44,7 @@ TEST(StickScript, CompiledProgramIsFit)
 
 TEST(StickScript, FirstLineThatTheKernelCannotRunIsAnError)
 {
-    const std::string lines[] = {"echo\n",
-                                 "\n#!/bin/sh\n",
-                                 " #!/bin/sh\n",
-                                 "\xef\xbb\xbf#!/bin/sh\n", // a byte order mark
-                                 "#!\n",
+    const std::string lines[] = {"#!\n",
                                  "#!sh\n",
                                  "#!/bin/sh\r\n",
                                  "#!/bin/sh\rexit 0\r",
@@ -57,6 +53,16 @@ TEST(StickScript, FirstLineThatTheKernelCannotRunIsAnError)
     for (const std::string& script : lines) {
         EXPECT_EQ(findingsOf(check(script)), Lines{"error script-first-line"}) << script;
     }
+}
+
+TEST(StickScript, FirstLineWithoutAnInterpreterIsAWarningBecauseAShellRunsIt)
+{
+    const std::string lines[] = {"echo\n", "\n#!/bin/sh\n", " #!/bin/sh\n",
+                                 "\xef\xbb\xbf#!/bin/sh\n" /* byte order mark */};
+    for (const std::string& script : lines) {
+        EXPECT_EQ(findingsOf(check(script)), Lines{"warning script-first-line"}) << script;
+    }
+    EXPECT_EQ(findingsOf(check("echo\r\n")), (Lines{"warning script-first-line", "error script-line-ends"}));
 }
 
 TEST(StickScript, FirstLineIsShownEscaped)

@@ -549,3 +549,52 @@ TEST_F(Stick, NothingOnTheStickIsChanged)
     check();
     EXPECT_EQ(times(), before);
 }
+
+TEST_F(Stick, VersionFolderThatMayNotBeEnteredIsUnchecked)
+{
+    for (const char* folder : {"debs/QUORB/armhf/quorb2.2.0", "debs/QUORB/armhf"}) {
+        chmod(stick.path(folder).c_str(), 0744);
+        const AsNobody nobody;
+        EXPECT_EQ(findings(), Lines{"unchecked stick-unreadable"}) << folder;
+    }
+}
+
+TEST_F(Stick, LinkToTheUnitsMountPointIsFollowedOnTheStick)
+{
+    rename("debs/QUORB/armhf/quorb2.2.0", "files");
+    stick.makeLink("debs/QUORB/armhf/quorb2.2.0", "/root/USB_MOUNT/files");
+    EXPECT_EQ(findings(), Lines());
+    remove("debs/QUORB/armhf/quorb2.2.0");
+    stick.makeLink("debs/QUORB/armhf/quorb2.2.0", "/root/USB_MOUNT_2/files");
+    EXPECT_EQ(findings()[0], "error link-leaves-stick");
+}
+
+TEST_F(Stick, MarkerLinkToItselfRequestsNothing)
+{
+    stick.makeLink("debs/installTV", "installTV");
+    const Report report = check();
+    EXPECT_EQ(factOf(report, "teamviewer_requested"), "false");
+    EXPECT_EQ(findingsOf(report), Lines{"error link-broken"});
+}
+
+TEST_F(Stick, MarkerInTheSticksOwnFolderIsNamed)
+{
+    stick.put("installTV", "");
+    EXPECT_EQ(findings(), Lines{"warning marker-name"});
+    EXPECT_THAT(whatOf(check(), "marker-name"), HasSubstr("in the stick's own folder"));
+}
+
+TEST_F(Stick, FolderOneLevelTooDeepIsNamed)
+{
+    fs::create_directory(stick.path("update"));
+    rename("debs", "update/debs");
+    EXPECT_THAT(whatOf(check(), "no-board-folder"), HasSubstr("\"update/debs\" is one level too deep"));
+}
+
+TEST_F(Stick, VerdictCountsTheWarnings)
+{
+    rename("debs/QUORB/armhf/quorb2.2.0", "debs/QUORB/armhf/quorb_2.2.0");
+    std::ostringstream out;
+    check().write(false, out);
+    EXPECT_THAT(out.str(), HasSubstr("The stick is fit for an update, with 1 warning.\n"));
+}

@@ -42,12 +42,13 @@ std::string zipArchive(const std::vector<ZipEntry>& entries)
         directory += "PK\x01\x02";
         directory += littleEndian(20, 2); // version made by
         directory += fields;
-        directory += littleEndian(0, 10); // comment, disk, attributes
+        directory += littleEndian(0, 6); // comment, disk, internal attributes
+        directory += littleEndian(entry.attributes, 4);
         directory += littleEndian(archive.size(), 4);
         directory += entry.name;
         archive += "PK\x03\x04";
         archive += fields;
-        archive += entry.name;
+        archive += entry.localName.value_or(entry.name);
         archive += data;
     }
     const std::size_t start = archive.size();

@@ -15,6 +15,8 @@ struct ZipEntry
     std::optional<std::uint32_t> checksum = std::nullopt;
     std::optional<std::uint32_t> packedSize = std::nullopt;
     std::optional<std::uint32_t> unpackedSize = std::nullopt;
+    std::optional<std::string> localName = std::nullopt; ///< in front of the data; as long as `name`
+    std::uint32_t attributes = 0;                        ///< external ones: stat(2)'s mode in the upper half
 };
 
 /// The bytes of an archive with these entries.

@@ -15,7 +15,7 @@ from bench.compare import differences
 from bench.show.text import PlainDisplay, Summary, print_summary, terminal
 from bench.show.page import page
 from bench.runner import KINDS, UnitMaker, run_on, temporary_folder
-from bench.run_all import run_all
+from bench.run_all import run_all, write_page
 from bench.show.terminal import LiveDisplay
 from bench.unit import PROGRAMS
 
@@ -31,7 +31,7 @@ def run(maker: UnitMaker, what: scenario.Scenario, page_file: Path | None) -> in
     summary = Summary(what, unit.name, result, differences(what, result))
     print_summary(summary)
     if page_file:
-        page_file.write_text(page(summary, maker.speed), encoding="utf-8", errors="replace")
+        write_page(page_file, page(summary, maker.speed))
         print(f"Page: {page_file}")
     return 1 if summary.wrong else 0
 
@@ -73,15 +73,24 @@ def arguments() -> argparse.Namespace:
         help="use the build in FOLDER as it is (default: build/default, built first)",
     )
     parser.add_argument("--full-length", action="store_true", help="keep every wait: up to 14 minutes")
-    parser.add_argument("--record", type=Path, metavar="FILE", help="write the run as an HTML page with its timeline")
+    parser.add_argument(
+        "--record",
+        type=Path,
+        metavar="FILE",
+        help="write the run as an HTML page with its timeline; with --all, a page for each scenario and an index into "
+        "the folder FILE",
+    )
     given = parser.parse_args()
     if not 1 <= given.speed < math.inf:
         parser.error("--speed: must be a number, 1 or more")
     if given.build and not os.path.isfile(given.build / PROGRAMS["remote"]):
         parser.error(f"--build: {given.build} holds no {PROGRAMS['remote']}: build it there or leave --build out")
     if given.record and given.all:
-        parser.error("--record: takes one scenario, not --all")
-    if given.record and not writable(given.record):
+        try:
+            given.record.mkdir(parents=True, exist_ok=True)
+        except OSError as error:
+            parser.error(f"--record: {given.record} cannot be a folder: {error.strerror}")
+    elif given.record and not writable(given.record):
         parser.error(f"--record: {given.record} cannot be written")
     if given.jobs < 1:
         parser.error("--jobs: must be 1 or more")
@@ -110,7 +119,7 @@ def show(given: argparse.Namespace) -> int:
         build()
     maker = UnitMaker(given.unit, given.speed, (given.build or BUILD).resolve())
     if given.all:
-        return 0 if run_all(maker, wanted, given.jobs) else 1
+        return 0 if run_all(maker, wanted, given.jobs, given.record) else 1
     return run(maker, wanted[0], given.record)
 
 

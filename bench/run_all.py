@@ -1,14 +1,18 @@
-"""Runs many scenarios side by side and shows how each came out."""
+"""Runs many scenarios side by side, shows how each came out, and writes their pages."""
 
 import subprocess
 import threading
 import time
 from concurrent.futures import ThreadPoolExecutor, as_completed
 from dataclasses import dataclass
+from pathlib import Path
 
 from bench.compare import differences
 from bench.runner import NotServed, UnitMaker, run_on, temporary_folder
 from bench.scenario import Scenario
+from bench.show.gallery import index
+from bench.show.page import page, page_name
+from bench.show.text import Summary
 from bench.unit import UnitError
 
 
@@ -21,14 +25,15 @@ class Row:
     seconds: float  # with set-up
     text: str
     wrong: list[str]
+    summary: Summary | None = None  # of a run
 
 
 def run_one(maker: UnitMaker, what: Scenario, stop: threading.Event) -> Row:
     """Runs the scenario `what` and shows nothing. Ends early when `stop` is set."""
     begin = time.monotonic()
 
-    def row(kind: str, text: str, wrong: list[str]) -> Row:
-        return Row(what, kind, time.monotonic() - begin, text, wrong)
+    def row(kind: str, text: str, wrong: list[str], summary: Summary | None = None) -> Row:
+        return Row(what, kind, time.monotonic() - begin, text, wrong, summary)
 
     def check(*_: object) -> None:
         if stop.is_set():
@@ -38,19 +43,21 @@ def run_one(maker: UnitMaker, what: Scenario, stop: threading.Event) -> Row:
         try:
             check()
             unit = maker.make(what, folder)
-            wrong = differences(what, run_on(unit, check, maker.speed))
+            result = run_on(unit, check, maker.speed)
+            summary = Summary(what, unit.name, result, differences(what, result))
         except NotServed as error:
             return row("none", f"not run: {error}", [])
         except (UnitError, OSError, subprocess.SubprocessError) as error:
             return row("none", "FAILED", [str(error)])
-    return row(unit.kind, "DIFFERENT" if wrong else "as it says", wrong)
+    return row(unit.kind, "DIFFERENT" if summary.wrong else "as expected", summary.wrong, summary)
 
 
-def run_all(maker: UnitMaker, scenarios: list[Scenario], at_once: int) -> bool:
-    """Runs `scenarios`, `at_once` at a time, and prints a table. True when none came out other than its file says."""
+def run_all(maker: UnitMaker, scenarios: list[Scenario], at_once: int, gallery: Path | None) -> bool:
+    """Runs `scenarios`, `at_once` at a time, and prints a table. Writes their pages and an index of them into the
+    folder `gallery`. True when each came out as its file says."""
     stop = threading.Event()
     begin = time.monotonic()
-    wrong = 0
+    rows = []
     # The longest first: none of them is left to run alone at the end.
     order = sorted(scenarios, key=lambda what: what.setup.board.link not in ("dies", "lost"))
     print(f"{'scenario':38} {'unit':8} {'time':>7}  result")
@@ -62,8 +69,20 @@ def run_all(maker: UnitMaker, scenarios: list[Scenario], at_once: int) -> bool:
                 for line in row.wrong:
                     print(f"    {line}")
                 print(end="", flush=True)
-                wrong += bool(row.wrong)
+                rows.append(row)
+                if gallery and row.summary:
+                    write_page(gallery / page_name(row.scenario), page(row.summary, maker.speed))
         finally:
             stop.set()
+    wrong = sum(bool(row.wrong) for row in rows)
     print(f"{len(scenarios)} scenarios, {wrong} wrong, {time.monotonic() - begin:.0f} s")
+    if gallery:
+        missing = [(row.scenario.name, " ".join([row.text, *row.wrong])) for row in rows if not row.summary]
+        write_page(gallery / "index.html", index([row.summary for row in rows if row.summary], missing))
+        print(f"Pages: {gallery / 'index.html'}")
     return not wrong
+
+
+def write_page(file: Path, text: str) -> None:
+    """Writes a page; bytes of a log that are no text become question marks."""
+    file.write_text(text, encoding="utf-8", errors="replace")

@@ -9,6 +9,7 @@ from string import Template
 from bench.show.text import Summary
 from bench.observation import Call, Run, now
 from bench.panel import STEP_UNIT, Panel, color_name, led_name
+from bench.scenario import Scenario
 from bench.show.panel import fill_of, panel_picture
 
 WIDTH = 1200  # of the timeline; all lengths are in the drawing's own unit
@@ -21,20 +22,27 @@ COMMAND, WAIT = "#57606a", "#c9a227"
 TICKS = [0.1, 0.2, 0.5, 1, 2, 5, 10, 20, 30, 60, 120, 300]  # s
 MOST_TICKS = 16
 
+# Of the pages of all runs and of their index: light and dark, on a screen of 1,200 pixels and on paper.
+STYLE = """
+:root { color-scheme: light dark; --text: #1c1f24; --line: #d8dbe0; --wrong: #b01020; --bar: #57606a; }
+@media (prefers-color-scheme: dark) { :root { --text: #e6e8eb; --line: #3c4148; --wrong: #ff7b82; --bar: #9aa4b0; } }
+@media print { :root { color-scheme: light; --text: #000000; } a { color: inherit; } tr, svg { break-inside: avoid; } }
+body { font: 14px/1.4 sans-serif; margin: 24px auto; max-width: 1168px; padding: 0 16px; color: var(--text); }
+h1 { font-size: 22px; margin: 0; } h2 { font-size: 16px; margin: 28px 0 8px; }
+table { border-collapse: collapse; } th { text-align: left; font-weight: 600; }
+td, th { padding: 2px 16px 2px 0; vertical-align: top; }
+svg { max-width: 100%; height: auto; }
+#timeline text { font-size: 11px; fill: var(--text); } #timeline line { stroke: var(--line); }
+code, pre { font: 12px monospace; white-space: pre-wrap; overflow-wrap: anywhere; }
+.number { text-align: right; white-space: nowrap; } .wrong { color: var(--wrong); }
+"""
 PAGE = Template(
     """<!DOCTYPE html>
 <html lang="en">
 <meta charset="utf-8">
+<meta name="viewport" content="width=device-width">
 <title>$name: $outcome</title>
-<style>
-body { font: 14px/1.4 sans-serif; margin: 24px auto; max-width: ${width}px; padding: 0 16px; color: #1c1f24; }
-h1 { font-size: 22px; margin: 0; } h2 { font-size: 16px; margin: 28px 0 8px; }
-table { border-collapse: collapse; } th { text-align: left; font-weight: 600; }
-td, th { padding: 2px 16px 2px 0; vertical-align: top; }
-svg { max-width: 100%; height: auto; } svg text { font-size: 11px; fill: #1c1f24; }
-code, pre { font: 12px monospace; white-space: pre-wrap; overflow-wrap: anywhere; }
-.number { text-align: right; white-space: nowrap; } .wrong { color: #d1242f; }
-</style>
+<style>$style</style>
 <h1>$name: $outcome</h1>
 <p>$summary<br>Unit: $unit. $speed</p>
 $wrong<h2>Panel at the end</h2>
@@ -53,6 +61,11 @@ $commands</table>
 )
 
 
+def page_name(scenario: Scenario) -> str:
+    """The file of the scenario's page in a gallery."""
+    return f"{scenario.name}.html"
+
+
 def page(summary: Summary, speed: float) -> str:
     """The page for a run whose waits were `speed` times shorter."""
     run, scenario = summary.result.run, summary.scenario
@@ -62,7 +75,7 @@ def page(summary: Summary, speed: float) -> str:
     speeded = f"The updater's waits are {speed:g} times shorter, commands take their real time." if speed > 1 else ""
     wrong = "".join(f'<p class="wrong">Not as the scenario says: {escape(line)}</p>\n' for line in summary.wrong)
     return PAGE.substitute(
-        width=WIDTH,
+        style=STYLE,
         name=escape(scenario.name),
         outcome=escape(summary.outcome),
         summary=escape(scenario.summary),
@@ -136,7 +149,7 @@ def _timeline(run: Run, begin: float, end: float) -> str:
     grid = ""
     for number in range(int((end - begin) / step) + 1):
         x = across(begin + number * step)
-        grid += f'<line x1="{x:.1f}" y1="0" x2="{x:.1f}" y2="{top}" stroke="#f0f1f3"/>'
+        grid += f'<line x1="{x:.1f}" y1="0" x2="{x:.1f}" y2="{top}"/>'
         grid += f'<text x="{x:.1f}" y="{top + 14}" text-anchor="middle">{number * step:g} s</text>\n'
     return f'<svg id="timeline" viewBox="0 0 {WIDTH} {top + 20}">\n{grid}{drawn}</svg>'
 

@@ -60,7 +60,9 @@ class BadInput(unittest.TestCase):
             self.check_words(f"--record: {file} cannot be written", "--record", file, "up-to-date")
 
     def test_page_of_many_scenarios(self) -> None:
-        self.check_words("--record: takes one scenario, not --all", "--all", "--record", self.folder / "page.html")
+        (self.folder / "file").touch()
+        file = self.folder / "file"
+        self.check_words(f"--record: {file} cannot be a folder: File exists", "--all", "--record", file)
 
     def test_scenario_beside_all_or_list(self) -> None:
         self.check_words("argument scenario: not allowed with argument --all", "--all", "up-to-date")

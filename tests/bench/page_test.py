@@ -2,12 +2,15 @@
 
 The page that bench/run --record writes."""
 
+import io
 import os
 import re
 import subprocess
 import sys
 import tempfile
 import unittest
+from contextlib import redirect_stdout
+from dataclasses import replace
 from html.parser import HTMLParser
 from pathlib import Path
 
@@ -15,6 +18,9 @@ from bench.show import page as page_module
 from bench.show import panel as panel_module
 from bench.observation import Run
 from bench.panel import STEP_TIME
+from bench.run_all import run_all
+from bench.runner import UnitMaker
+from bench.scenario import load
 from bench.unit import Files
 from tests.command_line import take_path
 
@@ -135,6 +141,31 @@ class Page(unittest.TestCase):
         self.assertIn("Not as the scenario says: marker: expected False, not True", page)
         self.assertIn("&lt;b&gt;", page)
         self.assertNotIn("<b>", page)
+
+
+class Gallery(unittest.TestCase):
+    """The pages of many runs, and their index."""
+
+    def test_index_of_runs_and_of_a_scenario_that_does_not_run(self) -> None:
+        scenarios = [load(name) for name in ("mirrors-fail", "up-to-date", "harl-unknown")]
+        expect = replace(scenarios[1].expect, marker=not scenarios[1].expect.marker)
+        scenarios[1] = replace(scenarios[1], expect=expect)
+        scenarios[2] = replace(scenarios[2], only="real")
+        with tempfile.TemporaryDirectory() as name:
+            folder = Path(name)
+            with redirect_stdout(io.StringIO()):
+                self.assertFalse(run_all(UnitMaker("stand-in", 2000, BUILD), scenarios, 2, folder))
+            self.assertEqual(
+                {file.name for file in folder.iterdir()}, {"index.html", "mirrors-fail.html", "up-to-date.html"}
+            )
+            index = (folder / "index.html").read_text(encoding="utf-8")
+        elements = Elements(index)
+        self.assertIn("2 scenarios, 1 of them not as expected. 1 did not run.", elements.texts("p"))
+        self.assertEqual(elements.texts("a"), ["mirrors-fail", "up-to-date"])
+        self.assertEqual([title for title in elements.texts("title") if title.endswith((" pass", " fail"))],
+                         ["REMOTE fail", "MAIN fail", "REMOTE pass", "MAIN pass"])
+        self.assertIn("marker: expected", index)
+        self.assertIn("harl-unknown needs the real unit", index)
 
 
 if __name__ == "__main__":

@@ -23,7 +23,7 @@ inline constexpr Limit limits[] = {
     {"detach", "umount", "--lazy", 20, 20, false, false},
     {"stick", "umount", nullptr, 120, 120, false, false},
     {"services", "systemctl", nullptr, 300, 300, false, false},
-    {"mirrors", "apt", "update", 1200, 1200, false, false},
+    {"mirrors", "apt", "update", 1080, 1080, false, false}, // the application is back within 20 minutes
     {"versions", "apt-cache", nullptr, 180, 180, false, false},
     {"installation", "apt", nullptr, 5400, 5400, false, true},
     {"board-version", "ssh", "version.txt", 180, 180, false, false},

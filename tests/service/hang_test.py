@@ -6,6 +6,7 @@ shows what the procedure gives for that failure, and the next run ends as it sho
 """
 
 import time
+from collections.abc import Iterable
 from dataclasses import dataclass
 
 from bench.makers.files import write, write_script
@@ -147,15 +148,23 @@ class Matrix(HangTest):
     """Each command hanging in each way; the tests are made below."""
 
 
-def add_cases() -> None:
+class ShippedLimits(HangTest):
+    """One command hanging in each way, with the limits that are shipped; the tests are made below."""
+
+    def setUp(self) -> None:
+        super().setUp()
+        self.inside("cp", "/opt/hand-over", "/usr/lib/harl-updater/hand-over")
+
+
+def add_cases(tests: type[HangTest], commands: Iterable[str]) -> None:
     """One test for each command and each way to hang."""
-    for name, command in COMMANDS.items():
+    for name in commands:
         for kind, how in KINDS.items():
 
-            def case(self: HangTest, command: Command = command, how: str = how) -> None:
+            def case(self: HangTest, command: Command = COMMANDS[name], how: str = how) -> None:
                 self.check(command, how)
 
-            setattr(Matrix, f"test_{name}_{kind}", case)
+            setattr(tests, f"test_{name}_{kind}", case)
 
 
 class Others(HangTest):
@@ -197,12 +206,6 @@ class Others(HangTest):
         self.run_to_the_end()
         self.assertEqual(self.panel(), CHECK_FAILED.panel)
         self.check_next_run()
-
-    def test_panel_with_the_shipped_limits(self) -> None:
-        self.inside("cp", "/opt/hand-over", "/usr/lib/harl-updater/hand-over")
-        self.hang("i2cset", "*' 0x2 c'", KINDS["never_ends"], once=True)
-        self.run_to_the_end()
-        self.assertEqual(self.panel(faults=True), UPDATED.panel)
 
     def mount_stick(self) -> None:
         """Plugs the stick in again."""
@@ -303,5 +306,6 @@ class Rescuer(HangTest):
 
 
 if __name__ == "__main__":
-    add_cases()
+    add_cases(Matrix, COMMANDS)
+    add_cases(ShippedLimits, ["colour_of_the_outcome"])
     main()

@@ -121,6 +121,7 @@ class ServiceTest(unittest.TestCase):
 
     unit: Machine
     package: str
+    before: list[str] = []  # what leaves out of the journal what came before the run
 
     def setUp(self) -> None:
         self.maxDiff = None
@@ -170,7 +171,9 @@ class ServiceTest(unittest.TestCase):
 
     def note_journal(self) -> None:
         """The run's part of the journal begins here."""
-        self.cursor = self.inside("journalctl", "--lines=0", "--show-cursor").split("-- cursor: ")[1].strip()
+        # As in service/prepare.
+        last = self.inside("sh", "-c", "journalctl --identifier=harl-updater --lines=0 --show-cursor || true")
+        self.before = [f"--after-cursor={line[11:]}" for line in last.splitlines() if line.startswith("-- cursor: ")]
 
     def kill(self, signal: str) -> None:
         """Sends a signal to the updater itself."""
@@ -211,8 +214,7 @@ class ServiceTest(unittest.TestCase):
     def journal(self) -> str:
         """The messages of the service, of this run."""
         self.inside("journalctl", "--sync")
-        match = [f"--after-cursor={self.cursor}", "--identifier=harl-updater"]
-        return self.inside("journalctl", "--quiet", "--output=cat", *match)
+        return self.inside("journalctl", "--quiet", "--output=cat", "--identifier=harl-updater", *self.before)
 
     def package_state(self, name: str = "solvik4-rh") -> str:
         """State and version in the package database."""
@@ -496,6 +498,7 @@ class Repairs(ServiceTest):
         self.assertTrue((self.unit.root() / "run/harl-job").exists())
         self.wait_for_end()
         self.assertEqual(self.panel(), {"PASS": "pass"})
+        self.assertIn("prepare: a job of apt's own timers is at work, waiting for it", self.journal())
 
 
 class Surroundings(ServiceTest):
@@ -572,7 +575,7 @@ class Surroundings(ServiceTest):
         self.assertEqual(len(kept), 10)
         self.assertEqual(kept[0], "2001-01-01_00-00-00.log")
         log = self.read(f"/var/lib/harl-updater/{kept[-1]}")
-        self.assertIn("TavrenUpdater version: ", log)
+        self.assertRegex(log, r"Updater \| .*int main\(int, char\*\*\)\n.*TavrenUpdater version: ")
         self.assertIn("static void UpdateManager::stopUpdater()", log)
 
     def test_upgrade_of_the_updater_in_its_own_run(self) -> None:

@@ -69,6 +69,13 @@ HARL = "[Unit]\nAfter=harl-updater.service\n[Service]\nExecStart=/bin/sleep infi
 FOLDERS = [*DATABASE, "var/log/journal", "opt", "root/RESOURCES/SOUNDS", "root/USB_MOUNT", "srv/repository"]
 
 
+def built_package(name: str) -> Path | None:
+    """The package of packaging/build for this machine."""
+    architecture = subprocess.check_output(["dpkg", "--print-architecture"], text=True).strip()
+    found = sorted((ROOT / "build/package").glob(f"{name}_*_{architecture}.deb"))
+    return found[-1] if found else None
+
+
 def make_files(unit: Machine, package: Path, programs: Path) -> None:
     """Writes what the machine has: tools, packages and the application."""
     files = unit.files
@@ -114,6 +121,19 @@ def wait_for(what: str, condition: Callable[[], bool], seconds: float = 60) -> N
         if time.monotonic() > end:
             raise AssertionError(f"not within {seconds} s: {what}")
         time.sleep(0.1)
+
+
+def states(unit: Machine) -> set[str]:
+    """What the service and the one that gives the instrument back do; a number for a start that is still queued."""
+    return set(unit.run("systemctl", "show", "--value", "--property=ActiveState,Job", *UNITS).split())
+
+
+def panel(unit: Machine) -> Panel:
+    """The panel after what it was sent."""
+    shown = Panel()
+    for byte in (unit.root() / "var/log/panel").read_text().split():
+        shown.send(int(byte, 16), 0)
+    return shown
 
 
 class ServiceTest(unittest.TestCase):
@@ -192,8 +212,8 @@ class ServiceTest(unittest.TestCase):
         wait_for("end of the service", lambda: self.states() <= {"inactive", "failed"}, 90)
 
     def states(self) -> set[str]:
-        """What the service and the one that gives the instrument back do; a number for a start that is still queued."""
-        return set(self.inside("systemctl", "show", "--value", "--property=ActiveState,Job", *UNITS).split())
+        """See states()."""
+        return states(self.unit)
 
     def ended_as(self) -> tuple[str, str, str]:
         """Result of the service, and how the updater's process ended."""
@@ -201,11 +221,9 @@ class ServiceTest(unittest.TestCase):
 
     def panel(self, faults: bool = False) -> dict[str, str]:
         """The LEDs that are lit, when the panel has understood every byte, or has had `faults`."""
-        panel = Panel()
-        for byte in self.read("/var/log/panel").split():
-            panel.send(int(byte, 16), 0)
-        self.assertEqual(bool(panel.faults), faults)
-        return panel.pattern(0)
+        shown = panel(self.unit)
+        self.assertEqual(bool(shown.faults), faults)
+        return shown.pattern(0)
 
     def read(self, path: str) -> str:
         """Text of a file inside."""
@@ -621,14 +639,13 @@ class Result(unittest.TextTestResult):
 def main() -> None:
     """Runs the tests of the program, as its usage says."""
     programs, package, system = take_path(), take_word(), take_path()
-    architecture = subprocess.check_output(["dpkg", "--print-architecture"], text=True).strip()
-    found = sorted((ROOT / "build/package").glob(f"{package}_*_{architecture}.deb"))
-    if not found:
+    file = built_package(package)
+    if not file:
         skip("there is no package for this machine: packaging/build")
     if os.geteuid() != 0:
         skip("systemd as the first process of a machine of its own needs root")
     with machine(system) as made:
-        make_files(made, found[-1], programs)
+        make_files(made, file, programs)
         try:
             made.start()
         except MachineError as error:

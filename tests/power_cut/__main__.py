@@ -1,0 +1,79 @@
+"""tests/power_cut/run: cuts the power at every write of an update to the unit's disk, then starts the next run on it.
+
+The service updates the package and the board, and in a second recording itself as well, on a machine with real systemd,
+apt and dpkg whose disk records its writes. Every disk that a power cut could leave is mounted and checked. Those that
+are equal as the unit sees them are one group, and one of each group goes through the next runs of the service: with
+network and stick, without network, without stick. Ends with 1 when one of them is not as it should be.
+"""
+
+import argparse
+import os
+import sys
+import time
+from collections import Counter, defaultdict
+
+from bench.build import BUILD
+from tests.power_cut.cuts import Group, PowerCuts
+from tests.power_cut.disk import own_mounts
+from tests.power_cut.unit import SITUATIONS
+from tests.service.service_test import built_package
+
+SUBSETS = 20  # for each flush
+BORDERS = 3  # for each write
+SEED = 20
+RECORDINGS = {False: "the package and the board", True: "the package, the board and the updater itself"}
+
+
+def print_groups(groups: list[Group]) -> None:
+    """The states that the cuts left, and what became of them."""
+    states: dict[str, list[Group]] = defaultdict(list)
+    for group in groups:
+        states[group.before.packages + (f", {group.remedy}" if group.remedy else "")].append(group)
+    print(" images groups  state after the cut, and what the next run shows (groups)")
+    for state, these in sorted(states.items(), key=lambda item: -sum(group.images for group in item[1])):
+        print(f"{sum(group.images for group in these):7} {len(these):6}  {state}")
+        for situation in SITUATIONS:
+            shown = Counter(group.shown.get(situation.name, "no end") for group in these)
+            print(f"{'':16}{situation.name}: " + ", ".join(f"{what} ({count})" for what, count in shown.items()))
+    for group in groups:
+        for fault in group.faults:
+            print(f"WRONG: {group.before.packages}, {group.cut}, {group.images} images: {fault}")
+
+
+def main() -> int:
+    """The command."""
+    parser = argparse.ArgumentParser(prog="tests/power_cut/run", description=__doc__)
+    parser.add_argument("--every", type=int, default=1, metavar="N", help="take each Nth image only")
+    parser.add_argument("--jobs", type=int, default=os.cpu_count(), metavar="N", help="N images or machines at a time")
+    parser.add_argument("--without-repair", action="store_true", help="the service leaves broken installations alone")
+    given = parser.parse_args()
+    if os.geteuid() != 0:
+        sys.exit("tests/power_cut/run: mounts and machines of their own need root: run this as root")
+    package = built_package("harl-updater")
+    if not package:
+        sys.exit("tests/power_cut/run: there is no package for this machine: run packaging/build")
+    begin = time.monotonic()
+    found: list[Group] = []
+    with own_mounts() as folder:
+        for upgrades_itself, what in RECORDINGS.items():
+            own = folder / str(upgrades_itself)
+            own.mkdir()
+            cuts = PowerCuts(own, package, BUILD, upgrades_itself)
+            writes, flushes = len(cuts.recording.writes), len(cuts.recording.flushes) - 1
+            print(f"An update of {what}: {writes} writes, {flushes} flushes", flush=True)
+            these = cuts.recording.cuts(SUBSETS, BORDERS, SEED)[:: given.every]
+            groups = cuts.groups(these, given.jobs)
+            kinds = ", ".join(f"{number} {kind}" for kind, number in Counter(cut.kind for cut in these).items())
+            took = time.monotonic() - begin
+            print(f"{len(these)} images ({kinds}) in {len(groups)} groups, after {took:.0f} s", flush=True)
+            groups = cuts.judged(groups, given.jobs, not given.without_repair)
+            print_groups(groups)
+            found += groups
+    wrong = sum(1 for group in found if group.faults)
+    images = sum(group.images for group in found)
+    print(f"{images} images in {len(found)} groups, {wrong} groups wrong, {time.monotonic() - begin:.0f} s")
+    return 1 if wrong else 0
+
+
+if __name__ == "__main__":
+    sys.exit(main())

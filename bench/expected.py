@@ -42,7 +42,7 @@ def sound_command(sound: str) -> str:
     return f"aplay {SOUND_FOLDER}/{SOUND_FILES[sound]}"
 
 
-# Runs of records that many scenarios share, for `log` in their files: "(name)", with arguments for {1}, {2} behind the
+# Runs of records that many scenarios share, for `log` in their files: "(name)", with arguments for {1}, {2} after the
 # name. A line is an operation's name, a colon and the message.
 BLOCKS = {
     # (opening STATUS): what stopping harl gave
@@ -208,7 +208,7 @@ def expected_commands(entries: list[str]) -> list[str]:
     for entry in entries:
         name, _, count = entry.partition(" x")
         if count and not re.fullmatch(r"[1-9]\d{0,2}", count):
-            raise ValueError(f"{entry!r}: no number behind the x")
+            raise ValueError(f"{entry!r}: no number after the x")
         lines += [_command(name)] * int(count or 1)
     return lines
 
@@ -239,7 +239,7 @@ def _block(name: str, arguments: list[str]) -> str:
     content = BLOCKS[name]
     wanted = len(set(re.findall(r"\{(\d)\}", content)))
     if len(arguments) != wanted:
-        raise ValueError(f"block {name!r}: values behind the name: must be {wanted}, not {len(arguments)}")
+        raise ValueError(f"block {name!r}: values after the name: must be {wanted}, not {len(arguments)}")
     for number, argument in enumerate(arguments, 1):
         content = content.replace(f"{{{number}}}", argument)
     return content

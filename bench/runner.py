@@ -40,7 +40,7 @@ class Result:
 
 @contextlib.contextmanager
 def temporary_folder() -> Iterator[Path]:
-    """A folder that goes with this process, in whatever way the process ends, and with it the updater.
+    """A folder that is removed with this process, however it ends, and with it the updater.
 
     Raises UnitError when there is no room for a unit in it.
     """

@@ -29,10 +29,10 @@ std::string asRead(const std::string& output);
 /// The exit code that the runner is to derive from a raw wait status.
 int codeOf(int status);
 
-/// The lines of a text; a last one without a line feed counts, an empty one behind the last line feed does not.
+/// The lines of a text; a last one without a line feed counts, an empty one after the last line feed does not.
 std::vector<std::string> linesOf(const std::string& text);
 
-/// What stands behind the first `key` in the last line that has it and none of `unless`; "" without such a line.
+/// What follows the first `key` in the last line that has it and none of `unless`; "" without such a line.
 std::string lastBehind(const std::vector<std::string>& lines, const std::string& key, const std::string& unless = "");
 
 /// The updater's log since the last call.

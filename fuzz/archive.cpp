@@ -1,4 +1,4 @@
-/// The check of the stick's archive against the zip library's own reading. Input: a byte that tells how much of the
+/// The check of the stick's archive against the zip library's own reading. Input: a byte that says how much of the
 /// medium can be read, in 256ths (255: all of it), then the archive.
 
 #include "stick/archive.h"

@@ -25,7 +25,7 @@ class Events : public LogSink
 public:
     void record(const ParsedRecord& record) override
     {
-        // That a head has no message is known only behind lines of others.
+        // That a head has no message is known only after lines of others.
         expect(record.line > mLastRecord, "records in order");
         mLastRecord = record.line;
         mText << '\n' << record.line << " record";
@@ -77,7 +77,7 @@ std::string events(std::string_view log, std::size_t blockSize)
     Events sink;
     LogParser parser(sink);
     feed(parser, log, blockSize);
-    expect(sink.lastLine() <= parser.lines(), "no line behind the last");
+    expect(sink.lastLine() <= parser.lines(), "no line after the last");
     expect(parser.lines() == static_cast<std::uint64_t>(std::count(log.begin(), log.end(), '\n')) +
                                  (!log.empty() && log.back() != '\n' ? 1 : 0),
            "all lines counted");
@@ -157,6 +157,6 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
 
     expect(events(log, std::max<std::size_t>(log.size(), 1)) == events(log, blockSize), "blocks make no difference");
     expectFitReports(log, 64 * blockSize);
-    expect(lastRun(log + '\n' + wholeRun) == saidOfIt, "a whole run is told as it is");
+    expect(lastRun(log + '\n' + wholeRun) == saidOfIt, "a whole run is explained as it is");
     return 0;
 }

@@ -1,5 +1,5 @@
 /// The check of a stick's layout against glob(3) and scandir(3). Input: names on the stick, separated by the byte 0x1E.
-/// Each is a letter, a path, and behind the byte 0x1F its content: d a folder, f a file, x one with its run bit, z an
+/// Each is a letter, a path, and after the byte 0x1F its content: d a folder, f a file, x one with its run bit, z an
 /// intact archive, l a symbolic link to its content, p a pipe.
 
 #include "Input.h"

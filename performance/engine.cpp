@@ -28,7 +28,7 @@ namespace
 const std::size_t mebibyte = 1U << 20U;
 
 /// A file of `size` bytes in lines of `lineLength`, line end included; a length of 0 makes one line without an end. It
-/// has no name: it goes with the process, in whatever way that ends.
+/// has no name: it is removed with the process, however that ends.
 class TextFile
 {
 public:
@@ -208,7 +208,7 @@ void LogOneRecord(benchmark::State& state)
 {
     const int records = 10000;
     const std::string message(static_cast<std::size_t>(state.range(0)), 'm');
-    const std::string line(message.size() + 90, 'r'); // what stands in front of a message takes about that much
+    const std::string line(message.size() + 90, 'r'); // what precedes a message takes about that much
     const Muted muted;
     for (auto _ : state) {
         const double before = fromProc("/proc/self/io", "syscw:");

@@ -71,7 +71,7 @@ def build_tree(tree: Path, folder: Path) -> Path:
 
 
 def raise_version(file: Path, version: str, folder: Path, more: dict[str, str] | None = None) -> Path:
-    """Builds the package `file` again as `version` into `folder`, with `more` texts behind those of its files."""
+    """Builds the package `file` again as `version` into `folder`, with `more` texts appended to its files."""
     with tempfile.TemporaryDirectory(prefix="package-") as name:
         tree = Path(name) / "tree"
         subprocess.run(["dpkg-deb", "--raw-extract", file, tree], check=True)

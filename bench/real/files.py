@@ -100,7 +100,7 @@ def _write_packages(folder: Path, setup: Setup, kept: Path) -> None:
 
 
 def _write_tools(folder: Path, setup: Setup, has_systemd: bool) -> None:
-    """What stands in front of the real tools, and with a tool missing, a search path without it."""
+    """What precedes the real tools in the search path; for a missing tool, a search path without it."""
     wrappers = folder / "bin"
     shutil.copytree(HERE / "head", wrappers)
     if not has_systemd:

@@ -12,7 +12,7 @@ from bench.makers.files import write
 from bench.scenario import Setup
 
 PROGRAM = Path("/lib/systemd/systemd")
-ENDED = "bench: the updater has ended: "  # the journal's line behind the updater's last one
+ENDED = "bench: the updater has ended: "  # the journal's line after the updater's last one
 
 TARGET = """[Unit]
 DefaultDependencies=no
@@ -115,7 +115,7 @@ class Journal:
         self._source = source
         self._target = target
         self._offset = 0
-        self._in_head = False  # behind the first line of a record
+        self._in_head = False  # past the first line of a record
         self.ended = ""  # how the updater ended: "exited 0", "killed TERM"
 
     def update(self) -> None:

@@ -197,7 +197,7 @@ class RealUnit:
         return "(none)"
 
     def _sounds_played(self) -> list[str]:
-        """The sounds whose samples reached the sound device, all of them and nothing but silence behind them."""
+        """The sounds whose samples reached the sound device, all of them, followed by nothing but silence."""
         found = []
         for played in sorted(self._out.glob("played-*.raw"), key=lambda path: path.stat().st_mtime):
             heard = played.read_bytes()

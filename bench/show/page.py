@@ -13,8 +13,8 @@ from bench.scenario import Scenario
 from bench.show.panel import fill_of, panel_picture
 
 WIDTH = 1200  # of the timeline; all lengths are in the drawing's own unit
-LEFT = 90  # of the time axis; before it stand the names of the LEDs
-RIGHT = 16  # margin behind the axis
+LEFT = 90  # of the time axis; the names of the LEDs are before it
+RIGHT = 16  # margin after the axis
 ROW = 20
 LETTER = 6.2  # about the width of one
 DARK = "#e4e6ea"
@@ -155,11 +155,11 @@ def _timeline(run: Run, begin: float, end: float) -> str:
 
 
 def _label(text: str, left: float, right: float, baseline: float) -> str:
-    """`text` behind its bar, or before it where there is more room; cut to what fits."""
-    behind = WIDTH - right >= left - LEFT
-    room = int(((WIDTH - right if behind else left - LEFT) - 12) / LETTER)
+    """`text` after its bar, or before it where there is more room; cut to what fits."""
+    after = WIDTH - right >= left - LEFT
+    room = int(((WIDTH - right if after else left - LEFT) - 12) / LETTER)
     shown = text if len(text) <= room else f"{text[: max(room - 1, 0)]}…"
-    place = f'x="{right + 5:.1f}"' if behind else f'x="{left - 5:.1f}" text-anchor="end"'
+    place = f'x="{right + 5:.1f}"' if after else f'x="{left - 5:.1f}" text-anchor="end"'
     return f'<text {place} y="{baseline}">{escape(shown)}</text>\n'
 
 

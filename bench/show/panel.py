@@ -12,7 +12,7 @@ from bench.panel import COLOR_CODES, LED_CODES, Panel, color_name, led_name
 
 FILLS = {"off": "#ffffff", "blue": "#1f6feb", "pass": "#1a9c3e", "fail": "#d1242f"}
 OTHER_FILL = "#a020a0"
-# What a lit LED bears, so that the colours can be told apart in black and white: a dot, a tick, a cross.
+# The mark on a lit LED, so that colours differ in black and white too: a dot, a tick, a cross.
 MARKS = {
     "blue": '<circle r="4" fill="#ffffff"/>',
     "pass": '<path d="M-6 0 L-2 5 L6 -5" fill="none" stroke="#ffffff" stroke-width="3"/>',

@@ -57,7 +57,7 @@ class PlainDisplay:
 
 @dataclass
 class Summary:
-    """What is told about a run at its end."""
+    """What is printed about a run at its end."""
 
     scenario: Scenario
     unit: str  # what is real and what is a stand-in

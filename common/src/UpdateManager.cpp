@@ -29,7 +29,7 @@ bool eraseThrough(std::string& line, const std::string& key)
     return true;
 }
 
-/// Removes the first `end` and everything behind it from `text`.
+/// Removes the first `end` and everything after it from `text`.
 void cutAt(std::string& text, char end)
 {
     text.resize(std::min(text.find(end), text.size()));

@@ -132,7 +132,7 @@ class BadInput(unittest.TestCase):
 
     def test_commands(self) -> None:
         for entry, reason in (
-            ("stop-harl xtwo", "'stop-harl xtwo': no number behind the x"),
+            ("stop-harl xtwo", "'stop-harl xtwo': no number after the x"),
             ("stop", f"no command 'stop'; there are {', '.join(COMMANDS)}"),
         ):
             text = GOOD.replace('"stop-harl"', f'"{entry}"')
@@ -143,7 +143,7 @@ class BadInput(unittest.TestCase):
     def test_log(self) -> None:
         for line, reason in (
             ("(nothing 0)", f"no block 'nothing'; there are {', '.join(BLOCKS)}"),
-            ("(opening)", "block 'opening': values behind the name: must be 1, not 0"),
+            ("(opening)", "block 'opening': values after the name: must be 1, not 0"),
             ("runProcess: {stop}", f"no command 'stop'; there are {', '.join(COMMANDS)}"),
         ):
             text = GOOD.replace("(opening 0)", line)

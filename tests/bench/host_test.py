@@ -1,6 +1,6 @@
 """Usage: host_test.py BUILD_FOLDER
 
-The machine is the same before and after a run of the bench, in whatever way the run ends."""
+The machine is the same before and after a run of the bench, however the run ends."""
 
 import os
 import signal

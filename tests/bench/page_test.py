@@ -32,7 +32,7 @@ BLUE, PASS = panel_module.FILLS["blue"], panel_module.FILLS["pass"]
 
 
 class Elements(HTMLParser):
-    """The page's elements: name, attributes, the text directly behind the start; inner titles go to `titles`."""
+    """The page's elements: name, attributes, the text right after the start; inner titles go to `titles`."""
 
     def __init__(self, page: str) -> None:
         super().__init__()
@@ -54,8 +54,8 @@ class Elements(HTMLParser):
 
     def filled(self, fill: str) -> list[str]:
         """The titles of the bars in the colour `fill`."""
-        behind = zip(self.found, self.found[1:])
-        return [text for (tag, attributes, _), (_, _, text) in behind if tag == "rect" and attributes["fill"] == fill]
+        pairs = zip(self.found, self.found[1:])
+        return [text for (tag, attributes, _), (_, _, text) in pairs if tag == "rect" and attributes["fill"] == fill]
 
 
 def written(scenario: str, folder: str) -> str:

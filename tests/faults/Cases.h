@@ -20,7 +20,7 @@ struct Case
 const char panelStep[] = "panel";
 const char soundStep[] = "sound";
 
-/// Every LED command of a run that comes to one of `reports`: those stand for all panels that there are.
+/// Every LED command of a run that comes to one of `reports`: those represent all panels.
 platform::Lines ledCommands(const std::vector<std::string>& reports = {"result 0", "result 1", "error 0", "error 2"});
 
 /// Every step on `unit`, panel and sound included, with every fault.

@@ -135,7 +135,7 @@ void expectPanelShows(const std::string& report)
               1);
 }
 
-/// The one report of the remote head comes from `callback`, behind a record with the outcome's `message`.
+/// The one report of the remote head comes from `callback`, after a record with the outcome's `message`.
 void expectOneReport(const std::string& report, const std::string& message)
 {
     const std::string callback = report[0] == 'r' ? "resultCallback" : "errorCallback";
@@ -279,7 +279,7 @@ TEST_P(OneFault, EndsAsTheProcedureSays)
     expectHolds(GetParam());
 }
 
-/// The parameter's fault, together with each fault of each step behind it.
+/// The parameter's fault, together with each fault of each later step.
 class TwoFaults : public testing::TestWithParam<Case>
 {
 };
@@ -288,12 +288,12 @@ TEST_P(TwoFaults, EndAsTheProcedureSays)
 {
     const Unit& unit = GetParam().unit;
     const Injection& first = GetParam().injections.at(0);
-    bool behind = false;
+    bool later = false;
     for (const Injection& second : procedureInjections(unit)) {
-        if (behind && second.step != first.step && allHappen(unit, {first, second})) {
+        if (later && second.step != first.step && allHappen(unit, {first, second})) {
             expectHolds({unit, {first, second}});
         }
-        behind = behind || (second.step == first.step && second.fault == first.fault && second.times == first.times);
+        later = later || (second.step == first.step && second.fault == first.fault && second.times == first.times);
     }
 }
 

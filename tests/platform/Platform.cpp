@@ -29,7 +29,7 @@ struct Script
     std::size_t next = 0;
 };
 
-/// Stands behind std::cout. Each piece that is handed over at once is kept as one text.
+/// The buffer of std::cout. Each piece that is handed over at once is kept as one text.
 class LogBuffer : public std::streambuf
 {
 public:

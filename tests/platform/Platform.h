@@ -10,7 +10,7 @@
 #include <vector>
 
 /// A stand-in for the platform: linked into a test program, it takes the place of the C library's `system`, `popen`,
-/// `pclose` and `nanosleep`, and of the buffer behind std::cout.
+/// `pclose` and `nanosleep`, and of std::cout's buffer.
 ///
 /// Every call and every log record becomes an entry of one journal, so that a test compares the whole course of events.
 /// A command that has no scripted answer prints nothing and exits with 0; a pause takes 10 ms. All operations may be

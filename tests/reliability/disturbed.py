@@ -19,7 +19,7 @@ class DisturbedUnit(StandInUnit):
     """A stand-in unit whose updater is started by shell lines, and which can be started a second time.
 
     `circumstances` are shell lines that run before the updater takes the shell's place, such as "ulimit -n 4";
-    `redirection` is the updater's own, such as ">/dev/full"; `runner` stands in front of its name.
+    `redirection` is the updater's own, such as ">/dev/full"; `runner` precedes its name.
     """
 
     def __init__(self, what: Scenario, folder: Path, build: Path, circumstances: str = "", redirection: str = "",
@@ -80,7 +80,7 @@ def group_lives(group: int) -> bool:
     """Whether a process of `group` still runs; one that has ended and that nobody asks for its status does not."""
     for process in Path("/proc").glob("[0-9]*"):
         with contextlib.suppress(OSError):  # has just ended
-            # Behind the name in parentheses: state, parent, group; proc(5).
+            # After the name in parentheses: state, parent, group; proc(5).
             state, _, its_group = (process / "stat").read_text(errors="replace").rpartition(")")[2].split()[:3]
             if int(its_group) == group and state != "Z":
                 return True

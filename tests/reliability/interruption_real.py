@@ -1,7 +1,7 @@
 """Usage: tests/reliability/interruption_real [COMMAND...]
 
 Kills the updater, or everything that runs on the head, at each command of an update of package and board in turn, right
-before the command and right behind it, on the bench unit with the real tools. Then the updater runs again on the unit
+before the command and right after it, on the bench unit with the real tools. Then the updater runs again on the unit
 as it was left. That run must end as a first run on a unit with that package, board, marker and stick does, and
 dpkg --audit must say nothing but where AUDITED expects it. Prints a line for each interruption, and fails at any
 difference. COMMAND is one of the names in the lines.
@@ -25,7 +25,7 @@ from tests.reliability.interruption import HEADER, Aftermath, Interruption, inte
 
 AT_ONCE = 3
 
-# Behind the updater's own commands those of apt, in the middle of the installation.
+# After the updater's own commands those of apt, in the middle of the installation.
 POINTS = interruption.POINTS | {"unpack": ("dpkg", "*--unpack*"), "configure": ("dpkg", "*--configure*")}
 # Everything on the head has this root; the board and the bench have others.
 KILLS = {
@@ -117,7 +117,7 @@ exit "$status"
 
 
 def report(aftermath: Aftermath) -> bool:
-    """Prints what became of an interruption. True when it is as due."""
+    """Prints the result of an interruption. True when it is as expected."""
     what, wrong = aftermath.interruption, aftermath.differences()
     if bool(aftermath.audit) != ((what.killed, what.point, what.moment) in AUDITED):
         wrong.append(f"dpkg --audit: {aftermath.audit!r}")

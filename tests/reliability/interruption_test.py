@@ -2,7 +2,7 @@
        interruption_test.py BUILD_FOLDER --table
 
 Ends the updater, or the whole unit, at each command of an update in turn, on stand-in units: right before the command
-takes effect and right after. --table prints what became of each.
+takes effect and right after. --table prints the result of each.
 """
 
 import sys

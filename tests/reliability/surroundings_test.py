@@ -145,7 +145,7 @@ class SurroundingsTest(unittest.TestCase):
         self.assertEqual(last, [led_command(LED_CODES[led], COLOR_CODES["fail"]) for led in CHECK_FAILED.leds])
 
     def plain_users_unit(self, runner: str = "") -> DisturbedUnit:
-        """A unit whose updater runs, behind `runner`, as a user for whom limits count."""
+        """A unit whose updater runs, through `runner`, as a user for whom limits count."""
         if os.geteuid() != 0:
             self.skipTest("needs root, to run as a user without other processes")
         self.folder.chmod(0o777)

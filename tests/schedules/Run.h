@@ -2,7 +2,7 @@
 
 #include <string>
 
-/// What became of one exploration.
+/// The result of one exploration.
 struct Found
 {
     long schedules = 0;

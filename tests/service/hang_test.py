@@ -258,7 +258,8 @@ class Rescuer(HangTest):
         self.wait_for_file("/run/hung")
         self.inside("kill", "-s", "KILL", str(self.main_of_give_back()))
         self.assert_given_back_at_last()
-        self.assertEqual(self.panel(), INSTALLATION_FAILED.panel)
+        # The pair of bytes that was broken off costs the controller a byte that means nothing to it.
+        self.assertEqual(self.panel(faults=True), INSTALLATION_FAILED.panel)
 
     def test_killed_while_it_releases_the_stick(self) -> None:
         self.kill_at("umount", "/root/USB_MOUNT")

@@ -84,7 +84,7 @@ def make_files(unit: Machine, package: Path, programs: Path) -> None:
     write(files / "etc/systemd/system/harl.service", HARL)
     write(files / "etc/apt/sources.list", SOURCES.format(folder="repository"))
     write(files / "etc/apt/apt.conf.d/50test", 'APT::Sandbox::User "root";\n')
-    (files / "etc/systemd/system/dbus.socket").symlink_to("/dev/null")  # apt would wait for a login manager behind it
+    (files / "etc/systemd/system/dbus.socket").symlink_to("/dev/null")  # else apt waits for a login manager
     write(files / "srv/board", "2.2.0\n")
     for folder in FOLDERS:
         (files / folder).mkdir(parents=True, exist_ok=True)
@@ -97,7 +97,7 @@ def make_files(unit: Machine, package: Path, programs: Path) -> None:
 
 
 def install(unit: Machine) -> None:
-    """Installs the package under test, and a package that stands for all that it depends on."""
+    """Installs the package under test, and a package in place of all that it depends on."""
     depends = unit.run("dpkg-deb", "--field", "/srv/updater.deb", "Depends")
     names = ", ".join(f"{item.split()[0]} (= 9999)" for item in depends.split(","))
     tools = build(Package("tools", "1.0", {"Provides": names}), unit.root() / "srv")

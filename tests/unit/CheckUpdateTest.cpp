@@ -12,7 +12,7 @@ protected:
         return UpdateManager::checkUpdate(ignoreNoInternet, policyCommand, installed, candidate, versionsFound);
     }
 
-    /// The records behind those of the start and the runner.
+    /// The records after those of the start and the runner.
     static Lines parsed()
     {
         const Lines all = entries("log:");

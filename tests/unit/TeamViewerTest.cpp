@@ -12,7 +12,7 @@ protected:
         return UpdateManager::checkTVUpdate(ok);
     }
 
-    /// The records behind those of the runner.
+    /// The records after those of the runner.
     static std::string lastMessages()
     {
         std::string text;

@@ -28,7 +28,7 @@ protected:
 /// How many results, failures among them, the running test has so far.
 int resultsSoFar();
 
-/// Ends the process of a death test, whose failures nobody prints: with 0 when there are none behind the first `before`
+/// Ends the process of a death test, whose failures nobody prints: with 0 when there are none after the first `before`
 /// results, which the test had already when it made the process; else with 1 and what failed on standard error.
 [[noreturn]] void endCase(int before);
 

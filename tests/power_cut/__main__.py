@@ -13,15 +13,14 @@ import time
 from collections import Counter, defaultdict
 
 from bench.build import BUILD
+from bench.real.systemd import obstacle
 from tests.power_cut.cuts import Group, PowerCuts
-from tests.power_cut.disk import own_mounts
+from tests.power_cut.disk import missing, own_mounts
 from tests.power_cut.unit import SITUATIONS
 from tests.service.service_test import built_package
 
-SUBSETS = 20  # for each flush
-BORDERS = 3  # for each write
-SEED = 20
-RECORDINGS = {False: "the package and the board", True: "the package, the board and the updater itself"}
+JOBS = 2 * (os.cpu_count() or 1)  # about half of a run is waiting
+UPDATES = {False: "the package and the board", True: "the package, the board and the updater itself"}
 
 
 def print_groups(groups: list[Group]) -> None:
@@ -40,33 +39,45 @@ def print_groups(groups: list[Group]) -> None:
             print(f"WRONG: {group.before.packages}, {group.cut}, {group.images} images: {fault}")
 
 
+def number(text: str) -> int:
+    """A number of the command line, 1 or more."""
+    if not text.isdecimal() or int(text) < 1:
+        raise argparse.ArgumentTypeError(f"{text}: give a number, 1 or more")
+    return int(text)
+
+
+def judged(cuts: PowerCuts, every: int, jobs: int, repairs: bool) -> list[Group]:
+    """The groups of an update after their next runs."""
+    print(f"{len(cuts.recording.writes)} writes, {len(cuts.recording.flushes) - 1} flushes", flush=True)
+    begin = time.monotonic()
+    these = cuts.recording.cuts()[::every]
+    groups = cuts.groups(these, jobs)
+    kinds = ", ".join(f"{count} {kind}" for kind, count in Counter(cut.kind for cut in these).items())
+    print(f"{len(these)} images ({kinds}) in {len(groups)} groups, {time.monotonic() - begin:.0f} s", flush=True)
+    return cuts.judged(groups, jobs, repairs)
+
+
 def main() -> int:
     """The command."""
     parser = argparse.ArgumentParser(prog="tests/power_cut/run", description=__doc__)
-    parser.add_argument("--every", type=int, default=1, metavar="N", help="take each Nth image only")
-    parser.add_argument("--jobs", type=int, default=os.cpu_count(), metavar="N", help="N images or machines at a time")
+    parser.add_argument("--every", type=number, default=1, metavar="N", help="take each Nth image only")
+    parser.add_argument("--jobs", type=number, default=JOBS, metavar="N", help=f"at a time; default: {JOBS}")
     parser.add_argument("--without-repair", action="store_true", help="the service leaves broken installations alone")
     given = parser.parse_args()
-    if os.geteuid() != 0:
-        sys.exit("tests/power_cut/run: mounts and machines of their own need root: run this as root")
+    if reason := obstacle() or missing():
+        sys.exit(f"tests/power_cut/run: a machine with a recorded disk cannot be made here: {reason}")
     package = built_package("harl-updater")
     if not package:
         sys.exit("tests/power_cut/run: there is no package for this machine: run packaging/build")
     begin = time.monotonic()
     found: list[Group] = []
     with own_mounts() as folder:
-        for upgrades_itself, what in RECORDINGS.items():
+        for upgrades_itself, what in UPDATES.items():
             own = folder / str(upgrades_itself)
             own.mkdir()
+            print(f"An update of {what}", flush=True)
             cuts = PowerCuts(own, package, BUILD, upgrades_itself)
-            writes, flushes = len(cuts.recording.writes), len(cuts.recording.flushes) - 1
-            print(f"An update of {what}: {writes} writes, {flushes} flushes", flush=True)
-            these = cuts.recording.cuts(SUBSETS, BORDERS, SEED)[:: given.every]
-            groups = cuts.groups(these, given.jobs)
-            kinds = ", ".join(f"{number} {kind}" for kind, number in Counter(cut.kind for cut in these).items())
-            took = time.monotonic() - begin
-            print(f"{len(these)} images ({kinds}) in {len(groups)} groups, after {took:.0f} s", flush=True)
-            groups = cuts.judged(groups, given.jobs, not given.without_repair)
+            groups = judged(cuts, given.every, given.jobs, not given.without_repair)
             print_groups(groups)
             found += groups
     wrong = sum(1 for group in found if group.faults)

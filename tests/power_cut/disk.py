@@ -9,6 +9,7 @@ import contextlib
 import ctypes
 import itertools
 import random
+import shutil
 import struct
 import subprocess
 import tempfile
@@ -17,8 +18,7 @@ from collections.abc import Callable, Iterator
 from dataclasses import dataclass, replace
 from pathlib import Path
 
-TOOLS = ["qemu-storage-daemon", "fusermount3", "mkfs.ext4", "e2fsck", "losetup"]
-DEVICE = "/dev/fuse"
+TOOLS = ["qemu-storage-daemon", "mkfs.ext4", "e2fsck", "losetup", "/dev/fuse", "/dev/loop-control"]
 SECTOR = 512  # bytes
 MAGIC, VERSION = 0x6A736677736872, 1
 FLUSH, DISCARD = 1, 4
@@ -70,7 +70,7 @@ class Recording:
                     self.writes.append(Write(sector, sectors, offset))
                     offset += sectors * SECTOR
 
-    def cuts(self, subsets: int, borders: int, seed: int) -> list[Cut]:
+    def cuts(self, subsets: int = 20, borders: int = 3, seed: int = 20) -> list[Cut]:
         """Every cut to try, each once: after each write, with the writes in another order, in the middle of a write.
 
         @param subsets  for each flush, so many random choices of the writes since the flush before it
@@ -100,6 +100,11 @@ class Recording:
                 log.seek(write.data)
                 disk.seek(write.sector * SECTOR)
                 disk.write(log.read(write.sectors * SECTOR))
+
+
+def missing() -> str:
+    """What a disk cannot be recorded without and this machine does not have; "" when it has all."""
+    return ", ".join(tool for tool in TOOLS if not (shutil.which(tool) or Path(tool).exists()))
 
 
 @contextlib.contextmanager

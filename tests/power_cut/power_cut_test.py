@@ -3,14 +3,12 @@
 A sample of what tests/power_cut/run judges, and a fault that it must notice, on the built package in build/package/.
 """
 
-import os
-import shutil
 import unittest
 
 from bench.real.systemd import obstacle
 from tests.command_line import skip, take_path
 from tests.power_cut.cuts import Group, PowerCuts
-from tests.power_cut.disk import DEVICE, TOOLS, own_mounts
+from tests.power_cut.disk import missing, own_mounts
 from tests.service.service_test import built_package
 
 EVERY = 150  # images
@@ -25,7 +23,7 @@ class Sample(unittest.TestCase):
 
     @classmethod
     def setUpClass(cls) -> None:
-        cuts = cls.power_cuts.recording.cuts(subsets=20, borders=3, seed=20)[::EVERY]
+        cuts = cls.power_cuts.recording.cuts()[::EVERY]
         cls.groups = cls.power_cuts.groups(cuts, JOBS)
 
     def test_every_group_heals(self) -> None:
@@ -48,8 +46,8 @@ def main() -> None:
         skip("there is no package for this machine: packaging/build")
     if reason := obstacle():
         skip(f"this machine allows no machine of its own: {reason}")
-    if missing := [tool for tool in TOOLS if not shutil.which(tool)] + [DEVICE] * (not os.path.exists(DEVICE)):
-        skip(f"a disk cannot be recorded without {', '.join(missing)}")
+    if tools := missing():
+        skip(f"a disk cannot be recorded without {tools}")
     with own_mounts() as folder:
         Sample.power_cuts = PowerCuts(folder, package, programs, upgrades_itself=True)
         unittest.main(verbosity=2)

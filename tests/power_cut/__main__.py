@@ -75,7 +75,7 @@ def main() -> int:
         for upgrades_itself, what in UPDATES.items():
             own = folder / str(upgrades_itself)
             own.mkdir()
-            print(f"An update of {what}", flush=True)
+            print(f"An update of {what}", end=": ", flush=True)
             cuts = PowerCuts(own, package, BUILD, upgrades_itself)
             groups = judged(cuts, given.every, given.jobs, not given.without_repair)
             print_groups(groups)

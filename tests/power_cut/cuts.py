@@ -98,7 +98,7 @@ class PowerCuts:
             unit.start(OLDER_BOARD, WITH_ALL)
             unit.run_service(WITH_ALL)
             after = unit.state()
-        assert after.shown == UPDATED.meaning and not after.database and not after.kept, after
+        assert after.shown == UPDATED.meaning and not after.database and not after.withheld, after
         self._newest = after.packages
         recording = Recording(before, writes)
         image = self._folder / "replayed.img"
@@ -156,8 +156,8 @@ class PowerCuts:
 
     def _faults(self, situation: Situation, before: State, after: State) -> Iterator[str]:
         """What is wrong after a run."""
-        if after.kept:
-            yield f"not given back: {after.kept}"
+        if after.withheld:
+            yield f"not given back: {after.withheld}"
         is_new = after.packages == self._newest and not after.database
         has_new_board = after.board == NEWER_BOARD or not situation.stick
         is_changed = (before.packages, before.board) != (after.packages, after.board)

@@ -65,7 +65,7 @@ class State:
     marker: bool
     database: str = ""  # what is wrong with the packages
     shown: str = ""  # the outcome, in words
-    kept: str = ""  # what is not given back
+    withheld: str = ""  # what is not given back
 
 
 def make_repository(updater: Path | None, folder: Path) -> None:
@@ -137,7 +137,7 @@ class Unit:
             marker=self._root(MARKER).exists(),
             shown=meaning_of(panel(self._inside).pattern(0)),
             database=self._output("dpkg", "--verify", UPDATER, PACKAGE) + self._output("dpkg", "--audit"),
-            kept=" ".join(self._kept()),
+            withheld=" ".join(self._withheld()),
         )
 
     def _has_ended(self) -> bool:
@@ -146,7 +146,7 @@ class Unit:
         has_noted = notes.exists() and "given-back" in notes.read_text()
         return has_noted and states(self._inside) <= {"inactive", "failed"}
 
-    def _kept(self) -> Iterator[str]:
+    def _withheld(self) -> Iterator[str]:
         """What of the instrument is not given back."""
         if self._inside.status("mountpoint", "-q", STICK) == 0:
             yield "the stick"

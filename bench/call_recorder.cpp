@@ -9,7 +9,7 @@
 /// asked for (s) and the text how long it takes in fact (s).
 ///
 /// Shortens the waits: BENCH_SPEED times (1: full length), but to no less than BENCH_SHORTEST_WAIT (s; 0.2 when it is
-/// not set) so that the panel's flashing stays visible. The wall clock that the updater sees moves on by what waits of
+/// not set) so that the panel's flashing stays visible; a longer one makes its pauses longer. The wall clock that the updater sees moves on by what waits of
 /// 2 s and more were shortened by: the log reads like a run at full length.
 
 #include <algorithm>
@@ -108,7 +108,7 @@ int nanosleep(const timespec* asked, timespec* remaining)
     const double length = static_cast<double>(asked->tv_sec) + static_cast<double>(asked->tv_nsec) / 1e9;
     const double shortestWait = number("BENCH_SHORTEST_WAIT", 0.2);
     const double speed = std::max(1.0, number("BENCH_SPEED", 1));
-    const double factor = std::max(std::min(1.0, shortestWait / length), 1 / speed);
+    const double factor = std::max(shortestWait / length, 1 / speed);
     const double shortened = length * factor;
     timespec wait = {static_cast<std::time_t>(shortened), 0};
     wait.tv_nsec = static_cast<long>((shortened - std::floor(shortened)) * 1e9);

@@ -1,6 +1,7 @@
 """target/run: proves the updater's package on an emulated armhf unit: kernel, systemd, real tools, I2C bus, sound."""
 
 import argparse
+import contextlib
 import fcntl
 import os
 import shutil
@@ -8,32 +9,27 @@ import signal
 import subprocess
 import sys
 import time
+from collections.abc import Iterator
 from pathlib import Path
 from typing import IO
 
 from bench.outcomes import SOUND_FILES
-from bench.panel import Panel
 from bench.scenario import ScenarioError
 from bench.show.text import panel_line
-from target.check import check, check_cut
-from target.inputs import write_input
-from target.machine import MachineError, boot
-from target.evidence import Evidence, read, read_bus
+from target import power_cuts
+from target.machine import MachineError
 from target.plan import Plan, PlanError, load, names
+from target.runner import WORK, Emulation, Results
 
 HERE = Path(__file__).parent
 ROOT = HERE.parent
-
-
-WORK = ROOT / "build/target"
 PACKAGED = ["CMakeLists.txt", "cmake", "common", "debian", "companion", "docs/man", "packaging", "remote", "service"]
 NEEDED = ["qemu-system-arm", "qemu-user-static", "mmdebstrap", "arch-test", "e2fsprogs", "dosfstools", "mtools", "kmod"]
 NEEDED += ["cpio", "openssh-client", "dpkg-dev", "g++-11-arm-linux-gnueabihf"]  # of Debian
-SPACE = 2000  # MiB, for disks and results
+SPACE = 2000  # MiB, for disks and results; and for each power cut:
+DISK_SPACE = 500
 SPEED = 300  # how many times shorter the updater's waits are
 TOOL_LIMIT = 3000  # s, to build the package or the image
-SCENARIO_LIMIT = 420  # s, for one scenario besides the updater's waits; guest/main gives up before that
-SLOWNESS = 5  # how many times longer than by the unit's clock a wait with the flashing in it may take
 
 
 class TargetError(Exception):
@@ -94,51 +90,7 @@ def make_image() -> Path:
     return Path(folder.strip())
 
 
-def time_limit(plans: list[Plan], speed: float) -> float:
-    """How long `plans` may take in one boot, s."""
-    return sum(SCENARIO_LIMIT + SLOWNESS * sum(plan.like.expect.waits) / speed for plan in plans)
-
-
-def run_shared(plans: list[Plan], image: Path, updater: Path, speed: float) -> dict[str, tuple[Evidence, list[str]]]:
-    """Runs `plans` one after the other in one boot. Returns what each left and its differences. Raises MachineError."""
-    folder, inputs = WORK / "shared", WORK / "in.tar"
-    write_input(inputs, WORK / "in", image, updater, plans, speed, again=False)
-    boot(image, image / "root.ext4", inputs, folder, time_limit(plans, speed))
-    return evaluate(plans, folder)
-
-
-def run_cut(plan: Plan, image: Path, updater: Path, speed: float) -> dict[str, tuple[Evidence, list[str]]]:
-    """Runs `plan` until it stops the machine hard, boots the same disk again and runs the update. As run_shared."""
-    folder, inputs, disk = WORK / plan.name, WORK / "in.tar", WORK / "disk.ext4"
-    subprocess.run(["cp", "--sparse=always", image / "root.ext4", disk], check=True)
-    try:
-        write_input(inputs, WORK / "in", image, updater, [plan], speed, again=False)
-        boot(image, disk, inputs, WORK / f"{plan.name}-cut", time_limit([plan], speed), keep=True, cut=True)
-        panel = Panel()
-        for byte in read_bus(WORK / f"{plan.name}-cut/bus")[-1]:
-            panel.send(byte, 0)
-        write_input(inputs, WORK / "in", image, updater, [plan], speed, again=True)
-        boot(image, disk, inputs, folder, time_limit([plan], speed), keep=True)
-    finally:
-        disk.unlink(missing_ok=True)
-    results = evaluate([plan], folder)
-    evidence, found = results[plan.name]
-    return {plan.name: (evidence, check_cut(panel) + found)}
-
-
-def evaluate(plans: list[Plan], folder: Path) -> dict[str, tuple[Evidence, list[str]]]:
-    """Reads and checks what a boot with `plans` left in `folder`. Raises MachineError."""
-    parts = read_bus(folder / "bus")
-    if len(parts) != 2 * len(plans) + 1:
-        raise MachineError(f"{len(parts) - 1} marks on the I2C bus for {len(plans)} scenarios: see {folder / 'bus'}")
-    results = {}
-    for index, plan in enumerate(plans):
-        evidence = read(folder / plan.name, parts[2 * index + 1])
-        results[plan.name] = (evidence, check(plan, evidence))
-    return results
-
-
-def print_table(results: dict[str, tuple[Evidence, list[str]]]) -> None:
+def print_table(results: Results) -> None:
     """The results as a table for a document."""
     print("\n| Scenario | Result | Unit | Package | Board | Panel | Sound | Time |\n|---|---|---|---|---|---|---|---|")
     for name, (evidence, found) in results.items():
@@ -156,32 +108,44 @@ def print_table(results: dict[str, tuple[Evidence, list[str]]]) -> None:
         print(f"| {' | '.join(cells)} |")
 
 
-def run(plans: list[Plan], package: Path | None, speed: float) -> int:
-    """Runs `plans` and shows what came of them. Returns the status of the command. Raises TargetError, MachineError."""
+@contextlib.contextmanager
+def emulation(package: Path | None, speed: float, space: int) -> Iterator[Emulation]:
+    """The unit's image and the package to prove, while no other run uses the folder. Raises TargetError.
+
+    @param space  on the disk (MiB)
+    """
     WORK.mkdir(parents=True, exist_ok=True)
-    if shutil.disk_usage(WORK).free < SPACE << 20:
-        raise TargetError(f"{WORK} has less than {SPACE} MiB free: free some space")
-    lock = (WORK / "lock").open("w")
-    try:
-        fcntl.flock(lock, fcntl.LOCK_EX | fcntl.LOCK_NB)
-    except BlockingIOError as error:
-        raise TargetError(f"another target/run works in {WORK}: wait for it, or take another checkout") from error
+    if shutil.disk_usage(WORK).free < space << 20:
+        raise TargetError(f"{WORK} has less than {space} MiB free: free some space")
+    with (WORK / "lock").open("w") as lock:
+        try:
+            fcntl.flock(lock, fcntl.LOCK_EX | fcntl.LOCK_NB)
+        except BlockingIOError as error:
+            raise TargetError(f"another target/run works in {WORK}: wait for it, or take another checkout") from error
+        if subprocess.run([ROOT / "scripts/install-packages", *NEEDED], check=False).returncode != 0:
+            raise TargetError("packages are missing, see above")
+        updater, image = updater_package(package), make_image()
+        print(f"Package: {updater.name}", flush=True)
+        yield Emulation(image, updater, speed)
+
+
+def run(plans: list[Plan], unit: Emulation) -> int:
+    """Runs `plans` and shows what came of them. Returns the status of the command. Raises MachineError."""
     begin = time.monotonic()
-    if subprocess.run([ROOT / "scripts/install-packages", *NEEDED], check=False).returncode != 0:
-        raise TargetError("packages are missing, see above")
-    updater, image = updater_package(package), make_image()
-    print(f"Package: {updater.name}", flush=True)
-    shared = [plan for plan in plans if plan.settings.event != "power-cut"]
-    results = run_shared(shared, image, updater, speed) if shared else {}
+    shared = [plan for plan in plans if not plan.settings.is_cut()]
+    results = unit.run_shared(shared) if shared else {}
     for plan in plans:
         if plan not in shared:
-            results |= run_cut(plan, image, updater, speed)
+            results |= unit.run_cut(plan)
     print_table(results)
+    for evidence, _ in results.values():
+        for line in evidence.remarks():
+            print(f"\n{line}")
     for name, (_, found) in results.items():
         for line in found:
             print(f"DIFFERENCE: {name}: {line}")
     failed = sum(1 for _, found in results.values() if found)
-    print(f"\n{len(results) - failed} of {len(results)} scenarios as expected, {time.monotonic() - begin:.0f} s in all")
+    print(f"\n{len(results) - failed} of {len(results)} scenarios as expected, {time.monotonic() - begin:.0f} s")
     return 1 if failed else 0
 
 
@@ -193,8 +157,13 @@ def main() -> int:
     parser.add_argument(
         "--full-length", action="store_true", help="keep every wait; an hour for package-and-board, the default then"
     )
+    parser.add_argument(
+        "--power-cuts", type=int, default=0, help="instead: cut the power N times in an update, each time run the next"
+    )
     parser.add_argument("--package", type=Path, help="default: built by packaging/build armhf", metavar="FILE")
     arguments = parser.parse_args()
+    if arguments.power_cuts < 0 or (arguments.power_cuts and (arguments.scenario or arguments.full_length)):
+        parser.error("--power-cuts takes a number, and neither a scenario nor --full-length")
     for number in (signal.SIGTERM, signal.SIGHUP):
         signal.signal(number, lambda received, _: sys.exit(128 + received))
     try:
@@ -203,7 +172,10 @@ def main() -> int:
                 print(f"{name:32}  {load(name).summary}")
             return 0
         chosen = arguments.scenario or (["package-and-board"] if arguments.full_length else names())
-        return run([load(name) for name in chosen], arguments.package, 1 if arguments.full_length else SPEED)
+        plans = [load(name) for name in chosen]
+        space, speed = SPACE + DISK_SPACE * arguments.power_cuts, 1 if arguments.full_length else SPEED
+        with emulation(arguments.package, speed, space) as unit:
+            return power_cuts.run(unit, arguments.power_cuts) if arguments.power_cuts else run(plans, unit)
     except BrokenPipeError:
         os.dup2(os.open(os.devnull, os.O_WRONLY), sys.stdout.fileno())
     except (TargetError, PlanError, ScenarioError, MachineError) as error:

@@ -3,13 +3,18 @@
 import math
 import re
 
-from bench.compare import differences
-from bench.observation import Call
+from bench.compare import differences, log_difference
+from bench.expected import COMMANDS
+from bench.observation import Call, now
+from bench.outcomes import SOUND_FILES, UP_TO_DATE, UPDATED
 from bench.panel import Panel, lit
 from target.evidence import Evidence
+from target.inputs import BOARD_VERSION
 from target.plan import Plan
 
 IDENTIFIER = "harl-updater"
+LONGEST_PHASE = 1.2  # of the flashing, with the hand-over: times as long as without
+AFTER_START = ["startHARL: 0", "stopUpdater:"]  # the records after the command that starts the application
 
 
 def panel_bytes(calls: list[Call]) -> list[int]:
@@ -24,7 +29,7 @@ def check_bus(plan: Plan, evidence: Evidence) -> list[str]:
     sent = evidence.sent
     if sent != evidence.asked:
         return [f"bus: {len(sent)} bytes that are not the {len(evidence.asked)} bytes the kernel was asked to send"]
-    if plan.settings.event in ("nothing", "power-cut"):
+    if plan.settings.event == "nothing" or plan.settings.is_cut():
         if sent != ended:
             return [f"bus: {len(sent)} bytes that are not the {len(ended)} bytes of the commands"]
     elif sent[: len(ended)] != ended:  # what runs after the updater sends more
@@ -70,10 +75,11 @@ def check(plan: Plan, evidence: Evidence) -> list[str]:
             found.append(f"{what}: expected {expected!r}, not {seen!r}")
 
     setup = plan.like.setup
-    cut = plan.settings.event == "power-cut"
+    cut = plan.settings.is_cut()
+    done = plan.settings.event == "power-cut-before-application"
     same("package before", setup.package.offered if cut else setup.package.installed, before["package"])
-    same("board before", setup.board.installed, before["board"])
-    same("marker before", "yes" if setup.head.marker else "no", before["marker"])
+    same("board before", BOARD_VERSION if done else setup.board.installed, before["board"])
+    same("marker before", "yes" if setup.head.marker and not done else "no", before["marker"])
     same("stick before", "yes", before["stick"])
     same("journal identifiers", {IDENTIFIER}, evidence.identifiers)
     same("result of the unit", plan.expect.result, after["Result"])
@@ -87,13 +93,62 @@ def check(plan: Plan, evidence: Evidence) -> list[str]:
         same("harl was started after the package's maintainer script", True, int(after["harl_since"]) / 1e6 > ended)
     if cut:
         same("harl after the boot", "active", before["harl"])
-        same("package status after the boot", "half-configured", before["package_status"])
+        same("package status after the boot", "installed" if done else "half-configured", before["package_status"])
+    if plan.settings.times_flashing and evidence.flashing_ratio() > LONGEST_PHASE:
+        found.append(f"flashing: {evidence.flashing_ratio():.2f} times as long with the hand-over")
+    return found + check_whole(evidence)
+
+
+def check_whole(evidence: Evidence) -> list[str]:
+    """Nothing is left unfinished in the package database, no file is damaged, and the disk had no error."""
+    wanted = {"damaged_files": "0", "audit": "0", "disk_errors": "0"}
+    return [
+        f"{name}: expected {value}, not {evidence.after[name]}"
+        for name, value in wanted.items()
+        if evidence.after[name] != value
+    ]
+
+
+def check_cut(plan: Plan, panel: Panel, evidence: Evidence) -> list[str]:
+    """What the panel showed when the machine was stopped, and what the journal has of the run that was cut.
+
+    Right before the application starts: the outcome, and every record up to that command. Earlier: the blue flashing of
+    an update at work, and the records up to any of them, as far as the journal had written them.
+    """
+    found = []
+    pattern = panel.pattern(0)
+    if plan.settings.event == "power-cut-before-application":
+        wanted = pattern == UPDATED.panel
+        ends = [len(plan.whole_log) - len(AFTER_START)]
+    else:
+        wanted = set(pattern.values()) <= {"blue"}
+        ends = list(range(len(plan.whole_log)))
+    if not wanted:
+        found.append(f"panel at the power cut: {pattern!r}")
+    kept = evidence.before_cut or []
+    if all(log_difference(plan.whole_log[:end], kept) for end in ends):
+        found.append(f"journal of the run before the power cut: {log_difference(plan.whole_log[: ends[-1]], kept)}")
     return found
 
 
-def check_cut(panel: Panel) -> list[str]:
-    """What the panel showed when the machine was stopped: the blue flashing of an update at work."""
-    pattern = panel.pattern(0)
-    if set(pattern.values()) - {"blue"}:
-        return [f"panel at the power cut: expected the blue flashing, not {pattern!r}"]
-    return []
+def check_next_run(plan: Plan, evidence: Evidence) -> list[str]:
+    """The run after a power cut, with the network and the stick: it does what is left to do and shows that."""
+    state, before, after = evidence.result.state, evidence.before, evidence.after
+    done = {call.text for call in evidence.result.run.commands()}
+    outcome = UPDATED if done & {COMMANDS["install-package"], COMMANDS["install-board"]} else UP_TO_DATE
+    found = check_main_thread(evidence) + check_bus(plan, evidence) + check_sound(evidence) + check_whole(evidence)
+    pairs = {
+        "panel": (outcome.panel, evidence.result.run.panel.pattern(now())),
+        "sound": ([SOUND_FILES[outcome.sound]], state.sounds),
+        "package": (plan.like.setup.package.offered, state.package),
+        "package status": ("installed", after["package_status"]),
+        "board": (BOARD_VERSION, state.board),
+        "stick": (False, state.stick),
+        "harl": ("active", state.harl),
+        "harl after the boot": ("active", before["harl"]),
+        "harl was started again": (True, int(after["harl_since"]) > int(before["harl_since"])),
+        "result of the unit": ("success", after["Result"]),
+        "status": (True, evidence.result.status in plan.like.expect.status),
+    }
+    found += [f"{what}: expected {wanted!r}, not {seen!r}" for what, (wanted, seen) in pairs.items() if wanted != seen]
+    return found

@@ -4,7 +4,9 @@ import json
 import re
 from dataclasses import dataclass
 from pathlib import Path
+from statistics import median
 
+from bench.compare import seen_log
 from bench.makers.sounds import SOUNDS, samples
 from bench.observation import Run
 from bench.runner import Result
@@ -30,6 +32,25 @@ class Evidence:
     after: dict[str, str]
     identifiers: set[str]  # under which the updater's own records stand in the journal
     package_script: dict[str, float]  # "began", "ended": when the package's maintainer script did, s since the boot
+    before_cut: list[str] | None  # the records of the run before the power cut that the journal has; None: no cut
+    power_cuts: list[float]  # when the power was cut, s since the boot
+    flashing: dict[str, list[float]]  # how long phases of it took (s), with the "hand-over" and "direct"
+
+    def flashing_ratio(self) -> float:
+        """How many times longer a phase of the flashing takes with the hand-over."""
+        return median(self.flashing["hand-over"]) / median(self.flashing["direct"])
+
+    def remarks(self) -> list[str]:
+        """What else was measured, a line each."""
+        lines = []
+        if self.flashing:
+            lines.append(
+                f"A phase of the flashing: {median(self.flashing['hand-over']):.2f} s with the hand-over,"
+                f" {median(self.flashing['direct']):.2f} s without, {self.flashing_ratio():.2f} times as long"
+            )
+        if self.before_cut is not None:
+            lines.append(f"Of the run before the power cut the journal has {len(self.before_cut)} records")
+        return lines
 
 
 def read_bus(trace: Path) -> list[list[int]]:
@@ -61,6 +82,23 @@ def read_journal(file: Path, log: Path) -> set[str]:
     own = [(entry, line) for entry, line in zip(entries, lines) if entry.get("_PID") == process]
     log.write_text("".join(f"{line}\n" for _, line in own), newline="")
     return {entry.get("SYSLOG_IDENTIFIER", "") for entry, _ in own}
+
+
+def read_words(file: Path) -> list[list[str]]:
+    """The words of each line; none without the file."""
+    return [line.split() for line in file.read_text().splitlines()] if file.exists() else []
+
+
+def read_before_cut(folder: Path) -> list[str] | None:
+    """The records of the run before the power cut that the journal has, as the bench compares them; None: no cut."""
+    journal = folder / "journal-before-cut"
+    if not journal.exists():
+        return None
+    files = Files(log=folder / "log-before-cut", calls=folder / "none", panel=folder / "none")
+    read_journal(journal, files.log)
+    run = Run(files)
+    run.update()
+    return seen_log(run)
 
 
 def heard(recording: Path) -> list[str]:
@@ -108,8 +146,13 @@ def read(folder: Path, sent: list[int]) -> Evidence:
         status=code if int(after["ExecMainCode"]) == CLD_EXITED else -code,
         seconds=float(after["uptime"]) - float(before["uptime"]),
     )
-    script = folder / "package-script"
-    lines = script.read_text().splitlines() if script.exists() else []
-    package_script = {line.split()[0]: float(line.split()[1]) for line in lines}
+    package_script = {name: float(moment) for name, moment in read_words(folder / "package-script")}
+    flashing: dict[str, list[float]] = {}
+    for name, begin, end in read_words(folder / "flashing"):
+        flashing.setdefault(name, []).append(float(end) - float(begin))
+    power_cuts = [float(moment) for [moment] in read_words(folder / "power-cuts")]
     asked = [int(write["byte"], 16) for write in writes]
-    return Evidence(result, asked, sent, before, after, identifiers, package_script)
+    kept = read_before_cut(folder)
+    return Evidence(
+        result, asked, sent, before, after, identifiers, package_script, kept, power_cuts, flashing
+    )

@@ -1,15 +1,26 @@
 """The emulated machine: boots a disk with what a run carries in, within a bounded time, and brings back its results."""
 
+import os
 import shutil
+import signal
 import subprocess
 import tarfile
+import threading
 import time
 from pathlib import Path
 
 BOOT_LIMIT = 300  # s, until the guest's own program runs
 POLL = 0.2  # s
 OUTPUT_SIZE = 128 << 20  # bytes, for the results of one boot
-CUT = "target: power-cut"  # what the guest's console says when the machine is to be stopped hard
+CUT = "target: power-cut"  # what the guest's console says when the machine loses its power
+
+
+stopping = threading.Event()
+
+
+def stop_machines() -> None:
+    """Ends all machines that run, and lets none start any more: for a program that ends early."""
+    stopping.set()
 
 
 class MachineError(Exception):
@@ -22,8 +33,20 @@ def drive(name: str, file: Path, *options: str) -> list[str]:
     return ["-drive", ",".join(settings), "-device", f"virtio-blk-device,drive={name},serial={name}"]
 
 
+def copy_disk(disk: Path, copy: Path) -> None:
+    """Copies a disk image; what it has no data for takes no space."""
+    subprocess.run(["cp", "--sparse=always", disk, copy], check=True)
+
+
 def boot(
-    image: Path, disk: Path, inputs: Path, folder: Path, limit: float, keep: bool = False, cut: bool = False
+    image: Path,
+    disk: Path,
+    inputs: Path,
+    folder: Path,
+    limit: float,
+    keep: bool = False,
+    cut: bool = False,
+    copies: list[Path] | None = None,
 ) -> None:
     """Boots `disk` and waits for the end; `folder` then holds the guest's results, `console` and `bus`, the I2C trace.
 
@@ -32,6 +55,7 @@ def boot(
     @param inputs  the disk that carries the scenarios in
     @param limit   how long the scenarios may take (s)
     @param cut     stop the machine hard when the guest asks for it; there are no results of the guest then
+    @param copies  instead: where a copy of the disk goes each time that the guest asks for it
     Raises MachineError.
     """
     shutil.rmtree(folder, ignore_errors=True)
@@ -53,12 +77,13 @@ def boot(
     with (folder / "errors").open("wb") as errors:
         machine = subprocess.Popen(command, stdin=subprocess.DEVNULL, stdout=errors, stderr=errors)
     try:
-        was_cut = follow(machine, console, limit)
+        cuts = follow(machine, console, limit, disk, copies or [])
     finally:
         machine.kill()
         machine.wait()
-    if was_cut != cut:
-        raise MachineError(f"the guest {'did not ask' if cut else 'asked'} for a power cut: see {console}")
+    expected = len(copies or []) + cut
+    if cuts != expected:
+        raise MachineError(f"the guest asked for {cuts} power cuts, not for {expected}: see {console}")
     if cut:
         return
     if machine.returncode != 0:
@@ -74,21 +99,32 @@ def boot(
         raise MachineError(f"the guest's program failed: see {folder / 'guest.log'}")
 
 
-def follow(machine: subprocess.Popen[bytes], console: Path, limit: float) -> bool:
-    """Shows the guest's progress until it ends. True when it asked for a power cut. Raises MachineError."""
+def follow(machine: subprocess.Popen[bytes], console: Path, limit: float, disk: Path, copies: list[Path]) -> int:
+    """Shows the guest's progress until it ends, or until it asks for a power cut and `copies` has no place any more.
+
+    A copy has what a machine that is stopped hard at that moment leaves on `disk`: it is held meanwhile.
+    Returns how often the guest asked for a power cut. Raises MachineError.
+    """
     begin = time.monotonic()
-    shown = 0
+    shown = cuts = 0
     while machine.poll() is None:
+        if stopping.is_set():
+            raise MachineError("stopped")
         lines = [line for line in console.read_text(errors="replace").splitlines() if line.startswith("target: ")]
         for line in lines[shown:]:
-            print(f"{time.monotonic() - begin:6.0f} s  {line[8:]}", flush=True)
+            print(f"{console.parent.name:16} {time.monotonic() - begin:6.0f} s  {line[8:]}", flush=True)
         shown = len(lines)
-        if CUT in lines:
-            return True
+        while cuts < lines.count(CUT):
+            if cuts == len(copies):
+                return cuts + 1
+            os.kill(machine.pid, signal.SIGSTOP)
+            copy_disk(disk, copies[cuts])
+            os.kill(machine.pid, signal.SIGCONT)
+            cuts += 1
         passed = time.monotonic() - begin
         if not lines and passed > BOOT_LIMIT:
             raise MachineError(f"the machine did not come up within {BOOT_LIMIT} s: see {console}")
         if passed > BOOT_LIMIT + limit:
             raise MachineError(f"the scenarios did not end within {BOOT_LIMIT + limit:.0f} s: see {console}")
         time.sleep(POLL)
-    return False
+    return cuts

@@ -2,7 +2,7 @@
 
 import copy
 import re
-from dataclasses import dataclass, fields, replace
+from dataclasses import dataclass, field, fields, replace
 from pathlib import Path
 from typing import Any, Literal
 
@@ -15,14 +15,30 @@ from bench.fields import FieldError, fill
 FOLDER = Path(__file__).parent / "scenarios"
 
 
+Event = Literal[
+    "nothing", "crash", "stop", "out-of-memory", "give-back-killed", "power-cut", "power-cut-before-application"
+]
+NOT_IN_SCRIPT = ("nothing", "power-cut-before-application")
+
+
 @dataclass
 class Settings:
     """What a file may say beside `summary`, `like` and `expect`."""
 
-    # what befalls the updater while the package's maintainer script is at work
-    event: Literal["nothing", "crash", "stop", "out-of-memory", "power-cut", "give-back-killed"] = "nothing"
+    # what befalls the updater: while the package's maintainer script is at work, or right before the application starts
+    event: Event = "nothing"
     script_seconds: int = 0  # that the package's maintainer script takes
+    package_files: int = 1  # that the offered package has
     needs_newer_updater: bool = False  # the offered package depends on a newer harl-updater, which is offered too
+    board_script_limit: int = 0  # s, of the hand-over, in place of the shipped one; 0: the shipped one
+    shortest_wait: int = 1  # s, that the updater's waits are shortened to at most; a pause of the flashing takes that
+    # moments at which the disk is copied as a power cut leaves it: parts of the length of the run before, in one boot
+    power_cuts: list[float] = field(default_factory=list)
+    times_flashing: bool = False  # after the run: a phase of the flashing, with the hand-over and without
+
+    def is_cut(self) -> bool:
+        """Whether the machine loses its power."""
+        return self.event.startswith("power-cut")
 
 
 @dataclass
@@ -38,7 +54,7 @@ class Expect:
 SUPPORTED = {
     "package": ["installed", "offered"],
     "mirrors": ["refresh"],
-    "board": ["installed", "link"],
+    "board": ["installed", "link", "script"],
     "head": ["marker"],
     "updater": ["stopped"],
 }
@@ -55,6 +71,7 @@ class Plan:
     name: str
     summary: str
     like: bench.Scenario
+    whole_log: list[str]  # the records that the bench scenario expects
     settings: Settings
     expect: Expect
 
@@ -85,17 +102,21 @@ def read(path: Path) -> Plan:
         expect: dict[str, Any] = content.pop("expect", {})
         known = {field.name for field in fields(bench.Expect)}
         own = {key: expect.pop(key) for key in list(expect) if key in known}
+        whole_log = journaled(like.expect.log)
         like.expect = bench.expectations(vars(like.expect) | own)
         settings, expected = fill(Settings, "", content), fill(Expect, "expect.", expect)
     except FieldError as error:
         raise PlanError(f"{path}: {error}") from error
-    # The journal drops blanks and carriage returns at the ends of lines.
-    log = "\n".join(re.sub(r"(\\r| )+$", "", line) for line in expected_log(like.expect.log))
-    like.expect = replace(like.expect, log=log)
+    like.expect = replace(like.expect, log="\n".join(journaled(like.expect.log)))
     check_setup(path, like)
-    if settings.event != "nothing" and settings.script_seconds < 1:
+    if settings.event not in NOT_IN_SCRIPT and settings.script_seconds < 1:
         raise PlanError(f"{path}: script_seconds: must be 1 or more with event = {settings.event!r}")
-    return Plan(path.stem, summary, like, settings, expected)
+    return Plan(path.stem, summary, like, whole_log, settings, expected)
+
+
+def journaled(log: str) -> list[str]:
+    """The expected records as the journal keeps them: without blanks and carriage returns at the ends of lines."""
+    return [re.sub(r"(\\r| )+$", "", line) for line in expected_log(log)]
 
 
 def check_setup(path: Path, like: bench.Scenario) -> None:
@@ -109,3 +130,5 @@ def check_setup(path: Path, like: bench.Scenario) -> None:
                 raise PlanError(f"{path}: like: {like.name} has {what}, which cannot be made here")
     if like.setup.board.link not in ("up", "down"):
         raise PlanError(f"{path}: like: the target test knows a board link that is up or down, no other")
+    if like.setup.board.script not in ("works", "never-returns"):
+        raise PlanError(f"{path}: like: the target test knows a board's script that works or never returns, no other")

@@ -1,0 +1,82 @@
+"""Runs scenarios on the emulated unit, those of one boot one after the other, and reads what each left."""
+
+from dataclasses import dataclass
+from pathlib import Path
+
+from bench.panel import Panel
+from target.check import check, check_cut
+from target.evidence import Evidence, read, read_bus
+from target.inputs import write_input
+from target.machine import MachineError, boot, copy_disk
+from target.plan import Plan
+
+WORK = Path(__file__).parent.parent / "build/target"
+SCENARIO_LIMIT = 420  # s, for one scenario besides the updater's waits; guest/main gives up before that
+SLOWNESS = 5  # how many times longer than by the unit's clock a wait with the flashing in it may take
+
+Results = dict[str, tuple[Evidence, list[str]]]  # what each scenario left, and its differences
+
+
+@dataclass
+class Emulation:
+    """What every boot has in common."""
+
+    image: Path  # folder with the disk and the boot files
+    updater: Path  # package
+    speed: float  # how many times shorter the updater's waits are
+
+    def write_input(self, plans: list[Plan], again: bool = False) -> Path:
+        """Writes the disk that brings `plans` into the unit. `again`: the run after a power cut."""
+        inputs = WORK / "in.tar"
+        write_input(inputs, WORK / "in", self.image, self.updater, plans, self.speed, again)
+        return inputs
+
+    def boot(
+        self,
+        inputs: Path,
+        plans: list[Plan],
+        folder: Path,
+        disk: Path | None = None,
+        cut: bool = False,
+        copies: list[Path] | None = None,
+    ) -> None:
+        """Boots a unit with the `inputs` for `plans` and waits for the end; `folder` then holds what it leaves.
+
+        @param disk  the unit's disk; none: that of the image, left as it is
+        The rest is as in machine.boot. Raises MachineError.
+        """
+        limit = sum(SCENARIO_LIMIT + SLOWNESS * sum(plan.like.expect.waits) / self.speed for plan in plans)
+        kept = disk is not None
+        boot(self.image, disk or self.image / "root.ext4", inputs, folder, limit, kept, cut, copies)
+
+    def run_shared(self, plans: list[Plan]) -> Results:
+        """Runs `plans` one after the other in one boot. Raises MachineError."""
+        folder = WORK / "shared"
+        self.boot(self.write_input(plans), plans, folder)
+        return {plan.name: (left, check(plan, left)) for plan, left in zip(plans, read_all(plans, folder))}
+
+    def run_cut(self, plan: Plan) -> Results:
+        """Runs `plan` until it stops the machine hard, boots the same disk again and runs the update.
+
+        Raises MachineError.
+        """
+        folder, disk = WORK / plan.name, WORK / "disk.ext4"
+        copy_disk(self.image / "root.ext4", disk)
+        try:
+            self.boot(self.write_input([plan]), [plan], WORK / f"{plan.name}-cut", disk, cut=True)
+            self.boot(self.write_input([plan], again=True), [plan], folder, disk)
+        finally:
+            disk.unlink(missing_ok=True)
+        panel = Panel()
+        for byte in read_bus(WORK / f"{plan.name}-cut/bus")[-1]:
+            panel.send(byte, 0)
+        [evidence] = read_all([plan], folder)
+        return {plan.name: (evidence, check_cut(plan, panel, evidence) + check(plan, evidence))}
+
+
+def read_all(plans: list[Plan], folder: Path) -> list[Evidence]:
+    """Reads what a boot with `plans` left in `folder`. Raises MachineError."""
+    parts = read_bus(folder / "bus")
+    if len(parts) != 2 * len(plans) + 1:
+        raise MachineError(f"{len(parts) - 1} marks on the I2C bus for {len(plans)} scenarios: see {folder / 'bus'}")
+    return [read(folder / plan.name, parts[2 * index + 1]) for index, plan in enumerate(plans)]

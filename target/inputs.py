@@ -82,7 +82,7 @@ def write_scenario(folder: Path, plan: Plan, updater: Path, speed: float, again:
         "keep_head": "yes" if again else "no",  # the head and the board are left as the power cut left them
         "times_flashing": "yes" if plan.settings.times_flashing else "no",
         "speed": str(speed),  # how many times shorter the updater's waits are
-        "shortest_wait": str(plan.settings.shortest_wait),
+        "shortest_wait": str(plan.settings.shortest_wait if speed > 1 else 1),
         "waits": str(round(sum(plan.like.expect.waits) / speed)),  # s, that they take
     }
     (folder / "settings").write_text("".join(f"{key}='{value}'\n" for key, value in settings.items()))

@@ -9,7 +9,7 @@ import threading
 import time
 from pathlib import Path
 
-BOOT_LIMIT = 300  # s, until the guest's own program runs
+BOOT_LIMIT = 900  # s, until the guest's own program runs; a minute on an idle machine
 POLL = 0.2  # s
 OUTPUT_SIZE = 128 << 20  # bytes, for the results of one boot
 CUT = "target: power-cut"  # what the guest's console says when the machine loses its power

@@ -31,7 +31,7 @@ class Settings:
     package_files: int = 1  # that the offered package has
     needs_newer_updater: bool = False  # the offered package depends on a newer harl-updater, which is offered too
     board_script_limit: int = 0  # s, of the hand-over, in place of the shipped one; 0: the shipped one
-    shortest_wait: int = 1  # s, that the updater's waits are shortened to at most; a pause of the flashing takes that
+    shortest_wait: int = 5  # s, that the updater's waits are shortened to at most; a pause of the flashing takes that
     # moments at which the disk is copied as a power cut leaves it: parts of the length of the run before, in one boot
     power_cuts: list[float] = field(default_factory=list)
     times_flashing: bool = False  # after the run: a phase of the flashing, with the hand-over and without

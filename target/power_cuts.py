@@ -22,9 +22,8 @@ from target.plan import Plan, Settings, load
 from target.runner import WORK, Emulation, read_all
 
 SEED = 1
-# A maintainer script and an unpacking that take some seconds each on the emulated unit, which flashes less often than
-# it does in the scenarios: that takes half of its time.
-SETTINGS = Settings(script_seconds=3, package_files=100, shortest_wait=5)
+# A maintainer script and an unpacking that take some seconds each on the emulated unit.
+SETTINGS = Settings(script_seconds=3, package_files=100)
 
 
 def moments(count: int) -> list[float]:

@@ -9,8 +9,8 @@
 /// asked for (s) and the text how long it takes in fact (s).
 ///
 /// Shortens the waits: BENCH_SPEED times (1: full length), but to no less than BENCH_SHORTEST_WAIT (s; 0.2 when it is
-/// not set) so that the panel's flashing stays visible; a longer one makes its pauses longer. The wall clock that the updater sees moves on by what waits of
-/// 2 s and more were shortened by: the log reads like a run at full length.
+/// not set) so that the panel's flashing stays visible; a longer one makes its pauses longer. The wall clock that the
+/// updater sees moves on by what waits of 2 s and more were shortened by: the log reads like a run at full length.
 
 #include <algorithm>
 #include <atomic>

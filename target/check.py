@@ -87,6 +87,8 @@ def check(plan: Plan, evidence: Evidence) -> list[str]:
     same("harl-updater", plan.expect.updater, "same" if before["updater"] == after["updater"] else "newer")
     same("harl-updater starts at boot", False, after["enabled"] == "enabled")
     same("harl was started again", True, int(after["harl_since"]) > int(before["harl_since"]))
+    killed = plan.settings.event == "give-back-killed"
+    same("give-back was killed and started again", killed, int(after["rescuer_restarts"]) > 0)
     if plan.settings.script_seconds:
         same("package's maintainer script", ["began", "ended"], list(evidence.package_script))
         ended = evidence.package_script.get("ended", math.inf)

@@ -1,8 +1,8 @@
 """target/run --power-cuts: the power is cut at random moments of an update, and each time the next run is judged.
 
-The update runs once to learn how long it takes, and once more for the power cuts. At each moment the machine is held
-and its disk copied: the copy has, byte for byte, what a machine leaves that is stopped hard then. A boot of each copy
-and a whole run of the updater follow.
+The update runs once to learn how long it takes up to the start of the application, and once more for the power cuts. At
+each moment the machine is held and its disk copied: the copy has, byte for byte, what a machine leaves that is stopped
+hard then. A boot of each copy and a whole run of the updater follow.
 """
 
 import os

@@ -7,34 +7,41 @@
 #include <cerrno>
 #include <csignal>
 #include <sstream>
+#include <thread>
 
 #include <fcntl.h>
-#include <poll.h>
 #include <spawn.h>
+#include <sys/mman.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
+
+using namespace std::chrono_literals;
 
 namespace
 {
 
-const std::size_t mostOutput = std::size_t{256} * 1024;       // bytes
-const int pollTime = 10;                                      // ms between two looks at whether a program has ended
-const std::array<int, 3> endings = {SIGHUP, SIGINT, SIGTERM}; // from outside
+const std::size_t mostKept = std::size_t{256} * 1024;          // bytes of an output
+const std::size_t mostWritten = std::size_t{64} * 1024 * 1024; // bytes; a program that writes more gets an error
+const std::chrono::milliseconds longestPause(10);              // between two looks at whether a program has ended
+const std::array<int, 3> endings = {SIGHUP, SIGINT, SIGTERM};  // from outside
 
-struct Pipe
+/// A file in memory for what a program writes, which so waits for nobody and cannot fill the memory. Its length is that
+/// of mostWritten; what was written ends at its offset.
+Descriptor makeOutput()
 {
-    Descriptor readEnd;
-    Descriptor writeEnd;
-};
-
-Pipe makePipe()
-{
-    std::array<int, 2> ends = {-1, -1};
-    if (pipe2(ends.data(), O_CLOEXEC) != 0) {
-        return Pipe();
+    Descriptor file(memfd_create("output", MFD_CLOEXEC | MFD_ALLOW_SEALING));
+    if (file && (ftruncate(file.number(), mostWritten) != 0 || fcntl(file.number(), F_ADD_SEALS, F_SEAL_GROW) != 0)) {
+        file = Descriptor();
     }
-    fcntl(ends[0], F_SETFL, O_NONBLOCK);
-    return {Descriptor(ends[0]), Descriptor(ends[1])};
+    return file;
+}
+
+std::string contentOf(const Descriptor& output)
+{
+    const auto written = static_cast<std::size_t>(std::max<off_t>(lseek(output.number(), 0, SEEK_CUR), 0));
+    std::string text(std::min(written, mostKept), '\0');
+    text.resize(static_cast<std::size_t>(std::max<ssize_t>(pread(output.number(), text.data(), text.size(), 0), 0)));
+    return text;
 }
 
 std::vector<char*> pointers(const std::vector<std::string>& texts)
@@ -56,22 +63,6 @@ std::string searchPathOf(const std::vector<std::string>& environment)
         }
     }
     return "";
-}
-
-/// Appends what `descriptor` has to give by now. False at its end.
-bool drain(int descriptor, std::string& text)
-{
-    std::array<char, 8192> buffer{};
-    for (;;) {
-        const ssize_t count = read(descriptor, buffer.data(), buffer.size());
-        if (count < 0 && errno == EINTR) {
-            continue;
-        }
-        if (count <= 0) {
-            return count < 0 && errno == EAGAIN;
-        }
-        text.append(buffer.data(), std::min(static_cast<std::size_t>(count), mostOutput - text.size()));
-    }
 }
 
 /// Starts the program in a session of its own. Its process id, or -1.
@@ -137,37 +128,23 @@ CommandResult runCommand(const std::vector<std::string>& arguments, const std::v
 {
     CommandResult result;
     const std::string program = findProgram(arguments.front(), searchPathOf(environment));
-    Pipe output = makePipe();
-    Pipe errors = makePipe();
-    if (program.empty() || !output.readEnd || !errors.readEnd) {
+    const Descriptor output = makeOutput();
+    const Descriptor errors = makeOutput();
+    if (program.empty() || !output || !errors) {
         return result;
     }
     const HeldSignals signals;
     const auto deadline = std::chrono::steady_clock::now() + limit;
-    const pid_t child = spawn(program, arguments, environment, output.writeEnd.number(), errors.writeEnd.number());
+    const pid_t child = spawn(program, arguments, environment, output.number(), errors.number());
     if (child < 0) {
         return result;
     }
     result.started = true;
-    output.writeEnd = Descriptor();
-    errors.writeEnd = Descriptor();
-
-    // A background child of the program may keep the pipes open: the program's own end is what counts. It is looked
-    // for now and then, as not every kernel tells it to poll(2) (pidfd_open(2): since Linux 5.3).
-    std::array<pollfd, 2> watched = {{{output.readEnd.number(), POLLIN, 0}, {errors.readEnd.number(), POLLIN, 0}}};
-    while (!hasEnded(child)) {
-        if (std::chrono::steady_clock::now() >= deadline || signals.any()) {
-            result.timedOut = true;
-            break;
-        }
-        const bool silent = watched[0].fd < 0 && watched[1].fd < 0; // about to end
-        poll(watched.data(), watched.size(), silent ? 1 : pollTime);
-        if (watched[0].revents != 0 && !drain(watched[0].fd, result.output)) {
-            watched[0].fd = -1;
-        }
-        if (watched[1].revents != 0 && !drain(watched[1].fd, result.errors)) {
-            watched[1].fd = -1;
-        }
+    // The program's own end counts, not that of its children. Not every kernel tells it to poll(2) (pidfd_open(2):
+    // since Linux 5.3).
+    for (auto pause = 1ms; !hasEnded(child) && !result.timedOut; pause = std::min(2 * pause, longestPause)) {
+        std::this_thread::sleep_for(pause);
+        result.timedOut = std::chrono::steady_clock::now() >= deadline || signals.any();
     }
     if (result.timedOut) {
         kill(-child, SIGKILL);
@@ -175,8 +152,8 @@ CommandResult runCommand(const std::vector<std::string>& arguments, const std::v
     int status = 0;
     while (waitpid(child, &status, 0) == -1 && errno == EINTR) {
     }
-    drain(output.readEnd.number(), result.output);
-    drain(errors.readEnd.number(), result.errors);
+    result.output = contentOf(output);
+    result.errors = contentOf(errors);
     if (!result.timedOut && WIFEXITED(status)) {
         result.exitCode = WEXITSTATUS(status);
     }

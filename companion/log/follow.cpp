@@ -58,15 +58,6 @@ bool nextDependsOnCheck(const Run& run)
     return !step.took && !run.mainHead && (step.kind == StepKind::CHECK_PACKAGE || step.kind == StepKind::CHECK_BOARD);
 }
 
-std::string nextText(const Run& run)
-{
-    const std::optional<StepKind> next = nextStep(run);
-    if (!next) {
-        return "";
-    }
-    return std::string("; then: ") + factsOf(*next).title + (nextDependsOnCheck(run) ? ", if they differ" : "");
-}
-
 } // namespace
 
 void ExpectedTimes::learn(const Run& run)
@@ -84,56 +75,54 @@ std::optional<std::int64_t> ExpectedTimes::of(StepKind kind) const
     return wait > 0 ? wait : mLast.at(static_cast<std::size_t>(kind));
 }
 
-std::optional<StepKind> nextStep(const Run& run)
+std::vector<StepKind> stepsToCome(const Run& run)
 {
-    if (run.steps.empty()) {
-        return StepKind::STOP_APPLICATION;
+    const StepKind last = run.steps.empty() ? StepKind::START : run.steps.back().kind;
+    const bool failed = !run.steps.empty() && run.steps.back().result == StepResult::FAILED;
+    const bool ends = failed && last != StepKind::STOP_APPLICATION && last != StepKind::RUN_BOARD_SCRIPT;
+    const auto mayDiffer = [&](const Versions& versions, StepKind check) {
+        const Step* step = run.find(check);
+        return !run.mainHead && !ends && (versions.differ() || step == nullptr || !step->took);
+    };
+    const bool package = mayDiffer(run.package, StepKind::CHECK_PACKAGE);
+    const bool board = mayDiffer(run.board, StepKind::CHECK_BOARD);
+    const auto comes = [&](StepKind kind) {
+        switch (kind) {
+        case StepKind::INSTALL_PACKAGE:
+            return package;
+        case StepKind::UPLOAD_BOARD:
+        case StepKind::RUN_BOARD_SCRIPT:
+        case StepKind::WAIT_FOR_BOARD:
+            return board;
+        case StepKind::CHECK_TEAMVIEWER:
+            return run.mainHead && (!ends || last == StepKind::CHECK_BOARD);
+        case StepKind::INSTALL_TEAMVIEWER: // its user decides
+            return false;
+        case StepKind::REMOVE_MARKER:
+            return run.mainHead ? !ends && last != StepKind::INSTALL_TEAMVIEWER : package || board;
+        default:
+            return kind >= StepKind::SHOW_OUTCOME || !ends;
+        }
+    };
+    std::vector<StepKind> kinds;
+    for (std::size_t index = static_cast<std::size_t>(last) + 1; index < stepKinds; ++index) {
+        if (comes(static_cast<StepKind>(index))) {
+            kinds.push_back(static_cast<StepKind>(index));
+        }
     }
+    return kinds;
+}
+
+/// How long the run goes on at least, as far as its steps' lengths are known (s).
+std::int64_t Follower::remaining(const Run& run, std::int64_t now) const
+{
     const Step& step = run.steps.back();
-    const bool failed = step.result == StepResult::FAILED;
-    switch (step.kind) {
-    case StepKind::START:
-        return StepKind::STOP_APPLICATION;
-    case StepKind::STOP_APPLICATION:
-        return StepKind::REFRESH_MIRRORS;
-    case StepKind::REFRESH_MIRRORS:
-        return failed ? StepKind::SHOW_OUTCOME : StepKind::CHECK_PACKAGE;
-    case StepKind::CHECK_PACKAGE:
-        if (failed) {
-            return StepKind::SHOW_OUTCOME;
-        }
-        return !run.mainHead && (run.package.differ() || !step.took) ? StepKind::INSTALL_PACKAGE
-                                                                     : StepKind::CHECK_BOARD;
-    case StepKind::INSTALL_PACKAGE:
-        return failed ? StepKind::SHOW_OUTCOME : StepKind::CHECK_BOARD;
-    case StepKind::CHECK_BOARD:
-        if (run.mainHead) {
-            return StepKind::CHECK_TEAMVIEWER;
-        }
-        if (run.board.differ() || !step.took) {
-            return StepKind::UPLOAD_BOARD;
-        }
-        return run.package.differ() && !failed ? StepKind::REMOVE_MARKER : StepKind::SHOW_OUTCOME;
-    case StepKind::UPLOAD_BOARD:
-        return failed ? StepKind::SHOW_OUTCOME : StepKind::RUN_BOARD_SCRIPT;
-    case StepKind::RUN_BOARD_SCRIPT:
-        return StepKind::WAIT_FOR_BOARD;
-    case StepKind::WAIT_FOR_BOARD:
-    case StepKind::CHECK_TEAMVIEWER:
-        return StepKind::REMOVE_MARKER;
-    case StepKind::REMOVE_MARKER:
-    case StepKind::INSTALL_TEAMVIEWER:
-        return StepKind::SHOW_OUTCOME;
-    case StepKind::SHOW_OUTCOME:
-        return StepKind::SHOW_TO_OPERATOR;
-    case StepKind::SHOW_TO_OPERATOR:
-        return StepKind::GIVE_BACK;
-    case StepKind::GIVE_BACK:
-        return StepKind::STOP_UPDATER;
-    case StepKind::STOP_UPDATER:
-        return std::nullopt;
+    const std::int64_t rest = step.took ? 0 : mExpected.of(step.kind).value_or(0) - (now - step.start);
+    std::int64_t sum = std::max<std::int64_t>(rest, 0);
+    for (const StepKind kind : stepsToCome(run)) {
+        sum += mExpected.of(kind).value_or(0);
     }
-    return std::nullopt;
+    return sum;
 }
 
 void Follower::show(const Run* run, std::int64_t now)
@@ -173,7 +162,7 @@ void Follower::showChange(const Run* run, std::int64_t now)
         if (known) {
             const Step& step = run->steps.back();
             const std::optional<std::int64_t> expected = mExpected.of(step.kind);
-            const std::optional<StepKind> next = nextStep(*run);
+            const std::vector<StepKind> next = stepsToCome(*run);
             object["run"] = run->number;
             object["step"] = factsOf(step.kind).name;
             object["title"] = factsOf(step.kind).title;
@@ -182,7 +171,8 @@ void Follower::showChange(const Run* run, std::int64_t now)
             object["expected_s"] = expected ? nlohmann::ordered_json(*expected) : nlohmann::ordered_json();
             object["result"] = step.took ? resultText(*run, step) : "";
             object["failed_attempts"] = step.failedAttempts;
-            object["next"] = next ? nlohmann::ordered_json(factsOf(*next).name) : nlohmann::ordered_json();
+            object["remaining_s"] = over || overdue ? 0 : remaining(*run, now);
+            object["next"] = next.empty() ? nlohmann::ordered_json() : nlohmann::ordered_json(factsOf(next[0]).name);
             object["next_if_versions_differ"] = nextDependsOnCheck(*run);
             object["outcome"] = outcomeName(run->outcome);
             Run explained = *run;
@@ -230,7 +220,12 @@ void Follower::showChange(const Run* run, std::int64_t now)
              << factsOf(step.kind).afterwards << '\n';
         return;
     }
-    mOut << nextText(*run) << '\n';
+    if (const std::vector<StepKind> next = stepsToCome(*run); !next.empty()) {
+        const std::int64_t minutes = (remaining(*run, now) + 59) / 60;
+        mOut << "; then: " << factsOf(next[0]).title << (nextDependsOnCheck(*run) ? ", if they differ" : "");
+        mOut << "; in all at least " << minutes << " min more";
+    }
+    mOut << '\n';
 }
 
 void Follower::showBar(const Run& run, std::int64_t now)

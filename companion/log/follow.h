@@ -7,6 +7,7 @@
 #include <iosfwd>
 #include <optional>
 #include <string>
+#include <vector>
 
 /// How long each step takes: the updater's own waits, else as long as it took last time in the same log.
 class ExpectedTimes
@@ -21,9 +22,9 @@ private:
     std::array<std::optional<std::int64_t>, stepKinds> mLast;
 };
 
-/// The step that comes after the one that goes on; empty after the last. While versions are compared: the installation
-/// that comes if they differ.
-std::optional<StepKind> nextStep(const Run& run);
+/// The steps that come after the one that goes on. While versions are compared: also the installation that comes if
+/// they differ.
+std::vector<StepKind> stepsToCome(const Run& run);
 
 /// Shows the run that goes on while its log grows: a line for each change, on a terminal with a progress bar below it,
 /// or one JSON object for each change.
@@ -47,6 +48,7 @@ public:
 private:
     void showChange(const Run* run, std::int64_t now);
     void showBar(const Run& run, std::int64_t now);
+    std::int64_t remaining(const Run& run, std::int64_t now) const;
 
     bool mJson;
     bool mTerminal;

@@ -1,5 +1,6 @@
 #include "log/log_command.h"
 
+#include "command.h"
 #include "descriptor.h"
 #include "findings.h"
 #include "log/catalogue.h"
@@ -14,12 +15,10 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <fstream>
-#include <memory>
 #include <optional>
 #include <ostream>
 #include <vector>
@@ -66,13 +65,22 @@ const char* adviceFor(std::string_view start)
     return nullptr;
 }
 
-/// Reads a source block by block into a parser.
+/// Reads one of the sources that the options name, block by block, into a parser.
 class Reader
 {
 public:
-    Reader(const LogSource& source, LogParser& parser)
-        : mSource(source), mParser(parser), mDress(parser), mBlock(blockSize)
+    explicit Reader(LogSink& sink) : mParser(sink), mDress(mParser), mBlock(blockSize) {}
+
+    /// Opens the source number `index`. False when that fails.
+    bool open(const LogOptions& options, std::size_t index, std::ostream& err)
     {
+        mJournal = options.journal;
+        mError = mJournal ? mSource.openJournal(options.follow)
+                          : mSource.openFile(options.files.empty() ? "-" : options.files[index]);
+        if (mError.empty() && isatty(mSource.descriptor()) == 1) {
+            err << "harl-updater-tool: reading the log from the terminal; end it with Ctrl-D.\n";
+        }
+        return mError.empty();
     }
 
     /// Reads one block. False at the source's end for now, and when something is wrong.
@@ -89,7 +97,7 @@ public:
             return false;
         }
         const std::string_view text(mBlock.data(), static_cast<std::size_t>(length));
-        if (const char* advice = mDress.bytes() == 0 ? adviceFor(text) : nullptr; advice != nullptr) {
+        if (const char* advice = bytes() == 0 ? adviceFor(text) : nullptr; advice != nullptr) {
             mError = position() + "no log but " + advice;
             return false;
         }
@@ -97,98 +105,100 @@ public:
         if (mDress.tooLarge()) {
             mError =
                 "the newest lines come first and are too many to be turned round: tac FILE | harl-updater-tool log";
-            return false;
         }
-        return true;
+        return mError.empty();
+    }
+
+    /// Ends the reading. What is wrong, in words; empty for nothing.
+    ///
+    /// @param allRead  the source has come to its end
+    std::string finish(bool allRead)
+    {
+        if (allRead) {
+            mDress.finish();
+        }
+        if (const int code = mSource.close(allRead && mError.empty()); mError.empty() && code != 0) {
+            mError = "journalctl ended with status " + std::to_string(code) +
+                     ". Run it as root; journalctl --unit=harl-updater shows why.";
+        }
+        if (mError.empty() && mParser.records() == 0) {
+            mError = mJournal && bytes() == 0
+                         ? "nothing in it: the service has not run since the journal begins (often with the boot), or "
+                           "only root may read it. Run it as root."
+                         : "no record of the updater in " + counted(lines(), "line") + ", " + byteCount(bytes()) +
+                               ". A record begins with \"Updater | DD-MM-YYYY HH-MM-SS\".";
+        }
+        return mError.empty() ? "" : mSource.name() + ": " + mError;
+    }
+
+    /// False, and nothing more is to be read, when something is wrong; also when a file has become shorter.
+    bool isGood()
+    {
+        struct stat state = {};
+        if (mSource.isRegularFile() && fstat(mSource.descriptor(), &state) == 0 &&
+            static_cast<std::uint64_t>(state.st_size) < bytes()) {
+            mError = position() + "the file was made shorter while it was read; start again";
+        }
+        return mError.empty();
     }
 
     void expectOldestFirst() { mDress.expectOldestFirst(); }
-
-    /// The source has ended.
-    void finish() { mDress.finish(); }
-
+    const LogSource& source() const { return mSource; }
     std::uint64_t bytes() const { return mDress.bytes(); }
+    std::uint64_t lines() const { return mParser.lines(); }
 
+private:
     /// "byte 17, line 2: ", of what comes next.
     std::string position() const
     {
-        return "byte " + std::to_string(mDress.bytes()) + ", line " + std::to_string(mParser.lines() + 1) + ": ";
+        return "byte " + std::to_string(bytes()) + ", line " + std::to_string(lines() + 1) + ": ";
     }
 
-    /// What is wrong, in words; empty for nothing.
-    const std::string& error() const { return mError; }
-
-private:
-    const LogSource& mSource;
-    LogParser& mParser;
+    LogSource mSource;
+    LogParser mParser;
     Dress mDress;
     std::vector<char> mBlock;
     std::string mError;
+    bool mJournal = false;
 };
 
-const char* unfinishedFile = nullptr; // for removeUnfinished() only
-
-/// Handles a signal that ends the program.
-void removeUnfinished(int number)
+/// Opens a file without a name: nothing is left of it however the program ends. False, and errno tells why, when none
+/// can be made.
+bool openUnnamed(std::fstream& file)
 {
-    unlink(unfinishedFile);
-    std::signal(number, SIG_DFL);
-    std::raise(number);
+    const char* folder = std::getenv("TMPDIR");
+    std::string path = std::string(folder == nullptr ? "/tmp" : folder) + "/harl-updater-tool-XXXXXX";
+    const Descriptor made(mkstemp(path.data()));
+    if (made) {
+        file.open(path, std::ios::binary | std::ios::in | std::ios::out);
+        unlink(path.c_str());
+    }
+    return file.is_open();
 }
 
-/// A file that takes the place of another one of its name once it is whole; one at a time. Nothing is left of it when
-/// the program is ended before.
-class NewFile
+/// Puts `content` in the place of the file at `path` in one step. What is wrong, in words; empty for nothing.
+std::string replaceFile(const std::string& path, std::fstream& content)
 {
-public:
-    explicit NewFile(const std::string& path) : mPath(path), mPartPath(path + ".XXXXXX")
-    {
-        const Descriptor part(mkstemp(mPartPath.data()));
-        if (part) {
-            const mode_t withheld = umask(0);
-            umask(withheld);
-            fchmod(part.number(), 0666 & ~withheld);
-            mStream.open(mPartPath, std::ios::binary);
-            unfinishedFile = mPartPath.c_str();
-            for (const int number : {SIGHUP, SIGINT, SIGTERM, SIGPIPE, SIGQUIT}) {
-                if (std::signal(number, removeUnfinished) == SIG_IGN) { // as nohup(1) leaves one
-                    std::signal(number, SIG_IGN);
-                }
-            }
-        } else {
-            mPartPath.clear();
-            mStream.setstate(std::ios::failbit);
-        }
+    const HeldSignals signals; // until the file has its name
+    std::string partPath = path + ".XXXXXX";
+    const Descriptor part(mkstemp(partPath.data()));
+    if (!part) {
+        return std::strerror(errno);
     }
-    ~NewFile()
-    {
-        if (!mKept) {
-            std::remove(mPartPath.c_str());
-        }
-        unfinishedFile = nullptr;
+    const mode_t withheld = umask(0);
+    umask(withheld);
+    fchmod(part.number(), 0666 & ~withheld);
+    std::ofstream file(partPath, std::ios::binary);
+    content.seekg(0);
+    file << content.rdbuf();
+    file.close();
+    if (!content || !file || std::rename(partPath.c_str(), path.c_str()) != 0) {
+        std::string wrong = std::strerror(errno);
+        std::remove(partPath.c_str());
+        return wrong;
     }
-    NewFile(const NewFile&) = delete;
-    NewFile& operator=(const NewFile&) = delete;
-
-    std::ostream& stream() { return mStream; }
-
-    /// Returns what is wrong, in words; empty when the file is whole and in its place.
-    std::string keep()
-    {
-        mStream.close();
-        if (!mStream || std::rename(mPartPath.c_str(), mPath.c_str()) != 0) {
-            return std::strerror(errno);
-        }
-        mKept = true;
-        return "";
-    }
-
-private:
-    std::string mPath;
-    std::string mPartPath;
-    std::ofstream mStream;
-    bool mKept = false;
-};
+    return "";
+}
 
 /// Prints explained runs one by one: for people, as one line each, or as one JSON object.
 class Printer
@@ -253,36 +263,6 @@ std::string objectionTo(const std::string& path, const LogOptions& options)
     return same ? "the log itself; name another file for the page" : "";
 }
 
-/// What journalctl(1) failed with, in words.
-std::string journalText(int code)
-{
-    return "journalctl ended with status " + std::to_string(code) +
-           ". Run it as root; journalctl --unit=harl-updater shows why.";
-}
-
-std::string noRecordText(const LogParser& parser, bool journal)
-{
-    if (journal && parser.bytes() == 0) {
-        return "nothing in it: the service has not run since the journal begins (often with the boot), or only root "
-               "may read it. Run it as root.";
-    }
-    return "no record of the updater in " + counted(parser.lines(), "line") + ", " + byteCount(parser.bytes()) +
-           ". A record begins with \"Updater | DD-MM-YYYY HH-MM-SS\".";
-}
-
-/// Opens the source number `index` of the options. What is wrong, in words; empty when it is open.
-std::string openSource(const LogOptions& options, std::size_t index, LogSource& source, std::ostream& err)
-{
-    if (options.journal) {
-        return source.openJournal(options.follow);
-    }
-    std::string wrong = source.openFile(options.files.empty() ? "-" : options.files[index]);
-    if (wrong.empty() && isatty(source.descriptor()) == 1) {
-        err << "harl-updater-tool: reading the log from the terminal; end it with Ctrl-D.\n";
-    }
-    return wrong;
-}
-
 /// True when a run leaves nothing to be done.
 bool isClean(const Run& run)
 {
@@ -315,59 +295,45 @@ public:
         mPrinter.finish(mLines, mBytes, error.empty() ? mStatus : LOG_UNREADABLE, error);
         if (error.empty() && mPage) {
             mPage->finish();
-            if (const std::string wrong = mFile->keep(); !wrong.empty()) {
-                error = escaped(mOptions.htmlFile) + ": " + wrong;
-            }
+            error = pageError(replaceFile(mOptions.htmlFile, mPageText));
         }
         if (!error.empty()) {
             mErrors << "harl-updater-tool: " << error << '\n';
-            return LOG_UNREADABLE;
         }
-        return mStatus;
+        return error.empty() ? mStatus : LOG_UNREADABLE;
     }
 
 private:
+    std::string pageError(const std::string& wrong) const
+    {
+        return wrong.empty() ? "" : escaped(mOptions.htmlFile) + ": " + wrong;
+    }
+
     std::string openPage()
     {
         if (mOptions.htmlFile.empty()) {
             return "";
         }
-        std::string wrong = objectionTo(mOptions.htmlFile, mOptions);
-        if (wrong.empty()) {
-            mFile = std::make_unique<NewFile>(mOptions.htmlFile);
-            if (mFile->stream()) {
-                mPage.emplace(mFile->stream());
-                return "";
-            }
-            wrong = std::strerror(errno);
+        const std::string objection = objectionTo(mOptions.htmlFile, mOptions);
+        if (!objection.empty() || !openUnnamed(mPageText)) {
+            return pageError(objection.empty() ? std::strerror(errno) : objection);
         }
-        return escaped(mOptions.htmlFile) + ": " + wrong;
+        mPage.emplace(mPageText);
+        return "";
     }
 
     std::string readSource(std::size_t index)
     {
-        LogSource source;
-        std::string error = openSource(mOptions, index, source, mErrors);
-        mSource = source.name();
-        if (!error.empty()) {
-            return mSource + ": " + error;
+        Reader reader(mBuilder);
+        const bool opened = reader.open(mOptions, index, mErrors);
+        mSource = reader.source().name();
+        while (opened && reader.readBlock()) {
         }
-        LogParser parser(mBuilder);
-        Reader reader(source, parser);
-        while (reader.readBlock()) {
-        }
-        reader.finish();
+        std::string error = reader.finish(opened);
         mBuilder.sourceEnds();
-        mLines += parser.lines();
+        mLines += reader.lines();
         mBytes += reader.bytes();
-        error = reader.error();
-        if (const int code = source.close(error.empty()); error.empty() && code != 0) {
-            error = journalText(code);
-        }
-        if (error.empty() && parser.records() == 0) {
-            error = noRecordText(parser, mOptions.journal);
-        }
-        return error.empty() ? "" : mSource + ": " + error;
+        return error;
     }
 
     void take(Run& run)
@@ -395,7 +361,7 @@ private:
     std::ostream& mErrors;
     Printer mPrinter;
     RunBuilder mBuilder;
-    std::unique_ptr<NewFile> mFile;
+    std::fstream mPageText;
     std::optional<HtmlPage> mPage;
     std::string mSource;
     std::optional<Run> mLast;
@@ -417,14 +383,14 @@ bool awaitMore(const LogSource& source, int time)
 /// Reads all that is there by now. A file's end is the end for now; a pipe ends when nobody writes into it any more.
 ///
 /// @return false when nothing more can come
-bool readWhatIsThere(Reader& reader, const LogSource& source)
+bool readWhatIsThere(Reader& reader)
 {
-    if (source.isRegularFile()) {
+    if (reader.source().isRegularFile()) {
         while (reader.readBlock()) {
         }
         return true;
     }
-    while (awaitMore(source, 0)) {
+    while (awaitMore(reader.source(), 0)) {
         if (!reader.readBlock()) {
             return false;
         }
@@ -433,29 +399,18 @@ bool readWhatIsThere(Reader& reader, const LogSource& source)
 }
 
 /// Reads the earlier runs, which a journal hands out with little pauses. As readWhatIsThere() otherwise.
-bool readEarlierRuns(Reader& reader, const LogSource& source)
+bool readEarlierRuns(Reader& reader)
 {
     const std::int64_t end = localNow() + settleTime;
-    while (readWhatIsThere(reader, source)) {
-        if (source.isRegularFile() || localNow() > end || !awaitMore(source, pollTime)) {
+    while (readWhatIsThere(reader)) {
+        if (reader.source().isRegularFile() || localNow() > end || !awaitMore(reader.source(), pollTime)) {
             return true;
         }
     }
     return false;
 }
 
-/// What is wrong with a file that others write to, in words; empty for nothing.
-std::string changeOf(const LogSource& source, const Reader& reader)
-{
-    struct stat state = {};
-    if (fstat(source.descriptor(), &state) == 0 && S_ISREG(state.st_mode) &&
-        static_cast<std::uint64_t>(state.st_size) < reader.bytes()) {
-        return reader.position() + "the file was made shorter while it was read; start again";
-    }
-    return reader.error();
-}
-
-int followLast(LogSource& source, const LogOptions& options, std::ostream& out, std::ostream& err)
+int followLast(const LogOptions& options, std::ostream& out, std::ostream& err)
 {
     Follower follower(options.json, options.terminal, out);
     LogStatus status = LOG_UNREADABLE;
@@ -464,33 +419,28 @@ int followLast(LogSource& source, const LogOptions& options, std::ostream& out, 
         follower.runComplete(run);
         status = wentWell(run) ? LOG_WENT_WELL : LOG_WENT_WRONG;
     });
-    LogParser parser(builder);
-    Reader reader(source, parser);
-    reader.expectOldestFirst();
-    std::string error;
-
-    bool open = readEarlierRuns(reader, source);
-    while (true) {
-        error = changeOf(source, reader);
-        if (!open) {
-            reader.finish();
-        }
+    Reader reader(builder);
+    bool open = reader.open(options, 0, err);
+    const bool opened = open;
+    if (opened) {
+        reader.expectOldestFirst();
+        open = readEarlierRuns(reader);
+    }
+    while (open && reader.isGood()) {
         follower.show(builder.current(), localNow());
-        if (!open || !error.empty() || follower.ended()) {
+        if (follower.ended()) {
             break;
         }
-        awaitMore(source, pollTime);
-        open = readWhatIsThere(reader, source);
+        awaitMore(reader.source(), pollTime);
+        open = readWhatIsThere(reader);
+    }
+    const std::string error = reader.finish(!open);
+    if (opened && !open) {
+        follower.show(builder.current(), localNow());
     }
     builder.finish();
-    const int code = source.close(!open && error.empty());
-    if (error.empty() && code != 0) {
-        error = journalText(code);
-    } else if (error.empty() && parser.records() == 0) {
-        error = noRecordText(parser, options.journal);
-    }
     if (!error.empty()) {
-        err << "harl-updater-tool: " << source.name() << ": " << error << '\n';
+        err << "harl-updater-tool: " << error << '\n';
         return LOG_UNREADABLE;
     }
     return status;
@@ -517,14 +467,5 @@ std::string conflictIn(const LogOptions& options)
 
 int runLog(const LogOptions& options, std::ostream& out, std::ostream& err)
 {
-    if (!options.follow) {
-        return Explanation(options, out, err).run();
-    }
-    LogSource source;
-    const std::string wrong = openSource(options, 0, source, err);
-    if (!wrong.empty()) {
-        err << "harl-updater-tool: " << source.name() << ": " << wrong << '\n';
-        return LOG_UNREADABLE;
-    }
-    return followLast(source, options, out, err);
+    return options.follow ? followLast(options, out, err) : Explanation(options, out, err).run();
 }

@@ -1,12 +1,10 @@
 #include "log/source.h"
 
-#include "command.h"
 #include "findings.h"
 
 #include <array>
 #include <cerrno>
 #include <csignal>
-#include <cstdlib>
 #include <cstring>
 #include <vector>
 
@@ -33,11 +31,6 @@ std::string LogSource::openFile(const std::string& path)
 std::string LogSource::openJournal(bool follow)
 {
     mName = "the journal of harl-updater";
-    const char* searchPath = std::getenv("PATH");
-    const std::string program = findProgram("journalctl", searchPath == nullptr ? "/usr/bin:/bin" : searchPath);
-    if (program.empty()) {
-        return "journalctl is not on the search path. On a machine without it, give the log as a file.";
-    }
     std::array<int, 2> ends = {-1, -1};
     if (pipe2(ends.data(), O_CLOEXEC) != 0) {
         return std::strerror(errno);
@@ -56,15 +49,16 @@ std::string LogSource::openJournal(bool follow)
     posix_spawn_file_actions_t actions;
     posix_spawn_file_actions_init(&actions);
     posix_spawn_file_actions_adddup2(&actions, writeEnd.number(), STDOUT_FILENO);
-    const int error = posix_spawn(&mJournal, program.c_str(), &actions, nullptr,
-                                  const_cast<char* const*>(arguments.data()), // not changed, posix_spawn(3)
-                                  environ);
+    const int error = posix_spawnp(&mJournal, arguments.front(), &actions, nullptr,
+                                   const_cast<char* const*>(arguments.data()), // not changed, posix_spawn(3)
+                                   environ);
     posix_spawn_file_actions_destroy(&actions);
-    if (error != 0) {
-        mJournal = -1;
-        return "journalctl cannot be run: " + std::string(std::strerror(error));
+    if (error == 0) {
+        return "";
     }
-    return "";
+    mJournal = -1;
+    return error == ENOENT ? "journalctl is not on the search path. On a machine without it, give the log as a file."
+                           : "journalctl cannot be run: " + std::string(std::strerror(error));
 }
 
 bool LogSource::isRegularFile() const

@@ -1,5 +1,4 @@
 #include "check/check.h"
-#include "check/verify.h"
 #include "findings.h"
 #include "log/catalogue.h"
 #include "log/log_command.h"
@@ -82,7 +81,8 @@ int run(std::vector<std::string> arguments)
     CLI::App app("Answers what a technician asks before and after an update. It never changes the updater.",
                  "harl-updater-tool");
     app.require_subcommand(1);
-    app.set_version_flag("-V,--version", "harl-updater-tool " VERSION, "Print the program's name and version and exit");
+    app.set_version_flag("-V,--version", "harl-updater-tool " TOOL_VERSION,
+                         "Print the program's name and version and exit");
 
     std::string stickPath = stickMountPoint;
     bool json = false;

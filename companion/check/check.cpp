@@ -1,15 +1,21 @@
 #include "check/check.h"
 
 #include "findings.h"
+#include "log/run.h"
 #include "procedure.h"
 #include "stick/stick_check.h"
+#include "unit/packages.h"
 #include "unit/unit_check.h"
 
 #include <cstring>
+#include <filesystem>
 #include <ostream>
+#include <sstream>
 
 namespace
 {
+
+const auto filesLimit = 120s; // dpkg(1) reads every file of the package
 
 /// "1.2.0 -> 1.3.0, would be installed"
 std::string plan(const std::string& installed, const std::string& candidate)
@@ -35,6 +41,108 @@ void addPlans(const Unit& unit, Report& report)
     if (unit.isMainHead() && installs) {
         report.add("update-offered");
     }
+}
+
+/// Checks the package's files against the database. Changed configuration files are the technician's own.
+void checkFiles(const Unit& unit, Report& report)
+{
+    const CommandResult files = unit.run({"dpkg", "--verify", unit.package()}, filesLimit);
+    if (!files.started || files.timedOut || (files.exitCode != 0 && files.output.empty())) {
+        report.add("package-files.unknown", {{"complaint", complaint(files)}});
+        return;
+    }
+    std::vector<std::string> wrong;
+    for (const std::string& line : linesOf(files.output)) { // "??5??????   /path", with c before a configuration file's
+        const std::size_t path = line.find('/');
+        if (path != std::string::npos && path > 2 && line.substr(path - 2, 2) != "c ") {
+            wrong.push_back(line.substr(path));
+        }
+    }
+    if (!wrong.empty()) {
+        report.add("package-files", {{"files", listed(wrong)}});
+    }
+}
+
+/// Looks for configuration files that the package brought and that were not put in place of changed ones.
+void checkConfiguration(const Unit& unit, Report& report)
+{
+    const CommandResult list =
+        unit.run({"dpkg-query", "--show", "--showformat=${Conffiles}\\n", unit.package()}, quick);
+    std::vector<std::string> kept;
+    for (const std::string& line : linesOf(list.output)) { // " /etc/file checksum"
+        std::istringstream words(line);
+        std::string path;
+        if (words >> path && path.front() == '/' && std::filesystem::exists(unit.path(path + ".dpkg-dist"))) {
+            kept.push_back(path);
+        }
+    }
+    if (!kept.empty()) {
+        report.add("configuration-kept", {{"files", listed(kept)}});
+    }
+}
+
+/// The last run in the journal; without a step when there is none.
+Run lastRun(const Unit& unit)
+{
+    const CommandResult journal = unit.run(
+        {"journalctl", "--unit=harl-updater", "--output=short-iso", "--all", "--quiet", "--no-pager", "--lines=1500"},
+        quick);
+    Run last;
+    RunBuilder builder([&](Run& run) { last = run; });
+    LogParser parser(builder);
+    parser.feed(journal.output);
+    parser.finish();
+    builder.finish();
+    return last;
+}
+
+/// Compares a version with the one that the last run was to leave.
+void checkVersion(const char* check, const std::string& found, const Versions& versions, Report& report)
+{
+    const std::string& wanted = versions.differ() ? versions.candidate : versions.installed;
+    if (!found.empty() && versions.found() && !wanted.empty() && found != wanted) {
+        report.add(check, {{"found", shown(found)}, {"wanted", shown(wanted)}});
+    }
+}
+
+void checkVersions(const Unit& unit, Report& report)
+{
+    const Run run = lastRun(unit);
+    const CommandResult package = unit.run({"dpkg-query", "--show", "--showformat=${Version}", unit.package()}, quick);
+    const std::string installed = escaped(package.output);
+    if (package.succeeded()) {
+        report.addFact("package_installed", "Package installed", installed);
+    }
+    checkBoard(unit, report);
+    if (run.steps.empty()) {
+        report.add("last-run");
+        return;
+    }
+    checkVersion("package-version", installed, run.package, report);
+    checkVersion("board-version-old", report.fact("board_version"), run.board, report);
+}
+
+void checkApplication(const Unit& unit, Report& report)
+{
+    const std::string state = unit.property("harl", "ActiveState");
+    if (state != "active") {
+        report.add(state.empty() ? "application.unknown" : "application", {{"state", shown(state)}});
+    }
+}
+
+/// The line for the journal.
+std::string recordOf(const Report& report)
+{
+    const bool bad = report.status() == Report::STATUS_NOT_FIT;
+    std::string names;
+    for (const Finding& finding : report.findings()) {
+        if (finding.severity == (bad ? Severity::ERROR : Severity::UNCHECKED)) {
+            names += (names.empty() ? "" : ", ") + finding.check;
+        }
+    }
+    return "verify: " + (bad             ? "the unit is not well: " + names
+                         : names.empty() ? "the unit is well"
+                                         : "not everything could be checked: " + names);
 }
 
 } // namespace
@@ -64,5 +172,23 @@ int runCheck(const std::string& path, bool json, const UnitSite& site, std::ostr
         report.add("not-a-unit");
     }
     report.write(json, out);
+    return report.status();
+}
+
+int runVerify(const VerifyOptions& options, const UnitSite& site, std::ostream& out)
+{
+    const Unit unit(site);
+    Report report("verify", "The unit", "well");
+    unit.defineTexts(report);
+    checkApplication(unit, report);
+    checkUnfinishedWork(unit, report);
+    checkFiles(unit, report);
+    checkConfiguration(unit, report);
+    checkVersions(unit, report);
+    if (options.record) {
+        out << recordOf(report) << '\n';
+    } else {
+        report.write(options.json, out);
+    }
     return report.status();
 }

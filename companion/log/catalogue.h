@@ -1,6 +1,6 @@
 #pragma once
 
-#include "log/step.h"
+#include "log/vocabulary.h"
 
 #include <iosfwd>
 #include <string>

@@ -2,7 +2,6 @@
 
 #include "log/catalogue.h"
 #include "log/parser.h"
-#include "log/vocabulary.h"
 
 #include <bitset>
 #include <cstdint>

@@ -1,12 +1,13 @@
 #include "log/text.h"
 
 #include "findings.h"
-#include "log/status.h"
 #include "procedure.h"
 
 #include <algorithm>
 #include <array>
+#include <csignal>
 #include <cstdio>
+#include <cstring>
 #include <ctime>
 #include <ostream>
 #include <sstream>
@@ -50,6 +51,29 @@ std::string formattedTime(std::int64_t time, const char* format)
     gmtime_r(&seconds, &parts); // the log's local time is kept as if it were UTC
     std::array<char, 64> buffer{};
     return {buffer.data(), std::strftime(buffer.data(), buffer.size(), format, &parts)};
+}
+
+/// "signal 9 (SIGKILL)"
+std::string signalText(int signal)
+{
+    const char* name = sigabbrev_np(signal);
+    std::string text = "signal " + std::to_string(signal);
+    return name == nullptr ? text : text + " (SIG" + name + ')';
+}
+
+std::string exitCodeText(long code)
+{
+    std::string text = "exit " + std::to_string(code);
+    if (code == 126) {
+        return text + " (command cannot be run)";
+    }
+    if (code == 127) {
+        return text + " (command not found)";
+    }
+    if (code > 128 && code <= 128 + SIGRTMAX) {
+        return text + " (killed by " + signalText(static_cast<int>(code) - 128) + ')';
+    }
+    return text;
 }
 
 void printSteps(const Run& run, std::ostream& out)
@@ -446,4 +470,19 @@ void printRun(const Run& run, const std::string& source, std::ostream& out)
             printWrapped("  - ", text, out);
         }
     }
+}
+
+std::string statusText(const CommandStatus& status)
+{
+    if (!status.raw) {
+        return exitCodeText(status.number);
+    }
+    if (status.lost()) {
+        return "its status is not available";
+    }
+    if (status.number < 0 || status.number > 0xFFFF) {
+        return std::to_string(status.number) + " (no wait status)";
+    }
+    const int signal = static_cast<int>(status.number & 0x7F);
+    return signal != 0 ? "killed by " + signalText(signal) : exitCodeText(status.number >> 8);
 }

@@ -2,7 +2,6 @@
 
 #include "procedure.h"
 #include "stick/archive.h"
-#include "stick/script.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -12,6 +11,8 @@
 #include <ostream>
 #include <utility>
 #include <vector>
+
+#include <sys/stat.h>
 
 namespace
 {
@@ -72,6 +73,16 @@ std::size_t readAt(int descriptor, std::uint64_t offset, char* buffer, std::size
         done += static_cast<std::size_t>(count);
     }
     return done;
+}
+
+const std::size_t firstLineBytes = 255; // what the kernel reads of it, execve(2)
+
+/// The interpreter that `line` names behind its "#!".
+std::string_view interpreterOf(std::string_view line)
+{
+    line.remove_prefix(std::min<std::size_t>(line.size(), 2));
+    line.remove_prefix(std::min(line.find_first_not_of(" \t"), line.size()));
+    return line.substr(0, line.find_first_of(" \t"));
 }
 
 /// The stick check: each operation adds to the report what it finds.
@@ -422,4 +433,52 @@ std::string checkVersionName(const std::string& name, Report& report)
                    {{"prefix", shown(line.substr(0, versionPrefixLength))}, {"version", shown(version)}});
     }
     return version;
+}
+
+void checkScript(std::string_view start, std::uint64_t size, const std::string& name, Report& report)
+{
+    if (start.substr(0, 4) == std::string_view("\x7f"
+                                               "ELF")) {
+        report.addFact("script_interpreter", "Script", byteCount(size) + ", a compiled program", nullptr);
+        return;
+    }
+    const std::string_view firstLine = start.substr(0, start.find('\n'));
+    const Values values = {
+        {"name", name}, {"start", shown(firstLine.substr(0, 60))}, {"interpreter", shown(interpreterOf(firstLine))}};
+    const bool names = firstLine.substr(0, 2) == "#!";
+    if (names && firstLine.find('\r') != std::string_view::npos) {
+        report.add("script-first-line.windows", values);
+        return;
+    }
+    if (names && (interpreterOf(firstLine).substr(0, 1) != "/" || firstLine.size() > firstLineBytes ||
+                  firstLine.find('\0') != std::string_view::npos)) {
+        report.add("script-first-line.interpreter", values);
+        return;
+    }
+    if (names) {
+        report.addFact("script_interpreter", "Script", byteCount(size) + ", run by " + shown(interpreterOf(firstLine)),
+                       escaped(interpreterOf(firstLine)));
+    } else {
+        report.add("script-first-line", values);
+    }
+
+    // Behind a zero byte a script carries data, not lines.
+    const std::string_view text = start.substr(0, start.find('\0'));
+    const std::size_t carriageReturn = text.find("\r\n");
+    if (carriageReturn == std::string_view::npos) {
+        return;
+    }
+    const auto line = 1 + std::count(text.begin(), text.begin() + static_cast<std::ptrdiff_t>(carriageReturn), '\n');
+    report.add("script-line-ends", {{"name", name}, {"line", std::to_string(line)}});
+}
+
+void checkRunBit(mode_t mode, bool keepsPermissions, bool onUnit, const std::string& name, Report& report)
+{
+    if ((mode & (S_IXUSR | S_IXGRP | S_IXOTH)) != 0) {
+        return;
+    }
+    report.add(keepsPermissions ? "script-run-bit"
+               : onUnit         ? "script-run-bit.mount"
+                                : "script-run-bit.elsewhere",
+               {{"name", name}});
 }

@@ -16,6 +16,9 @@ struct UnitOptions
 /// The check itself: adds to `report` what it finds.
 void checkUnit(const Unit& unit, Report& report);
 
+/// Asks the board for its version as the updater does: the fact "board_version", or what is wrong.
+void checkBoard(const Unit& unit, Report& report);
+
 /// Checks whether the unit is fit for an update, and prints the report to `out`.
 ///
 /// Starts no service and lights no LED; writes only a temporary folder, which it removes, and what the package tool

@@ -1,5 +1,3 @@
-#include "check/verify.h"
-
 #include "check/check.h"
 #include "findings.h"
 #include "unit/standin.h"

@@ -1,4 +1,4 @@
-#include "stick/script.h"
+#include "stick/stick_check.h"
 
 #include "finding_lines.h"
 

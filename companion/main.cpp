@@ -45,7 +45,7 @@ std::string usageText(const CLI::App& app, const CLI::ParseError& error)
     const std::vector<CLI::App*> parsed = app.get_subcommands();
     const std::vector<std::string> rest = app.remaining(true);
     if (parsed.empty() && rest.empty()) {
-        return "Name a command: stick, unit, check, verify, log or explain.";
+        return "Name a command: stick, unit, check, verify, log, explain or report.";
     }
     if (parsed.empty()) {
         std::string text = rest.front() + " is not a command.";
@@ -134,6 +134,13 @@ int run(std::vector<std::string> arguments)
     explain->add_flag("--json", json, "print one JSON object");
     explain->footer("Exit status: 0, 2 wrong usage or no such name.\n");
 
+    ReportOptions reportOptions;
+    reportOptions.stick = stickMountPoint;
+    CLI::App* report = app.add_subcommand("report", "Pack what support needs into one archive. Run it as root.");
+    report->add_option("FILE", reportOptions.file, "the archive to make, such as /tmp/report.tar.gz")->required();
+    report->add_flag("--json", json, "print one JSON object");
+    report->footer("Exit status: 0, 2 wrong usage or the archive cannot be made.\n");
+
     if (!arguments.empty() && arguments.front() == "help") { // "help log" is "log --help"
         arguments.erase(arguments.begin());
         arguments.resize(std::min<std::size_t>(arguments.size(), 1));
@@ -166,6 +173,10 @@ int run(std::vector<std::string> arguments)
     }
     if (check->parsed()) {
         return runCheck(checkPath, json, thisUnit(), std::cout, std::cerr);
+    }
+    if (report->parsed()) {
+        reportOptions.json = json;
+        return runReport(reportOptions, thisUnit(), std::cout, std::cerr);
     }
     if (verify->parsed()) {
         verifyOptions.json = json;

@@ -30,9 +30,11 @@ std::string plan(const std::string& installed, const std::string& candidate)
 void addPlans(const Unit& unit, Report& report)
 {
     const std::string board = plan(report.fact("board_version"), report.fact("version"));
-    report.addFact("package_plan", "Package",
-                   plan(report.fact("package_installed"), report.fact("package_candidate")) +
-                       " as of the last refresh");
+    const std::string candidate = candidateNow(unit, report);
+    report.addFact(
+        "package_plan", "Package",
+        plan(report.fact("package_installed"), candidate.empty() ? report.fact("package_candidate") : candidate) +
+            (candidate.empty() ? ", as of the last refresh" : ""));
     report.addFact("board_plan", "Board", board);
     const bool installs = board.find("would be installed") != std::string::npos;
     const std::int64_t seconds = outcomeWait + giveBackWait + (installs ? boardWait : 0);
@@ -84,13 +86,10 @@ void checkConfiguration(const Unit& unit, Report& report)
 /// The last run in the journal; without a step when there is none.
 Run lastRun(const Unit& unit)
 {
-    const CommandResult journal = unit.run(
-        {"journalctl", "--unit=harl-updater", "--output=short-iso", "--all", "--quiet", "--no-pager", "--lines=1500"},
-        quick);
     Run last;
     RunBuilder builder([&](Run& run) { last = run; });
     LogParser parser(builder);
-    parser.feed(journal.output);
+    parser.feed(unit.journal());
     parser.finish();
     builder.finish();
     return last;
@@ -178,6 +177,9 @@ int runCheck(const std::string& path, bool json, const UnitSite& site, std::ostr
 int runVerify(const VerifyOptions& options, const UnitSite& site, std::ostream& out)
 {
     const Unit unit(site);
+    if (options.record && unit.updaterRuns()) {
+        return Report::STATUS_UNCHECKED; // the next run has begun; its end is verified
+    }
     Report report("verify", "The unit", "well");
     unit.defineTexts(report);
     checkApplication(unit, report);

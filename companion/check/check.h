@@ -12,6 +12,19 @@
 /// @return a Report::Status; also STATUS_UNCHECKED, with a message on `errors`, when there is no stick to read
 int runCheck(const std::string& path, bool json, const UnitSite& site, std::ostream& out, std::ostream& errors);
 
+struct ReportOptions
+{
+    std::string file;  ///< the archive, which must not be there yet
+    std::string stick; ///< where a stick may be plugged in
+    bool json = false;
+};
+
+/// Packs what support needs into one archive (tar, gzip): the journal's runs, what the checks say, versions, clock and
+/// the package database's state; no secrets. A README.txt in it says what is left out.
+///
+/// @return a Report::Status: STATUS_FIT, or STATUS_UNCHECKED with a message on `errors` and no file
+int runReport(const ReportOptions& options, const UnitSite& site, std::ostream& out, std::ostream& errors);
+
 struct VerifyOptions
 {
     bool json = false;

@@ -18,7 +18,8 @@ struct ParsedRecord
     bool cut = false;                        ///< The log ends in the message, which may lack its end.
 };
 
-/// Takes what a LogParser finds, in the order of the log.
+/// Takes what a LogParser finds, in the order of the log; but that a head has no message is known only behind lines of
+/// others, so its record comes after them.
 class LogSink
 {
 public:

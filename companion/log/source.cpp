@@ -39,9 +39,14 @@ std::string LogSource::openJournal(bool follow)
     const Descriptor writeEnd(ends[1]);
 
     // All entries, with their times and programs; --all keeps tabs as they are.
-    std::vector<const char*> arguments = {
-        "journalctl", "--unit=harl-updater", "--unit=harl-updater-give-back", "--output=short-iso", "--all",
-        "--quiet",    "--no-pager"};
+    std::vector<const char*> arguments = {"journalctl",
+                                          "--unit=harl-updater",
+                                          "--unit=harl-updater-give-back",
+                                          "--unit=harl-updater-verify",
+                                          "--output=short-iso",
+                                          "--all",
+                                          "--quiet",
+                                          "--no-pager"};
     if (follow) {
         arguments.insert(arguments.end(), {"--follow", "--no-tail"});
     }

@@ -2,6 +2,7 @@
 
 #include "findings.h"
 
+#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
@@ -33,7 +34,9 @@ Unit::Unit(const UnitSite& site) : mSite(site)
 {
     mEnvironment["PATH"] = site.searchPath;
     const CommandResult services =
-        run({"systemctl", "show", "--property=Id,LoadState,ActiveState,Environment", "harl", "harl-updater"}, quick);
+        run({"systemctl", "show", "--property=Id,LoadState,ActiveState,Environment,NeedDaemonReload", "harl",
+             "harl-updater"},
+            quick);
     mServicesKnown = services.succeeded();
     takeServices(services.output);
     // A service has the manager's variables and, over them, its own.
@@ -82,6 +85,14 @@ std::string Unit::property(const std::string& service, const std::string& name) 
     }
     const auto value = properties->second.find(name);
     return value == properties->second.end() ? "" : value->second;
+}
+
+std::string Unit::journal() const
+{
+    return run({"journalctl", "--unit=harl-updater", "--unit=harl-updater-give-back", "--unit=harl-updater-verify",
+                "--output=short-iso", "--all", "--quiet", "--no-pager", "--lines=1000"},
+               quick)
+        .output;
 }
 
 bool Unit::updaterRuns() const
@@ -134,6 +145,19 @@ bool Unit::isInstalled(const std::string& package) const
 {
     const std::string state = run({"dpkg-query", "--show", "--showformat=${db:Status-Status}", package}, quick).output;
     return !state.empty() && state != "not-installed" && state != "config-files";
+}
+
+TemporaryFolder::TemporaryFolder(const Unit& unit) : mPath(unit.path("/tmp/harl-updater-tool-XXXXXX"))
+{
+    if (mkdtemp(mPath.data()) == nullptr) {
+        mPath.clear();
+    }
+}
+
+TemporaryFolder::~TemporaryFolder()
+{
+    std::error_code error;
+    std::filesystem::remove_all(mPath, error);
 }
 
 std::vector<std::string> linesOf(const std::string& text)

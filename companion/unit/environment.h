@@ -71,6 +71,9 @@ public:
     /// A property of a service, systemctl(1), such as "ActiveState"; empty when it is not known.
     std::string property(const std::string& service, const std::string& name) const;
 
+    /// The journal of the update's services, as far as it is kept of a command's output.
+    std::string journal() const;
+
     /// True when the updater runs, as its service or started by hand.
     bool updaterRuns() const;
 
@@ -84,6 +87,23 @@ private:
     std::map<std::string, std::map<std::string, std::string>> mServices;
     bool mServicesKnown = false;
     bool mMainHead = false;
+};
+
+/// A folder for a while; nothing is left of it when the program is ended before.
+class TemporaryFolder
+{
+public:
+    explicit TemporaryFolder(const Unit& unit);
+    ~TemporaryFolder();
+    TemporaryFolder(const TemporaryFolder&) = delete;
+    TemporaryFolder& operator=(const TemporaryFolder&) = delete;
+
+    /// Empty, and errno tells why, when it cannot be made.
+    const std::string& path() const { return mPath; }
+
+private:
+    HeldSignals mSignals;
+    std::string mPath;
 };
 
 // What the checks need to judge commands and files

@@ -3,6 +3,7 @@
 #include "descriptor.h"
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
@@ -16,35 +17,10 @@
 namespace
 {
 
+const auto refreshLimit = 120s;
 const auto mirrorLimit = 15s; // for all mirrors together
 const std::size_t mostAddresses = 32;
 const std::uint64_t littleSpace = 100'000'000; // bytes
-
-/// A folder for a while; nothing is left of it when the program is ended before.
-class TemporaryFolder
-{
-public:
-    explicit TemporaryFolder(const Unit& unit) : mPath(unit.path("/tmp/harl-updater-tool-XXXXXX"))
-    {
-        if (mkdtemp(mPath.data()) == nullptr) {
-            mPath.clear();
-        }
-    }
-    ~TemporaryFolder()
-    {
-        std::error_code error;
-        std::filesystem::remove_all(mPath, error);
-    }
-    TemporaryFolder(const TemporaryFolder&) = delete;
-    TemporaryFolder& operator=(const TemporaryFolder&) = delete;
-
-    /// Empty, and errno tells why, when it cannot be made.
-    const std::string& path() const { return mPath; }
-
-private:
-    HeldSignals mSignals;
-    std::string mPath;
-};
 
 void checkLocks(const Unit& unit, Report& report)
 {
@@ -113,6 +89,23 @@ void checkPolicy(const Unit& unit, Report& report)
                    escaped(candidate));
     if (candidate == "(none)") {
         report.add("package-not-offered");
+    }
+}
+
+/// Looks for settings in /etc/apt that contradict the service's own (service/apt-last.conf).
+void checkSettings(const Unit& unit, Report& report)
+{
+    static const std::array<const char*, 4> contradicting = {
+        R"(DPkg::Options:: "--force-confnew";)", R"(DPkg::Options:: "--force-confask";)",
+        R"(APT::Update::Error-Mode "any";)", R"(Binary::apt::APT::Update::Error-Mode "any";)"};
+    std::vector<std::string> found;
+    for (const std::string& line : linesOf(unit.run({"apt-config", "dump"}, quick).output)) {
+        if (std::find(contradicting.begin(), contradicting.end(), line) != contradicting.end()) {
+            found.push_back(line);
+        }
+    }
+    if (!found.empty()) {
+        report.add("apt-settings", {{"settings", listed(found)}});
     }
 }
 
@@ -229,8 +222,38 @@ void checkPackageManager(const Unit& unit, Report& report)
     checkLocks(unit, report);
     checkUnfinishedWork(unit, report);
     checkPolicy(unit, report);
+    checkSettings(unit, report);
     checkSpace(unit, report);
     checkMirrors(unit, report);
+}
+
+std::string candidateNow(const Unit& unit, Report& report)
+{
+    const TemporaryFolder folder(unit);
+    std::error_code error;
+    if (folder.path().empty() || !std::filesystem::create_directories(folder.path() + "/lists/partial", error)) {
+        report.add("mirrors-unknown.folder", {{"error", errorText(errno)}});
+        return "";
+    }
+    const auto privately = [&](const char* tool, const std::vector<std::string>& command) {
+        std::vector<std::string> arguments = {tool};
+        for (const std::string& option :
+             {"Dir::State::lists=" + folder.path() + "/lists", "Dir::Cache=" + folder.path(),
+              std::string("APT::Sandbox::User=root"), std::string("Acquire::Retries=0"),
+              std::string("Acquire::http::Timeout=20"), std::string("Acquire::https::Timeout=20")}) {
+            arguments.insert(arguments.end(), {"-o", option});
+        }
+        arguments.insert(arguments.end(), command.begin(), command.end());
+        return unit.run(arguments, refreshLimit);
+    };
+    const CommandResult refresh = privately("apt-get", {"update"});
+    if (!refresh.succeeded() || contains(refresh.errors, "Failed to fetch")) {
+        report.add(refresh.started ? "refresh-fails" : "mirrors-unreadable.unknown",
+                   {{"complaint", complaint(refresh)}});
+        return "";
+    }
+    const std::string policy = privately("apt-cache", {"policy", unit.package()}).output;
+    return escaped(valueAfter(policy, "Candidate: "));
 }
 
 void checkFreeSpace(const struct statvfs& system, std::uint64_t needed, Report& report)

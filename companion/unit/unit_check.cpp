@@ -7,11 +7,14 @@
 #include "unit/wave.h"
 
 #include <cerrno>
+#include <ctime>
 #include <filesystem>
 #include <fstream>
 #include <ostream>
 #include <system_error>
 #include <utility>
+
+#include <sys/stat.h>
 
 namespace
 {
@@ -47,6 +50,8 @@ public:
                         (mUnit.isMainHead() ? "main head, package " : "remote head, package ") + shown(mUnit.package()),
                         mUnit.isMainHead() ? "main" : "remote");
         checkServices();
+        checkJournal();
+        checkClock();
         checkTools();
         if (!mUnit.isMainHead()) {
             checkPanel();
@@ -74,7 +79,28 @@ private:
         if (state != "loaded") {
             mReport.add("service-not-loaded." + service, {{"state", shown(state)}});
         }
+        if (mUnit.property(service, "NeedDaemonReload") == "yes") {
+            mReport.add("service-not-reloaded", {{"service", shown(service)}});
+        }
         mReport.addFact(fact, "Service " + service, escaped(mUnit.property(service, "ActiveState")));
+    }
+
+    /// Without its folder the journal is kept in memory, journald.conf(5).
+    void checkJournal()
+    {
+        if (!std::filesystem::exists(mUnit.path("/var/log/journal"))) {
+            mReport.add("journal-volatile");
+        }
+    }
+
+    /// The package tools keep the time at which the updater was built.
+    void checkClock()
+    {
+        struct stat updater = {};
+        if (stat(mUnit.path("/usr/sbin/harl-updater").c_str(), &updater) == 0 &&
+            std::time(nullptr) < updater.st_mtime) {
+            mReport.add("clock-behind");
+        }
     }
 
     void checkTools()

@@ -46,6 +46,7 @@ class Schema(unittest.TestCase):
     def test_sticks_and_catalogue(self) -> None:
         with tempfile.TemporaryDirectory() as folder:
             self.expect_valid("stick", "--json", folder)
+            self.expect_valid("report", "--json", f"{folder}/none/report.tar.gz")
         self.expect_valid("stick", "--json", "/nonexistent")
         self.expect_valid("check", "--json", "/nonexistent")
         self.expect_valid("explain", "--json")

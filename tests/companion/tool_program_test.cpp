@@ -74,7 +74,7 @@ TEST_F(ToolProgram, UnknownSubcommandIsNamed)
 {
     EXPECT_THAT(tool({"stik"}).errors, HasSubstr("harl-updater-tool: stik is not a command. Did you mean stick?"));
     EXPECT_THAT(tool({"nonsense"}).errors, HasSubstr("harl-updater-tool: nonsense is not a command. See: "));
-    EXPECT_THAT(tool({}).errors, HasSubstr("Name a command: stick, unit, check, verify, log or explain."));
+    EXPECT_THAT(tool({}).errors, HasSubstr("Name a command: stick, unit, check, verify, log, explain or report."));
 }
 
 TEST_F(ToolProgram, WrongUsageIsAnObjectForPrograms)

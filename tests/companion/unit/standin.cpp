@@ -91,6 +91,7 @@ StandInUnit::StandInUnit()
     folder.makeLink("root/usr/lib/apt/apt-helper", UNIT_STANDINS);
     folder.makeLink("root/usr/lib/settings", "../../../settings");
     folder.makeFolder("root/tmp");
+    folder.makeFolder("root/var/log/journal");
     for (const char* file : {"dev/i2c-0", "var/lib/apt/lists/lock", "var/lib/dpkg/lock-frontend", "var/lib/dpkg/lock",
                              "var/cache/apt/archives/lock"}) {
         put(file, "");

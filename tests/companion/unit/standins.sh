@@ -89,13 +89,14 @@ dpkg_query() {
 }
 
 apt_cache() {
+    while [ "$1" = -o ]; do shift 2; done
     case $1 in
     policy)
         if known "$2"; then
             printf '%s:\n  Installed: %s\n  Candidate: %s\n  Version table:\n' \
                 "$package" "$PACKAGE_INSTALLED" "$PACKAGE_OFFERED"
         fi
-        printf 'apt:\n  Installed: 2.6.1\n  Candidate: 2.6.1\n  Version table:\n'
+        [ "${3-}" != apt ] || printf 'apt:\n  Installed: 2.6.1\n  Candidate: 2.6.1\n  Version table:\n'
         ;;
     show)
         known "$3" || fail 100 "E: No packages found"

@@ -166,6 +166,32 @@ INSTANTIATE_TEST_SUITE_P(
                            unit.folder.path("root/usr/lib/apt/apt-helper"));
             },
             Lines{"warning mirror-index"}},
+        Fault{"VolatileJournalIsAWarning", [](StandInUnit& unit) { unit.remove("var/log/journal"); },
+              Lines{"warning journal-volatile"}},
+        Fault{"ClockBehindTheUpdaterIsAnError",
+              [](StandInUnit& unit) {
+                  unit.put("usr/sbin/harl-updater", "");
+                  fs::last_write_time(unit.folder.path("root/usr/sbin/harl-updater"),
+                                      fs::file_time_type::clock::now() + std::chrono::hours(24));
+              },
+              Lines{"error clock-behind"}},
+        Fault{"ServiceThatWasNotReloadedIsAWarning",
+              [](StandInUnit& unit) {
+                  unit.replaceTool("systemctl",
+                                   "printf 'Id=harl.service\\nLoadState=loaded\\n\\n"
+                                   "Id=harl-updater.service\\nLoadState=loaded\\nNeedDaemonReload=yes\\n'");
+              },
+              Lines{"warning service-not-reloaded"}},
+        Fault{"AptSettingsAgainstTheServicesAreAWarning",
+              [](StandInUnit& unit) { unit.replaceTool("apt-config", R"(echo 'DPkg::Options:: "--force-confnew";')"); },
+              Lines{"warning apt-settings"}},
+        Fault{"NineSilentAddressesOfOneMirrorAreOneError",
+              [](StandInUnit& unit) {
+                  unit.set("MIRRORS_REFRESH", "unreachable");
+                  unit.replaceTool("apt-get",
+                                   "for n in 1 2 3 4 5 6 7 8 9; do echo \"'http://mirror.invalid/$n' $n 0 \"; done");
+              },
+              Lines{"error mirror-silent"}},
         Fault{"WithoutServiceManagerItsToolIsMissing", [](StandInUnit& unit) { unit.removeTool("systemctl"); },
               Lines{"unchecked services-unknown", "error tool-missing"}}),
     [](const auto& test) { return test.param.name; });
@@ -538,6 +564,16 @@ TEST_F(UnitCheck, MirrorsAreFetchedWithTheUpdatersTimeOut)
                 Contains(testing::AllOf(HasSubstr("Acquire::http::Timeout=2 -o Acquire::https::Timeout=2 download-file "
                                                   "http://mirror.invalid/dists/stable/InRelease "),
                                         HasSubstr("Acquire::Retries=0"))));
+}
+
+TEST_F(UnitCheck, FirstBytesOfASlowMirrorAreAnAnswer)
+{
+    unit.folder.put("root/usr/lib/apt/helper",
+                    "#!/bin/sh\nfor word; do shift; case $word in http*) printf P >\"$1\";; esac; "
+                    "done\necho 'E: Download Failed' >&2\nexit 100\n",
+                    0755);
+    fs::rename(unit.folder.path("root/usr/lib/apt/helper"), unit.folder.path("root/usr/lib/apt/apt-helper"));
+    EXPECT_EQ(findings(), Lines());
 }
 
 TEST_F(UnitCheck, SilentMirrorIsAnErrorThatExplainsTheExitStatus)

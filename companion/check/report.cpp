@@ -1,0 +1,135 @@
+#include "check/check.h"
+
+#include "descriptor.h"
+#include "findings.h"
+#include "log/log_command.h"
+#include "unit/unit_check.h"
+
+#include <cerrno>
+#include <filesystem>
+#include <fstream>
+#include <ostream>
+#include <sstream>
+
+#include <fcntl.h>
+
+namespace
+{
+
+namespace fs = std::filesystem;
+
+const auto packLimit = 120s;
+const char folderName[] = "harl-updater-report";
+const char keptLogs[] = "/var/lib/harl-updater"; // where the service keeps the runs that the journal loses
+const char readMe[] = R"(What harl-updater-tool report has gathered on this unit:
+
+journal.txt   the journal of the update's services
+log.txt       what harl-updater-tool log says of it
+kept-logs/    runs that the service has kept, where the journal is lost with the power
+unit.txt      what harl-updater-tool unit says
+check.txt     what harl-updater-tool check says, with the stick that was plugged in
+verify.txt    what harl-updater-tool verify says
+system.txt    versions, clock, services, space and the state of the package database
+
+Left out: keys, passwords, the contents of configuration files, the addresses with logins that package sources may hold,
+the journal of other services, and everything on the stick but its names.
+)";
+
+/// Commands that look something up, for system.txt.
+const std::vector<std::string> lookups[] = {
+    {"uname", "-a"},
+    {"cat", "/etc/os-release", "/etc/debian_version"},
+    {"date", "--iso-8601=seconds"},
+    {"timedatectl", "status"},
+    {"df", "-h", "/", "/var", "/tmp"},
+    {"systemctl", "--no-pager", "--lines=0", "status", "harl", "harl-updater", "harl-updater-give-back",
+     "harl-updater-verify"},
+    {"dpkg", "--audit"},
+    {"dpkg-query", "--list"},
+};
+
+/// Without what stands between "//" and "@": a login in an address.
+std::string withoutLogins(std::string text)
+{
+    for (std::size_t begin = 0; (begin = text.find("//", begin)) != std::string::npos; begin += 2) {
+        const std::size_t end = text.find_first_of("@/ \n\"'", begin + 2);
+        if (end != std::string::npos && text[end] == '@') {
+            text.replace(begin + 2, end - begin - 2, "(login)");
+        }
+    }
+    return text;
+}
+
+/// Gathers the files in `folder`.
+void gather(const fs::path& folder, const std::string& stickPath, const Unit& unit, const UnitSite& site)
+{
+    const auto save = [&](const char* name, const std::string& text) {
+        std::ofstream(folder / name) << withoutLogins(text);
+    };
+    const auto saveOf = [&](const char* name, auto print) {
+        std::ostringstream text;
+        print(text);
+        save(name, text.str());
+    };
+    save("README.txt", readMe);
+    save("journal.txt", unit.journal());
+    saveOf("log.txt", [&](std::ostream& out) {
+        LogOptions options;
+        options.files = {(folder / "journal.txt").string()};
+        runLog(options, out, out);
+    });
+    saveOf("unit.txt", [&](std::ostream& out) { runUnit({}, site, out, out); });
+    saveOf("check.txt", [&](std::ostream& out) { runCheck(stickPath, false, site, out, out); });
+    saveOf("verify.txt", [&](std::ostream& out) { runVerify({}, site, out); });
+    saveOf("system.txt", [&](std::ostream& out) {
+        out << "harl-updater-tool " << TOOL_VERSION << '\n';
+        for (const std::vector<std::string>& lookup : lookups) {
+            const CommandResult result = unit.run(lookup, quick);
+            out << "\n# " << lookup.front() << ' ' << lookup[1] << '\n' << result.output << result.errors;
+        }
+    });
+    std::error_code error;
+    fs::copy(unit.path(keptLogs), folder / "kept-logs", error);
+}
+
+} // namespace
+
+int runReport(const ReportOptions& options, const UnitSite& site, std::ostream& out, std::ostream& errors)
+{
+    const auto refuse = [&](const std::string& text) {
+        if (options.json) {
+            out << refusal("report", text).dump(2) << '\n';
+        }
+        errors << "harl-updater-tool: " << escaped(options.file) << ": " << text << '\n';
+        return Report::STATUS_UNCHECKED;
+    };
+    const Descriptor made(open(options.file.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
+    if (!made) {
+        return refuse(errno == EEXIST ? "exists already; name another file" : "cannot be written: " + errorText(errno));
+    }
+    const Unit unit(site);
+    const TemporaryFolder temporary(unit);
+    std::error_code error;
+    const fs::path folder = fs::path(temporary.path()) / folderName;
+    if (temporary.path().empty() || !fs::create_directory(folder, error)) {
+        fs::remove(options.file, error);
+        return refuse("no temporary folder can be made; check the space in /tmp: df /tmp");
+    }
+    gather(folder, options.stick, unit, site);
+    const CommandResult packed = unit.run({"tar", "--create", "--gzip", "--file", fs::absolute(options.file).string(),
+                                           "--directory", temporary.path(), folderName},
+                                          packLimit);
+    if (!packed.succeeded()) {
+        fs::remove(options.file, error);
+        return refuse("cannot be written: " + complaint(packed));
+    }
+    if (options.json) {
+        out << nlohmann::ordered_json{{"command", "report"}, {"version", jsonVersion}, {"file", escaped(options.file)}}
+                   .dump(2)
+            << '\n';
+    } else {
+        out << escaped(options.file) << " holds what support needs, and nothing secret: its README.txt says what is "
+            << "left out.\nRead it with: tar -xzf " << escaped(options.file) << '\n';
+    }
+    return Report::STATUS_FIT;
+}

@@ -15,7 +15,8 @@ const std::size_t mostActions = 32;     // of a step; an upload has 20 attempts
 const std::size_t longestText = 400;    // bytes kept of a text
 const std::size_t mostLinesAtEnds = 10; // of other programs: the first and the last
 const std::int64_t longestGap = 86400;  // s between two records
-const std::int64_t mostDelay = 60;      // s by which a wait may end late
+const std::string mainPackage = packageOf(true);
+const std::int64_t mostDelay = 60; // s by which a wait may end late
 
 bool startsWith(std::string_view text, std::string_view start)
 {
@@ -460,7 +461,8 @@ void RunBuilder::takeRunEvent(const ParsedRecord& record, const Meaning& meaning
     default:
         break;
     }
-    if (contains(record.message.value_or(""), packageOf(true)) && meaning.step) {
+    const bool package = meaning.step == StepKind::CHECK_PACKAGE || meaning.step == StepKind::INSTALL_PACKAGE;
+    if (package && !run.mainHead && contains(record.message.value_or(""), mainPackage)) {
         run.mainHead = true;
     }
 }

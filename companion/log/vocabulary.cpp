@@ -194,17 +194,22 @@ std::optional<long> takeNumber(std::string_view& text)
 /// True, with what it holds in `meaning`, when `message` has the form of `pattern`.
 bool fits(std::string_view pattern, std::string_view message, Meaning& meaning)
 {
-    const std::string_view fixed = pattern.substr(0, pattern.find_first_of("#*"));
-    const std::string_view form = pattern.substr(fixed.size());
-    if (message.substr(0, fixed.size()) != fixed) {
+    const auto takeEnd = [&](char sign) {
+        const bool there = !pattern.empty() && pattern.back() == sign;
+        pattern.remove_suffix(there ? 1 : 0);
+        return there;
+    };
+    const bool anyText = takeEnd('*');
+    const bool number = takeEnd('#');
+    if (message.substr(0, pattern.size()) != pattern) {
         return false;
     }
-    meaning.rest = message.substr(fixed.size());
+    meaning.rest = message.substr(pattern.size());
     meaning.number.reset();
-    if (!form.empty() && form.front() == '#' && !(meaning.number = takeNumber(meaning.rest))) {
+    if (number && !(meaning.number = takeNumber(meaning.rest))) {
         return false;
     }
-    return (!form.empty() && form.back() == '*') || meaning.rest.empty();
+    return anyText || meaning.rest.empty();
 }
 
 /// What a record means whatever its message is.

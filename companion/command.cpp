@@ -15,8 +15,6 @@
 #include <sys/stat.h>
 #include <sys/wait.h>
 
-using namespace std::chrono_literals;
-
 namespace
 {
 
@@ -142,7 +140,8 @@ CommandResult runCommand(const std::vector<std::string>& arguments, const std::v
     result.started = true;
     // The program's own end counts, not that of its children. Not every kernel tells it to poll(2) (pidfd_open(2):
     // since Linux 5.3).
-    for (auto pause = 1ms; !hasEnded(child) && !result.timedOut; pause = std::min(2 * pause, longestPause)) {
+    for (std::chrono::milliseconds pause{1}; !hasEnded(child) && !result.timedOut;
+         pause = std::min(2 * pause, longestPause)) {
         std::this_thread::sleep_for(pause);
         result.timedOut = std::chrono::steady_clock::now() >= deadline || signals.any();
     }

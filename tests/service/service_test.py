@@ -266,6 +266,7 @@ class Ends(ServiceTest):
         last = list(RECORD.finditer(log))[-1]
         self.assertEqual(last["function"], "static void UpdateManager::stopUpdater()")
         self.assertNotIn("give-back", log)
+        wait_for("the verification", lambda: "verify: the unit is well" in self.journal(), 30)
 
     def test_killed_during_the_installation(self) -> None:
         # With the first of two packages not yet unpacked, most of the work is still to be done.

@@ -189,9 +189,9 @@ private:
     /// empty when it is not.
     std::string oneLevelDeeper(const std::string& path) const
     {
-        for (const std::string& name : mStick.names(".").names) {
-            if (mStick.node(inFolder(name, path)).kind == Node::FOLDER) {
-                return inFolder(name, path);
+        for (const std::string& outer : mStick.names(".").names) {
+            if (mStick.node(inFolder(outer, path)).kind == Node::FOLDER) {
+                return inFolder(outer, path);
             }
         }
         return "";

@@ -89,7 +89,11 @@ void gather(const fs::path& folder, const std::string& stickPath, const Unit& un
         }
     });
     std::error_code error;
-    fs::copy(unit.path(keptLogs), folder / "kept-logs", error);
+    for (const auto& log : fs::directory_iterator(unit.path(keptLogs), error)) {
+        fs::create_directory(folder / "kept-logs");
+        saveOf(("kept-logs" / log.path().filename()).c_str(),
+               [&](std::ostream& out) { out << std::ifstream(log.path()).rdbuf(); });
+    }
 }
 
 } // namespace

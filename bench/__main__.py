@@ -13,9 +13,9 @@ from bench.build import BUILD, build
 from bench.command import status_of
 from bench.compare import differences
 from bench.show.text import PlainDisplay, Summary, print_summary, terminal
-from bench.show.page import page
+from bench.show.page import page, write_page
 from bench.runner import KINDS, UnitMaker, run_on, temporary_folder
-from bench.run_all import run_all, write_page
+from bench.run_all import run_all
 from bench.show.terminal import LiveDisplay
 from bench.unit import PROGRAMS
 

@@ -1,5 +1,6 @@
 """Model of the front panel's LED controller: what its 14 LEDs show after the bytes that reached it."""
 
+from collections.abc import Iterable
 from dataclasses import dataclass, field
 
 FIRST_LED = 0x10
@@ -92,3 +93,11 @@ class Panel:
     def pattern(self, time: float) -> dict[str, str]:
         """The LEDs that are lit at `time` (s), by name, with the names of their colours."""
         return lit(self.shown(time))
+
+
+def panel_after(sent: Iterable[int]) -> Panel:
+    """A panel that was sent these bytes, all at once."""
+    panel = Panel()
+    for byte in sent:
+        panel.send(byte, 0)
+    return panel

@@ -11,7 +11,7 @@ from bench.compare import differences
 from bench.runner import NotServed, UnitMaker, run_on, temporary_folder
 from bench.scenario import Scenario
 from bench.show.gallery import index
-from bench.show.page import page, page_name
+from bench.show.page import page, page_name, write_page
 from bench.show.text import Summary
 from bench.unit import UnitError
 
@@ -81,8 +81,3 @@ def run_all(maker: UnitMaker, scenarios: list[Scenario], at_once: int, gallery: 
         write_page(gallery / "index.html", index([row.summary for row in rows if row.summary], missing))
         print(f"Pages: {gallery / 'index.html'}")
     return not wrong
-
-
-def write_page(file: Path, text: str) -> None:
-    """Writes a page; bytes of a log that are no text become question marks."""
-    file.write_text(text, encoding="utf-8", errors="replace")

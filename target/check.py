@@ -17,6 +17,11 @@ LONGEST_PHASE = 1.2  # of the flashing, with the hand-over: times as long as wit
 AFTER_START = ["startHARL: 0", "stopUpdater:"]  # the records after the command that starts the application
 
 
+def same(what: str, expected: object, seen: object) -> list[str]:
+    """The difference, if there is one."""
+    return [] if expected == seen else [f"{what}: expected {expected!r}, not {seen!r}"]
+
+
 def panel_bytes(calls: list[Call]) -> list[int]:
     """The bytes that the panel commands among `calls` send."""
     return [int(byte, 16) for call in calls for byte in re.findall(r"i2cset -y 0 0x07 (0x\w+) c", call.text)]
@@ -70,32 +75,30 @@ def check(plan: Plan, evidence: Evidence) -> list[str]:
     found = differences(plan.like, evidence.result) + check_main_thread(evidence)
     found += check_bus(plan, evidence) + check_sound(evidence)
 
-    def same(what: str, expected: object, seen: object) -> None:
-        if expected != seen:
-            found.append(f"{what}: expected {expected!r}, not {seen!r}")
-
     setup = plan.like.setup
     cut = plan.settings.is_cut()
     done = plan.settings.event == "power-cut-before-application"
-    same("package before", setup.package.offered if cut else setup.package.installed, before["package"])
-    same("board before", BOARD_VERSION if done else setup.board.installed, before["board"])
-    same("marker before", "yes" if setup.head.marker and not done else "no", before["marker"])
-    same("stick before", "yes", before["stick"])
-    same("journal identifiers", {IDENTIFIER}, evidence.identifiers)
-    same("result of the unit", plan.expect.result, after["Result"])
-    same("package status", plan.expect.package_status, after["package_status"])
-    same("harl-updater", plan.expect.updater, "same" if before["updater"] == after["updater"] else "newer")
-    same("harl-updater starts at boot", False, after["enabled"] == "enabled")
-    same("harl was started again", True, int(after["harl_since"]) > int(before["harl_since"]))
+    found += same("package before", setup.package.offered if cut else setup.package.installed, before["package"])
+    found += same("board before", BOARD_VERSION if done else setup.board.installed, before["board"])
+    found += same("marker before", "yes" if setup.head.marker and not done else "no", before["marker"])
+    found += same("stick before", "yes", before["stick"])
+    found += same("journal identifiers", {IDENTIFIER}, evidence.identifiers)
+    found += same("result of the unit", plan.expect.result, after["Result"])
+    found += same("package status", plan.expect.package_status, after["package_status"])
+    found += same("harl-updater", plan.expect.updater, "same" if before["updater"] == after["updater"] else "newer")
+    found += same("harl-updater starts at boot", False, after["enabled"] == "enabled")
+    found += same("harl was started again", True, int(after["harl_since"]) > int(before["harl_since"]))
     killed = plan.settings.event == "give-back-killed"
-    same("give-back was killed and started again", killed, int(after["rescuer_restarts"]) > 0)
+    found += same("give-back was killed and started again", killed, int(after["rescuer_restarts"]) > 0)
     if plan.settings.script_seconds:
-        same("package's maintainer script", ["began", "ended"], list(evidence.package_script))
+        found += same("package's maintainer script", ["began", "ended"], list(evidence.package_script))
         ended = evidence.package_script.get("ended", math.inf)
-        same("harl was started after the package's maintainer script", True, int(after["harl_since"]) / 1e6 > ended)
+        later = int(after["harl_since"]) / 1e6 > ended
+        found += same("harl was started after the package's maintainer script", True, later)
     if cut:
-        same("harl after the boot", "active", before["harl"])
-        same("package status after the boot", "installed" if done else "half-configured", before["package_status"])
+        found += same("harl after the boot", "active", before["harl"])
+        status = "installed" if done else "half-configured"
+        found += same("package status after the boot", status, before["package_status"])
     if plan.settings.times_flashing and evidence.flashing_ratio() > LONGEST_PHASE:
         found.append(f"flashing: {evidence.flashing_ratio():.2f} times as long with the hand-over")
     return found + check_whole(evidence)
@@ -103,12 +106,8 @@ def check(plan: Plan, evidence: Evidence) -> list[str]:
 
 def check_whole(evidence: Evidence) -> list[str]:
     """Nothing is left unfinished in the package database, no file is damaged, and the disk had no error."""
-    wanted = {"damaged_files": "0", "audit": "0", "disk_errors": "0"}
-    return [
-        f"{name}: expected {value}, not {evidence.after[name]}"
-        for name, value in wanted.items()
-        if evidence.after[name] != value
-    ]
+    names = ("damaged_files", "audit", "disk_errors")
+    return [line for name in names for line in same(name, "0", evidence.after[name])]
 
 
 def check_cut(plan: Plan, panel: Panel, evidence: Evidence) -> list[str]:
@@ -152,5 +151,4 @@ def check_next_run(plan: Plan, evidence: Evidence) -> list[str]:
         "result of the unit": ("success", after["Result"]),
         "status": (True, evidence.result.status in plan.like.expect.status),
     }
-    found += [f"{what}: expected {wanted!r}, not {seen!r}" for what, (wanted, seen) in pairs.items() if wanted != seen]
-    return found
+    return found + [line for what, (wanted, seen) in pairs.items() for line in same(what, wanted, seen)]

@@ -3,7 +3,7 @@
 from dataclasses import dataclass
 from pathlib import Path
 
-from bench.panel import Panel
+from bench.panel import panel_after
 from target.check import check, check_cut
 from target.evidence import Evidence, read, read_bus
 from target.inputs import write_input
@@ -67,9 +67,7 @@ class Emulation:
             self.boot(self.write_input([plan], again=True), [plan], folder, disk)
         finally:
             disk.unlink(missing_ok=True)
-        panel = Panel()
-        for byte in read_bus(WORK / f"{plan.name}-cut/bus")[-1]:
-            panel.send(byte, 0)
+        panel = panel_after(read_bus(WORK / f"{plan.name}-cut/bus")[-1])
         [evidence] = read_all([plan], folder)
         return {plan.name: (evidence, check_cut(plan, panel, evidence) + check(plan, evidence))}
 

@@ -4,6 +4,7 @@ import re
 from collections.abc import Iterator
 from html import escape
 from itertools import pairwise
+from pathlib import Path
 from string import Template
 
 from bench.show.text import Summary
@@ -88,6 +89,11 @@ def page(summary: Summary, speed: float) -> str:
         commands="".join(_command(call, begin) for call in run.commands()),
         log=escape(run.log),
     )
+
+
+def write_page(file: Path, text: str) -> None:
+    """Writes a page; bytes of a log that are no text become question marks."""
+    file.write_text(text, encoding="utf-8", errors="replace")
 
 
 def lit(run: Run, end: float) -> dict[int, list[tuple[float, float, int]]]:

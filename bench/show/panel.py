@@ -8,7 +8,7 @@ import sys
 from pathlib import Path
 
 from bench.outcomes import CHECK_FAILED, INSTALLATION_FAILED, UP_TO_DATE, UPDATED
-from bench.panel import COLOR_CODES, LED_CODES, Panel, color_name, led_name
+from bench.panel import COLOR_CODES, LED_CODES, color_name, led_name, panel_after
 
 FILLS = {"off": "#ffffff", "blue": "#1f6feb", "pass": "#1a9c3e", "fail": "#d1242f"}
 OTHER_FILL = "#a020a0"
@@ -57,11 +57,7 @@ def _led(led: int, color: int, x: int, row: int) -> str:
 
 def after(*commands: tuple[str, str]) -> dict[int, int]:
     """What the controller shows after commands of LED and colour, by name."""
-    panel = Panel()
-    for led, color in commands:
-        panel.send(LED_CODES[led], 0)
-        panel.send(COLOR_CODES[color], 0)
-    return panel.shown(0)
+    return panel_after(code for led, color in commands for code in (LED_CODES[led], COLOR_CODES[color])).shown(0)
 
 
 def pictures() -> dict[str, str]:

@@ -22,7 +22,7 @@ from bench.makers.packages import DATABASE, SOURCES, Package, build, raise_versi
 from bench.makers.sticks import VERSIONS, version_file_archive, write_stick
 from bench.observation import RECORD
 from bench.outcomes import UP_TO_DATE, UPDATED
-from bench.panel import Panel
+from bench.panel import Panel, panel_after
 from tests.command_line import skip, take_path, take_word
 
 ROOT = Path(__file__).parents[2]
@@ -130,10 +130,7 @@ def states(unit: Machine) -> set[str]:
 
 def panel(unit: Machine) -> Panel:
     """The panel after what it was sent."""
-    shown = Panel()
-    for byte in (unit.root() / "var/log/panel").read_text().split():
-        shown.send(int(byte, 16), 0)
-    return shown
+    return panel_after(int(byte, 16) for byte in (unit.root() / "var/log/panel").read_text().split())
 
 
 class ServiceTest(unittest.TestCase):

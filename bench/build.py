@@ -6,7 +6,7 @@ from pathlib import Path
 
 ROOT = Path(__file__).parent.parent
 BUILD = ROOT / "build/default"
-TARGETS = ["harl-updater", "main-head-driver", "call_recorder", "i2c_bus"]
+TARGETS = ["harl-updater", "main-head", "call_recorder", "i2c_bus"]
 
 
 def build(*more: str) -> None:

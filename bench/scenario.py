@@ -90,11 +90,17 @@ class Tools:
 class Updater:
     """The updater and what happens to it."""
 
-    program: Literal["remote", "main"] = "remote"  # main: the main-head driver
+    program: Literal["remote", "main"] = "remote"  # main: examples/main-head
+    answer: str = "all"  # of the main head's operator to the list that is offered; "" no answer
     arguments: list[str] = field(default_factory=list)
     children: Literal["waited-for", "ignored"] = "waited-for"  # ignored: started with SIGCHLD ignored
     # by the service manager. at-its-end: by its own last command. in-install: while the package is being installed.
     stopped: Literal["never", "at-its-end", "in-install"] = "at-its-end"
+
+    @property
+    def input(self) -> str:
+        """What the program reads on standard input; the remote head's has no operator."""
+        return f"{self.answer}\n" if self.program == "main" and self.answer else ""
 
 
 @dataclass

@@ -5,7 +5,7 @@ from pathlib import Path
 from typing import Protocol
 
 # The program that runs on a unit, in the folder of the programs, by what `updater.program` in a scenario says.
-PROGRAMS = {"remote": Path("harl-updater"), "main": Path("bench/main-head-driver")}
+PROGRAMS = {"remote": Path("harl-updater"), "main": Path("bench/main-head")}
 
 
 @dataclass

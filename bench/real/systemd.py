@@ -29,6 +29,7 @@ DefaultDependencies=no
 After=systemd-journald.service harl.service
 [Service]
 ExecStart={{command}}
+StandardInput=file:/opt/bench/input
 StandardOutput=journal
 StandardError=append:/opt/bench/out/errors
 KillMode=process

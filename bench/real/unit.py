@@ -133,6 +133,7 @@ class RealUnit:
         program = PROGRAMS[self._setup.updater.program]
         for file in (program, Path("bench/call_recorder.so"), Path("bench/i2c_bus.so")):
             shutil.copy(self._build / file, self._folder / "head/opt/bench")
+        (self._folder / "head/opt/bench/input").write_text(self._setup.updater.input)
         words = ["/usr/bin/env", "-i"]
         if self._setup.updater.children == "ignored":
             words.append("--ignore-signal=CHLD")

@@ -100,7 +100,7 @@ run_updater() {
     echo active >"$head/run/harl"
     start_events
     # shellcheck disable=SC2086 # words by intention
-    setsid chroot "$head" $BENCH_COMMAND </dev/null >"$folder/out/log" 2>"$folder/out/errors" &
+    setsid chroot "$head" $BENCH_COMMAND <"$head/opt/bench/input" >"$folder/out/log" 2>"$folder/out/errors" &
     updater=$!
     echo $updater >"$head/run/unit.pid"
     echo >"$folder/out/started"

@@ -137,12 +137,14 @@ class StandInUnit:
             env.append("--ignore-signal=CHLD")
         program = self._build / PROGRAMS[self._setup.updater.program]
         env.append("LD_PRELOAD=" + ":".join([*sanitizers(program), str(self._build / "bench/call_recorder.so")]))
-        with self.files.log.open("wb") as log, (self._folder / "errors").open("wb") as errors:
+        answer = self._folder / "input"
+        answer.write_text(self._setup.updater.input)
+        with self.files.log.open("wb") as log, (self._folder / "errors").open("wb") as errors, answer.open() as typed:
             self._updater = subprocess.Popen(
                 with_pid_file(self._folder, [*env, program, *self._setup.updater.arguments]),
                 env=environment,
                 cwd=self._folder,
-                stdin=subprocess.DEVNULL,
+                stdin=typed,
                 stdout=log,
                 stderr=errors,
                 start_new_session=True,

@@ -16,7 +16,14 @@ FOLDER = Path(__file__).parent / "scenarios"
 
 
 Event = Literal[
-    "nothing", "crash", "stop", "out-of-memory", "give-back-killed", "power-cut", "power-cut-before-application"
+    "nothing",
+    "crash",
+    "stop",
+    "out-of-memory",
+    "give-back-killed",
+    "give-back-out-of-memory",
+    "power-cut",
+    "power-cut-before-application",
 ]
 NOT_IN_SCRIPT = ("nothing", "power-cut-before-application")
 

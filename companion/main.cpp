@@ -3,6 +3,7 @@
 #include "log/catalogue.h"
 #include "log/log_command.h"
 #include "procedure.h"
+#include "stick/make.h"
 #include "stick/stick_check.h"
 #include "unit/unit_check.h"
 
@@ -89,7 +90,28 @@ int run(std::vector<std::string> arguments)
     CLI::App* stick = app.add_subcommand("stick", "Show what the updater would do with a stick. Reads only.");
     stick->add_option("PATH", stickPath, "the folder that the stick is mounted at")->capture_default_str();
     stick->add_flag("--json", json, "print one JSON object");
+    std::string keyring;
+    stick->add_option("--keyring", keyring, "verify the stick with these keys instead of the installed ones")
+        ->type_name("FILE");
     stick->footer("Exit status: 0 fit for an update, 1 not fit, 2 wrong usage or not everything could be read.\n");
+
+    MakeOptions makeOptions;
+    CLI::App* make = stick->add_subcommand("make", "Make a stick: write it, read it back, sign it.");
+    make->add_option("TARGET", makeOptions.target, "the folder that the stick is mounted at, or any folder")
+        ->required();
+    make->add_option("--archive", makeOptions.archive, "the board's upgrade archive")->type_name("ZIP")->required();
+    make->add_option("--script", makeOptions.script, "the board's install script")->type_name("SCRIPT")->required();
+    make->add_option("--version", makeOptions.version, "the version, as the board will report it")
+        ->type_name("VERSION")
+        ->required();
+    make->add_flag("--replace", makeOptions.replace, "replace the version that is on the stick");
+    make->add_flag("--teamviewer", makeOptions.teamViewer, "request TeamViewer on a main head");
+    CLI::Option* sign =
+        make->add_option("--sign", makeOptions.key, "sign the stick with this key of gpg's")->type_name("KEY");
+    make->add_option("--oldest", makeOptions.oldest, "the oldest version that this one may replace")
+        ->type_name("VERSION")
+        ->needs(sign);
+    make->footer("Exit status: 0 made and fit, 1 not fit, 2 wrong usage or it could not be made.\n");
 
     UnitOptions unitOptions;
     CLI::App* unit = app.add_subcommand("unit", "Show whether this unit is fit for an update. Run it as root.");
@@ -157,8 +179,12 @@ int run(std::vector<std::string> arguments)
         const std::vector<CLI::App*> parsed = app.get_subcommands();
         return refuse(parsed.empty() ? "" : parsed.front()->get_name(), wantsJson, usageText(app, error));
     }
+    if (make->parsed()) {
+        makeOptions.progress = isatty(STDERR_FILENO) == 1;
+        return makeStick(makeOptions, std::cout, std::cerr);
+    }
     if (stick->parsed()) {
-        return runStick(stickPath, json, std::cout, std::cerr);
+        return runStick(stickPath, json, std::cout, std::cerr, keyring);
     }
     if (log->parsed()) {
         logOptions.json = json;

@@ -3,6 +3,7 @@
 #include "findings.h"
 #include "log/run.h"
 #include "procedure.h"
+#include "stick/signature.h"
 #include "stick/stick_check.h"
 #include "unit/packages.h"
 #include "unit/unit_check.h"
@@ -165,8 +166,10 @@ int runCheck(const std::string& path, bool json, const UnitSite& site, std::ostr
         checkUnit(unit, report);
     }
     checkStick(stick, isUnit, report);
+    checkSignature(path, "", report);
     if (isUnit) {
         addPlans(unit, report);
+        checkReplaced(path, report);
     } else {
         report.add("not-a-unit");
     }

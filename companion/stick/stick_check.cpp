@@ -2,6 +2,7 @@
 
 #include "procedure.h"
 #include "stick/archive.h"
+#include "stick/signature.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -17,8 +18,6 @@
 namespace
 {
 
-const char archiveName[] = "OSUpgrade.zip";
-const char scriptName[] = "unzipUpgrade.sh";
 const char markerFolder[] = "debs";
 const char markerName[] = "installTV";
 
@@ -214,7 +213,12 @@ private:
         names.erase(std::remove_if(names.begin(), names.end(), [](const auto& name) { return name.front() == '.'; }),
                     names.end());
         if (names.empty()) {
-            mReport.add(all.names.empty() ? "no-version-folder.empty" : "no-version-folder.hidden",
+            const bool isUnfinished = std::any_of(all.names.begin(), all.names.end(), [](const std::string& name) {
+                return name.rfind(unfinishedPrefix, 0) == 0;
+            });
+            mReport.add(all.names.empty() ? "no-version-folder.empty"
+                        : isUnfinished    ? "no-version-folder.unfinished"
+                                          : "no-version-folder.hidden",
                         {{"names", listed(all.names)}});
             return;
         }
@@ -385,7 +389,7 @@ bool isUnitMountPoint(const std::string& path)
 
 } // namespace
 
-int runStick(const std::string& path, bool json, std::ostream& out, std::ostream& errors)
+int runStick(const std::string& path, bool json, std::ostream& out, std::ostream& errors, const std::string& keyring)
 {
     const StickFolder stick(path);
     if (stick.error() != 0) {
@@ -401,6 +405,7 @@ int runStick(const std::string& path, bool json, std::ostream& out, std::ostream
     }
     Report report("stick", "The stick at " + shown(path));
     checkStick(stick, isUnitMountPoint(path), report);
+    checkSignature(path, keyring, report);
     report.write(json, out);
     return report.status();
 }

@@ -9,14 +9,20 @@
 
 #include <sys/types.h>
 
+inline constexpr char archiveName[] = "OSUpgrade.zip";
+inline constexpr char scriptName[] = "unzipUpgrade.sh";
+inline constexpr char unfinishedPrefix[] = ".unfinished-"; ///< of the version folder while `stick make` writes it
+
 /// Checks the stick at `path` for what the updater will do with it, and prints the report to `out`.
 ///
 /// Reads only, runs nothing and opens no file outside the stick: a symbolic link that leads out of it is reported
 /// and not followed.
 ///
-/// @param json  print one JSON object instead of text
+/// @param json     print one JSON object instead of text
+/// @param keyring  with the keys that the maker signs with; empty: the installed one
 /// @return a Report::Status; also STATUS_UNCHECKED, with a message on `errors`, when there is no folder to read
-int runStick(const std::string& path, bool json, std::ostream& out, std::ostream& errors);
+int runStick(const std::string& path, bool json, std::ostream& out, std::ostream& errors,
+             const std::string& keyring = "");
 
 /// The check itself: adds to `report` what it finds.
 ///

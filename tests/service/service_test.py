@@ -9,6 +9,7 @@ import os
 import re
 import shutil
 import subprocess
+import tempfile
 import time
 import unittest
 from collections.abc import Callable
@@ -19,11 +20,12 @@ from bench.machine.machine import Machine, MachineError, machine
 from bench.makers.files import write, write_script
 from bench.makers.i2cset import NEWER
 from bench.makers.packages import DATABASE, SOURCES, Package, build, raise_version, write_index
-from bench.makers.sticks import VERSIONS, version_file_archive, write_stick
+from bench.makers.sticks import VERSIONS, version_file_archive, write_stick, zip_archive
 from bench.observation import RECORD
 from bench.outcomes import UP_TO_DATE, UPDATED
 from bench.panel import Panel, panel_after
 from tests.command_line import skip, take_path, take_word
+from tests.companion.stick.make_test import make_key
 
 ROOT = Path(__file__).parents[2]
 
@@ -138,6 +140,7 @@ class ServiceTest(unittest.TestCase):
 
     unit: Machine
     package: str
+    tool: Path  # the companion program, on this machine
     before: list[str] = []  # what leaves out of the journal what came before the run
 
     def setUp(self) -> None:
@@ -359,6 +362,107 @@ class Ends(ServiceTest):
         started = float(self.inside("systemctl", "show", "--value", "--property=ActiveEnterTimestampMonotonic", "harl"))
         self.assertGreater(started / 1e6, float(self.read("/run/board-ended").split()[0]) + 4)
         self.assertEqual(self.panel(), {"FAIL": "fail"})
+
+
+class Sticks(ServiceTest):
+    """With the maker's keyring on the unit, only a stick that he signed is used."""
+
+    def setUp(self) -> None:
+        super().setUp()
+        holder = tempfile.TemporaryDirectory(prefix="maker-")
+        self.addCleanup(holder.cleanup)
+        self.maker = Path(holder.name)
+        self.stick = self.unit.root() / STICK.lstrip("/")
+        self.keyring = self.unit.root() / "usr/share/keyrings/harl-updater-stick.gpg"
+        make_key(self.maker / "keys", "maker", self.maker / "keys.gpg")
+        self.addCleanup(self.keyring.unlink, missing_ok=True)
+        self.inside("sh", "-c", "echo 2.1.0 >/srv/board")
+        write_script(self.unit.root() / "usr/local/sbin/scp", "touch /run/uploads")
+        self.addCleanup(write_script, self.unit.root() / "usr/local/sbin/scp", TOOLS["scp"])
+        write_index(self.repository)
+
+    def install_keyring(self) -> None:
+        """From now on the unit knows the maker."""
+        shutil.copy(self.maker / "keys.gpg", self.keyring)
+
+    def sign(self) -> None:
+        """Makes the stick again, signed by the maker."""
+        (self.maker / "script").write_text("#!/bin/sh\n")
+        (self.maker / "archive").write_bytes(zip_archive("2.2.0"))
+        words = ["--archive", "archive", "--script", "script", "--version", "2.2.0", "--replace", "--sign", "maker"]
+        subprocess.run(
+            [self.tool, "stick", "make", *words, self.stick],
+            cwd=self.maker,
+            env=os.environ | {"GNUPGHOME": str(self.maker / "keys")},
+            stdout=subprocess.DEVNULL,
+            check=True,
+        )
+
+    def assert_used(self) -> None:
+        """The board's files were copied from the stick."""
+        self.start()
+        self.wait_for_end()
+        self.assert_given_back()
+        self.assertTrue((self.unit.root() / "run/uploads").exists())
+        self.assertEqual(self.panel(), {"PASS": "pass"})
+
+    def assert_refused(self, why: str) -> None:
+        """The updater did not run, FAIL is shown, the log says why, the instrument is given back."""
+        self.note_journal()
+        self.assertNotEqual(self.unit.status("systemctl", "start", "harl-updater"), 0)
+        self.wait_for_end()
+        self.assert_given_back()
+        self.assertEqual(self.panel(), {"FAIL": "fail"})
+        self.assertIn(f"prepare: the stick is not as the maker signed it: {why}\n", self.journal())
+        self.assertNotIn("TavrenUpdater", self.journal())
+        self.assertFalse((self.unit.root() / "run/uploads").exists())
+
+    def test_signed_stick_is_used(self) -> None:
+        self.sign()
+        self.install_keyring()
+        self.assert_used()
+
+    def test_without_a_keyring_nothing_changes(self) -> None:
+        self.assert_used()
+
+    def test_stick_without_a_signature(self) -> None:
+        self.install_keyring()
+        self.assert_refused("not signed")
+
+    def test_tampered_file(self) -> None:
+        self.sign()
+        self.install_keyring()
+        path = f"{VERSIONS}/quorb2.2.0/unzipUpgrade.sh"
+        (self.stick / path).write_text("#!/bin/sh\nreboot\n")
+        self.assert_refused(f"changed: {path}")
+
+    def test_tampered_manifest(self) -> None:
+        self.sign()
+        self.install_keyring()
+        with (self.stick / "harl-updater.manifest").open("a") as manifest:
+            manifest.write(" more\n")
+        self.assert_refused("changed: the manifest")
+
+    def test_other_key(self) -> None:
+        self.sign()
+        make_key(self.maker / "others", "other", self.maker / "keys.gpg")
+        self.install_keyring()
+        self.assert_refused("not signed by a known key")
+
+    def test_keyring_that_cannot_be_read(self) -> None:
+        self.sign()
+        self.keyring.write_text("no keys")
+        self.assert_refused("not signed by a known key")
+
+    def test_stick_without_anything_for_the_board_is_nothing_to_verify(self) -> None:
+        self.install_keyring()
+        shutil.rmtree(self.stick / "debs")
+        self.offer()
+        self.start()
+        self.wait_for_end()
+        self.assert_given_back()
+        self.assertIn("TavrenUpdater", self.journal())
+        self.assertNotIn("prepare: the stick", self.journal())
 
 
 class Outcomes(ServiceTest):
@@ -649,6 +753,7 @@ def main() -> None:
         except MachineError as error:
             skip(f"this machine allows no machine of its own: {error}")
         ServiceTest.unit, ServiceTest.package = made, package
+        ServiceTest.tool = programs / "companion/harl-updater-tool"
         install(made)
         unittest.main(verbosity=2, testRunner=unittest.TextTestRunner(resultclass=Result, verbosity=2))
 

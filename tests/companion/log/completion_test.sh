@@ -38,7 +38,8 @@ for command in $commands; do
     expect "$(helped "$command")" "$command" --
     expect "$(helped "$command")" "$command" --json --
 done
-for option in $(helped) $(for command in $commands; do helped "$command"; done); do
+expect "$(helped stick make)" stick make --
+for option in $(helped) $(helped stick make) $(for command in $commands; do helped "$command"; done); do
     grep -q -- "${option//-/\\\\-}" docs/man/harl-updater-tool.1 || { echo "the manual page lacks $option" && wrong=1; }
 done
 
@@ -56,5 +57,6 @@ touch "$folder/an update.log"
 expect "$folder/a stick" stick "$folder/a"
 expect "$folder/a stick $folder/an update.log" log "$folder/a"
 expect "$folder/an update.log" log --html "$folder/an"
+expect "$folder/an update.log" stick make --archive "$folder/an"
 expect '' unit "$folder/a"
 exit $wrong

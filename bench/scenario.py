@@ -37,7 +37,10 @@ class Package:
 class Mirrors:
     """The package mirrors."""
 
-    refresh: Literal["works", "unreachable"] = "works"  # unreachable: apt exits 100
+    # What is wrong with them: apt exits 100. All but "unreachable" need a server, for signed release files.
+    refresh: Literal["works", "unreachable", "wrong-key", "expired", "not-yet-valid", "half-synchronised"] = "works"
+    # file: a folder, not signed. Signed, over HTTP: stalls: in the middle of the package. slow: 8 kbit/s.
+    server: Literal["file", "http", "stalls", "slow"] = "file"
 
 
 @dataclass

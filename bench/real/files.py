@@ -8,11 +8,14 @@ from pathlib import Path
 from bench.makers import sticks
 from bench.makers.board import write_version
 from bench.makers.files import write
+from bench.makers.keys import sign_index
 from bench.makers.packages import DATABASE, SOURCES, kept_package
 from bench.makers.sounds import write_sounds
 from bench.scenario import TOOLS, Setup
 
 HERE = Path(__file__).parent
+MIRROR_PORT = 8080
+SIGNED_SOURCES = f"deb [signed-by=/etc/apt/mirror.gpg] http://127.0.0.1:{MIRROR_PORT} ./\n"
 MAKERS = HERE.parent / "makers"
 
 
@@ -93,7 +96,12 @@ def _write_packages(folder: Path, setup: Setup, kept: Path) -> None:
         [file] = kept_package("other", "1.0", "holds-lock", kept).glob("*.deb")
         shutil.copy(file, folder / "srv/other.deb")
     where = "repository" if setup.mirrors.refresh == "works" else "gone"
-    write(folder / "etc/apt/sources.list", SOURCES.format(folder=where))
+    if setup.mirrors.server == "file":
+        write(folder / "etc/apt/sources.list", SOURCES.format(folder=where))
+    else:
+        sign_index(folder / "srv/repository", folder / "etc/apt/mirror.gpg", setup.mirrors.refresh)
+        write(folder / "etc/apt/sources.list", SIGNED_SOURCES)
+        write(folder / "etc/apt/apt.conf.d/60mirror", 'Acquire::Retries "0"; Acquire::http::Timeout "5";\n')
     if wanted.downgrades:
         write(folder / "etc/apt/preferences", 'Package: *\nPin: origin ""\nPin-Priority: 1001\n')
         write(folder / "etc/apt/apt.conf.d/60downgrade", 'APT::Get::allow-downgrades "true";\n')

@@ -10,6 +10,7 @@ import shlex
 import shutil
 import signal
 import subprocess
+import sys
 import time
 from pathlib import Path
 
@@ -17,7 +18,7 @@ from bench.cleanup import remove_control_group
 from bench.makers import board as board_files
 from bench.makers import sounds
 from bench.real import sshd, systemd
-from bench.real.files import HERE, head_package, search_path, write_board, write_head, write_stick
+from bench.real.files import HERE, MIRROR_PORT, head_package, search_path, write_board, write_head, write_stick
 from bench.scenario import Scenario, variables
 from bench.unit import PROGRAMS, Files, State, UnitError, with_pid_file
 
@@ -150,7 +151,9 @@ class RealUnit:
         values = variables(self._setup) | {
             "BENCH_COMMAND": command,
             "BENCH_CONTROL_GROUP": str(self._control_group or ""),
+            "BENCH_MIRROR_PORT": str(MIRROR_PORT),
             "BENCH_PACKAGE": head_package(self._setup),
+            "BENCH_PYTHON": sys.executable,
             "BENCH_SERVICE": systemd.updater_service(self._setup),
             "BENCH_SFTP_SERVER": server.sftp_server,
             "BENCH_SOUND_LENGTH": f"{sounds.SECONDS / self._speed:.3f}",

@@ -58,6 +58,17 @@ wait_for_board() {
     esac
 }
 
+start_mirror() {
+    [ "$MIRRORS_SERVER" != file ] || return 0
+    if [ "$MIRRORS_SERVER" = slow ]; then
+        ip link set lo mtu 1500 # a packet must fit into the burst
+        tc qdisc add dev lo root tbf rate 8kbit burst 2k latency 10s
+    fi
+    "$BENCH_PYTHON" -I "$here/mirror.py" "$head/srv/repository" "$BENCH_MIRROR_PORT" "$MIRRORS_SERVER" \
+        2>"$folder/out/mirror" &
+    until [ -n "$(ss --no-header --listening --tcp "sport = $BENCH_MIRROR_PORT")" ]; do sleep 0.01; done
+}
+
 # A package database with the older package in it, made by dpkg itself.
 install_package() {
     cd "$head"
@@ -130,6 +141,7 @@ make_root "$head" / 0
 add_files "$head" "$folder/head"
 mount --bind "$folder/out" "$head/opt/bench/out"
 mount --bind "$board/run" "$head/opt/bench/board"
+start_mirror
 install_package
 insert_stick
 wait_for_board

@@ -67,6 +67,7 @@ apt() {
             "$BENCH_TOOLS/systemctl" stop harl-updater
             exec /bin/sleep 60 # the package's script goes on
         fi
+        [ "$MIRRORS_SERVER" != stalls ] || fail 100 "E: Failed to fetch http://mirrors/$3.deb  Connection timed out"
         [ "$PACKAGE_KNOWN" = true ] || fail 100 "E: Unable to locate package $3"
         [ "$PACKAGE_INSTALL" != locked ] || /bin/sleep 0.5
         echo "Setting up $3 ($PACKAGE_OFFERED) ..."

@@ -95,7 +95,8 @@ void signStick(const std::string& stick, const std::string& version, const std::
     }
     text << "Date: " << date << "\nSHA256:\n";
     for (const fs::path& file : files) {
-        text << ' ' << sha256(file) << ' ' << fs::file_size(file) << ' ' << fs::relative(file, stick).string() << '\n';
+        text << ' ' << sha256(file) << ' ' << fs::file_size(file) << ' ' << file.lexically_relative(stick).string()
+             << '\n';
     }
     const fs::path manifest = fs::path(stick) / manifestName;
     std::ofstream out(manifest, std::ios::trunc);

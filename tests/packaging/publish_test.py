@@ -8,9 +8,9 @@ import tempfile
 import unittest
 from pathlib import Path
 
+from bench.makers.keys import make_key
 from bench.makers.packages import Package, build
 from tests.command_line import skip
-from tests.companion.stick.make_test import make_key
 
 ROOT = Path(__file__).parents[2]
 

@@ -19,13 +19,13 @@ from typing import Any
 from bench.machine.machine import Machine, MachineError, machine
 from bench.makers.files import write, write_script
 from bench.makers.i2cset import NEWER
+from bench.makers.keys import make_key
 from bench.makers.packages import DATABASE, SOURCES, Package, build, raise_version, write_index
 from bench.makers.sticks import VERSIONS, version_file_archive, write_stick, zip_archive
 from bench.observation import RECORD
 from bench.outcomes import UP_TO_DATE, UPDATED
 from bench.panel import Panel, panel_after
 from tests.command_line import skip, take_path, take_word
-from tests.companion.stick.make_test import make_key
 
 ROOT = Path(__file__).parents[2]
 

@@ -13,20 +13,12 @@ import time
 import unittest
 from pathlib import Path
 
+from bench.makers.keys import make_key
 from bench.makers.sticks import VERSIONS, zip_archive
 from tests.command_line import skip, take_path
 
 SCRIPT = "#!/bin/sh\nunzip -o root/OSUpgrade.zip\n"
 MANIFEST = "harl-updater.manifest"
-
-
-def make_key(home: Path, name: str, keyring: Path) -> None:
-    """A key of gpg's in the folder `home`, and a keyring with its public half."""
-    home.mkdir(mode=0o700, exist_ok=True)
-    command = ["gpg", "--homedir", str(home), "--batch", "--quiet"]
-    subprocess.run([*command, "--passphrase", "", "--quick-generate-key", name, "ed25519", "sign", "never"], check=True)
-    with keyring.open("wb") as out:
-        subprocess.run([*command, "--export", name], stdout=out, check=True)
 
 
 class Stick(unittest.TestCase):

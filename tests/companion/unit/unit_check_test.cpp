@@ -90,6 +90,11 @@ struct Fault
     Lines findings;
 };
 
+void PrintTo(const Fault& fault, std::ostream* out)
+{
+    *out << fault.name;
+}
+
 /// What one change of a unit that is fit makes of the check's findings.
 class UnitCheckOfFault : public UnitCheck, public testing::WithParamInterface<Fault>
 {

@@ -2,8 +2,8 @@
 # Starts systemd as the first process of a machine of its own: new namespaces, in which machine.py runs this as root.
 #
 # Usage: machine.sh FOLDER SYSTEM GROUP [DISK]
-# FOLDER/files is what the machine has besides the /usr of the root file system SYSTEM. What it writes stays in memory, or
-# goes to the file system in the file DISK, from which it starts when it has been there before. GROUP is its control
+# FOLDER/files holds the machine's files besides the /usr of the root file system SYSTEM. What the machine writes stays
+# in memory, or goes to the file system in the file DISK, from which a later start continues. GROUP is its control
 # group.
 set -eu
 

@@ -14,11 +14,11 @@ ip link set eth0 up
 case $link in
 slow | dies) tc qdisc add dev eth0 root tbf rate 512kbit burst 8k latency 1s ;; # and so does the head's end
 esac
-# Where there is only one user sshd cannot change to another: it runs as a user of its own instead, named root.
+# Where there is only one user, sshd cannot change to another one: it runs as its own user, named root, instead.
 echo 0 >/proc/sys/net/ipv4/ip_unprivileged_port_start
 LD_LIBRARY_PATH=/opt/bench/lib unshare --user --map-user=1000 --map-group=1000 --root="$board" --wd=/ "$sshd" -D -e &
 
-# What happens to the board at the request of others.
+# Events on the board that others request.
 while read -r request <"$board/run/requests"; do
     case $request in
     link-down) ip link set eth0 down ;;

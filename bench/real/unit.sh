@@ -78,7 +78,7 @@ install_package() {
     done
     # A configuration file that was changed on the unit: dpkg asks which one to keep.
     if [ "$PACKAGE_INSTALL" = asks ]; then echo changed >>"etc/$BENCH_PACKAGE.conf"; fi
-    # A refresh that does not take place leaves what an earlier one has brought.
+    # A refresh that fails leaves the lists of an earlier one.
     case " $TOOLS_KILLED " in
     *" apt "*) in_head apt-get update >"$folder/out/apt" 2>&1 || fail "$(cat "$folder/out/apt")" ;;
     esac
@@ -95,7 +95,7 @@ in_head() {
     chroot "$head" env -i HOME=/root LANG=C.UTF-8 PATH=/opt/bench/bin:/usr/sbin:/usr/bin:/sbin:/bin "$@"
 }
 
-# What else happens on the head while the updater runs.
+# Other events on the head while the updater runs.
 start_events() {
     if [ "$PACKAGE_INSTALL" = locked ]; then
         in_head apt-get --assume-yes install /srv/other.deb >"$folder/out/other" 2>&1 &
@@ -110,7 +110,7 @@ start_events() {
 run_updater() {
     echo active >"$head/run/harl"
     start_events
-    # shellcheck disable=SC2086 # words by intention
+    # shellcheck disable=SC2086 # several words, intended
     setsid chroot "$head" $BENCH_COMMAND <"$head/opt/bench/input" >"$folder/out/log" 2>"$folder/out/errors" &
     updater=$!
     echo $updater >"$head/run/unit.pid"
@@ -150,6 +150,6 @@ if [ -n "$BENCH_CONTROL_GROUP" ]; then
 else
     mkfifo "$folder/out/again"
     run_updater
-    # unit.py still looks at the unit, then ends it. A line in `again` asks for one more run on the unit as it is.
+    # unit.py reads the unit's state, then ends it. A line in `again` requests one more run on the unit as it is.
     while read -r _ <"$folder/out/again"; do run_updater; done
 fi

@@ -2,7 +2,8 @@
 # The tools of the stand-in unit. Its search path holds a link to this file for each of them, and nothing else.
 #
 # UNIT is the folder that holds the unit's state; the scenario comes in one variable for each of its keys, such as
-# BOARD_LINK, and BENCH_TOOLS is the folder of the tools that are the same on every unit. The tools change the state as the real ones would: a second run would find what this one left.
+# BOARD_LINK, and BENCH_TOOLS is the folder of the tools that are the same on every unit. The tools change the state as
+# the real ones would: a second run finds what the first one left.
 # shellcheck disable=SC2154 # the scenario's variables
 set -u
 

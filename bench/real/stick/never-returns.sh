@@ -1,5 +1,5 @@
 #!/bin/sh
-# Hangs; after some time, which is the scenario's, the connection breaks.
+# Hangs; the connection breaks after a time that the scenario sets.
 read -r parent </proc/$PPID/comm
 session=$PPID
 if [ "$parent" = sh ]; then session=$(cut -d ' ' -f 4 "/proc/$PPID/stat"); fi

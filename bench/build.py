@@ -10,7 +10,7 @@ TARGETS = ["harl-updater", "main-head", "call_recorder", "i2c_bus"]
 
 
 def build(*more: str) -> None:
-    """Brings the updater, the bench's own programs and the targets `more` up to date; installs what that needs.
+    """Brings the updater, the bench's own programs and the targets `more` up to date; installs what this requires.
 
     Ends the program when something fails.
     """
@@ -21,7 +21,7 @@ def build(*more: str) -> None:
     commands = [["cmake", "--build", "--preset", "default", "--target", *TARGETS, *more]]
     configured, presets = BUILD / "build.ninja", ROOT / "CMakePresets.json"
     if not configured.exists() or configured.stat().st_mtime < presets.stat().st_mtime:
-        commands.insert(0, ["cmake", "--preset", "default"])  # later on the build does so when it needs to
+        commands.insert(0, ["cmake", "--preset", "default"])  # later the build does this itself when necessary
     for command in commands:
         done = subprocess.run(
             command, cwd=ROOT, stdout=subprocess.PIPE, stderr=subprocess.STDOUT, text=True, check=False

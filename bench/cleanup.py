@@ -1,7 +1,7 @@
 """Usage: cleanup.py FOLDER
 
 Waits until the owner of the other end of standard input has ended, then ends what still runs in the temporary folder of
-a unit and clears the folder away. Starts no process for that: it works where no more can be had.
+a unit and removes the folder. Starts no process for that, so that it works where none can be created.
 """
 
 import contextlib

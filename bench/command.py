@@ -10,7 +10,7 @@ from bench.unit import UnitError
 
 
 def status_of(command: Callable[[], int]) -> int:
-    """The status of `command`; what it raises becomes one line and a status of its own, see docs/bench.md."""
+    """The status of `command`; each exception becomes one line and its own status, see docs/bench.md."""
     try:
         return command()
     except BrokenPipeError:

@@ -1,4 +1,4 @@
-"""Compares what a run showed with what its scenario says must come out."""
+"""Compares what a run showed with what its scenario expects."""
 
 import re
 
@@ -24,7 +24,7 @@ def seen_log(run: Run) -> list[str]:
 
 
 def log_difference(expected: list[str], seen: list[str]) -> str | None:
-    """The first difference, or None. An expected "..." stands for any records, at a line's end for any rest of it."""
+    """The first difference, or None. An expected "..." matches any records, or at a line's end any rest of it."""
     position = 0
     skipping = False
     for line in expected:
@@ -45,7 +45,7 @@ def log_difference(expected: list[str], seen: list[str]) -> str | None:
 
 
 def differences(scenario: Scenario, result: Result) -> list[str]:
-    """One line for each difference; none when the run came out as the scenario says."""
+    """One line for each difference; none when the run was as the scenario expects."""
     expect = scenario.expect
     run, state, status = result.run, result.state, result.status
     found = []

@@ -1,4 +1,4 @@
-"""What the short names in the `commands` and the `log` of a scenario stand for."""
+"""The meaning of the short names in the `commands` and the `log` of a scenario."""
 
 import re
 
@@ -42,7 +42,7 @@ def sound_command(sound: str) -> str:
     return f"aplay {SOUND_FOLDER}/{SOUND_FILES[sound]}"
 
 
-# Runs of records that many scenarios share, for `log` in their files: "(name)", with arguments for {1}, {2} after the
+# Blocks of records that many scenarios share, for `log` in their files: "(name)", with arguments for {1}, {2} after the
 # name. A line is an operation's name, a colon and the message.
 BLOCKS = {
     # (opening STATUS): what stopping harl gave

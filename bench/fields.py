@@ -1,4 +1,4 @@
-"""Dataclasses filled from TOML tables: their fields say which keys there are, of what type, and with what default."""
+"""Dataclasses filled from TOML tables: their fields define the keys, their types and their defaults."""
 
 import dataclasses
 from typing import Any, Literal, TypeVar, get_args, get_origin, get_type_hints
@@ -7,7 +7,7 @@ Section = TypeVar("Section")
 
 
 class FieldError(Exception):
-    """A value that a field cannot take. `key` is its name, with the section's in front."""
+    """A value that a field cannot take. `key` is the field's name, preceded by the section's."""
 
     def __init__(self, key: str, reason: str) -> None:
         super().__init__(f"{key}: {reason}")

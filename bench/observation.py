@@ -1,4 +1,4 @@
-"""What was seen of a run: the log's records, the commands and waits with their times, the panel and its changes."""
+"""Everything observed of a run: the log's records, commands and waits with their times, the panel and its changes."""
 
 import re
 import time
@@ -46,7 +46,7 @@ class Call:
     start: float  # s
     text: str  # command line
     seconds: int = 0  # asked for by a wait
-    real: float = 0.0  # s, that the wait takes in fact
+    real: float = 0.0  # s, that the wait really takes
     end: float | None = None
     status: int | None = None
 
@@ -61,7 +61,7 @@ class Change:
 
 @dataclass
 class Run:
-    """Everything seen so far. `update` reads what has come since."""
+    """Everything observed so far. `update` reads what is new."""
 
     files: Files
     log: str = ""
@@ -72,7 +72,7 @@ class Run:
     _offsets: dict[Path, int] = field(default_factory=dict)
 
     def update(self) -> str:
-        """Reads what the unit's files have grown by; returns what is new of the log."""
+        """Reads what was appended to the unit's files; returns the new part of the log."""
         for line in self._new_lines(self.files.calls).splitlines():
             self._take_call(line)
         for line in self._new_lines(self.files.panel).splitlines():
@@ -94,12 +94,12 @@ class Run:
         ]
 
     def commands(self) -> list[Call]:
-        """All commands but those of the panel and the sound, in order."""
+        """All commands except those of the panel and the sound, in order."""
         apart = ("i2cset ", "aplay ")
         return [call for call in self.calls if call.call != "nanosleep" and not call.text.startswith(apart)]
 
     def waits(self) -> list[Call]:
-        """The waits, in order, those of the flashing thread left out."""
+        """The waits, in order, without those of the flashing thread."""
         flashing = {call.thread for call in self.calls if call.call == "nanosleep" and call.seconds == 1}
         return [call for call in self.calls if call.call == "nanosleep" and call.thread not in flashing]
 

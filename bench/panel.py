@@ -14,7 +14,7 @@ COLOR_CODES = {name: code for code, name in COLORS.items()}
 
 
 def led_name(led: int) -> str:
-    """The name of a LED that has a use of its own, otherwise its code."""
+    """The name of a LED that has its own use, otherwise its code."""
     return NAMES.get(led, f"{led:#x}")
 
 
@@ -50,7 +50,7 @@ class Led:
 
 
 class Panel:
-    """The controller takes bytes in pairs: a LED and what it is to do, or the step time register and a duration."""
+    """The controller takes bytes in pairs: a LED and its command, or the step time register and a duration."""
 
     def __init__(self) -> None:
         self.leds = {led: Led() for led in range(FIRST_LED, LAST_LED + 1)}

@@ -1,4 +1,4 @@
-"""Runs many scenarios side by side, shows how each came out, and writes their pages."""
+"""Runs many scenarios in parallel, shows the result of each, and writes their pages."""
 
 import subprocess
 import threading
@@ -18,7 +18,7 @@ from bench.unit import UnitError
 
 @dataclass
 class Row:
-    """How one scenario came out."""
+    """The result of one scenario."""
 
     scenario: Scenario
     unit: str  # the kind of unit it ran on
@@ -54,11 +54,11 @@ def run_one(maker: UnitMaker, what: Scenario, stop: threading.Event) -> Row:
 
 def run_all(maker: UnitMaker, scenarios: list[Scenario], at_once: int, gallery: Path | None) -> bool:
     """Runs `scenarios`, `at_once` at a time, and prints a table. Writes their pages and an index of them into the
-    folder `gallery`. True when each came out as its file says."""
+    folder `gallery`. True when the result of each is as its file expects."""
     stop = threading.Event()
     begin = time.monotonic()
     rows = []
-    # The longest first: none of them is left to run alone at the end.
+    # The longest first, so that none of them runs alone at the end.
     order = sorted(scenarios, key=lambda what: what.setup.board.link not in ("dies", "lost"))
     print(f"{'scenario':38} {'unit':8} {'time':>7}  result")
     with ThreadPoolExecutor(at_once) as workers:

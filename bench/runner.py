@@ -21,7 +21,7 @@ from bench.unit import State, Unit, UnitError
 # best: real where this machine allows it. real: with systemd where this machine allows that.
 KINDS = ["best", "real", "real-without-systemd", "stand-in"]
 POLL = 0.02  # s
-LONGEST_RUN = 120  # s, besides the waits; a run that takes longer hangs
+LONGEST_RUN = 120  # s, without the waits; a run that takes longer hangs
 SPACE = 20  # MB, that a unit may take in its temporary folder
 WAITS = 820  # s, of an update at full length
 CLEANUP = Path(__file__).with_name("cleanup.py")
@@ -40,9 +40,9 @@ class Result:
 
 @contextlib.contextmanager
 def temporary_folder() -> Iterator[Path]:
-    """A folder that is removed with this process, however it ends, and with it the updater.
+    """A folder that is removed, and the updater ended, with this process, however it ends.
 
-    Raises UnitError when there is no room for a unit in it.
+    Raises UnitError when it has no space for a unit.
     """
     place = tempfile.gettempdir()
     free = shutil.disk_usage(place).free // 1_000_000
@@ -80,7 +80,7 @@ class UnitMaker:
     build: Path  # folder of the programs
 
     def make(self, scenario: Scenario, folder: Path) -> Unit:
-        """A unit for `scenario` in the empty `folder`. Raises UnitError; NotServed when another kind can do it."""
+        """A unit for `scenario` in the empty `folder`. Raises UnitError; NotServed when another kind can serve it."""
         unit = self._make(scenario, folder)
         if scenario.only not in ("", unit.kind):
             raise NotServed(f"{scenario.name} needs the {scenario.only} unit")
@@ -99,7 +99,7 @@ class UnitMaker:
 
 
 def run_on(unit: Unit, show: Callable[[Run, str], None], speed: float) -> Result:
-    """Runs the updater on `unit`; `show` gets what was seen so far and what is new of the log. Raises UnitError."""
+    """Runs the updater on `unit`; `show` gets the observation so far and the new part of the log. Raises UnitError."""
     seen = Run(unit.files)
     begin = now()
     try:

@@ -1,4 +1,4 @@
-"""Scenario files: what a unit is like before an update, and what must come out. docs/bench.md explains how to add one.
+"""Scenario files: a unit before an update, and the expected result. docs/bench.md explains how to add one.
 
 The dataclasses are the sections of a file: their fields are its keys, with defaults and allowed values.
 """
@@ -37,7 +37,7 @@ class Package:
 class Mirrors:
     """The package mirrors."""
 
-    # What is wrong with them: apt exits 100. All but "unreachable" need a server, for signed release files.
+    # Their fault: apt exits 100. All but "unreachable" need a server, for signed release files.
     refresh: Literal["works", "unreachable", "wrong-key", "expired", "not-yet-valid", "half-synchronised"] = "works"
     # file: a folder, not signed. Signed, over HTTP: stalls: in the middle of the package. slow: 8 kbit/s.
     server: Literal["file", "http", "stalls", "slow"] = "file"
@@ -65,7 +65,7 @@ class Stick:
 
     inserted: bool = True
     directories: list[str] = field(default_factory=lambda: ["quorb2.2.0"])  # version directories under debs/QUORB/armhf
-    # debs/installTV. unreadable: ls exits with a code that no file system brings about.
+    # debs/installTV. unreadable: ls exits with a code that no file system causes.
     teamviewer: Literal["absent", "file", "directory", "unreadable"] = "absent"
     pulled_out: Literal["never", "before-upload"] = "never"
 
@@ -94,7 +94,7 @@ class Updater:
     """The updater and what happens to it."""
 
     program: Literal["remote", "main"] = "remote"  # main: examples/main-head
-    answer: str = "all"  # of the main head's operator to the list that is offered; "" no answer
+    answer: str = "all"  # of the main head's operator to the offered list; "" no answer
     arguments: list[str] = field(default_factory=list)
     children: Literal["waited-for", "ignored"] = "waited-for"  # ignored: started with SIGCHLD ignored
     # by the service manager. at-its-end: by its own last command. in-install: while the package is being installed.
@@ -102,13 +102,13 @@ class Updater:
 
     @property
     def input(self) -> str:
-        """What the program reads on standard input; the remote head's has no operator."""
+        """What the program reads on standard input; the remote head's program has no operator."""
         return f"{self.answer}\n" if self.program == "main" and self.answer else ""
 
 
 @dataclass
 class Setup:
-    """What a unit is like before an update."""
+    """A unit before an update."""
 
     package: Package = field(default_factory=Package)
     mirrors: Mirrors = field(default_factory=Mirrors)
@@ -121,7 +121,7 @@ class Setup:
 
 @dataclass
 class Expect:
-    """What must come out."""
+    """The expected result."""
 
     status: list[int]  # exit codes, or minus signal numbers, that the updater may end with
     # LED: colour at the end; LEDs that are not named are dark. any: whatever is lit has this colour.
@@ -131,7 +131,7 @@ class Expect:
     waits: list[int]  # s, in order, without those of the flashing thread
     # of the update's thread, a line each: the operation's name, a colon, the message. "(name ...)" is a block of
     # expected.py, "(N more)" repeats the line above, "{name}" is a command of expected.py, "..." matches any records,
-    # and at a line's end any rest of it.
+    # or at a line's end any rest of it.
     log: str
     package: str
     board: str
@@ -228,7 +228,7 @@ def _scenario(name: str, content: dict[str, Any]) -> Scenario:
 
 
 def expectations(values: dict[str, Any]) -> Expect:
-    """What must come out, from the section of a file. Raises FieldError."""
+    """The expected result, from the section of a file. Raises FieldError."""
     expect = fill(Expect, "expect.", values)
     try:
         expected_commands(expect.commands)

@@ -1,6 +1,6 @@
-"""bench/times: where the time of a run on the bench unit goes, from the command to the cleared machine.
+"""bench/times: prints what a run on the bench unit spends its time on, from the command to the clean-up.
 
-Each figure is the median of the runs. The goals are those of a machine with 2 cores that does nothing else.
+Each figure is the median of the runs. The goals are for an idle machine with 2 cores.
 """
 
 import argparse
@@ -36,7 +36,7 @@ class Stopwatch:
 
 
 def measure(name: str) -> tuple[str, dict[str, float]]:
-    """One run of the scenario `name`: what unit it ran on, and the time for each purpose (s). Raises UnitError."""
+    """One run of the scenario `name`: the unit it ran on, and the time for each purpose (s). Raises UnitError."""
     what = scenario.load(name)
     watch = Stopwatch()
     interpreter = [sys.executable, "-B", "-c", "import argparse, statistics, subprocess, tomllib, zipfile"]

@@ -1,4 +1,4 @@
-"""What the bench asks of a unit: the stand-in unit and the real one are two makes of the same thing."""
+"""The interface of a unit; the stand-in unit and the real one are two implementations of it."""
 
 from dataclasses import dataclass, field
 from pathlib import Path
@@ -10,7 +10,7 @@ PROGRAMS = {"remote": Path("harl-updater"), "main": Path("bench/main-head")}
 
 @dataclass
 class State:
-    """The lasting things of a unit, read at any moment of a run."""
+    """The state of a unit at any moment of a run."""
 
     package: str  # version of the head's package, "(none)" when it is not installed
     board: str  # version in the board's version file, "" when it cannot be read from the bench's side
@@ -45,7 +45,7 @@ class Unit(Protocol):
 
     `__init__(scenario, folder, speed, build)` only keeps its arguments: the scenario, an empty folder for everything
     the unit needs, how many times faster the updater's own clock and waits run (1: full length), and the folder of the
-    programs. The rest of the bench calls `start`, then `ended` and `state` again and again, and `close` in any case.
+    programs. The rest of the bench calls `start`, then `ended` and `state` repeatedly, and `close` in any case.
     """
 
     kind: str  # "real" or "stand-in"
@@ -63,12 +63,12 @@ class Unit(Protocol):
         """The unit as it is now; called several times a second while the updater runs, and once after it."""
 
     def close(self) -> None:
-        """Ends every process of the unit and takes everything back. May be called at any time and more than once."""
+        """Ends every process of the unit and undoes everything. May be called at any time and more than once."""
 
 
 def with_pid_file(folder: Path, command: list[str | Path]) -> list[str | Path]:
-    """`command`, to be started in a session of its own, with a line in front that leaves its process id in `folder`.
+    """`command`, to be started in its own session, preceded by a line that writes its process id into `folder`.
 
-    Whoever clears the folder away ends the session; a command that finds the folder gone does not start.
+    Whoever removes the folder ends the session; a command that finds the folder gone does not start.
     """
     return ["/bin/sh", "-c", 'echo $$ >"$0/unit.pid" && exec "$@"', folder, *command]

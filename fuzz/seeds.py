@@ -1,6 +1,6 @@
 """Usage: seeds.py FOLDER
 
-Writes the fuzzers' first inputs: what the tools print in each of the bench's scenarios, its sticks, some archives,
+Writes the fuzzers' first inputs: the output of the tools in each of the bench's scenarios, its sticks, some archives,
 and the golden logs.
 """
 
@@ -49,7 +49,7 @@ FIT_STICK = (
     f"ddebs\x1eddebs/QUORB\x1ed{BOARD_FOLDER}\x1ed{BOARD_FOLDER}/quorb2.2.0\x1ez{BOARD_FOLDER}/quorb2.2.0/OSUpgrade.zip"
     f"\x1ex{BOARD_FOLDER}/quorb2.2.0/unzipUpgrade.sh\x1f#!/bin/sh\nexit 0\n"
 )
-# What else can lie on a stick that the bench has not.
+# Other contents of a stick that the bench does not have.
 ODD_STICKS = {
     "hidden": f"{FIT_STICK}\x1ef{BOARD_FOLDER}/.hidden",
     "hidden-folder": FIT_STICK.replace("quorb2", ".quorb2"),
@@ -78,7 +78,7 @@ def stick_seed(setup: Setup) -> str:
 
 
 def archive_seeds() -> dict[str, bytes]:
-    """Intact archives of every kind that is tested, on a sound medium."""
+    """Intact archives of every tested kind, on a healthy medium."""
     seeds = {}
     for method in (zipfile.ZIP_STORED, zipfile.ZIP_DEFLATED, zipfile.ZIP_BZIP2):
         file = io.BytesIO()

@@ -1,8 +1,9 @@
 """Usage: performance/processes [ROUNDS]
 
-Runs whole updates on the stand-in unit with the waits taken out, a run of each outcome, next to the same commands in a
-bare loop of system(3) calls and in a POSIX shell script. In each of the ROUNDS (9) all of them run in turn; the figures
-are medians, and ratios to the loop of the same round as median and, in brackets, lowest and highest.
+Runs whole updates on the stand-in unit without the waits, a run of each outcome, and compares them with the same
+commands in a bare loop of system(3) calls and in a POSIX shell script. In each of the ROUNDS (9) all of them run in
+turn. The figures are medians; ratios to the loop of the same round are given as median and, in brackets, lowest and
+highest.
 """
 
 import copy
@@ -30,7 +31,7 @@ PROGRAMS = ["updater", "loop", "script", "shells"]
 
 @dataclass
 class Cost:
-    """What one run took: seconds, and KiB. `own` and `peak` are those of the program without its children."""
+    """The cost of one run: seconds, and KiB. `own` and `peak` are those of the program without its children."""
 
     wall: float
     cpu: float
@@ -72,7 +73,7 @@ class MeasuredUnit(StandInUnit):
 
 
 def prepare(folder: Path, commands: list[str]) -> dict[str, list[str | Path]]:
-    """The programs to be compared, with what they run in `folder`."""
+    """The programs to compare, with the files that they run in `folder`."""
     lines = "".join(f"{command}\n" for command in commands)
     (folder / "commands").write_text(lines)
     (folder / "shells").write_text(":\n" * len(commands))
@@ -97,13 +98,13 @@ def recorded(name: str) -> tuple[list[str], float]:
 
 
 def processes_of(name: str, command: list[str | Path]) -> int:
-    """How many processes, and threads, a run starts: a process namespace numbers them."""
+    """How many processes and threads a run starts: a process namespace numbers them."""
     with temporary_folder() as folder:
         unit = MeasuredUnit(name, folder)
         counting = '"$@"; (exec /bin/sh -c \'echo $$ >"$UNIT/last"\'); :'
         inner = ["/usr/bin/env", f"LD_PRELOAD={BUILD}/performance/measured.so", *command]
         unit.run(["/usr/bin/unshare", "--map-root-user", "--pid", "--fork", "/bin/sh", "-c", counting, "sh", *inner])
-        return int((folder / "last").read_text()) - 2  # but for the counting shells
+        return int((folder / "last").read_text()) - 2  # without the counting shells
 
 
 def spread(values: list[float]) -> str:

@@ -1,4 +1,4 @@
-"""target/run: proves the updater's package on an emulated armhf unit: kernel, systemd, real tools, I2C bus, sound."""
+"""target/run: tests the updater's package on an emulated armhf unit: kernel, systemd, real tools, I2C bus, sound."""
 
 import argparse
 import contextlib
@@ -26,7 +26,7 @@ ROOT = HERE.parent
 PACKAGED = ["CMakeLists.txt", "cmake", "common", "debian", "companion", "docs/man", "packaging", "remote", "service"]
 NEEDED = ["qemu-system-arm", "qemu-user-static", "mmdebstrap", "arch-test", "e2fsprogs", "dosfstools", "mtools", "kmod"]
 NEEDED += ["cpio", "openssh-client", "dpkg-dev", "g++-11-arm-linux-gnueabihf"]  # of Debian
-SPACE = 2000  # MiB, for disks and results; and for each power cut:
+SPACE = 2000  # MiB, for disks and results; and in addition for each power cut:
 DISK_SPACE = 500
 SPEED = 300  # how many times shorter the updater's waits are
 TOOL_LIMIT = 3000  # s, to build the package or the image
@@ -37,9 +37,9 @@ class TargetError(Exception):
 
 
 def run_tool(command: list[str | Path], output: int | IO[str], errors: IO[str] | None) -> str | None:
-    """Runs a long command; whatever ends this program ends it with all that it started.
+    """Runs a long command; it ends with this program, as does everything that it started.
 
-    Returns its output when that is a pipe, "" when not, and None when it failed. Raises TargetError.
+    Returns its output if that is a pipe, otherwise "", and None if it failed. Raises TargetError.
     """
     with subprocess.Popen(command, stdout=output, stderr=errors, text=True, start_new_session=True) as tool:
         try:
@@ -53,7 +53,7 @@ def run_tool(command: list[str | Path], output: int | IO[str], errors: IO[str] |
 
 
 def updater_package(given: Path | None) -> Path:
-    """The package to prove: the one that was given, or one built from the checked-out commit. Raises TargetError."""
+    """The package to test: the given one, or one built from the checked-out commit. Raises TargetError."""
     if given:
         fields: list[str | Path] = ["dpkg-deb", "--field", given, "Package", "Architecture"]
         seen = subprocess.run(fields, stdout=subprocess.PIPE, stderr=subprocess.DEVNULL, text=True, check=False).stdout
@@ -64,7 +64,7 @@ def updater_package(given: Path | None) -> Path:
     sources = subprocess.check_output(["git", "ls-tree", "HEAD", *PACKAGED], cwd=ROOT, text=True)
     built = WORK / "package-sources"
     packages = list(folder.glob("harl-updater_*_armhf.deb"))
-    # A package newer than the note comes from another call of packaging/build, perhaps from other sources.
+    # A package newer than the note comes from another call of packaging/build, possibly from other sources.
     if (
         not (built.exists() and packages)
         or built.read_text() != sources
@@ -83,7 +83,7 @@ def updater_package(given: Path | None) -> Path:
 
 
 def make_image() -> Path:
-    """The folder of the unit's disk and boot files, made when there is none yet. Raises TargetError."""
+    """The folder of the unit's disk and boot files, made if there is none yet. Raises TargetError."""
     folder = run_tool([HERE / "image", WORK / "cache"], subprocess.PIPE, None)
     if folder is None:
         raise TargetError("no image of the unit, see above")
@@ -110,7 +110,7 @@ def print_table(results: Results) -> None:
 
 @contextlib.contextmanager
 def emulation(package: Path | None, speed: float, space: int) -> Iterator[Emulation]:
-    """The unit's image and the package to prove, while no other run uses the folder. Raises TargetError.
+    """The unit's image and the package to test, while no other run uses the folder. Raises TargetError.
 
     @param space  on the disk (MiB)
     """
@@ -130,7 +130,7 @@ def emulation(package: Path | None, speed: float, space: int) -> Iterator[Emulat
 
 
 def run(plans: list[Plan], unit: Emulation) -> int:
-    """Runs `plans` and shows what came of them. Returns the status of the command. Raises MachineError."""
+    """Runs `plans` and shows their results. Returns the status of the command. Raises MachineError."""
     begin = time.monotonic()
     shared = [plan for plan in plans if not plan.settings.is_cut()]
     results = unit.run_shared(shared) if shared else {}

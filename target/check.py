@@ -1,4 +1,4 @@
-"""Compares what a scenario left with what must come out: all that the bench compares, and what only the unit shows."""
+"""Compares the result of a scenario with the expected one: as the bench does, and in what only the unit shows."""
 
 import math
 import re
@@ -13,7 +13,7 @@ from target.inputs import BOARD_VERSION
 from target.plan import Plan
 
 IDENTIFIER = "harl-updater"
-LONGEST_PHASE = 1.2  # of the flashing, with the hand-over: times as long as without
+LONGEST_PHASE = 1.2  # of the flashing: how many times as long with the hand-over as without
 AFTER_START = ["startHARL: 0", "stopUpdater:"]  # the records after the command that starts the application
 
 
@@ -37,13 +37,13 @@ def check_bus(plan: Plan, evidence: Evidence) -> list[str]:
     if plan.settings.event == "nothing" or plan.settings.is_cut():
         if sent != ended:
             return [f"bus: {len(sent)} bytes that are not the {len(ended)} bytes of the commands"]
-    elif sent[: len(ended)] != ended:  # what runs after the updater sends more
+    elif sent[: len(ended)] != ended:  # give-back sends more after the updater
         return ["bus: does not begin with the bytes of the commands"]
     return []
 
 
 def check_main_thread(evidence: Evidence) -> list[str]:
-    """The records of the thread that waits for the update; the bench's comparison is of the others."""
+    """The records of the thread that waits for the update; the bench compares those of the others."""
     records = evidence.result.run.records()
     seen = [f"{record.operation}: {record.message}".strip() for record in records if record.thread == records[0].thread]
     banner = f"main: TavrenUpdater version: {evidence.before['updater']}"
@@ -56,7 +56,7 @@ def check_sound(evidence: Evidence) -> list[str]:
     run = evidence.result.run
     sound = next((call for call in run.calls if call.text.startswith("aplay ")), None)
     if sound is None or sound.end is None:
-        return []  # the bench's comparison tells whether one was expected
+        return []  # the bench's comparison shows whether one was expected
     found = []
     flashed = [lit(change.leds) for change in run.changes if change.time < sound.start and lit(change.leds)]
     if flashed != [[{"REMOTE": "blue"}, {"MAIN": "blue"}][index % 2] for index in range(len(flashed))] or not flashed:
@@ -70,7 +70,7 @@ def check_sound(evidence: Evidence) -> list[str]:
 
 
 def check(plan: Plan, evidence: Evidence) -> list[str]:
-    """One line for each difference; none when the run came out as `plan` says."""
+    """One line for each difference; none when the run was as `plan` expects."""
     before, after = evidence.before, evidence.after
     found = differences(plan.like, evidence.result) + check_main_thread(evidence)
     found += check_bus(plan, evidence) + check_sound(evidence)
@@ -108,16 +108,16 @@ def check(plan: Plan, evidence: Evidence) -> list[str]:
 
 
 def check_whole(evidence: Evidence) -> list[str]:
-    """Nothing is left unfinished in the package database, no file is damaged, and the disk had no error."""
+    """The package database has nothing unfinished, no file is damaged, and the disk had no error."""
     names = ("damaged_files", "audit", "disk_errors")
     return [line for name in names for line in same(name, "0", evidence.after[name])]
 
 
 def check_cut(plan: Plan, panel: Panel, evidence: Evidence) -> list[str]:
-    """What the panel showed when the machine was stopped, and what the journal has of the run that was cut.
+    """What the panel showed when the machine stopped, and which records of the interrupted run the journal has.
 
     Right before the application starts: the outcome, and every record up to that command. Earlier: the blue flashing of
-    an update at work, and the records up to any of them, as far as the journal had written them.
+    a running update, and the first records, as far as the journal had written them.
     """
     found = []
     pattern = panel.pattern(0)
@@ -136,7 +136,7 @@ def check_cut(plan: Plan, panel: Panel, evidence: Evidence) -> list[str]:
 
 
 def check_next_run(plan: Plan, evidence: Evidence) -> list[str]:
-    """The run after a power cut, with the network and the stick: it does what is left to do and shows that."""
+    """The run after a power cut, with network and stick: it does what is left to do and shows that."""
     state, before, after = evidence.result.state, evidence.before, evidence.after
     done = {call.text for call in evidence.result.run.commands()}
     outcome = UPDATED if done & {COMMANDS["install-package"], COMMANDS["install-board"]} else UP_TO_DATE

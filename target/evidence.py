@@ -1,4 +1,4 @@
-"""What a scenario left: the guest's files and its part of the I2C trace, in the form in which the bench sees a run."""
+"""The result of a scenario: the guest's files and its part of the I2C trace, in the form of a run of the bench."""
 
 import json
 import re
@@ -18,7 +18,7 @@ EVENT = re.compile(r"i2c_(?P<kind>send|recv) \w+\(addr:0x07\) data:0x(?P<byte>\w
 WRITE = re.compile(r" (?P<time>[\d.]+): smbus_write: i2c-0 a=007 f=\w+ c=(?P<byte>\w+) BYTE ")
 PIECE = 400  # bytes of a sound, 25 ms
 LAST_PIECES = 8
-CLD_EXITED = 1  # waitid(2), as the service manager shows it in ExecMainCode; other codes are for signals
+CLD_EXITED = 1  # waitid(2), shown by the service manager in ExecMainCode; other codes are for signals
 
 
 @dataclass
@@ -30,9 +30,9 @@ class Evidence:
     sent: list[int]  # those that went over the bus
     before: dict[str, str]
     after: dict[str, str]
-    identifiers: set[str]  # under which the updater's own records stand in the journal
-    package_script: dict[str, float]  # "began", "ended": when the package's maintainer script did, s since the boot
-    before_cut: list[str] | None  # the records of the run before the power cut that the journal has; None: no cut
+    identifiers: set[str]  # of the updater's own records in the journal
+    package_script: dict[str, float]  # "began", "ended": times of the package's maintainer script, s since the boot
+    before_cut: list[str] | None  # the records in the journal of the run before the power cut; None: no cut
     power_cuts: list[float]  # when the power was cut, s since the boot
     flashing: dict[str, list[float]]  # how long phases of it took (s), with the "hand-over" and "direct"
 
@@ -41,7 +41,7 @@ class Evidence:
         return median(self.flashing["hand-over"]) / median(self.flashing["direct"])
 
     def remarks(self) -> list[str]:
-        """What else was measured, a line each."""
+        """Other measurements, a line each."""
         lines = []
         if self.flashing:
             lines.append(
@@ -70,13 +70,13 @@ def read_state(file: Path) -> dict[str, str]:
 
 
 def read_journal(file: Path, log: Path) -> set[str]:
-    """Writes the updater's own lines of the journal to `log`; what its children and systemd say is left out.
+    """Writes the updater's own lines of the journal to `log`, without those of its children and systemd.
 
     Returns the identifiers of those lines. The updater's process is the one that printed the banner.
     """
     entries = [json.loads(line) for line in file.read_text().splitlines()]
     texts = [entry["MESSAGE"] for entry in entries]
-    # The journal gives a message that is not all printable, such as one with a carriage return, as a list of bytes.
+    # journalctl gives a message with unprintable characters, such as a carriage return, as a list of bytes.
     lines = [text if isinstance(text, str) else bytes(text).decode("utf-8", "backslashreplace") for text in texts]
     process = next((entry["_PID"] for entry, line in zip(entries, lines) if "TavrenUpdater version: " in line), None)
     own = [(entry, line) for entry, line in zip(entries, lines) if entry.get("_PID") == process]
@@ -85,12 +85,12 @@ def read_journal(file: Path, log: Path) -> set[str]:
 
 
 def read_words(file: Path) -> list[list[str]]:
-    """The words of each line; none without the file."""
+    """The words of each line; no lines without the file."""
     return [line.split() for line in file.read_text().splitlines()] if file.exists() else []
 
 
 def read_before_cut(folder: Path) -> list[str] | None:
-    """The records of the run before the power cut that the journal has, as the bench compares them; None: no cut."""
+    """The records in the journal of the run before the power cut, as the bench compares them; None: no cut."""
     journal = folder / "journal-before-cut"
     if not journal.exists():
         return None
@@ -102,10 +102,10 @@ def read_before_cut(folder: Path) -> list[str] | None:
 
 
 def heard(recording: Path) -> list[str]:
-    """The sounds that the sound card played to the end, by file name.
+    """The sounds that the sound card played to their end, by file name.
 
-    The loopback card may drop some samples when its timer is late: nine pieces of ten must be there, in order, and one
-    of the last ones.
+    The loopback card may drop samples when its timer is late: nine of ten pieces must be there, in order, and one of
+    the last ones.
     """
     data = recording.read_bytes()
     names = []
@@ -123,7 +123,7 @@ def heard(recording: Path) -> list[str]:
 
 
 def read(folder: Path, sent: list[int]) -> Evidence:
-    """Reads what one scenario left in `folder`; the bytes `sent` went over the bus meanwhile."""
+    """Reads the result of one scenario in `folder`; `sent` are the bytes that went over the bus meanwhile."""
     before, after = read_state(folder / "before"), read_state(folder / "after")
     files = Files(log=folder / "log", calls=folder / "calls", panel=folder / "panel")
     identifiers = read_journal(folder / "journal", files.log)

@@ -1,4 +1,4 @@
-"""What a boot carries into the unit: the guest's program, packages, stick, keys, and a folder for each scenario."""
+"""The inputs of a boot of the unit: the guest's program, packages, stick, keys, and a folder for each scenario."""
 
 import hashlib
 import re
@@ -34,7 +34,7 @@ def run(*command: str | Path) -> None:
 
 
 def head_package(version: str, settings: Settings, depends: str = "") -> Package:
-    """The head's package of `version`; its maintainer script notes when it begins and ends, if it takes some time."""
+    """The head's package of `version`; a maintainer script that takes time notes when it begins and ends."""
     files = {f"opt/solvik4/part{number}": f"{version}\n" * 1000 for number in range(1, settings.package_files)}
     package = Package("solvik4-rh", version, files={"opt/solvik4/version": f"{version}\n", **files})
     if depends:
@@ -42,9 +42,9 @@ def head_package(version: str, settings: Settings, depends: str = "") -> Package
     if settings.script_seconds:
         note = 'echo "{}" "$(cut -d " " -f 1 /proc/uptime)" >> /run/package-script'
         lines = [note.format("began")]
-        # A tool that keeps a line without an end in memory is killed for it.
+        # A tool that keeps an endless line in memory is killed.
         lines += ["tail /dev/zero || true"] if settings.event == "out-of-memory" else []
-        # It goes on talking after its long work, to whoever listens then.
+        # It prints more after its long work, to whoever still reads.
         lines += [f"sleep {settings.script_seconds}", "echo set up", note.format("ended")]
         package.scripts["postinst"] = "\n".join(lines)
     return package
@@ -79,7 +79,7 @@ def write_scenario(folder: Path, plan: Plan, updater: Path, speed: float, again:
         "event": "nothing" if again else plan.settings.event,  # see plan.py
         "power_cuts": "" if again else " ".join(map(str, plan.settings.power_cuts)),
         "keep_journal": "yes" if plan.settings.is_cut() else "no",  # on the disk
-        "keep_head": "yes" if again else "no",  # the head and the board are left as the power cut left them
+        "keep_head": "yes" if again else "no",  # the head and the board stay as the power cut left them
         "times_flashing": "yes" if plan.settings.times_flashing else "no",
         "speed": str(speed),  # how many times shorter the updater's waits are
         "shortest_wait": str(plan.settings.shortest_wait if speed > 1 else 1),
@@ -89,7 +89,7 @@ def write_scenario(folder: Path, plan: Plan, updater: Path, speed: float, again:
 
 
 def write_stick_image(image: Path, folder: Path, never_returns: bool) -> None:
-    """Writes the stick: a FAT file system with the board's upgrade files. `folder` is for the files on their way."""
+    """Writes the stick: a FAT file system with the board's upgrade files. `folder` is for temporary files."""
     archive = zip_archive(BOARD_VERSION)
     # The image has no unzip.
     text = version_text(BOARD_VERSION).replace("\t", "\\t").replace("\r\n", "\\r\\n")
@@ -110,7 +110,7 @@ def write_stick_image(image: Path, folder: Path, never_returns: bool) -> None:
 
 
 def write_head(folder: Path, image: Path) -> None:
-    """Writes the files of the head's own that all scenarios share."""
+    """Writes the head's own files, which all scenarios share."""
     write_sounds(folder)
     ssh = folder / "root/.ssh"
     ssh.mkdir()
@@ -146,7 +146,7 @@ def build_hand_over(program: Path, limit: int) -> None:
 def write_input(
     disk: Path, folder: Path, image: Path, updater: Path, plans: list[Plan], speed: float, again: bool
 ) -> None:
-    """Writes the disk that brings `plans` into the unit. `again`: the run after a power cut."""
+    """Writes the disk with `plans` for the unit. `again`: the run after a power cut."""
     shutil.rmtree(folder, ignore_errors=True)
     folder.mkdir()
     write_head(folder / "root", image)

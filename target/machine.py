@@ -1,4 +1,4 @@
-"""The emulated machine: boots a disk with what a run carries in, within a bounded time, and brings back its results."""
+"""The emulated machine: boots a disk with a run's inputs, within a bounded time, and returns the run's results."""
 
 import os
 import shutil
@@ -12,19 +12,19 @@ from pathlib import Path
 BOOT_LIMIT = 900  # s, until the guest's own program runs; a minute on an idle machine
 POLL = 0.2  # s
 OUTPUT_SIZE = 128 << 20  # bytes, for the results of one boot
-CUT = "target: power-cut"  # what the guest's console says when the machine loses its power
+CUT = "target: power-cut"  # the line on the guest's console when the machine loses its power
 
 
 stopping = threading.Event()
 
 
 def stop_machines() -> None:
-    """Ends all machines that run, and lets none start any more: for a program that ends early."""
+    """Ends all running machines and starts no more: for a program that ends early."""
     stopping.set()
 
 
 class MachineError(Exception):
-    """The machine did not do what a boot must do; the text is one line with what to look at."""
+    """The boot failed; the text is one line that says where to look."""
 
 
 def drive(name: str, file: Path, *options: str) -> list[str]:
@@ -34,7 +34,7 @@ def drive(name: str, file: Path, *options: str) -> list[str]:
 
 
 def copy_disk(disk: Path, copy: Path) -> None:
-    """Copies a disk image; what it has no data for takes no space."""
+    """Copies a disk image; holes take no space."""
     subprocess.run(["cp", "--sparse=always", disk, copy], check=True)
 
 
@@ -52,9 +52,9 @@ def boot(
 
     @param image   folder with the kernel, the device tree and the initrd
     @param disk    the root file system; written to only when `keep`
-    @param inputs  the disk that carries the scenarios in
+    @param inputs  the disk with the scenarios
     @param limit   how long the scenarios may take (s)
-    @param cut     stop the machine hard when the guest asks for it; there are no results of the guest then
+    @param cut     stop the machine hard when the guest asks for it; then the guest leaves no results
     @param copies  instead: where a copy of the disk goes each time that the guest asks for it
     Raises MachineError.
     """
@@ -67,7 +67,7 @@ def boot(
     command = ["setpriv", "--pdeathsig", "KILL", "nice", "qemu-system-arm"]  # it never outlives this process
     command += ["-M", "vexpress-a15", "-m", "1024", "-no-reboot", "-display", "none", "-monitor", "none"]
     command += ["-kernel", str(image / "vmlinuz"), "-initrd", str(image / "initrd"), "-dtb", str(image / "board.dtb")]
-    # The guest's clock counts instructions (2 ns each): a busy host makes the run longer, not the guest's tools late.
+    # The guest's clock counts instructions (2 ns each): a busy host lengthens the run but delays no tool of the guest.
     command += ["-icount", "shift=1"]
     command += ["-append", "rw console=ttyAMA0 quiet", "-serial", f"file:{console}", "-audiodev", "none,id=none"]
     # The panel's controller: a chip that acknowledges at its address. Every byte on the bus goes into the trace.
@@ -100,9 +100,9 @@ def boot(
 
 
 def follow(machine: subprocess.Popen[bytes], console: Path, limit: float, disk: Path, copies: list[Path]) -> int:
-    """Shows the guest's progress until it ends, or until it asks for a power cut and `copies` has no place any more.
+    """Shows the guest's progress until it ends, or until it asks for a power cut and `copies` has no more entries.
 
-    A copy has what a machine that is stopped hard at that moment leaves on `disk`: it is held meanwhile.
+    A copy has what a hard stop at that moment would leave on `disk`: the machine is held meanwhile.
     Returns how often the guest asked for a power cut. Raises MachineError.
     """
     begin = time.monotonic()

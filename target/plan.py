@@ -1,4 +1,4 @@
-"""Scenario files of the target test. docs/target-test.md tells how to add one."""
+"""Scenario files of the target test. docs/target-test.md explains how to add one."""
 
 import copy
 import re
@@ -30,18 +30,18 @@ NOT_IN_SCRIPT = ("nothing", "power-cut-before-application")
 
 @dataclass
 class Settings:
-    """What a file may say beside `summary`, `like` and `expect`."""
+    """The keys of a file besides `summary`, `like` and `expect`."""
 
-    # what befalls the updater: while the package's maintainer script is at work, or right before the application starts
+    # an event while the package's maintainer script runs, or right before the application starts
     event: Event = "nothing"
     script_seconds: int = 0  # that the package's maintainer script takes
     package_files: int = 1  # that the offered package has
     needs_newer_updater: bool = False  # the offered package depends on a newer harl-updater, which is offered too
-    board_script_limit: int = 0  # s, of the hand-over, in place of the shipped one; 0: the shipped one
-    shortest_wait: int = 5  # s, that the updater's waits are shortened to at most; a pause of the flashing takes that
-    # moments at which the disk is copied as a power cut leaves it: parts of the length of the run before, in one boot
+    board_script_limit: int = 0  # s, of the hand-over, instead of the shipped one; 0: the shipped one
+    shortest_wait: int = 5  # s, of the updater's shortened waits; each pause of the flashing takes this long
+    # moments at which the disk is copied as a power cut leaves it: parts of the length of an earlier run, in one boot
     power_cuts: list[float] = field(default_factory=list)
-    times_flashing: bool = False  # after the run: a phase of the flashing, with the hand-over and without
+    times_flashing: bool = False  # after the run: phases of the flashing, with and without the hand-over
 
     def is_cut(self) -> bool:
         """Whether the machine loses its power."""
@@ -50,11 +50,11 @@ class Settings:
 
 @dataclass
 class Expect:
-    """What must come out beside what the bench scenario says."""
+    """The expected result, besides that of the bench scenario."""
 
-    result: str = "success"  # the service manager's word for the unit's end
-    package_status: str = "installed"  # the package manager's
-    updater: Literal["same", "newer"] = "same"  # version of harl-updater against the one before
+    result: str = "success"  # the service manager's result of the service
+    package_status: str = "installed"  # the package manager's state
+    updater: Literal["same", "newer"] = "same"  # version of harl-updater compared with the one before
 
 
 # What the target test can make of a bench scenario's setup; everything else must be a default of bench/scenario.py.

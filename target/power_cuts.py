@@ -1,8 +1,8 @@
-"""target/run --power-cuts: the power is cut at random moments of an update, and each time the next run is judged.
+"""target/run --power-cuts: cuts the power at random moments of an update and checks the next run each time.
 
 The update runs once to learn how long it takes up to the start of the application, and once more for the power cuts. At
-each moment the machine is held and its disk copied: the copy has, byte for byte, what a machine leaves that is stopped
-hard then. A boot of each copy and a whole run of the updater follow.
+each moment the machine is held and its disk copied: the copy has, byte for byte, what a hard stop would leave. Then
+each copy is booted and the updater runs to its end.
 """
 
 import os
@@ -22,7 +22,7 @@ from target.plan import Plan, Settings, load
 from target.runner import WORK, Emulation, read_all
 
 SEED = 1
-# A maintainer script and an unpacking that take some seconds each on the emulated unit.
+# A maintainer script and an unpacking that take a few seconds each on the emulated unit.
 SETTINGS = Settings(script_seconds=3, package_files=100)
 
 
@@ -51,7 +51,7 @@ def short(command: str) -> str:
 
 
 def found_in(evidence: Evidence) -> str:
-    """What the unit was found in after the boot."""
+    """The state of the unit after the boot."""
     before = evidence.before
     marker = "marker" if before["marker"] == "yes" else "no marker"
     return f"{before['package']} {before['package_status']}, board {before['board']}, {marker}"
@@ -90,7 +90,7 @@ def run_next(unit: Emulation, plan: Plan, disks: list[Path]) -> Iterator[Evidenc
 
 
 def run(unit: Emulation, count: int) -> int:
-    """Cuts the power `count` times and shows what came of each. Returns the status of the command.
+    """Cuts the power `count` times and shows the result of each. Returns the status of the command.
 
     Raises MachineError.
     """

@@ -1,4 +1,4 @@
-"""Runs scenarios on the emulated unit, those of one boot one after the other, and reads what each left."""
+"""Runs scenarios on the emulated unit, those of one boot one after the other, and reads the result of each."""
 
 from dataclasses import dataclass
 from pathlib import Path
@@ -11,22 +11,22 @@ from target.machine import MachineError, boot, copy_disk
 from target.plan import Plan
 
 WORK = Path(__file__).parent.parent / "build/target"
-SCENARIO_LIMIT = 1800  # s, for one scenario besides the updater's waits; guest/main gives up before that
-SLOWNESS = 5  # how many times longer than by the unit's clock a wait with the flashing in it may take
+SCENARIO_LIMIT = 1800  # s, for one scenario without the updater's waits; guest/main gives up earlier
+SLOWNESS = 5  # how many times longer than by the unit's clock a wait with flashing may take
 
-Results = dict[str, tuple[Evidence, list[str]]]  # what each scenario left, and its differences
+Results = dict[str, tuple[Evidence, list[str]]]  # the result of each scenario, and its differences
 
 
 @dataclass
 class Emulation:
-    """What every boot has in common."""
+    """The settings that all boots share."""
 
     image: Path  # folder with the disk and the boot files
     updater: Path  # package
     speed: float  # how many times shorter the updater's waits are
 
     def write_input(self, plans: list[Plan], again: bool = False) -> Path:
-        """Writes the disk that brings `plans` into the unit. `again`: the run after a power cut."""
+        """Writes the disk with `plans` for the unit. `again`: the run after a power cut."""
         inputs = WORK / "in.tar"
         write_input(inputs, WORK / "in", self.image, self.updater, plans, self.speed, again)
         return inputs
@@ -40,9 +40,9 @@ class Emulation:
         cut: bool = False,
         copies: list[Path] | None = None,
     ) -> None:
-        """Boots a unit with the `inputs` for `plans` and waits for the end; `folder` then holds what it leaves.
+        """Boots a unit with the `inputs` for `plans` and waits for the end; `folder` then holds the results.
 
-        @param disk  the unit's disk; none: that of the image, left as it is
+        @param disk  the unit's disk; none: that of the image, which stays unchanged
         The rest is as in machine.boot. Raises MachineError.
         """
         limit = sum(SCENARIO_LIMIT + SLOWNESS * sum(plan.like.expect.waits) / self.speed for plan in plans)
@@ -73,7 +73,7 @@ class Emulation:
 
 
 def read_all(plans: list[Plan], folder: Path) -> list[Evidence]:
-    """Reads what a boot with `plans` left in `folder`. Raises MachineError."""
+    """Reads the results of a boot with `plans` from `folder`. Raises MachineError."""
     parts = read_bus(folder / "bus")
     if len(parts) != 2 * len(plans) + 1:
         raise MachineError(f"{len(parts) - 1} marks on the I2C bus for {len(plans)} scenarios: see {folder / 'bus'}")

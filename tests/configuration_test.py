@@ -1,7 +1,7 @@
 """Usage: configuration_test.py BUILD_FOLDER
 
-Configures the project anew in the build folder, in several ways, and compares the lists of tests: flags leave none
-out, and what another option leaves out is named, with the reason.
+Reconfigures the project in the build folder, in several ways, and compares the lists of tests: flags must omit none,
+and CMake must name every test that another option omits, with the reason.
 """
 
 import json
@@ -29,7 +29,7 @@ class ConfigurationTest(unittest.TestCase):
         self.folder = Path(holder.name)
 
     def configure(self, *options: str, **variables: str) -> tuple[int, str]:
-        """The status and the output of CMake in this test's folder, with no flags but those in `variables`."""
+        """The status and the output of CMake in this test's folder, with only the flags in `variables`."""
         environment = {name: value for name, value in os.environ.items() if name not in FLAGS} | variables
         command = ["cmake", "--preset", "default", "-B", str(self.folder), *options]
         done = subprocess.run(
@@ -38,7 +38,7 @@ class ConfigurationTest(unittest.TestCase):
         return done.returncode, re.sub(r"\s+", " ", done.stdout) if done.returncode else done.stdout
 
     def list_tests(self, *options: str, **variables: str) -> tuple[set[str], str]:
-        """The names of the tests, of a whole executable's where it finds them itself, and the output of CMake."""
+        """The names of the tests, or of the executable where CTest finds its tests later, and the output of CMake."""
         status, output = self.configure(*options, **variables)
         self.assertEqual(status, 0, output)
         shown = subprocess.run(

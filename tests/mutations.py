@@ -1,7 +1,7 @@
 """Usage: tests/mutation [--sample NUMBER [--seed NUMBER]] [--since COMMIT] [--jobs NUMBER]
 
-Single-line changes of the product, each built and run against the tests. All of it happens in a copy of the tree in a
-temporary folder: tests are built there once, and for each change only the files that it reaches.
+Makes single-line changes of the product, builds each and runs the tests on it. All this happens in a copy of the tree
+in a temporary folder: the tests are built there once, and for each change only the files that it affects.
 """
 
 import argparse
@@ -42,7 +42,7 @@ HEADERS = [
 SOURCES = [*HEADERS, *LIBRARY, MAIN]
 TESTS = ["unit-tests", "process-tests"]
 SCENARIOS = ["package-and-board", "not-a-service", "up-to-date", "i2cset-missing", "sound-absent"]
-EXPLORED = "--gtest_filter=*/NothingToUpdate:Flashing.*"  # the two explorations that show what the others do
+EXPLORED = "--gtest_filter=*/NothingToUpdate:Flashing.*"  # the two explorations that represent the others
 FLAGS = ["-std=c++17", "-O0", "-Werror=return-type", "-pthread"]
 CONFIGURE = ["cmake", "--preset", "default", "-DCMAKE_CXX_FLAGS_RELEASE=-O0"]
 BUILD_LIMIT = 120  # s
@@ -57,7 +57,7 @@ class Mutation:
     line: int  # of the first
     before: str
     after: str
-    place: str  # which of several lines that are the same; empty for the only one
+    place: str  # which one of several equal lines; empty for the only one
 
     def key(self) -> str:
         return f"{self.file}: {self.before}{self.place} -> {self.after}"
@@ -160,7 +160,7 @@ def apply(mutation: Mutation) -> str:
 
 
 def lines_since(commit: str) -> set[tuple[str, int]]:
-    """Lines of the sources that were added or changed since this branch left that of `commit`."""
+    """Lines of the sources added or changed since this branch left that of `commit`."""
     base = subprocess.run(["git", "merge-base", commit, "HEAD"], cwd=ROOT, capture_output=True, text=True)
     if base.returncode != 0:
         sys.exit(f"tests/mutation: {commit}: no commit to compare with: {base.stderr.strip()}")
@@ -207,7 +207,7 @@ class Trial:
             sys.exit(f"{' '.join(command)} failed in the copy of the tree:\n{done.stdout}{done.stderr}")
 
     def link_command(self, target: str) -> list[str]:
-        """The words of the command that links `target`, its output and the product's own objects left out."""
+        """The words of the command that links `target`, without its output and the product's own objects."""
         show = ["ninja", "-t", "commands", target]
         commands = subprocess.run(show, cwd=self.build, check=True, capture_output=True, text=True).stdout
         words = commands.splitlines()[-1].split()
@@ -217,7 +217,7 @@ class Trial:
         return words
 
     def compile(self, source: str, folder: Path, mutation: Mutation) -> Path | None:
-        """Compiles a file of the product with the change in it; the changed file is found before the original."""
+        """Compiles a file of the product with the change; the compiler finds the changed file before the original."""
         result = folder / (Path(source).stem + ".o")
         path = folder / Path(source).name
         if source != mutation.file:
@@ -235,7 +235,7 @@ class Trial:
         return program if done.returncode == 0 else None
 
     def verdict(self, mutation: Mutation) -> str:
-        """What noticed the change: a test program, "compiler", or "" when nothing did."""
+        """What detected the change: a test program, "compiler", or "" for nothing."""
         with tempfile.TemporaryDirectory(dir=self.scratch) as name:
             folder = Path(name)
             (folder / Path(mutation.file).name).write_text(apply(mutation))
@@ -263,7 +263,7 @@ class Trial:
             return "schedules" if program and not self.passes([str(program), EXPLORED], folder) else ""
 
     def verdict_of_rebuilt_tests(self, mutation: Mutation) -> str:
-        """The verdict where the tests, too, are built with a changed header, as those of a release are."""
+        """The verdict when the tests, too, are built with a changed header, as those of a release are."""
         tree = self.rebuilt_tree
         with self.rebuilding:
             if not tree.exists():
@@ -306,7 +306,7 @@ class Trial:
 
 
 def accepted() -> dict[str, str]:
-    """The survivors that change nothing that can be seen: the key of each, and why."""
+    """The survivors without a visible effect: the key of each, and why."""
     if not ACCEPTED.exists():
         return {}
     entries = [line.rsplit(" # ", 1) for line in ACCEPTED.read_text().splitlines() if line and line[0] != "#"]

@@ -12,7 +12,7 @@ from pathlib import Path
 from bench.cleanup import remove_control_group
 from bench.real.systemd import make_control_group, obstacle
 
-# The machine goes with the process that made it, however that ends.
+# The machine ends with the process that made it, however that ends.
 NAMESPACES = ["setpriv", "--pdeathsig", "KILL", "unshare", "--mount", "--net", "--ipc", "--uts", "--pid", "--fork"]
 NAMESPACES += ["--kill-child", "--mount-proc"]
 MACHINE = Path(__file__).with_name("machine.sh")
@@ -25,9 +25,9 @@ class MachineError(Exception):
 
 
 class Machine:
-    """A running machine. `files` is what it has besides the /usr of the root file system `system`.
+    """A running machine. `files` holds its files besides the /usr of the root file system `system`.
 
-    What it writes stays in memory, or goes to the file system in the file `disk`.
+    What the machine writes stays in memory, or goes to the file system in the file `disk`.
     """
 
     def __init__(self, folder: Path, system: Path, disk: Path | None = None) -> None:
@@ -54,7 +54,7 @@ class Machine:
                 start_new_session=True,
             )
         end = time.monotonic() + LONGEST_START
-        # The word, not the status: before systemd is there, systemctl takes the machine for a chroot and ends with 0.
+        # The word, not the status: before systemd runs, systemctl takes the machine for a chroot and ends with 0.
         while self._inside("systemctl", "is-active", "basic.target").stdout != "active\n":
             if self._namespaces.poll() is not None or time.monotonic() > end:
                 text = (self._folder / "console").read_text(errors="replace").strip().splitlines()
@@ -76,14 +76,14 @@ class Machine:
             time.sleep(0.05)
 
     def run(self, *command: str) -> str:
-        """What the command prints inside; fails with its errors when its status is not 0."""
+        """What the command prints in the machine; fails with its errors when its status is not 0."""
         done = self._inside(*command)
         if done.returncode != 0:
             raise AssertionError(f"{' '.join(command)}: status {done.returncode}\n{done.stdout}{done.stderr}")
         return done.stdout
 
     def status(self, *command: str) -> int:
-        """The status of the command inside."""
+        """The status of the command in the machine."""
         return self._inside(*command).returncode
 
     def root(self) -> Path:
@@ -112,7 +112,7 @@ class Machine:
 
 @contextlib.contextmanager
 def machine(system: Path, disk: Path | None = None) -> Iterator[Machine]:
-    """A machine with the programs of `system`, see Machine, that is not started yet and goes with the block."""
+    """A machine with the programs of `system`, see Machine: not started yet, and removed at the end of the block."""
     with tempfile.TemporaryDirectory(prefix="machine-") as folder:
         made = Machine(Path(folder), system, disk)
         try:

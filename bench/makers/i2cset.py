@@ -1,6 +1,6 @@
-"""Stand-ins for i2cset of i2c-tools before 4.2, and since: the newer ones take the panel's address only with -a.
+"""Stand-ins for i2cset of i2c-tools before 4.2, and since: the newer ones accept the panel's address only with -a.
 
-Lines of shell that judge the arguments; those that follow them get the arguments without -a.
+Lines of shell that check the arguments; the lines after them get the arguments without -a.
 """
 
 UNKNOWN = 'echo "Error: Unsupported option \\"$1\\"!" >&2; echo "Usage: i2cset [-f] [-y] [-m MASK] [-r] {}" >&2; exit 1'

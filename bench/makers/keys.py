@@ -1,4 +1,4 @@
-"""Keys of gpg's, and repositories that they sign."""
+"""Keys for gpg, and repositories that they sign."""
 
 import subprocess
 import tempfile
@@ -8,7 +8,7 @@ from pathlib import Path
 
 
 def make_key(home: Path, name: str, keyring: Path) -> None:
-    """A key of gpg's in the folder `home`, and a keyring with its public half."""
+    """A gpg key in the folder `home`, and a keyring with its public half."""
     home.mkdir(mode=0o700, exist_ok=True)
     command = ["gpg", "--homedir", str(home), "--batch", "--quiet"]
     subprocess.run([*command, "--passphrase", "", "--quick-generate-key", name, "ed25519", "sign", "never"], check=True)
@@ -20,7 +20,7 @@ def sign_index(repository: Path, keyring: Path, fault: str) -> None:
     """Signs the index of the folder `repository` for apt and writes the keyring that verifies it.
 
     @param fault  "wrong-key": the keyring has another key; "expired", "not-yet-valid": of the release file;
-                  "half-synchronised": the index is not the one that was signed; any other text: none
+                  "half-synchronised": the index is not the one that was signed; any other text: no fault
     """
     begin = datetime.now(UTC) + {"expired": -timedelta(days=30), "not-yet-valid": timedelta(days=7)}.get(
         fault, -timedelta(hours=1)

@@ -11,7 +11,7 @@ from pathlib import Path
 from bench.makers.files import write, write_script
 
 SOURCES = "deb [trusted=yes] file:/srv/{folder} ./\n"  # apt's line for a repository in /srv
-# Folders that dpkg and apt want, below the root of a unit without a package.
+# Folders that dpkg and apt require, below the root of a unit without a package.
 DATABASE = [
     "etc/apt/preferences.d",
     "var/cache/apt/archives/partial",
@@ -24,7 +24,7 @@ DATABASE = [
 
 @dataclass
 class Package:
-    """A package of the instrument, which anything can be packed into."""
+    """A package of the instrument with any content."""
 
     name: str
     version: str
@@ -63,7 +63,7 @@ def build_tree(tree: Path, folder: Path) -> Path:
             path.chmod(0o755)
     folder.mkdir(parents=True, exist_ok=True)
     with tempfile.TemporaryDirectory(prefix=".new-", dir=folder) as name:
-        # gzip: what every dpkg of a unit can unpack.
+        # gzip: every dpkg of a unit can unpack it.
         command: list[str | Path] = ["dpkg-deb", "--root-owner-group", "-Zgzip", "--build", tree, name]
         subprocess.run(command, check=True, stdout=subprocess.DEVNULL, stderr=subprocess.PIPE, text=True)
         [file] = Path(name).iterdir()
@@ -85,14 +85,14 @@ def raise_version(file: Path, version: str, folder: Path, more: dict[str, str] |
 
 
 def write_index(repository: Path) -> None:
-    """Writes the index of the packages in the folder `repository`: apt reads it there."""
-    # It finds nothing when it runs in a folder of another mount namespace.
+    """Writes the index of the packages in the folder `repository`, where apt reads it."""
+    # dpkg-scanpackages finds nothing in a folder of another mount namespace.
     scan: list[str | Path] = ["dpkg-scanpackages", "--multiversion", repository]
     done = subprocess.run(scan, cwd="/", check=True, capture_output=True, text=True)
     (repository / "Packages").write_text(done.stdout.replace(f"Filename: {repository}/", "Filename: ./"))
 
 
-# Maintainer scripts by what `package.install` in a scenario says.
+# Maintainer scripts by the value of `package.install` in a scenario.
 SCRIPTS = {
     "fails": {"postinst": "exit 1"},
     "interrupted": {"preinst": ": >/run/package-installs\nexec sleep 60"},
@@ -101,7 +101,7 @@ SCRIPTS = {
 
 
 def kept_package(name: str, version: str, scripts: str, kept: Path) -> Path:
-    """A folder with the package's .deb and the index of a repository that offers just it. Made when not in `kept`."""
+    """A folder with the package's .deb and the index of a repository that offers only it. Made if not in `kept`."""
     folder = kept / f"{name}_{version}_{scripts}"
     if folder.exists():
         return folder

@@ -1,4 +1,4 @@
-"""The sounds of the instrument, as files that a test can tell apart by any piece of them."""
+"""The sounds of the instrument, as files that a test can distinguish by any piece of them."""
 
 import math
 import struct

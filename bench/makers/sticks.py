@@ -16,12 +16,12 @@ PAYLOAD = 200_000  # bytes; more than a full board has left
 
 
 def version_of(directory: str) -> str:
-    """The version that the name of a version directory says."""
+    """The version in the name of a version directory."""
     return directory[len(PREFIX) :]
 
 
 def zip_archive(version: str) -> bytes:
-    """An upgrade archive: the board's new version file, and something that takes room and cannot be compressed."""
+    """An upgrade archive: the board's new version file, and data that cannot be compressed."""
     file = io.BytesIO()
     with zipfile.ZipFile(file, "w") as archive:
         archive.writestr("version.txt", version_text(version))

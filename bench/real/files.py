@@ -1,4 +1,4 @@
-"""What lies on the real unit before an update: the files of the head, the board and the stick."""
+"""The files of the real unit before an update: of the head, the board and the stick."""
 
 import os
 import shutil
@@ -30,7 +30,7 @@ def search_path(setup: Setup) -> str:
 
 
 def write_head(folder: Path, setup: Setup, kept: Path, has_systemd: bool) -> None:
-    """The head's files: package sources, sounds, marker and what the bench adds to the tools."""
+    """The head's files: package sources, sounds, marker and the bench's additions to the tools."""
     write(folder / "etc/apt/apt.conf.d/50bench", 'APT::Sandbox::User "root";\n')
     write(folder / "etc/dpkg/dpkg.cfg.d/bench", "force-unsafe-io\n")
     _write_packages(folder, setup, kept)
@@ -42,7 +42,7 @@ def write_head(folder: Path, setup: Setup, kept: Path, has_systemd: bool) -> Non
         script = (HERE / "teamviewer" / f"{setup.head.teamviewer_script}.sh").read_text()
         write(folder / "root/RESOURCES/teamviewer_updatescript.sh", script, 0o755)
     if setup.head.sound == "present":
-        # ALSA has no sound card here: the default device is a file, in fact a program that reads the samples.
+        # ALSA has no sound card here: the default device is a file, or rather a program that reads the samples.
         device = 'pcm.!default { type file slave.pcm null file "|/opt/bench/bin/play" format raw }\n'
         write(folder / "etc/asound.conf", device)
     _write_tools(folder / "opt/bench", setup, has_systemd)
@@ -78,7 +78,7 @@ def write_stick(folder: Path, setup: Setup) -> None:
 
 
 def _write_packages(folder: Path, setup: Setup, kept: Path) -> None:
-    """The repository with the package that is offered, and the .deb of the one that is installed at first."""
+    """The repository with the offered package, and the .deb of the one that is installed first."""
     name, wanted = head_package(setup), setup.package
     for path in DATABASE:
         (folder / path).mkdir(parents=True)

@@ -1,6 +1,6 @@
 """Usage: mirror.py FOLDER PORT KIND: serves FOLDER as a static web server on this machine's own address.
 
-KIND is `mirrors.server` of the scenario; "stalls": of a package it sends one half, and then nothing more.
+KIND is `mirrors.server` of the scenario; "stalls": it sends half of a package, then nothing more.
 """
 
 import sys
@@ -11,7 +11,7 @@ from typing import BinaryIO
 
 
 class Stalling(SimpleHTTPRequestHandler):
-    """Goes silent in the middle of a package."""
+    """Stops sending in the middle of a package."""
 
     def copyfile(self, source: BinaryIO, outputfile: BinaryIO) -> None:  # type: ignore[override]
         """Sends the file."""

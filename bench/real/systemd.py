@@ -1,6 +1,6 @@
 """The real unit's systemd: first process of the head, with the updater and the instrument's application as services.
 
-It needs root and a control group; elsewhere makers/tools/systemctl stands in for it.
+It needs root and a control group; elsewhere makers/tools/systemctl replaces it.
 """
 
 import contextlib
@@ -23,7 +23,7 @@ DefaultDependencies=no
 [Service]
 ExecStart=/bin/sleep infinity
 """
-# Standard error stays out of the journal: the log of a run is the updater's standard output.
+# Keeps standard error out of the journal: the log of a run is the updater's standard output.
 UPDATER = f"""[Unit]
 DefaultDependencies=no
 After=systemd-journald.service harl.service
@@ -84,7 +84,7 @@ def service_active(group: Path, name: str) -> bool:
 
 
 def updater_service(setup: Setup) -> str:
-    """The service that the updater runs in: not its own when it must not end with that."""
+    """The service that the updater runs in: not its own if it must survive the end of that."""
     return "by-hand.service" if setup.updater.stopped == "never" else "harl-updater.service"
 
 
@@ -120,7 +120,7 @@ class Journal:
         self.ended = ""  # how the updater ended: "exited 0", "killed TERM"
 
     def update(self) -> None:
-        """Takes over what is new."""
+        """Reads what is new."""
         if not self._source.exists():
             return
         with self._source.open("rb") as source, self._target.open("ab") as target:

@@ -1,7 +1,7 @@
 """The real unit: a head and a board with the real tools, in namespaces of their own on this machine.
 
-Nothing of it is on the host but one temporary folder: the roots lie in a tmpfs, the network in namespaces, and all of
-it ends with its first process.
+On the host it has only one temporary folder: the roots are in a tmpfs, the network in namespaces, and all of it ends
+with its first process.
 """
 
 import contextlib
@@ -23,8 +23,8 @@ from bench.scenario import Scenario, variables
 from bench.unit import PROGRAMS, Files, State, UnitError, with_pid_file
 
 NAMESPACES = ["unshare", "--mount", "--net", "--ipc", "--uts", "--pid", "--fork", "--kill-child", "--mount-proc"]
-ONE_USER = "--map-root-user"  # needs no right of root's; systemd does
-# Everything that unit.sh does and a machine may forbid.
+ONE_USER = "--map-root-user"  # needs no privilege; systemd does
+# Everything in unit.sh that a machine may forbid.
 PROBE = (
     "mount -t tmpfs probe /tmp && ip link add name probe0 type veth peer name probe1"
     " && unshare --user --map-user=1000 --map-group=1000 true"
@@ -117,10 +117,10 @@ class RealUnit:
         )
 
     def close(self) -> None:
-        """Ends every process of the unit; its mounts and networks go with them, its folder with its owner."""
+        """Ends every process of the unit, and with them its mounts and networks; the owner removes its folder."""
         if not self._namespaces:
             return
-        # The kernel ends all processes of a process namespace before its first one is gone.
+        # The kernel ends all processes of a process namespace before the first one disappears.
         with contextlib.suppress(UnitError, ProcessLookupError):
             os.kill(self._first_process(), signal.SIGKILL)
         self._namespaces.kill()
@@ -201,7 +201,7 @@ class RealUnit:
         return "(none)"
 
     def _sounds_played(self) -> list[str]:
-        """The sounds whose samples reached the sound device, all of them, followed by nothing but silence."""
+        """The sounds of which every sample reached the sound device, followed only by silence."""
         found = []
         for played in sorted(self._out.glob("played-*.raw"), key=lambda path: path.stat().st_mtime):
             heard = played.read_bytes()

@@ -23,7 +23,7 @@ COMMAND, WAIT = "#57606a", "#c9a227"
 TICKS = [0.1, 0.2, 0.5, 1, 2, 5, 10, 20, 30, 60, 120, 300]  # s
 MOST_TICKS = 16
 
-# Of the pages of all runs and of their index: light and dark, on a screen of 1,200 pixels and on paper.
+# Style of the pages of all runs and of their index: light and dark, for a screen of 1,200 pixels and for paper.
 STYLE = """
 :root { color-scheme: light dark; --text: #1c1f24; --line: #d8dbe0; --wrong: #b01020; --bar: #57606a; }
 @media (prefers-color-scheme: dark) { :root { --text: #e6e8eb; --line: #3c4148; --wrong: #ff7b82; --bar: #9aa4b0; } }
@@ -92,7 +92,7 @@ def page(summary: Summary, speed: float) -> str:
 
 
 def write_page(file: Path, text: str) -> None:
-    """Writes a page; bytes of a log that are no text become question marks."""
+    """Writes a page; bytes of a log that are not text become question marks."""
     file.write_text(text, encoding="utf-8", errors="replace")
 
 
@@ -161,7 +161,7 @@ def _timeline(run: Run, begin: float, end: float) -> str:
 
 
 def _label(text: str, left: float, right: float, baseline: float) -> str:
-    """`text` after its bar, or before it where there is more room; cut to what fits."""
+    """`text` after its bar, or before it where there is more space; cut to what fits."""
     after = WIDTH - right >= left - LEFT
     room = int(((WIDTH - right if after else left - LEFT) - 12) / LETTER)
     shown = text if len(text) <= room else f"{text[: max(room - 1, 0)]}…"

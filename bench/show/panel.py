@@ -64,7 +64,7 @@ def pictures() -> dict[str, str]:
     """The pictures by file name."""
     made = {name: panel_picture(after(*outcome.panel.items())) for name, outcome in OUTCOMES.items()}
     made["flashing"] = panel_picture(after(("REMOTE", "blue")), after(("MAIN", "blue")))
-    # What only a file of its own needs.
+    # Attributes that only a separate file needs.
     file = '<svg xmlns="http://www.w3.org/2000/svg"'
     return {f"{name}.svg": f"{picture}\n".replace("<svg", file) for name, picture in made.items()}
 

@@ -1,4 +1,4 @@
-"""Shows a run on a terminal: the log runs through above, the unit is below: panel, services, stick, board, wait."""
+"""Shows a run on a terminal: the log scrolls above; below are panel, services, stick, board and current wait."""
 
 import contextlib
 import sys
@@ -11,8 +11,8 @@ from bench.panel import color_name, led_name
 from bench.unit import State, UnitError
 
 REDRAW = 0.1  # s
-LOOK = 0.3  # s, between two looks at the unit's lasting things
-# Control sequences of ECMA-48 and DEC's autowrap mode, as every terminal of today knows them.
+LOOK = 0.3  # s, between two readings of the unit's state
+# Control sequences of ECMA-48 and DEC's autowrap mode, which every current terminal knows.
 NO_WRAP, WRAP = "\x1b[?7l", "\x1b[?7h"
 ERASE_BELOW = "\x1b[J"
 
@@ -23,7 +23,7 @@ def up(lines: int) -> str:
 
 
 def panel_rows(leds: dict[int, int]) -> list[str]:
-    """The front panel: all LEDs above their names, a letter for each that is lit where there are no colours."""
+    """The front panel: all LEDs above their names; without colours, a letter for each lit one."""
     names = [led_name(led).removeprefix("0x") for led in leds]
     width = sum(len(name) + 2 for name in names)
     lights = ""
@@ -39,7 +39,7 @@ def panel_rows(leds: dict[int, int]) -> list[str]:
 
 
 def activity(run: Run, moment: float) -> str:
-    """What the updater does at `moment` (s): a wait with what remains of it, or a command and since when."""
+    """What the updater does at `moment` (s): a wait and its remaining time, or a command and its duration so far."""
     waits = [call for call in run.waits() if call.end is None]
     if waits:
         here = max(0.0, waits[-1].start + waits[-1].real - moment)
@@ -51,14 +51,14 @@ def activity(run: Run, moment: float) -> str:
 
 
 class HasState(Protocol):
-    """What the display looks at."""
+    """What the display shows."""
 
     def state(self) -> State:
         """The unit as it is now."""
 
 
 class LiveDisplay:
-    """The display on a terminal. Use it in a `with`: in the end the lower part is gone."""
+    """The display on a terminal. Use it in a `with`, whose end removes the lower part."""
 
     def __init__(self, unit: HasState) -> None:
         self._unit = unit
@@ -76,7 +76,7 @@ class LiveDisplay:
         self._lines = 0
 
     def show(self, run: Run, log: str) -> None:
-        """Shows what is new of the log, and the unit as it is."""
+        """Shows the new part of the log, and the unit as it is."""
         moment = time.monotonic()
         if not log and moment - self._drawn < REDRAW:
             return

@@ -1,4 +1,4 @@
-"""Shows a run as lines of text: the log as it comes, the panel whenever it changes, and at the end the summary."""
+"""Shows a run as lines of text: the log as it grows, each change of the panel, and the summary at the end."""
 
 import os
 import sys
@@ -20,12 +20,12 @@ def terminal() -> bool:
 
 
 def colored() -> bool:
-    """Whether the output takes colours. NO_COLOR: see https://no-color.org"""
+    """Whether the output supports colours. NO_COLOR: see https://no-color.org"""
     return terminal() and not os.environ.get("NO_COLOR")
 
 
 def paint(text: str, color: str) -> str:
-    """`text` in the colour of a LED, where the output takes colours."""
+    """`text` in the colour of a LED, where the output supports colours."""
     return f"\x1b[{ANSI.get(color, OTHER_COLOR)}m{text}\x1b[0m" if colored() else text
 
 
@@ -62,7 +62,7 @@ class Summary:
     scenario: Scenario
     unit: str  # what is real and what is a stand-in
     result: Result
-    wrong: list[str]  # what came out other than the scenario says
+    wrong: list[str]  # the differences from what the scenario expects
 
     @property
     def outcome(self) -> str:

@@ -18,7 +18,7 @@ UNPACK = f"/bin/cp root/OSUpgrade.zip {board.VERSION_FILE}\n"  # where there is 
 
 
 def sanitizers(program: Path) -> list[str]:
-    """The sanitizers that `program` was built with: they have to be loaded before anything else."""
+    """The sanitizers that `program` was built with: they must be loaded before anything else."""
     # A script in the program's place has none: ldd fails.
     libraries = subprocess.run(["ldd", program], capture_output=True, text=True, check=False).stdout
     return re.findall(r"^\s*(lib[at]san\.so\.\d+) ", libraries, re.MULTILINE)
@@ -67,7 +67,7 @@ class StandInUnit:
         )
 
     def close(self) -> None:
-        """Ends the updater and its children; the folder goes with its owner."""
+        """Ends the updater and its children; the folder's owner removes the folder."""
         if self._updater:
             try:
                 os.killpg(self._updater.pid, signal.SIGKILL)
@@ -110,7 +110,7 @@ class StandInUnit:
         (self._folder / "head/USB_MOUNT").symlink_to(self._folder / "stick")
 
     def _candidate(self) -> str:
-        """The version that apt takes for the candidate: an older one only when it is told to."""
+        """The version that apt picks as the candidate: an older one only if configured."""
         package = self._setup.package
         older = ["dpkg", "--compare-versions", package.offered, "lt", package.installed]
         if package.downgrades or package.installed == "(none)" or subprocess.run(older, check=False).returncode != 0:

@@ -179,7 +179,7 @@ class BadInput(unittest.TestCase):
         query = tools / "dpkg-query"
         query.write_text('#!/bin/sh\nfor package; do :; done\n[ "$package" = alsa-utils ] || echo "ii "\n')
         query.chmod(0o755)
-        # No apt-get on this search path: nothing is installed.
+        # No apt-get on this search path, so that nothing is installed.
         status, shown, message = self.bench("up-to-date", PATH=str(tools))
         self.assertNotEqual(status, 0)
         self.assertIn("alsa-utils", message)

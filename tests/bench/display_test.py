@@ -51,14 +51,14 @@ def on_terminal(scenario: str, **variables: str) -> str:
 
 
 class HalfUnit:
-    """A unit that has a state and nothing else."""
+    """A unit that has only a state."""
 
     def state(self) -> State:
         return State(package="1.2.0", board="", marker=True, stick=False, harl="unknown", updater="inactive")
 
 
 class Display(unittest.TestCase):
-    """The scenario has both waits, both services' changes and each colour but red."""
+    """The scenario has both waits, both services' changes and each colour except red."""
 
     def check_summary(self, text: str) -> None:
         summary = text[text.index("\nCommands\n"):]
@@ -92,7 +92,7 @@ class Display(unittest.TestCase):
         self.assertGreater(len(left), 3)
         self.assertEqual(left, sorted(left, reverse=True))
         self.assertGreater(left[0], left[-1])
-        # What was drawn below the log is gone in the end.
+        # The part below the log is removed at the end.
         self.assertNotIn("│", plain[plain.rindex("\x1b[J"):])
 
     def test_terminal_without_colors(self) -> None:

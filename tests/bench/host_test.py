@@ -32,7 +32,7 @@ def output(*command: str) -> str:
 
 
 def machine(folder: str) -> dict[str, str]:
-    """What a run with the temporary folder `folder` must not change on this machine."""
+    """What a run with the temporary folder `folder` must leave unchanged on this machine."""
     return {
         "mounts": Path("/proc/self/mountinfo").read_text(),
         "links": output("ip", "-brief", "link"),
@@ -46,7 +46,7 @@ def machine(folder: str) -> dict[str, str]:
 
 
 def users_of(folder: str) -> list[str]:
-    """The processes that have something to do with `folder`: a command line, or a mount in a namespace of theirs."""
+    """The processes that use `folder`: in their command line, or as a mount in their namespace."""
     found = []
     for process in Path("/proc").glob("[0-9]*"):
         try:
@@ -59,7 +59,7 @@ def users_of(folder: str) -> list[str]:
 
 
 class HostTest(unittest.TestCase):
-    """Each test runs the bench with a temporary folder of its own, which must be empty and unused in the end."""
+    """Each test runs the bench with its own temporary folder, which must be empty and unused at the end."""
 
     def setUp(self) -> None:
         holder = tempfile.TemporaryDirectory(prefix="bench-host-test-")

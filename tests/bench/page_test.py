@@ -118,7 +118,7 @@ class Page(unittest.TestCase):
         waits = [title.split(":")[0] for title in elements.filled(page_module.WAIT)]
         self.assertEqual(waits, ["wait of 780 s", "wait of 30 s", "wait of 10 s"])
         commands = elements.filled(page_module.COMMAND)
-        self.assertEqual(len(commands), 13)  # the sound's, and those of the table
+        self.assertEqual(len(commands), 13)  # that of the sound, and those of the table
         self.assertRegex(commands[3], r"^apt --assume-yes install solvik4-rh: \d+\.\d\d s$")
         self.assertEqual(len(elements.texts("code")), 12)
         self.assertIn("BEFORE UPDATE", elements.texts("pre")[0])

@@ -1,6 +1,6 @@
 """Usage: scenario_test.py SCENARIO UNIT BUILD_FOLDER
 
-Runs the scenario on a unit of the kind UNIT and compares what comes out with what its file says.
+Runs the scenario on a unit of the kind UNIT and compares the result with what its file expects.
 """
 
 import sys

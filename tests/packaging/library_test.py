@@ -23,7 +23,7 @@ from tests.service.service_test import built_package
 ROOT = Path(__file__).parents[2]
 COMPILER = "g++-12"
 SPEED = 2000  # times shorter waits
-# As g++ 11 spells them, and no later one.
+# As only g++ 11 spells them, not later versions.
 ONLY_ELEVEN = {
     "static int32_t UpdateManager::runProcess(const string&, std::string&)",
     "void UpdateManager::update(std::vector<UpdateManager::UpdateComponent>, bool)",
@@ -31,7 +31,7 @@ ONLY_ELEVEN = {
 
 
 class Library(unittest.TestCase):
-    """The installed package, and what is built against it."""
+    """The installed package, and the program built against it."""
 
     package: Path
     build: Path
@@ -61,7 +61,7 @@ class Library(unittest.TestCase):
         return done.stdout
 
     def check_program(self) -> None:
-        """The example updates a main head, and its log is the one of a library of g++ 11."""
+        """The example updates a main head, and its log is that of a library built with g++ 11."""
         self.assertRegex(self.run_command("readelf", "--string-dump=.comment", self.program), r"(?s)GCC: .* 12\.")
         what = scenario.load("main-head-all")
         with temporary_folder() as temporary:

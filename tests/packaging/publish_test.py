@@ -76,7 +76,7 @@ class Publish(unittest.TestCase):
         return found
 
     def refused(self, changes: Path, says: str) -> None:
-        """The upload changes nothing, and one line says why."""
+        """The upload changes nothing, and one line explains why."""
         before = self.suites()
         said = self.publish("add", changes, status=1)
         self.assertEqual(said.count("\n"), 1, said)

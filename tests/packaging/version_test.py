@@ -1,4 +1,4 @@
-"""Versions: banner, build, changelog, package and manual page say the same."""
+"""Versions: banner, build, changelog, package and manual page agree."""
 
 import re
 import unittest
@@ -14,7 +14,7 @@ def find(path: str, pattern: str) -> str:
 
 
 class Version(unittest.TestCase):
-    """The banner is what the others follow."""
+    """The banner is the reference for the others."""
 
     def test_all_follow_the_banner(self) -> None:
         banner = find("remote/main.cpp", r"TavrenUpdater version: ([\d.]+)")

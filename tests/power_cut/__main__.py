@@ -1,9 +1,9 @@
 """tests/power_cut/run: cuts the power at every write of an update to the unit's disk, then starts the next run on it.
 
 The service updates the package and the board, and in a second recording itself as well, on a machine with real systemd,
-apt and dpkg whose disk records its writes. Every disk that a power cut could leave is mounted and checked. Those that
-are equal as the unit sees them are one group, and one of each group goes through the next runs of the service: with
-network and stick, without network, without stick. Ends with 1 when one of them is not as it should be.
+apt and dpkg whose disk records its writes. Every disk that a power cut could leave is mounted and checked. Disks that
+the unit cannot distinguish form a group, and one of each group goes through the next runs of the service: with network
+and stick, without network, without stick. Ends with 1 if one of them is not as expected.
 """
 
 import argparse
@@ -19,12 +19,12 @@ from tests.power_cut.disk import missing, own_mounts
 from tests.power_cut.unit import SITUATIONS
 from tests.service.service_test import built_package
 
-JOBS = 2 * (os.cpu_count() or 1)  # about half of a run is waiting
+JOBS = 2 * (os.cpu_count() or 1)  # a run waits for about half of its time
 UPDATES = {False: "the package and the board", True: "the package, the board and the updater itself"}
 
 
 def print_groups(groups: list[Group]) -> None:
-    """The states that the cuts left, and what became of them."""
+    """The states that the cuts left, and their results."""
     states: dict[str, list[Group]] = defaultdict(list)
     for group in groups:
         states[group.before.packages + (f", {group.remedy}" if group.remedy else "")].append(group)

@@ -42,7 +42,7 @@ DISK_SIZE = 256  # MiB, sparse; ext4 keeps a copy of its superblock from 128 on
 
 @dataclass
 class Group:
-    """Disks that are equal as the unit sees them."""
+    """Disks that the unit cannot distinguish."""
 
     cut: Cut  # one of them
     before: State
@@ -55,7 +55,7 @@ class Group:
 class PowerCuts:
     """One update, on the package under test in the file `package`; `programs` is the build folder.
 
-    `folder` takes some hundred MiB.
+    `folder` takes several hundred MiB.
     """
 
     def __init__(self, folder: Path, package: Path, programs: Path, upgrades_itself: bool) -> None:
@@ -68,7 +68,7 @@ class PowerCuts:
         self.recording = self._record()
 
     def groups(self, cuts: list[Cut], jobs: int) -> list[Group]:
-        """Boots the disk of every cut, `jobs` at a time, and puts together what is equal."""
+        """Boots the disk of every cut, `jobs` at a time, and groups equal ones."""
         found: dict[str, Group] = {}
         with ProcessPoolExecutor(jobs) as pool:
             for seen, image in pool.map(self._look, cuts, chunksize=8):
@@ -80,13 +80,13 @@ class PowerCuts:
     def judged(self, groups: list[Group], jobs: int, repairs: bool = True) -> list[Group]:
         """The groups after their next runs, `jobs` at a time.
 
-        @param repairs  false: a service that leaves broken installations alone, which is a fault to be noticed
+        @param repairs  false: a service that leaves broken installations alone, which is a fault to detect
         """
         with ProcessPoolExecutor(jobs) as pool:
             return list(pool.map(self._judge, groups, itertools.repeat(repairs)))
 
     def _record(self) -> Recording:
-        """Raises AssertionError when the update fails, or the log does not give the disk again."""
+        """Raises AssertionError when the update fails, or the log does not reproduce the disk."""
         disk, before, writes, seen = (self._folder / name for name in ("disk.img", "before.img", "writes", "disk"))
         make_disk(disk, DISK_SIZE)
         with machine(SYSTEM, disk) as made:
@@ -108,7 +108,7 @@ class PowerCuts:
         return recording
 
     def _look(self, cut: Cut) -> tuple[str, Group]:
-        """What the unit sees after the cut, as one word, and a group of this image alone."""
+        """What the unit sees after the cut, as one word, and a group with only this image."""
         with tempfile.TemporaryDirectory(dir=self._folder) as name:
             image, where = Path(name) / "image", Path(name) / "mount"
             where.mkdir()
@@ -141,7 +141,7 @@ class PowerCuts:
         return group
 
     def _run(self, unit: Unit, group: Group, situation: Situation) -> Iterator[str]:
-        """Goes through the runs of a situation; what is wrong after them."""
+        """Goes through the runs of a situation; returns what is wrong after them."""
         before = group.before
         unit.start(before.board, situation)
         unit.run_service(situation)

@@ -71,10 +71,10 @@ class Recording:
                     offset += sectors * SECTOR
 
     def cuts(self, subsets: int = 20, borders: int = 3, seed: int = 20) -> list[Cut]:
-        """Every cut to try, each once: after each write, with the writes in another order, in the middle of a write.
+        """Every cut, once each: after each write, with the writes in another order, in the middle of a write.
 
-        @param subsets  for each flush, so many random choices of the writes since the flush before it
-        @param borders  for each write, so many of its sectors' borders; and the one in the superblock's 1 KiB
+        @param subsets  for each flush, this many random choices of the writes since the previous flush
+        @param borders  for each write, this many of its sectors' borders; and the one in the superblock's 1 KiB
         """
         chance = random.Random(seed)
         found = [Cut("in order", number) for number in range(len(self.writes) + 1)]
@@ -103,13 +103,13 @@ class Recording:
 
 
 def missing() -> str:
-    """What a disk cannot be recorded without and this machine does not have; "" when it has all."""
+    """What this machine lacks to record a disk; "" when it lacks nothing."""
     return ", ".join(tool for tool in TOOLS if not (shutil.which(tool) or Path(tool).exists()))
 
 
 @contextlib.contextmanager
 def own_mounts() -> Iterator[Path]:
-    """A folder in memory. What this process mounts is seen by no other, and goes with it however it ends."""
+    """A folder in memory. Only this process sees its mounts, which end with it however it ends."""
     if ctypes.CDLL(None, use_errno=True).unshare(CLONE_NEWNS) != 0:
         raise OSError(ctypes.get_errno(), "no mounts of its own")
     run("mount", "--make-rprivate", "/")
@@ -122,7 +122,7 @@ def own_mounts() -> Iterator[Path]:
 
 
 def make_disk(image: Path, size: int) -> None:
-    """Makes an empty ext4 file system of `size` MiB. No part of it is left to be initialised later: that is a write."""
+    """Makes an empty ext4 file system of `size` MiB. No part of it is initialised later, which would be a write."""
     with image.open("wb") as file:
         file.truncate(size << 20)
     # The block size of a larger disk.
@@ -161,9 +161,9 @@ def repair_file_system(image: Path) -> str:
 
 @contextlib.contextmanager
 def recorded(image: Path, log: Path, disk: Path) -> Iterator[None]:
-    """The disk `image` appears as the file `disk`; until the end of the block what is written to it goes to `log` too.
+    """The disk `image` appears as the file `disk`; until the end of the block its writes also go to `log`.
 
-    At that end nothing mounts `disk` any more, or it is waited for.
+    At the end of the block it waits until nothing mounts `disk` any more.
     """
     disk.touch()
     with log.open("wb") as file:
@@ -185,7 +185,7 @@ def recorded(image: Path, log: Path, disk: Path) -> Iterator[None]:
 
 
 def wait_until_unmounted(disk: Path) -> None:
-    """The mounts of a machine go a moment after it."""
+    """The mounts of a machine disappear shortly after it."""
     _wait(f"{disk} is still mounted", lambda: not run("losetup", "--noheadings", "--associated", disk))
 
 

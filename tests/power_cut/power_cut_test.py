@@ -1,6 +1,6 @@
 """Usage: power_cut_test.py BUILD_FOLDER [TEST...]
 
-A sample of what tests/power_cut/run judges, and a fault that it must notice, on the built package in build/package/.
+A sample of what tests/power_cut/run checks, and a fault that it must detect, on the built package in build/package/.
 """
 
 import unittest

@@ -25,14 +25,14 @@ SPEED = 1000  # times shorter waits of the updater, each 0.2 s at least
 LONGEST_RUN = 180  # s, on a busy machine
 HARL_START = 10  # s
 
-# Nothing for the services is written to the disk: the repository, the stick and what is shortened is in memory.
+# Keeps the repository, the stick and the shortened settings in memory, so that they write nothing to the disk.
 SOURCES = "deb [trusted=yes] http://127.0.0.1/ ./\n"
-# A network that is out of reach counts as success for apt: it goes on with the lists that it has.
+# An unreachable network counts as success for apt: it continues with the lists that it has.
 NO_DELAY = 'Acquire::Retries::Delay "false";\n'
 MIRROR = "python3 -m http.server --bind 127.0.0.1 --directory /srv/repository 80"
 MIRROR_LISTENS = "0100007F:0050 00000000:0000 0A"  # proc(5), net/tcp
 SETTINGS = f"[Service]\nEnvironment=LD_PRELOAD=/opt/call_recorder.so BENCH_SPEED={SPEED} BENCH_CALLS=/var/log/calls\n"
-# In place of a program of the service: the same as it is on the disk, but for what `script` of sed changes.
+# In place of a program of the service: the one on the disk, with the changes of the sed `script`.
 CHANGED = """[Service]
 {line}=
 {line}=/bin/sh -c 'sed "{script}" /usr/lib/harl-updater/{program} >/run/{program}; exec sh /run/{program}'
@@ -45,7 +45,7 @@ SHORT_TIMES = CHANGED.format(
 
 @dataclass(frozen=True)
 class Situation:
-    """What there is in a run beside the head and the board."""
+    """What a run has besides the head and the board."""
 
     name: str
     network: bool = True
@@ -65,11 +65,11 @@ class State:
     marker: bool
     database: str = ""  # what is wrong with the packages
     shown: str = ""  # the outcome, in words
-    withheld: str = ""  # what is not given back
+    withheld: str = ""  # what was not given back
 
 
 def make_repository(updater: Path | None, folder: Path) -> None:
-    """Offers the newer package in `folder`; with an `updater`, which it depends on, a newer one of it too."""
+    """Offers the newer package in `folder`; with an `updater`, also a newer one of that, on which it depends."""
     fields = {}
     if updater:
         raise_version(updater, NEWER_UPDATER, folder)
@@ -87,7 +87,7 @@ class Unit:
         self._repairs = repairs
 
     def install(self, package: Path, programs: Path) -> None:
-        """Installs the package under test on the empty disk, and what there is to update."""
+        """Installs the package under test, and the packages to update, on the empty disk."""
         make_files(self._inside, package, programs)
         files = self._inside.files
         for name, lines in BOARD_TOOLS.items():
@@ -130,7 +130,7 @@ class Unit:
         wait_for("end of the service", self._has_ended, LONGEST_RUN)
 
     def state(self) -> State:
-        """What there is after a run of the service."""
+        """The state after a run of the service."""
         return State(
             packages=package_states(self._root(), [UPDATER, PACKAGE]),
             board=self._root("srv/board").read_text().strip(),
@@ -141,13 +141,13 @@ class Unit:
         )
 
     def _has_ended(self) -> bool:
-        """Whether the run, and what gives the instrument back, is over. Cheap as long as that has not been noted."""
+        """Whether the run and give-back have ended. Cheap as long as that has not been noted."""
         notes = self._root("run/harl-updater/notes")
         has_noted = notes.exists() and "given-back" in notes.read_text()
         return has_noted and states(self._inside) <= {"inactive", "failed"}
 
     def _withheld(self) -> Iterator[str]:
-        """What of the instrument is not given back."""
+        """What of the instrument was not given back."""
         if self._inside.status("mountpoint", "-q", STICK) == 0:
             yield "the stick"
         with contextlib.suppress(AssertionError):
@@ -156,7 +156,7 @@ class Unit:
         yield "harl"
 
     def _output(self, *command: str) -> str:
-        """What the command prints inside, whatever its status."""
+        """What the command prints in the machine, whatever its status."""
         return self._inside.run("sh", "-c", '"$@" 2>&1 || :', "sh", *command)
 
     def _root(self, path: str = "") -> Path:
@@ -164,6 +164,6 @@ class Unit:
 
 
 def _package_files(version: str) -> dict[str, str]:
-    """So many that an installation is more than one write."""
+    """Enough files that an installation is more than one write."""
     parts = {f"opt/{PACKAGE}/part{number}": f"part{number} {version}\n" * 200 for number in range(FILES)}
     return parts | {f"etc/{PACKAGE}.conf": f"version={version}\n"}

@@ -1,4 +1,4 @@
-"""What the unit sees of its disk: disks that are equal to it need one run for all of them."""
+"""What the unit sees of its disk: disks that it cannot distinguish need only one run."""
 
 import hashlib
 import os
@@ -7,19 +7,19 @@ import stat
 import subprocess
 from pathlib import Path
 
-# Left out, below the disk's root: what is mounted over or made anew at each start, what nobody reads or no update
-# writes, and apt's caches, which it makes again when they do not fit.
+# Ignored, below the disk's root: what is mounted over or recreated at each start, what nobody reads or no update
+# writes, and apt's caches, which apt rebuilds when they do not fit.
 UNREAD = re.compile(
     r"/work|/root/(dev|proc|run|srv|sys|tmp|usr|var/log|var/lib/systemd"
     r"|etc/(alternatives|group|machine-id|passwd|\.#.*)|var/lib/dpkg/(available|lock.*|status-old)"
     r"|var/cache/apt/\w+\.bin)"
 )
-# Of these only that there are some, not which of them nor their content: what dpkg begins again, what it has noted of
-# its steps (the state of the packages shows that), and the logs that give-back keeps.
+# Of these only their presence counts, not their names or contents: what dpkg begins again, its journal of its steps
+# (the state of the packages shows that), and the logs that give-back keeps.
 SOME = re.compile(
     r".*(?P<kind>\.dpkg-(new|tmp)|-new|dpkg/tmp\.ci/|dpkg/updates/(tmp\.i|(?=\d))|lib/harl-updater/(?=.*\.log)).*"
 )
-# The many files of the package differ in nothing but their number: which of them is broken is one case, not forty.
+# The many files of the package differ only in their number: which of them is broken is one case, not forty.
 NUMBER = re.compile(r"(?<=part)\d+")
 
 
@@ -32,7 +32,7 @@ def package_states(root: Path, packages: list[str]) -> str:
 
 
 def digest(top: Path) -> str:
-    """A hash of what a run sees on the disk mounted at `top`: names, modes and contents, but for the above."""
+    """A hash of what a run sees on the disk mounted at `top`: names, modes and contents, except for the above."""
     return hashlib.sha256(repr(sorted(_entries(top))).encode()).hexdigest()
 
 

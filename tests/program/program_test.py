@@ -1,6 +1,6 @@
 """Usage: program_test.py SCENARIO BUILD_FOLDER
 
-Runs the updater's executable on the stand-in unit and compares all that can be seen of it from outside.
+Runs the updater's executable on the stand-in unit and compares everything visible from outside.
 """
 
 import unittest
@@ -56,7 +56,7 @@ LEDS_OFF = [led_command(led, COLOR_CODES["off"]) for led in range(FIRST_LED, LAS
 
 
 class ProgramTest(unittest.TestCase):
-    """What holds for the run of one scenario."""
+    """Checks of the run of one scenario."""
 
     what: scenario.Scenario
     result: Result

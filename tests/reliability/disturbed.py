@@ -1,4 +1,4 @@
-"""Stand-in units that something happens to: the updater starts under other circumstances, a tool does more than it
+"""Stand-in units with disturbances: the updater starts under other circumstances, a tool does more than it
 should, or the unit is used a second time."""
 
 import contextlib
@@ -57,7 +57,7 @@ exec {runner} /usr/bin/env LD_PRELOAD={wrapped}/bench/call_recorder.so {wrapped}
         return None if status is not None and self._updater and group_lives(self._updater.pid) else status
 
     def restore_tools(self) -> None:
-        """Takes every change of a tool back."""
+        """Undoes every change of a tool."""
         for tool in self._changed_tools:
             (self._folder / "bin" / tool).unlink()
             (self._folder / "real" / tool).rename(self._folder / "bin" / tool)
@@ -77,7 +77,7 @@ exec {runner} /usr/bin/env LD_PRELOAD={wrapped}/bench/call_recorder.so {wrapped}
 
 
 def group_lives(group: int) -> bool:
-    """Whether a process of `group` still runs; one that has ended and that nobody asks for its status does not."""
+    """Whether a process of `group` still runs; a zombie does not."""
     for process in Path("/proc").glob("[0-9]*"):
         with contextlib.suppress(OSError):  # has just ended
             # After the name in parentheses: state, parent, group; proc(5).
@@ -88,7 +88,7 @@ def group_lives(group: int) -> bool:
 
 
 def observed(result: Result) -> dict[str, object]:
-    """What a run came to: how it ended, what it did, and what it left of the unit."""
+    """The result of a run: how it ended, what it did, and the state of the unit."""
     run, state = result.run, result.state
     return {
         "status": result.status,

@@ -44,16 +44,16 @@ class Interruption:
 
 @dataclass
 class Aftermath:
-    """A unit after an interruption, and what the next run and a first one made of it."""
+    """A unit after an interruption, and the results of the next run and of a first run on it."""
 
     interruption: Interruption
     state: State
     second: dict[str, object]
     first: dict[str, object]
-    audit: str  # what the package database's own check says
+    audit: str  # the output of the package database's own check
 
     def differences(self) -> list[str]:
-        """What the next run made other than a first one does."""
+        """The differences between the next run and a first one."""
         seen = self.second
         return [f"{key}: {seen[key]!r}, not {due!r}" for key, due in self.first.items() if seen[key] != due]
 
@@ -78,10 +78,10 @@ HEADER = (
 
 
 class InterruptedUnit(Unit, Protocol):
-    """A unit that kills the updater, or all that runs, once; it can be started again and is kept until `end`."""
+    """A unit that kills the updater, or everything that runs, once; it can be started again and stays until `end`."""
 
     def audit(self) -> str:
-        """What the package database's own check says."""
+        """The output of the package database's own check."""
 
     def end(self) -> None:
         """Ends the unit."""
@@ -114,7 +114,7 @@ def _interrupt(make: Maker, what: Interruption) -> Aftermath:
 
 @cache
 def _first_run(make: Maker, package: str, board: str, marker: bool, stick: bool) -> dict[str, object]:
-    """What a first run makes of a unit in that state. Whether harl runs makes no difference: an update stops it."""
+    """The result of a first run on a unit in that state. Whether harl runs makes no difference: an update stops it."""
     what = copy.deepcopy(scenario.load(SCENARIO))
     what.setup.package.installed = package
     what.setup.board.installed = board

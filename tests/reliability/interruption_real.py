@@ -2,8 +2,8 @@
 
 Kills the updater, or everything that runs on the head, at each command of an update of package and board in turn, right
 before the command and right after it, on the bench unit with the real tools. Then the updater runs again on the unit
-as it was left. That run must end as a first run on a unit with that package, board, marker and stick does, and
-dpkg --audit must say nothing but where AUDITED expects it. Prints a line for each interruption, and fails at any
+as it was left. That run must end as a first run on a unit with that package, board, marker and stick does, and dpkg
+--audit must report nothing except where AUDITED expects it. Prints a line for each interruption, and fails at any
 difference. COMMAND is one of the names in the lines.
 """
 
@@ -25,12 +25,12 @@ from tests.reliability.interruption import HEADER, Aftermath, Interruption, inte
 
 AT_ONCE = 3
 
-# After the updater's own commands those of apt, in the middle of the installation.
+# The updater's own commands, then those of apt in the middle of the installation.
 POINTS = interruption.POINTS | {"unpack": ("dpkg", "*--unpack*"), "configure": ("dpkg", "*--configure*")}
 # Everything on the head has this root; the board and the bench have others.
 KILLS = {
     "updater": 'read -r updater </run/unit.pid; kill -s KILL "$updater"',
-    # The updater first: it must not go on while its command is already gone.
+    # The updater first: it must not continue once its command is gone.
     "unit": """read -r updater </run/unit.pid
 kill -s KILL "$updater"
 for process in /proc/[0-9]*; do
@@ -38,7 +38,7 @@ for process in /proc/[0-9]*; do
 done
 kill -s KILL $$""",
 }
-# The package lies unpacked but was not configured. The next run finds its version installed and leaves it so.
+# The package is unpacked but not configured. The next run finds its version installed and leaves it so.
 AUDITED = {("unit", "unpack", "after"), ("unit", "configure", "before")}
 
 
@@ -68,7 +68,7 @@ class InterruptedReal(RealUnit):
         return None if status is None or self._running("head") > 0 or self._running("board") > 1 else status
 
     def close(self) -> None:
-        """The unit is kept for the next run."""
+        """Keeps the unit for the next run."""
 
     def end(self) -> None:
         """Ends the unit."""

@@ -17,13 +17,13 @@ from tests.reliability.interruption import HEADER, POINTS, Aftermath, Interrupti
 BUILD = Path()
 AT_ONCE = 4
 
-# The updater alone: its command runs on to its end. The unit: nothing runs on, the updater first, which must not go on
-# while its command is already gone.
+# The updater alone: its command runs to its end. The unit: everything ends, the updater first, which must not continue
+# once its command is gone.
 KILLS = {
     "updater": 'kill -s KILL "$updater"',
     "unit": 'kill -s KILL "$updater"; kill -s KILL -- "-$updater"',
 }
-# Where a second run comes too late for the first-boot marker: both are up to date, so that nothing is installed.
+# Where a second run is too late for the first-boot marker: both are up to date, so that nothing is installed.
 MARKER_STAYS = {
     ("updater", "install-board", "before"),
     ("updater", "install-board", "after"),
@@ -64,7 +64,7 @@ class InterruptedStandIn(DisturbedUnit):
 
 
 class InterruptionTest(unittest.TestCase):
-    """One table of aftermaths, looked at from several sides."""
+    """One table of aftermaths, checked in several ways."""
 
     aftermaths: list[Aftermath]
 

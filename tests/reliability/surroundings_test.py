@@ -1,7 +1,7 @@
 """Usage: surroundings_test.py BUILD_FOLDER [TEST...]
 
-Runs the updater's executable on the stand-in unit while its surroundings do not keep their side: signals, limits, and a
-standard output that takes nothing. Where the updater does not come through, the test says how it ends.
+Runs the updater's executable on the stand-in unit while the environment misbehaves: signals, limits, and a standard
+output that accepts nothing. Where the updater does not survive, the test states how it ends.
 """
 
 import os
@@ -23,7 +23,7 @@ from tests.command_line import take_path
 from tests.reliability.disturbed import SPEED, DisturbedUnit
 
 BUILD = Path()
-PLAIN_USER = 60000 + os.getpid() % 5000  # has no processes of its own, nor any of another run of this test
+PLAIN_USER = 60000 + os.getpid() % 5000  # an id without processes, and another in each run of this test
 AS_PLAIN_USER = ["/usr/bin/setpriv", f"--reuid={PLAIN_USER}", f"--regid={PLAIN_USER}", "--clear-groups"]
 
 
@@ -57,7 +57,7 @@ class SurroundingsTest(unittest.TestCase):
         return DisturbedUnit(self.what, self.folder, BUILD, **circumstances)
 
     def assert_complete(self, result: Result, without: tuple[str, ...] = ()) -> None:
-        """The update came out as ever; differences that begin like one of `without` do not count."""
+        """The update has its usual result; differences that begin like one of `without` do not count."""
         self.assertEqual([line for line in differences(self.what, result) if not line.startswith(without)], [])
 
     # Signals
@@ -82,7 +82,7 @@ class SurroundingsTest(unittest.TestCase):
         self.assert_no_wait_was_shortened(result)
 
     def test_stop_and_continue_in_every_wait_changes_nothing(self) -> None:
-        unit = self.unit(circumstances="export BENCH_SHORTEST_WAIT=1")  # long enough to be met
+        unit = self.unit(circumstances="export BENCH_SHORTEST_WAIT=1")  # long enough to be stopped in
         held = self.folder / "held"
         stopped: set[float] = set()
 
@@ -98,7 +98,7 @@ class SurroundingsTest(unittest.TestCase):
             if is_held:
                 held.unlink()
 
-        # Every tool is held until its command has been met.
+        # Holds every tool until the updater has been stopped and continued in its command.
         for tool in ("systemctl", "apt", "apt-cache", "ssh", "ls", "scp", "rm", "umount"):
             unit.change_tool(tool, self.HELD)
         result = run_on(unit, stop_in_new_call, SPEED)
@@ -107,7 +107,7 @@ class SurroundingsTest(unittest.TestCase):
         self.assertEqual(stopped, {call.start for call in [*result.run.commands(), *result.run.waits()]})
 
     def assert_no_wait_was_shortened(self, result: Result) -> None:
-        """Every wait that ended took as long as it had to."""
+        """Every wait that ended took its full time."""
         for call in result.run.calls:
             if call.call == "nanosleep" and call.end is not None:
                 self.assertGreaterEqual(call.end - call.start, call.real)
@@ -167,7 +167,7 @@ class SurroundingsTest(unittest.TestCase):
         self.assertIn("AFTER UPDATE", result.run.log)
         names = ["stop-harl", "refresh-mirrors", "read-package", "release-stick", "start-harl", "stop-updater"]
         self.assertEqual([call.text for call in result.run.commands()], [COMMANDS[name] for name in names])
-        # popen(3) fails; system(3) says what a shell without the tool would say.
+        # popen(3) fails; system(3) returns what a shell without the tool would return.
         self.assertEqual([call.status for call in result.run.commands()], [0, -1, -1, *[127 * 256] * 3])
         self.assertEqual(result.state.package, "1.2.0")
         self.assertEqual(result.state.harl, "inactive")

@@ -1,13 +1,13 @@
-/// Called in place of each tool of the updater: hands over to the real one, the next in the search path, and ends it
-/// when it takes too long.
+/// Called in place of each tool of the updater: runs the real one, the next in the search path, and ends it when it
+/// takes too long.
 ///
-/// Installed under the tools' names in a folder of its own, which comes first in the search path of the services. The
-/// tool does not notice: arguments, environment (but for that folder in PATH), standard streams and signals are as
-/// without it, and its exit code or signal is passed on. A call that reaches its limit (limits.h) ends with 124, as
-/// with timeout(1), and nothing of it is waited for any more.
+/// Installed under the tools' names in its own folder, which comes first in the search path of the services. The tool
+/// does not notice: arguments, environment (except for that folder in PATH), standard streams and signals are
+/// unchanged, and its exit code or signal is passed on. A call that reaches its limit (limits.h) ends with 124, as with
+/// timeout(1), and waits for none of its processes any longer.
 ///
-/// What a run remembers is in the folder RUNTIME_DIRECTORY, where the service has one. `notes` has a line for each
-/// event, with the time since boot (s) in front:
+/// The notes of a run are in the folder RUNTIME_DIRECTORY, if the service has one. `notes` has a line for each event,
+/// preceded by the time since boot (s):
 ///
 ///     option -a | none                      what i2cset needs for the panel's address
 ///     spent NAME SECONDS                    of the budget NAME
@@ -15,7 +15,7 @@
 ///     lit LED COLOR STATUS                  an outcome's LED was sent; 0: both bytes arrived
 ///     began NAME, ended NAME STATUS         a call of the limit NAME; the raw status
 ///
-/// It has no need of the C++ library's start-up, and a LED byte no time to lose.
+/// Needs no start-up of the C++ library, which would only delay each LED byte.
 
 #include "limits.h"
 
@@ -77,7 +77,7 @@ __attribute__((format(printf, 1, 2))) void say(const char* format, ...)
     dprintf(STDERR_FILENO, "hand-over: %s\n", line);
 }
 
-// What a run remembers
+// The notes of a run
 
 bool notePath(char (&path)[PATH_MAX], const char* name)
 {
@@ -85,7 +85,7 @@ bool notePath(char (&path)[PATH_MAX], const char* name)
     return folder != nullptr && std::snprintf(path, sizeof path, "%s/%s", folder, name) < PATH_MAX;
 }
 
-/// Adds a line to the notes; without a place for it the run goes on without.
+/// Adds a line to the notes; the run continues without it if it cannot be written.
 __attribute__((format(printf, 1, 2))) void note(const char* format, ...)
 {
     char path[PATH_MAX];
@@ -111,7 +111,7 @@ __attribute__((format(printf, 1, 2))) void note(const char* format, ...)
     close(file);
 }
 
-/// Reads a file of the run's folder as a text; empty without one.
+/// Reads a file of the run's folder as text; empty if there is none.
 template <size_t size>
 void readNotes(const char* name, char (&text)[size])
 {
@@ -126,7 +126,7 @@ void readNotes(const char* name, char (&text)[size])
     close(file);
 }
 
-/// What of the budget `name` is used up (s).
+/// The used part of the budget `name` (s).
 double spent(const char* name)
 {
     char notes[8192];
@@ -258,12 +258,12 @@ int nextSignal(double seconds)
 
 // Output
 
-/// The tool's output when somebody reads ours to its end: through a pipe of its own, so that no other process that the
-/// tool leaves behind can keep that reader waiting.
+/// Relays the tool's output through its own pipe where somebody reads ours to its end, so that no process that the tool
+/// leaves running can keep that reader waiting.
 class Relay
 {
 public:
-    /// Sets up the relay where standard output is a pipe. Without descriptors for it the tool gets ours.
+    /// Sets up the relay where standard output is a pipe. If no descriptors are left for it, the tool gets ours.
     void open()
     {
         struct stat output = {};
@@ -281,7 +281,7 @@ public:
     }
     /// What the tool writes to, or -1 for our own output.
     int toolsEnd() const { return mToolsEnd; }
-    /// Once the tool runs.
+    /// To be called once the tool runs.
     void begin() const
     {
         if (isOpen()) {
@@ -344,8 +344,8 @@ pid_t parentOf(const char* process)
     return name != nullptr && std::sscanf(name + 1, " %*c %d", &parent) == 1 ? parent : 0;
 }
 
-/// Sends the signal to every descendant, in whatever session or group. This process is the subreaper of them all: one
-/// whose parent has ended is its own child.
+/// Sends the signal to every descendant, in any session or group. This process is the subreaper of all of them: one
+/// whose parent has ended becomes its child.
 void signalDescendants(int signal)
 {
     struct Process
@@ -381,7 +381,7 @@ void signalDescendants(int signal)
     }
 }
 
-/// Takes the statuses of all that have ended. Returns whether no descendant is left; `status` is set when `tool` ended.
+/// Reaps every descendant that has ended. Returns whether none is left; `status` is set when `tool` ended.
 bool reap(pid_t tool, int& status)
 {
     int each = 0;
@@ -394,7 +394,7 @@ bool reap(pid_t tool, int& status)
     return ended == -1;
 }
 
-/// Asks every descendant to end, then kills what is left. What does not die of that, it leaves behind.
+/// Sends SIGTERM to every descendant, then SIGKILL to those left. Leaves running what does not die of that.
 void endDescendants(const char* name)
 {
     int status = 0;
@@ -425,8 +425,8 @@ struct Streams
 
 pid_t start(const char* path, char** arguments, const Streams& streams)
 {
-    // A copy of the memory would take longer than all the rest. The child has descriptors and signal settings of its
-    // own, vfork(2). NOLINTBEGIN(clang-analyzer-security.insecureAPI.vfork,clang-analyzer-unix.Vfork)
+    // A copy of the memory would take longer than everything else. The child has its own descriptors and signal
+    // settings, vfork(2). NOLINTBEGIN(clang-analyzer-security.insecureAPI.vfork,clang-analyzer-unix.Vfork)
     const pid_t child = vfork();
     if (child == 0) {
         if (streams.output != -1) {
@@ -496,8 +496,8 @@ int supervise(const char* path, char** arguments, double seconds, Streams stream
     return W_EXITCODE(expired, 0);
 }
 
-/// One call of a tool, within its limit and what is left of its budget. Returns the raw status; a tool that cannot be
-/// run has the shell's exit code for it.
+/// One call of a tool, within its limit and the rest of its budget. Returns the raw status, or the shell's exit code
+/// for a tool that cannot be run.
 int call(const char* tool, char** arguments, const Streams& streams = {})
 {
     const Limit& limit = limitOf(tool, arguments);
@@ -531,8 +531,8 @@ int call(const char* tool, char** arguments, const Streams& streams = {})
 
 // The panel
 
-/// What i2cset needs for the panel's address: since 4.2 it refuses 0x07, which the I2C bus reserves, without -a; before
-/// it knew no such option. Its usage text says which one it is; asked for once in a run.
+/// What i2cset needs for the panel's address: since 4.2 it refuses 0x07, which the I2C bus reserves, without -a;
+/// before, it had no such option. Its usage text shows which one it is; read once in a run.
 bool needsOption()
 {
     char text[8192];
@@ -606,7 +606,7 @@ int play(char** arguments)
     return call("aplay", arguments);
 }
 
-/// The journal of the run is on the disk before the application starts.
+/// Writes the journal of the run to the disk before the application starts.
 int controlServices(int count, char** arguments)
 {
     if (std::getenv("RUNTIME_DIRECTORY") != nullptr && equal(arguments[count - 1], "harl") &&

@@ -1,6 +1,6 @@
 #pragma once
 
-/// How long the updater's tools may take. docs/reliability.md says what the operator sees when a limit is reached.
+/// How long the updater's tools may take. docs/reliability.md describes what the operator sees at each limit.
 struct Limit
 {
     const char* name; ///< calls of one name share a budget
@@ -15,7 +15,7 @@ struct Limit
 #ifdef LIMITS
 #include LIMITS // shorter ones, for tests
 #else
-/// The first that fits counts. The last is for everything that is not named before.
+/// The first match counts. The last entry is for everything else.
 inline constexpr Limit limits[] = {
     {"panel", "i2cset", nullptr, 5, 60, false, false},
     {"sound", "aplay", nullptr, 120, 120, false, false},
@@ -36,8 +36,8 @@ inline constexpr Limit limits[] = {
     {"journal", "journalctl", nullptr, 5, 20, false, false},
     {"other", nullptr, nullptr, 300, 300, false, false},
 };
-/// From the request to end to the kill, and from the kill until what does not die is left behind.
+/// From SIGTERM to SIGKILL, and from there until what does not die is left running.
 inline constexpr double grace = 3; // s
-/// How long output is still waited for that another process holds open when the tool has ended.
+/// How long to wait for output that another process holds open after the tool has ended.
 inline constexpr double silence = 1; // s
 #endif

@@ -1,6 +1,6 @@
 """A file system whose every access is uninterruptible: a FUSE server that takes requests and never answers them.
 
-Usage: frozen_mount.py FOLDER - mounts it there, says so and waits. Needs root. It comes alive again, with errors, when
+Usage: frozen_mount.py FOLDER - mounts it there, prints so and waits. Needs root. The accesses end, with errors, when
 this process ends.
 """
 

@@ -1,4 +1,4 @@
-"""What runs after the service has ended, on stand-in tools; it looks for processes, in a namespace of its own here."""
+"""give-back, which runs after the service has ended, on stand-in tools; in its own process namespace here."""
 
 import re
 import shutil
@@ -44,7 +44,7 @@ echo "umount $*" >>"$UNIT/calls"
     "sleep": "exec /usr/bin/sleep 0.05",
 }
 MOUNT = "/dev/sda1 /root/USB_MOUNT vfat rw 0 0\n"
-# What of the program is this unit's own, and the time of an outcome (s).
+# The parts of the program that depend on the unit, and the time of an outcome (s).
 CHANGES = {
     r"'/harl-updater\(-give-back\)*\.service$'": "''",  # every process here is the updater's
     "/proc/self/mounts": '"$UNIT/mounts"',
@@ -74,7 +74,7 @@ class GiveBack(unittest.TestCase):
         }
         for name, text in TOOLS.items():
             write_script(self.unit / "bin" / name, text)
-        # Copies of sleep(1) under the names of what the updater may leave at work.
+        # Copies of sleep(1) under the names of the programs that the updater may leave running.
         for name in ("apt", "dpkg", "scp", "ssh"):
             shutil.copy("/usr/bin/sleep", self.unit / name)
         shutil.copy(GIVE_BACK, self.unit / "give-back")
@@ -89,13 +89,13 @@ class GiveBack(unittest.TestCase):
             program.write_text(text.replace(old, new))
 
     def note(self, *notes: str) -> None:
-        """What the run has noted, just now."""
+        """Writes the notes of the run, as if made just now."""
         now = Path("/proc/uptime").read_text().split()[0]
         with (self.unit / "run/notes").open("a") as file:
             file.writelines(f"{now} {note}\n" for note in notes)
 
     def give_back(self, beside: str = ":", after: str = ":", at_work: tuple[str, ...] = (), status: int = 0) -> str:
-        """Runs it once what the shell line `beside` starts is `at_work`, and `after` next; what it says."""
+        """Runs it once the processes of the shell line `beside` are `at_work`, then `after`; returns its output."""
         waits = "".join(f"until pgrep -x {name} >/dev/null; do /usr/bin/sleep 0.01; done\n" for name in at_work)
         line = f'cd "$UNIT"\n{beside}\n{waits}./give-back; status=$?\n{after}\nexit $status'
         command = [*NAMESPACES, "sh", "-c", line]
@@ -110,7 +110,7 @@ class GiveBack(unittest.TestCase):
         return [line for line in lines if not tools or line.split()[0] in tools]
 
     def panel(self) -> dict[str, str]:
-        """The LEDs that are lit after what was sent, had they flashed blue before."""
+        """The LEDs that are lit after the sent bytes, if they flashed blue before."""
         panel = Panel()
         for byte in (LED_CODES["REMOTE"], COLOR_CODES["blue"]):
             panel.send(byte, 0)
@@ -272,7 +272,7 @@ class GiveBack(unittest.TestCase):
 
 
 class Units(unittest.TestCase):
-    """What the unit files and the programs must agree on."""
+    """Values on which the unit files and the programs must agree."""
 
     def test_times_make_the_four_hours(self) -> None:
         found = {}

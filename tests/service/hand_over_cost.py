@@ -1,7 +1,7 @@
 """Usage: hand_over_cost.py HAND_OVER [PAIRS]
 
-What the hand-over costs: the CPU time of a LED command, with the shell that the updater starts it in, through it and
-directly, in turn. The bus is absent; the real tool does the rest of its work. Fails above the ratio that is allowed.
+Measures the cost of the hand-over: the CPU time of a LED command, including the updater's shell, in turn through the
+hand-over and directly. The bus is absent; the real tool does the rest of its work. Fails above the allowed ratio.
 """
 
 import os
@@ -27,7 +27,7 @@ def cpu_time(line: str, environment: dict[str, str]) -> float:
 
 
 def main() -> int:
-    """Measures, prints and judges."""
+    """Measures, prints and compares with the limit."""
     hand_over = take_path()
     pairs = int(sys.argv[1]) if len(sys.argv) > 1 else PAIRS
     if not Path(TOOL).exists():
@@ -39,7 +39,7 @@ def main() -> int:
         path = "/usr/sbin:/usr/bin:/sbin:/bin"
         through = {"PATH": f"{folder}:{path}", "RUNTIME_DIRECTORY": str(folder / "run")}
         line = "i2cset {0}-y 0 0x07 0x12 c ; i2cset {0}-y 0 0x07 0x1 c"
-        cpu_time(line.format(""), through)  # the first in a run decides on the option
+        cpu_time(line.format(""), through)  # the first call of a run finds out the option
         times = [
             (cpu_time(line.format("-a "), {"PATH": path}), cpu_time(line.format(""), through)) for _ in range(pairs)
         ]

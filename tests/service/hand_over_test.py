@@ -1,6 +1,6 @@
 """Usage: hand_over_test.py HAND_OVER HAND_OVER_SHORT [TEST...]
 
-The program that is called in place of the updater's tools, before stand-in tools: what it passes on, and what it ends.
+The hand-over, which is called in place of the updater's tools, with stand-in tools: what it passes on and what it ends.
 """
 
 import contextlib
@@ -22,7 +22,7 @@ from tests.command_line import take_path
 
 ROOT = Path(__file__).parents[2]
 SHELLS = ("dash", "bash")
-# Both kinds note when they are asked for their usage text, keep what they are sent, and refuse one byte.
+# Both kinds note each request for their usage text, keep the bytes that they get, and refuse one byte.
 ASKED = '[ "$1" != -h ] || echo asked >>"$FOLDER/asked"\n'
 SENT = 'echo "$*" >>"$FOLDER/sent"\n[ "$4" != "$REFUSED" ] || exit 1\n'
 OLD = ASKED + OLDER + SENT
@@ -30,7 +30,7 @@ NEW = ASKED + NEWER + SENT
 
 
 def running(marker: str) -> list[int]:
-    """The processes whose environment has the marker, but those that have ended."""
+    """The processes whose environment has the marker, except those that have ended."""
     found = []
     for process in Path("/proc").glob("[0-9]*"):
         with contextlib.suppress(OSError):
@@ -40,7 +40,7 @@ def running(marker: str) -> list[int]:
 
 
 class HandOverTest(unittest.TestCase):
-    """A folder `bin` with the hand-over under each tool's name, one with real tools, one for what a run remembers."""
+    """A folder `bin` with the hand-over under each tool's name, one with real tools, one for the notes of a run."""
 
     hand_over: Path
     short: Path
@@ -63,7 +63,7 @@ class HandOverTest(unittest.TestCase):
         self.addCleanup(self.end_all)
 
     def end_all(self) -> None:
-        """Ends what a tool has left behind."""
+        """Ends the processes that a tool has left running."""
         for process in running(f"FOLDER={self.folder}"):
             with contextlib.suppress(OSError):
                 os.kill(process, signal.SIGKILL)
@@ -82,7 +82,7 @@ class HandOverTest(unittest.TestCase):
     def shell(
         self, line: str, shell: str = "dash", direct: bool = False, read: bool = True
     ) -> "subprocess.CompletedProcess[str]":
-        """Runs a line as the updater does: its output is read to the end, or goes to a file."""
+        """Runs a line as the updater does: its output is read to its end, or goes to a file."""
         with open(self.folder / "output", "w+") as output, open(self.folder / "errors", "w+") as errors:
             done = subprocess.run(
                 [shell, "-c", line],
@@ -99,13 +99,13 @@ class HandOverTest(unittest.TestCase):
             return subprocess.CompletedProcess(line, done.returncode, done.stdout or output.read(), errors.read())
 
     def notes(self) -> list[str]:
-        """What the run remembers, without the times."""
+        """The notes of the run, without the times."""
         path = self.folder / "run/notes"
         return [line.split(maxsplit=1)[1] for line in path.read_text().splitlines()] if path.exists() else []
 
 
 class PassedOn(HandOverTest):
-    """A tool that does not hang notices nothing, nor does its caller."""
+    """Neither a tool that does not hang nor its caller notices anything."""
 
     def assert_same(self, line: str) -> None:
         """With and without the hand-over, in both shells."""
@@ -148,7 +148,7 @@ class PassedOn(HandOverTest):
         self.assert_same("apt update")
 
     def test_arguments_environment_and_signals(self) -> None:
-        # The tool prints its own arguments, from argv[0] on, its environment and its signals.
+        # The tool prints its arguments, from argv[0] on, its environment and its signals.
         shutil.copy("/usr/bin/cat", self.folder / "tools/ls")
         files = "/proc/self/cmdline /proc/self/environ"
         status = " | sed -n '/^Sig[BI]/p;/^ShdPnd/p'"
@@ -208,14 +208,14 @@ class PassedOn(HandOverTest):
 
 
 class Limits(HandOverTest):
-    """Shortened limits: nothing holds the caller longer."""
+    """Shortened limits: nothing delays the caller longer."""
 
     def setUp(self) -> None:
         super().setUp()
         self.use(self.short)
 
     def assert_expires(self, line: str, seconds: float, left_over: int = 0) -> "subprocess.CompletedProcess[str]":
-        """The line fails with 124 after about so many seconds; how many of its processes are left."""
+        """The line fails with 124 after about this many seconds; returns how many of its processes remain."""
         begin = time.monotonic()
         done = self.shell(line)
         self.assertEqual(done.returncode, 124, done.stderr)
@@ -329,7 +329,7 @@ class Limits(HandOverTest):
         self.assertEqual(done.stderr, "")
         self.assertEqual([note.split()[:2] for note in self.notes()[1:]], [["spent", "panel"]] * 3)
         self.tool("aplay", "exit 0")
-        self.assertEqual(self.shell("aplay x").returncode, 0)  # a budget of its own
+        self.assertEqual(self.shell("aplay x").returncode, 0)  # it has its own budget
 
     def test_uploads_are_counted_whole(self) -> None:
         self.tool("scp", "sleep 2.5; exit 1")
@@ -385,7 +385,7 @@ class Table(unittest.TestCase):
 
 
 class Panel(HandOverTest):
-    """Bytes for the panel, with either kind of the real tool."""
+    """Bytes for the panel, with both kinds of the real tool."""
 
     def send(self, *values: str, refused: str = "none") -> int:
         """Sends bytes as the updater does; the status of the last."""
@@ -439,7 +439,7 @@ class Panel(HandOverTest):
         real = Path("/usr/sbin/i2cset")
         if not real.exists():
             self.skipTest("no i2c-tools here")
-        # A bus that does not exist: the arguments are judged before it is opened.
+        # A bus that does not exist: the tool checks its arguments before it opens the bus.
         done = self.shell("i2cset -y 9999 0x07 0x12 c")
         self.assertIn("No such file or directory", done.stderr)
 

@@ -1,8 +1,8 @@
 """Usage: hang_test.py BUILD_FOLDER PACKAGE SYSTEM [TEST...]
 
-Every command of an update hangs in every way, on the service of the built PACKAGE in a machine of its own (see
-service_test.py), with shortened limits; a few with the shipped ones. Each time the instrument comes back, the panel
-shows what the procedure gives for that failure, and the next run ends as it should.
+Lets every command of an update hang in every way, with the service of the built PACKAGE in a machine of its own (see
+service_test.py), with shortened limits, and a few with the shipped ones. Each time the instrument must come back, the
+panel must show the outcome of that failure, and the next run must end normally.
 """
 
 import time
@@ -15,7 +15,7 @@ from bench.outcomes import CHECK_FAILED, INSTALLATION_FAILED, UP_TO_DATE, UPDATE
 from tests.service.service_test import ROOT, TOOLS, ServiceTest, main, shorten, wait_for
 
 FROZEN = "/run/frozen"
-# What a hanging call does. The last goes on with its work.
+# What a hanging call does. The last one continues its work.
 KINDS = {
     "never_ends": "exec sleep 600",
     "ignores_the_request_to_end": "trap '' TERM; while :; do sleep 600; done",
@@ -29,7 +29,7 @@ LONGEST = 75  # s, from the start to the application, with shortened limits on a
 
 @dataclass(frozen=True)
 class Command:
-    """A command of the updater, and what comes out when it fails."""
+    """A command of the updater, and the result when it fails."""
 
     tool: str
     arguments: str  # pattern of the shell
@@ -71,7 +71,7 @@ class HangTest(ServiceTest):
 
     def tearDown(self) -> None:
         self.restore_tools()
-        # What hung is still in the control group of the updater, and stays there where it is uninterruptible.
+        # A hanging process is still in the updater's control group, and stays there if it is uninterruptible.
         self.unit.status("sh", "-c", "kill -9 $(cat /run/frozen.pid); umount -l /run/frozen; rm /run/frozen.pid")
         self.unit.status("pkill", "--signal", "KILL", "--full", "sleep 600")
         super().tearDown()
@@ -87,7 +87,7 @@ class HangTest(ServiceTest):
         self.inside("rm", "-f", "/run/hung")
 
     def hang(self, tool: str, arguments: str, how: str, once: bool = False) -> None:
-        """Lets calls of the tool with these arguments hang."""
+        """Makes calls of the tool with these arguments hang."""
         path = self.unit.root() / "usr/local/sbin" / tool
         # A tool without a stand-in is the real one.
         rest = path.read_text().split("\n", 1)[1] if path.exists() else f'exec /usr/bin/{tool} "$@"'
@@ -118,7 +118,7 @@ class HangTest(ServiceTest):
         return time.monotonic() - begin
 
     def check_next_run(self) -> None:
-        """Nothing blocks the next run, and it does what is left to do."""
+        """The next run is not blocked and does what is left to do."""
         self.restore_tools()
         self.unit.status("systemctl", "reset-failed")
         done = self.package_state().endswith("1.3.0") and self.read("/srv/board") == "2.2.0\n"
@@ -168,18 +168,18 @@ def add_cases(tests: type[HangTest], commands: Iterable[str]) -> None:
 
 
 class Others(HangTest):
-    """Hangs that are no command's own."""
+    """Hangs outside the commands."""
 
     def test_maintainer_script(self) -> None:
         self.offer("sleep 600")
         self.run_to_the_end()
         self.assertEqual(self.panel(), INSTALLATION_FAILED.panel)
-        # Left half-configured; and it hangs again before the next run, and the ones after it.
+        # The package stays half-configured, and its script hangs again before each later run.
         self.mount_stick()
         self.run_to_the_end()
         self.assertIn("prepare: solvik4-rh cannot be finished", self.journal())
         self.assertEqual(self.panel(), INSTALLATION_FAILED.panel)
-        # Another version is its end.
+        # Another version ends this.
         build(Package("solvik4-rh", "1.4.0"), self.repository)
         write_index(self.repository)
         self.mount_stick()
@@ -193,7 +193,7 @@ class Others(HangTest):
         self.check_next_run()
 
     def test_all_of_systemctl(self) -> None:
-        # Not even give-back can start the application then: the manager does.
+        # Then not even give-back can start the application: the service manager does.
         self.inside("sh", "-c", "systemctl stop harl")
         self.hang("systemctl", "*harl*", KINDS["never_ends"])
         self.run_to_the_end()
@@ -215,7 +215,7 @@ class Others(HangTest):
 
 
 class Rescuer(HangTest):
-    """What gives the instrument back is killed, hangs or cannot be run."""
+    """give-back is killed, hangs or cannot be run."""
 
     def setUp(self) -> None:
         super().setUp()
@@ -258,7 +258,7 @@ class Rescuer(HangTest):
         self.wait_for_file("/run/hung")
         self.inside("kill", "-s", "KILL", str(self.main_of_give_back()))
         self.assert_given_back_at_last()
-        # The pair of bytes that was broken off costs the controller a byte that means nothing to it.
+        # After the interrupted pair, the controller gets one byte that it does not understand.
         self.assertEqual(self.panel(faults=True), INSTALLATION_FAILED.panel)
 
     def test_killed_while_it_releases_the_stick(self) -> None:
@@ -285,7 +285,7 @@ class Rescuer(HangTest):
         self.assert_given_back_at_last()
 
     def test_its_start_fails(self) -> None:
-        # Neither crash nor stop may depend on the command that starts it.
+        # Neither a crash nor a stop may depend on the command that starts give-back.
         drop_in = self.unit.root() / "etc/systemd/system/harl-updater.service.d/start.conf"
         for command in ("/bin/false", "/bin/sh -c 'kill -9 $$$$'", "/bin/sleep 600"):
             with self.subTest(command=command):

@@ -1,7 +1,7 @@
 """Usage: service_test.py BUILD_FOLDER PACKAGE SYSTEM [TEST...]
 
 Runs the service of the built PACKAGE (harl-updater or harl-updater-static, from build/package/) under real systemd, apt
-and dpkg of the root file system SYSTEM and lets it end in every way. The board, the sound and the panel's bus are
+and dpkg of the root file system SYSTEM and ends it in every way. The board, the sound and the panel's bus are
 stand-ins.
 """
 
@@ -33,7 +33,7 @@ ROOT = Path(__file__).parents[2]
 STICK = "/root/USB_MOUNT"
 UNITS = ("harl-updater", "harl-updater-give-back")
 SPEED = 10  # times shorter waits of the updater
-KEEP = 'echo "$4" >>/var/log/panel'  # the panel keeps what it is sent
+KEEP = 'echo "$4" >>/var/log/panel'  # the panel keeps the bytes that it gets
 TOOLS = {
     "i2cset": NEWER + KEEP,
     "aplay": 'sleep 0.2; echo "${1##*/}" >>/var/log/sounds',
@@ -61,7 +61,7 @@ DPkg::Options { "--force-confnew"; };
 Acquire::Retries "0"; Acquire::http::Timeout "999"; DPkg::Lock::Timeout "0";
 Binary::apt { Acquire::Retries "0"; Acquire::http::Timeout "999"; DPkg::Lock::Timeout "0"; };
 """
-# The application sees what is on the disk when it starts.
+# The application reads from the disk when it starts.
 JOURNAL_AT_START = """[Service]
 ExecStartPre=/bin/sh -c 'journalctl --quiet --directory=/var/log/journal --identifier=harl-updater >/run/harl-journal'
 """
@@ -79,7 +79,7 @@ def built_package(name: str) -> Path | None:
 
 
 def make_files(unit: Machine, package: Path, programs: Path) -> None:
-    """Writes what the machine has: tools, packages and the application."""
+    """Writes the machine's files: tools, packages and the application."""
     files = unit.files
     for name, text in TOOLS.items():
         write_script(files / "usr/local/sbin" / name, text)
@@ -99,7 +99,7 @@ def make_files(unit: Machine, package: Path, programs: Path) -> None:
 
 
 def install(unit: Machine) -> None:
-    """Installs the package under test, and a package in place of all that it depends on."""
+    """Installs the package under test, and one package in place of all its dependencies."""
     depends = unit.run("dpkg-deb", "--field", "/srv/updater.deb", "Depends")
     names = ", ".join(f"{item.split()[0]} (= 9999)" for item in depends.split(","))
     tools = build(Package("tools", "1.0", {"Provides": names}), unit.root() / "srv")
@@ -126,12 +126,12 @@ def wait_for(what: str, condition: Callable[[], bool], seconds: float = 60) -> N
 
 
 def states(unit: Machine) -> set[str]:
-    """What the service and the one that gives the instrument back do; a number for a start that is still queued."""
+    """The states of the service and of give-back; a number for a start that is still queued."""
     return set(unit.run("systemctl", "show", "--value", "--property=ActiveState,Job", *UNITS).split())
 
 
 def panel(unit: Machine) -> Panel:
-    """The panel after what it was sent."""
+    """The panel after the bytes that it got."""
     return panel_after(int(byte, 16) for byte in (unit.root() / "var/log/panel").read_text().split())
 
 
@@ -141,7 +141,7 @@ class ServiceTest(unittest.TestCase):
     unit: Machine
     package: str
     tool: Path  # the companion program, on this machine
-    before: list[str] = []  # what leaves out of the journal what came before the run
+    before: list[str] = []  # options that omit the journal before the run
 
     def setUp(self) -> None:
         self.maxDiff = None
@@ -178,7 +178,7 @@ class ServiceTest(unittest.TestCase):
         self.inside("systemctl", "daemon-reload")
 
     def offer(self, script: str = "", depends: str = "") -> None:
-        """Offers solvik4-rh 1.3.0, with a maintainer script of these lines, beside what the repository already has."""
+        """Offers solvik4-rh 1.3.0, with a maintainer script of these lines, besides the repository's packages."""
         fields = {"Depends": depends} if depends else {}
         build(Package("solvik4-rh", "1.3.0", fields, {"postinst": script}), self.repository)
         write_index(self.repository)
@@ -190,13 +190,13 @@ class ServiceTest(unittest.TestCase):
         self.main = int(self.show("MainPID"))
 
     def note_journal(self) -> None:
-        """The run's part of the journal begins here."""
+        """Begins the run's part of the journal."""
         # As in service/prepare.
         last = self.inside("sh", "-c", "journalctl --identifier=harl-updater --lines=0 --show-cursor || true")
         self.before = [f"--after-cursor={line[11:]}" for line in last.splitlines() if line.startswith("-- cursor: ")]
 
     def kill(self, signal: str) -> None:
-        """Sends a signal to the updater itself."""
+        """Sends a signal to the updater."""
         self.inside("kill", "-s", signal, str(self.main))
 
     def show(self, name: str) -> str:
@@ -204,7 +204,7 @@ class ServiceTest(unittest.TestCase):
         return self.inside("systemctl", "show", "--value", f"--property={name}", "harl-updater").strip()
 
     def wait_for_file(self, path: str) -> None:
-        """Waits for a file inside."""
+        """Waits for a file in the machine."""
         wait_for(path, lambda: (self.unit.root() / path.lstrip("/")).exists())
 
     def wait_for_end(self) -> None:
@@ -220,13 +220,13 @@ class ServiceTest(unittest.TestCase):
         return self.show("Result"), self.show("ExecMainCode"), self.show("ExecMainStatus")
 
     def panel(self, faults: bool = False) -> dict[str, str]:
-        """The LEDs that are lit, when the panel has understood every byte, or has had `faults`."""
+        """The lit LEDs; the panel must have understood every byte, or have had these `faults`."""
         shown = panel(self.unit)
         self.assertEqual(bool(shown.faults), faults)
         return shown.pattern(0)
 
     def read(self, path: str) -> str:
-        """Text of a file inside."""
+        """The text of a file in the machine."""
         return (self.unit.root() / path.lstrip("/")).read_text()
 
     def journal(self) -> str:
@@ -244,7 +244,7 @@ class ServiceTest(unittest.TestCase):
         wait_for("harl", lambda: self.unit.status("systemctl", "is-active", "--quiet", "harl") == 0, 10)
 
     def assert_installation_ended_well(self) -> None:
-        """The slow script was let finish, and the application kept away meanwhile."""
+        """The slow script could finish, and the application did not run meanwhile."""
         self.assertEqual(self.package_state(), "install ok installed 1.3.0")
         self.assertEqual(self.read("/run/harl-after"), "inactive\n")
 
@@ -324,7 +324,7 @@ class Ends(ServiceTest):
 
     def test_no_memory_for_the_threads(self) -> None:
         limit = self.unit.root() / "etc/systemd/system/harl-updater.service.d/limit.conf"
-        write(limit, "[Service]\nLimitDATA=12M\n")  # the stack of the second thread, 8 MiB, does not fit any more
+        write(limit, "[Service]\nLimitDATA=12M\n")  # the stack of the second thread, 8 MiB, no longer fits
         self.addCleanup(limit.unlink)
         self.inside("systemctl", "daemon-reload")
         self.offer()
@@ -365,7 +365,7 @@ class Ends(ServiceTest):
 
 
 class Sticks(ServiceTest):
-    """With the maker's keyring on the unit, only a stick that he signed is used."""
+    """With the maker's keyring on the unit, only a stick signed by the maker is used."""
 
     def setUp(self) -> None:
         super().setUp()
@@ -407,7 +407,7 @@ class Sticks(ServiceTest):
         self.assertEqual(self.panel(), {"PASS": "pass"})
 
     def assert_refused(self, why: str) -> None:
-        """The updater did not run, FAIL is shown, the log says why, the instrument is given back."""
+        """The updater did not run, FAIL is shown, the log shows why, the instrument is given back."""
         self.note_journal()
         self.assertNotEqual(self.unit.status("systemctl", "start", "harl-updater"), 0)
         self.wait_for_end()
@@ -478,7 +478,7 @@ class Outcomes(ServiceTest):
         self.assertNotIn("give-back", self.journal())
 
     def test_crash_after_the_outcome_was_shown(self) -> None:
-        self.set_speed(3)  # time to meet it while the outcome is shown
+        self.set_speed(3)  # time to act while the outcome is shown
         self.offer()
         self.start()
         wait_for("outcome", lambda: self.panel() == {"PASS": "pass"})
@@ -509,7 +509,7 @@ class Outcomes(ServiceTest):
                 self.setUp()
 
     def test_notes_that_cannot_be_written_leave_the_panel_alone(self) -> None:
-        # Prepared as ever; then the file system is full, or refuses writing.
+        # Prepared as usual; then the file system is full, or refuses writing.
         for fill in ("head -c 100M /dev/zero >/run/harl-updater/fill || true", "mount -o remount,ro /run/harl-updater"):
             with self.subTest(fill=fill):
                 self.inside("sh", "-c", "mkdir -p /run/harl-updater; mount -t tmpfs -o size=64k run /run/harl-updater")
@@ -523,7 +523,7 @@ class Outcomes(ServiceTest):
 
 
 class Repairs(ServiceTest):
-    """What comes before the updater: other package tools, and an installation that a power cut broke off."""
+    """What comes before the updater: other package tools, and an installation that a power cut interrupted."""
 
     def test_installation_that_a_power_cut_left_behind_is_finished(self) -> None:
         self.offer("touch /run/package-installs")
@@ -536,7 +536,7 @@ class Repairs(ServiceTest):
 
     def test_unpacking_that_a_power_cut_broke_off_is_done_again(self) -> None:
         self.offer()
-        # What dpkg notes of its steps stays in this folder until it ends; apt installs nothing as long as it is there.
+        # dpkg's journal of its steps stays in this folder until dpkg ends; apt installs nothing as long as it exists.
         self.inside(
             "sh",
             "-c",
@@ -730,7 +730,7 @@ class Surroundings(ServiceTest):
 
 
 class Result(unittest.TextTestResult):
-    """Prints the journal of a run that did not end as it should."""
+    """Prints the journal of a run that did not end as expected."""
 
     def addFailure(self, test: unittest.TestCase, err: Any) -> None:  # noqa: N802
         super().addFailure(test, err)

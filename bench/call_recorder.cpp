@@ -1,16 +1,16 @@
 /// Preloaded into the updater by the bench (LD_PRELOAD), and into none of its children.
 ///
-/// Writes the start and the end of every command and every wait to the file named by BENCH_CALLS, one line each, the
-/// columns separated by tabs:
+/// Writes the start and the end of every command and every wait to the file named by BENCH_CALLS, one line each, with
+/// tabs between the columns:
 ///
 ///   seconds of CLOCK_BOOTTIME, thread id, "system" | "popen" | "nanosleep", "start" | "end", value, text
 ///
-/// For a command the text is its command line and the value at its end the raw status. For a wait the value is what was
-/// asked for (s) and the text how long it takes in fact (s).
+/// For a command the text is its command line and the value at its end the raw status. For a wait the value is the
+/// requested time (s) and the text the time that it really takes (s).
 ///
 /// Shortens the waits: BENCH_SPEED times (1: full length), but to no less than BENCH_SHORTEST_WAIT (s; 0.2 when it is
 /// not set) so that the panel's flashing stays visible; a longer one makes its pauses longer. The wall clock that the
-/// updater sees moves on by what waits of 2 s and more were shortened by: the log reads like a run at full length.
+/// updater sees advances by the time cut from waits of 2 s and more, so that the log reads like a run at full length.
 
 #include <algorithm>
 #include <atomic>
@@ -31,7 +31,7 @@ namespace
 const double clockWait = 2; // s, the shortest wait whose shortening moves the wall clock
 
 std::atomic<double> clockOffset{0};   // s, by which the updater's wall clock is ahead
-std::mutex writing;                   // one descriptor serves both threads of an updater that has no more left
+std::mutex writing;                   // both threads use one descriptor, as the updater may have no more
 thread_local std::string pipeCommand; // the updater reads one command at a time on a thread
 
 __attribute__((constructor)) void leaveChildrenAlone()

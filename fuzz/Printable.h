@@ -2,8 +2,8 @@
 
 #include "findings.h"
 
-/// Ends the process unless `text` has no control characters but line feeds.
+/// Ends the process if `text` has control characters other than line feeds.
 void expectPrintable(const std::string& text);
 
-/// Ends the process unless all that the report shows is fit for a terminal and for JSON.
+/// Ends the process unless everything in the report is fit for a terminal and for JSON.
 void expectPrintable(const Report& report);

@@ -1,5 +1,5 @@
-/// The check of the stick's archive against the zip library's own reading. Input: a byte that says how much of the
-/// medium can be read, in 256ths (255: all of it), then the archive.
+/// The check of the stick's archive against the zip library's own reading. Input: a byte for the readable part of the
+/// medium, in 256ths (255: all of it), then the archive.
 
 #include "stick/archive.h"
 #include "Input.h"
@@ -16,7 +16,7 @@ namespace
 const std::uint64_t mostUnpacked = 1'000'000; // bytes
 const std::size_t buffers = 200'000;          // bytes that the check may read beyond it
 
-/// True when the zip library reads every entry to its end and finds its checksum right.
+/// True when the zip library reads every entry to its end with the right checksum.
 bool libraryReadsAll(const std::string& bytes)
 {
     zlib_filefunc64_def functions = {};

@@ -1,5 +1,5 @@
-/// The board check against an oracle. Input: a digit each for the status of the version's reading and of the stick's
-/// listing, then their outputs with the byte 0x1E between them.
+/// The board check against an oracle. Input: a digit for the status of reading the version and one for that of listing
+/// the stick, then the two outputs with the byte 0x1E between them.
 
 #include "Input.h"
 #include "UpdateManager.h"

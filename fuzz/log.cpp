@@ -1,8 +1,8 @@
 /// `harl-updater-tool log`: its parser, its explanation and its reports. Input: a byte for the size of the blocks in
 /// which the log comes, then the log.
 ///
-/// Blocks must make no difference, whatever is shown must be fit for a terminal, for JSON and for a page, and no log in
-/// front of a whole run may change what is said of that run.
+/// Blocks must make no difference, all output must be fit for a terminal, for JSON and for a page, and no log before a
+/// whole run may change the explanation of that run.
 
 #include "Input.h"
 #include "Printable.h"
@@ -19,13 +19,13 @@
 namespace
 {
 
-/// Writes down what the parser hands over, and looks at what must hold for all of it.
+/// Records what the parser hands over, and checks what must hold for all of it.
 class Events : public LogSink
 {
 public:
     void record(const ParsedRecord& record) override
     {
-        // That a head has no message is known only after lines of others.
+        // Only after lines of others is it known that a head has no message.
         expect(record.line > mLastRecord, "records in order");
         mLastRecord = record.line;
         mText << '\n' << record.line << " record";
@@ -84,7 +84,7 @@ std::string events(std::string_view log, std::size_t blockSize)
     return sink.text();
 }
 
-/// All that is shown of a log; looks at what must hold for it.
+/// Everything shown of a log; checks what must hold for it.
 void expectFitReports(std::string_view log, std::size_t blockSize)
 {
     std::ostringstream report;
@@ -114,7 +114,7 @@ void expectFitReports(std::string_view log, std::size_t blockSize)
     expectPrintable(changes.str());
 }
 
-/// What is said of the last run of a log, without the places in the log.
+/// The explanation of the last run of a log, without the places in the log.
 std::string lastRun(std::string_view log)
 {
     std::string said;

@@ -1,5 +1,5 @@
-/// The package check against an oracle that looks for the last values from the end. Input: a digit for the query's
-/// status, whose parity also says whether exit code 100 is let pass, then the query's output.
+/// The package check against an oracle that searches for the last values from the end. Input: a digit for the query's
+/// status, whose parity also decides whether exit code 100 is accepted, then the query's output.
 
 #include "Input.h"
 #include "UpdateManager.h"

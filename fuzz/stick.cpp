@@ -26,7 +26,7 @@ namespace
 namespace fs = std::filesystem;
 const std::string intactArchive = zipArchive({{"a", "x"}});
 
-/// An empty folder of the fuzzer's own, removed at its end.
+/// The fuzzer's own empty folder, removed at its end.
 const std::string& temporaryFolder()
 {
     static const std::string path = [] {
@@ -104,7 +104,7 @@ std::vector<std::string> uploaded(const std::string& folder, const std::string& 
     return paths;
 }
 
-/// True for a plain file that is not empty and lies on the stick, whatever links lead to it.
+/// True for a plain file on the stick that is not empty, whatever links lead to it.
 bool isFileOn(const std::string& root, const std::string& path)
 {
     std::error_code error;

@@ -1,5 +1,6 @@
 /// Usage: command-loop FILE
-/// Runs each line of FILE with system(3), one after the other: the least that a program can do to run these commands.
+/// Runs each line of FILE with system(3), one after the other: the minimum that a program must do to run these
+/// commands.
 
 #include <cstdio>
 #include <cstdlib>

@@ -1,7 +1,7 @@
-/// The engine's runner next to plain reads of the same output, and the log next to a plain write of the same bytes.
+/// Compares the engine's runner with plain reads of the same output, and the log with a plain write of the same bytes.
 ///
 /// Both sides of a pair are measured in turn in each repetition; a counter named *_ratio is the plain side's cost
-/// divided by the engine's, so that more is better and 1 is on a par.
+/// divided by the engine's: more is better, 1 means equal.
 
 #include "Log.h"
 #include "UpdateManager.h"
@@ -28,7 +28,7 @@ namespace
 const std::size_t mebibyte = 1U << 20U;
 
 /// A file of `size` bytes in lines of `lineLength`, line end included; a length of 0 makes one line without an end. It
-/// has no name: it is removed with the process, however that ends.
+/// has no name and so disappears with the process, however that ends.
 class TextFile
 {
 public:
@@ -68,7 +68,7 @@ private:
     int mFile;
 };
 
-/// Sends standard output to a place where it costs nothing, for as long as the object lives.
+/// Sends standard output to /dev/null as long as the object lives.
 class Muted
 {
 public:
@@ -136,7 +136,7 @@ Cost costOf(Function function)
     return {wall.count(), cpuTime() - cpu, (fromProc("/proc/self/status", "VmHWM:") - memory) * 1024};
 }
 
-/// What one would write instead of the runner, where only the output counts: 64 KiB reads into a string.
+/// The plain alternative to the runner where only the output counts: 64 KiB reads into a string.
 void readInBlocks(const std::string& command, std::string& output)
 {
     static char block[64 * 1024];
@@ -217,7 +217,7 @@ void LogOneRecord(benchmark::State& state)
                 LOG() << message;
             }
         });
-        // One write more: the reset of the peak.
+        // One more write: the reset of the peak.
         const double writes = fromProc("/proc/self/io", "syscw:") - before - 1;
         const Cost plain = costOf([&] {
             for (int i = 0; i < records; ++i) {

@@ -1,6 +1,6 @@
-/// Preloaded into the updater, or a program that it is compared with, by performance/processes, and into none of their
-/// children. Takes the waits out, and at the end writes what the process itself cost to the file named by MEASURED:
-/// its CPU time without its children's (s), and its peak of memory (KiB).
+/// Preloaded by performance/processes into the updater, or a program that it is compared with, and into none of their
+/// children. Removes the waits, and at the end writes the cost of the process itself to the file named by MEASURED: its
+/// CPU time without its children's (s), and its peak memory (KiB).
 ///
 /// The flashing thread would send LED commands without a pause: its pause of a second lasts until another thread waits
 /// for its end, so that each run has exactly one of its cycles.
@@ -52,7 +52,8 @@ __attribute__((destructor)) void end()
 
 } // namespace
 
-/// A shell ends by this, without the libraries' last words; so does a child of it that could run no program.
+/// A shell ends by this function, without the libraries' destructors; so does a child of it that could not run a
+/// program.
 extern "C" void _exit(int status)
 {
     if (getpid() == self) {

@@ -5,7 +5,7 @@
 #include <string>
 #include <vector>
 
-/// A unit and what goes wrong in one run on it.
+/// A unit and the faults of one run on it.
 struct Case
 {
     Unit unit;
@@ -20,18 +20,18 @@ struct Case
 const char panelStep[] = "panel";
 const char soundStep[] = "sound";
 
-/// Every LED command of a run that comes to one of `reports`: those represent all panels.
+/// Every LED command of a run that ends in one of `reports`, which represent all panels.
 platform::Lines ledCommands(const std::vector<std::string>& reports = {"result 0", "result 1", "error 0", "error 2"});
 
 /// Every step on `unit`, panel and sound included, with every fault.
 std::vector<Injection> procedureInjections(const Unit& unit);
 
-/// Whether each of `injections` meets its step in a run on `unit`: a step may be passed over there, or another's fault
-/// may keep it from being run.
+/// Whether each of `injections` reaches its step in a run on `unit`: the run may skip a step, or another fault may keep
+/// it from running.
 bool allHappen(const Unit& unit, const std::vector<Injection>& injections);
 
-/// Those that meet their step, as cases of all units.
+/// Those that reach their step, as cases of all units.
 std::vector<Case> faultsOfTheProcedure();
 
-/// These, a case without a fault for each unit, and every fault of each single LED command.
+/// These cases, one without a fault for each unit, and every fault of each single LED command.
 std::vector<Case> everyFault();

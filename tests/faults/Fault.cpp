@@ -65,7 +65,7 @@ const std::vector<Fault>& readFaults()
         std::vector<Fault> all;
         for (const int code : exitCodes) {
             all.push_back({"exit" + std::to_string(code), code * 256, Text::Kept, same});
-            // 127 without a word on standard output is what the shell makes of a missing tool.
+            // For a missing tool the shell gives 127 and prints nothing on standard output.
             all.push_back({code == 127 ? "toolMissing" : "exit" + std::to_string(code) + "Silent", code * 256,
                            Text::None, nothing});
         }

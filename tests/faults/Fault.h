@@ -3,7 +3,7 @@
 #include <string>
 #include <vector>
 
-/// What a fault leaves of the text that a healthy command prints.
+/// The effect of a fault on the text that a healthy command prints.
 enum class Text {
     Kept,            ///< nothing that matters is lost
     None,            ///< nothing is printed, or nobody reads it
@@ -28,5 +28,5 @@ struct Fault
 /// The faults of a command whose output is read.
 const std::vector<Fault>& readFaults();
 
-/// The faults of a command of which only the status is seen.
+/// The faults of a command whose status alone is visible.
 const std::vector<Fault>& runFaults();

@@ -1,5 +1,5 @@
 /// Every command of every path of both heads, with every fault, and with every pair of faults. Each case is a process
-/// of its own in which the program's main(), or one update of the main head, runs whole on the stand-in platform.
+/// of its own that runs the program's main(), or one update of the main head, on the stand-in platform.
 
 #include "AppLock.h"
 #include "Cases.h"
@@ -97,7 +97,7 @@ void expectWholeRecords()
     }
 }
 
-/// Every failing LED command and sound is logged, and nothing else is.
+/// Every failing LED command and sound is logged, and no other.
 void expectFailuresLogged()
 {
     platform::Lines failed;
@@ -155,7 +155,7 @@ void expectOneReport(const std::string& report, const std::string& message)
     EXPECT_EQ(reports, 1);
 }
 
-/// The main thread announces itself, darkens the panel before anything else happens, and waits for the update.
+/// The main thread logs its start, darkens the panel before anything else happens, and waits for the update.
 void expectMainThread(const platform::Lines& own)
 {
     const platform::Lines expected =

@@ -8,7 +8,7 @@
 namespace
 {
 
-/// What the updater can tell apart in a command's answer.
+/// What the updater can distinguish in a command's answer.
 enum class Seen {
     Any,
     Success,
@@ -95,7 +95,7 @@ const std::vector<Component> components = {
 
 const int attempts = 20;
 
-/// Closing steps; the remote head leaves 30 s to the operator first.
+/// Closing steps; the remote head first gives the operator 30 s.
 const platform::Lines closing = {ran(unmountCommand), ran(startHarlCommand), "sleep:10", ran(stopUpdaterCommand)};
 
 const Fault* faultOf(const std::vector<Injection>& injections, const std::string& step, int attempt = 0)
@@ -117,7 +117,7 @@ public:
     {
     }
 
-    /// Goes from `state` on through `rows`; returns the first state that they say nothing of.
+    /// Follows `rows` from `state`; returns the first state without a row.
     std::string go(const Rows& rows, std::string state);
 
     platform::Lines mCalls;
@@ -280,7 +280,7 @@ Expected followMainHead(Walk& walk)
     return expected;
 }
 
-/// The last record in front of a report, as far as it does not depend on a tool's output.
+/// The last record before a report, if it does not depend on a tool's output.
 std::string lastMessage(bool mainHead, const std::string& report, const std::vector<Injection>& injections)
 {
     if (report == "error 0") {

@@ -8,18 +8,18 @@
 #include <vector>
 
 /// @file
-/// The two heads' procedures as tables, written down apart from the updater: which command follows on which answer, and
-/// what is reported at the end. The fault matrix takes all that it expects from here.
+/// The procedures of the two heads as tables, written independently of the updater: which command follows which answer,
+/// and what is reported at the end. The fault matrix takes all its expectations from here.
 
-/// How much the updater looks at what a command does.
+/// What the updater evaluates of a command.
 enum class Reads {
     Nothing, ///< at no more than its raw status, for the log
-    Status,  ///< at whether its raw status is 0
-    Code,    ///< at whether its exit code is 0
-    Policy,  ///< at the two versions in its output, whatever its exit code
-    Board,   ///< at its exit code, then at the board's version in its output
+    Status,  ///< whether its raw status is 0
+    Code,    ///< whether its exit code is 0
+    Policy,  ///< the two versions in its output, whatever its exit code
+    Board,   ///< its exit code, then the board's version in its output
     Listing, ///< at its exit code, then at the first line of its output
-    Marker,  ///< at its exit code, 2 standing for no marker, then at the first line of its output
+    Marker,  ///< its exit code, where 2 means no marker, then the first line of its output
 };
 
 /// A command of the updater, by the name that the tables give it.
@@ -47,15 +47,15 @@ struct Injection
     int times = 0;
 };
 
-/// What must come out of one run.
+/// The expected result of one run.
 struct Expected
 {
     platform::Lines calls; ///< commands and pauses in order, as the journal spells them, reports included
     std::string report;    ///< the last one: "result 0", "error 1" ...
-    std::string message;   ///< of the last record in front of it; empty when it is not fixed
+    std::string message;   ///< of the last record before it; empty when it is not fixed
 };
 
-/// The commands of the procedure on `unit`, each once, those of panel and sound left out.
+/// The commands of the procedure on `unit`, each once, without those of panel and sound.
 std::vector<Step> stepsOf(const Unit& unit);
 
 /// What a healthy command prints on `unit`.

@@ -37,7 +37,7 @@ std::string toolOf(const std::string& command)
     return command.substr(0, command.find(' '));
 }
 
-/// The arguments of the first tool of a command line, as the shell is to read them.
+/// The arguments of the first tool of a command line, quoted for the shell.
 std::string argumentsOf(const std::string& command)
 {
     const std::string first = command.substr(0, command.find(" && "));
@@ -65,11 +65,11 @@ public:
     RealRun(const RealRun&) = delete;
     RealRun& operator=(const RealRun&) = delete;
 
-    /// Waits for the updater's end and compares all that was seen.
+    /// Waits for the updater's end and compares everything observed.
     void expectHolds();
 
 private:
-    /// The shell line with which a tool answers, once it has been told its step.
+    /// The shell line with which a tool answers once it knows its step.
     std::string answer(const std::string& step, const std::string& healthy, const Injection* injection);
     const Injection* injectionOf(const std::string& step) const;
     void makeTools();
@@ -130,7 +130,7 @@ std::string RealRun::answer(const std::string& step, const std::string& healthy,
         line << "/bin/cat " << output.string() << "; ";
     }
     if (fault != nullptr && fault->status > 0 && fault->status < 256) {
-        // The shell that ran the tool, unless it became the tool, dies with it: that is what the updater gets to see.
+        // The shell that ran the tool, unless it became the tool, dies with it: this is what the updater sees.
         line << "read -r parent </proc/$PPID/comm; [ \"$parent\" != sh ] || kill -" << fault->status << " $PPID; kill -"
              << fault->status << " $$; ";
     }

@@ -3,8 +3,8 @@
 #include <cstdlib>
 #include <new>
 
-// The program's heap, which counts what it releases. A file of its own: inlined into its users, g++ takes the pairs of
-// new and free() for a mistake.
+// The program's heap, which counts what it releases. In a file of its own, because g++ warns of the pairs of new and
+// free() if they are inlined.
 
 namespace
 {

@@ -29,7 +29,7 @@ struct Script
     std::size_t next = 0;
 };
 
-/// The buffer of std::cout. Each piece that is handed over at once is kept as one text.
+/// The buffer of std::cout. Keeps each piece that is written at once as one text.
 class LogBuffer : public std::streambuf
 {
 public:

@@ -20,7 +20,7 @@ namespace platform
 
 using Lines = std::vector<std::string>;
 
-/// What a command does when it is run.
+/// What a command does when it runs.
 struct Answer
 {
     int status = 0;                    ///< raw wait status that `system` or `pclose` returns; -1 for their failure
@@ -38,7 +38,7 @@ void reset();
 /// Scripts the answers of an exact command line, in order; the last one repeats.
 void script(const std::string& command, const std::vector<Answer>& answers);
 
-/// Replaces the pauses: `pause` gets and returns what nanosleep(2) does, errno included.
+/// Replaces the pauses: `pause` has the parameters and the result of nanosleep(2), including errno.
 void scriptSleep(const std::function<int(const timespec* duration, timespec* remaining)>& pause);
 
 /// Runs `hook` on the thread that has just written a record, before it goes on.
@@ -59,7 +59,7 @@ Lines entries(const std::string& prefix);
 /// The log records so far. Fails the test when one is not well-formed.
 std::vector<Record> records();
 
-/// Where the text of the last command was kept. Two calls got the same text, not two equal ones, when it is the same.
+/// The address of the last command's text. Two calls with the same address got the same text, not two equal ones.
 const void* lastCommand();
 
 /// How many objects of `size` bytes (less than 64) the calling thread has released with delete.

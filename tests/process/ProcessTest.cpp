@@ -36,7 +36,7 @@ std::string messageOf(const std::string& text)
     return record ? record->message : "";
 }
 
-/// Sends standard output to `descriptor` for the time of a test.
+/// Sends standard output to `descriptor` during a test.
 class Redirection
 {
 public:
@@ -53,7 +53,7 @@ private:
     const int mStdout = dup(STDOUT_FILENO);
 };
 
-/// Takes over standard output for the time of a test, and keeps what each write(2) hands over as one text.
+/// Takes over standard output during a test, and keeps the data of each write(2) as one text.
 class Output
 {
 public:
@@ -91,7 +91,7 @@ private:
     static std::array<int, 2> makeSockets()
     {
         std::array<int, 2> sockets = {-1, -1};
-        // This kind of socket keeps the bounds of each write.
+        // This kind of socket preserves the boundaries of each write.
         EXPECT_EQ(socketpair(AF_UNIX, SOCK_SEQPACKET, 0, sockets.data()), 0);
         return sockets;
     }
@@ -242,7 +242,7 @@ TEST_F(Runner, RecordsOfManyThreadsStayWhole)
             }
         });
     }
-    // Read while they speak: the socket holds only so many.
+    // Read while they write: the socket holds only a limited number.
     std::size_t records = 0;
     while (records < speakers * each) {
         records += log.messages().size();
@@ -281,8 +281,8 @@ class Grouping : public std::numpunct<char>
     std::string do_grouping() const override { return "\3"; }
 };
 
-/// The message of a record that is written while the global locale groups digits. The thread, too, is a number: with
-/// points in it there would be no record to take apart.
+/// The message of a record that is written while the global locale groups digits. The thread is a number, too: with
+/// separators in it the record could not be parsed.
 std::string messageWithGrouping()
 {
     const Output output;

@@ -18,11 +18,11 @@ namespace
 
 using Clock = std::chrono::steady_clock;
 
-/// A handled signal about every millisecond at the thread that made it.
+/// A handled signal about every millisecond for the thread that made it.
 class Storm
 {
 public:
-    /// `flags` are those of sigaction(2): with SA_RESTART the kernel takes up interrupted reads again.
+    /// `flags` are those of sigaction(2): with SA_RESTART the kernel resumes interrupted reads.
     explicit Storm(int flags)
     {
         struct sigaction action = {};

@@ -1,5 +1,5 @@
-/// Whole runs with delays that vary, for the thread sanitizer. Each run is a process of its own. --gtest_repeat=N makes
-/// N of each.
+/// Whole runs with varied delays, for the thread sanitizer. Each run is a process of its own. --gtest_repeat=N makes N
+/// of each.
 
 #include "AppLock.h"
 #include "Cases.h"
@@ -11,8 +11,8 @@
 
 int updaterMain(int, char**); // main() of the remote head's program, renamed for this test program
 
-/// A race ends the process at once, so that it cannot be overlooked. The main head's workers are left to run out, by
-/// intention: that is no leak to report.
+/// A race ends the process at once, so that it cannot be overlooked. The main head does not join every worker, on
+/// purpose: that is not a leak to report.
 extern "C" const char* __tsan_default_options() // NOLINT(bugprone-reserved-identifier): the sanitizer calls it
 {
     return "halt_on_error=1 report_thread_leaks=0";
@@ -46,7 +46,7 @@ std::atomic<int> ledCommandsRunning{0};
 std::atomic<bool> outcomeShown{false};
 std::atomic<bool> pairSplit{false};
 
-/// Two LED commands at a time mix their bytes on the bus.
+/// Two simultaneous LED commands mix their bytes on the bus.
 void sendLed()
 {
     if (++ledCommandsRunning > 1 && outcomeShown) {
@@ -173,8 +173,8 @@ TEST(Threads, RemoteHeadTearsNoRecordAndSplitsNoPairOnceTheOutcomeIsShown)
 
 TEST(Threads, MainHeadTearsNoRecordInAnyOrderOfCalls)
 {
-    // A closing step beside a check or an installation that still runs is allowed; so is a second installation, which
-    // waits for the first.
+    // A closing step is allowed while a check or an installation still runs; so is a second installation, which waits
+    // for the first.
     for (const std::string order : {"i u d", "iu d", "iud", "i ud", "i d", "id", "iuu d", "i u u d"}) {
         const unsigned seed = nextSeed();
         SCOPED_TRACE(order + ", seed " + std::to_string(seed));

@@ -4,10 +4,9 @@
 #include <string>
 
 /// @file
-/// What takes the place of pthreads and of the platform while a Scheduler runs. Outside of that they are what they
-/// were.
+/// Replaces pthreads and the platform while a Scheduler runs. Outside of that they are unchanged.
 
-/// What the program does, as seen from below; each is called on the thread that does it.
+/// What the program does, as seen by the platform; each is called on the thread that does it.
 struct Observer
 {
     /// Answers a command with its raw wait status. It runs whole; `output` is what popen(3) gives.

@@ -80,7 +80,7 @@ std::map<int, int> outcomeOf(Ending ending)
     return {};
 }
 
-/// Ends the schedule's branching once a thread has made its cycles and goes on all the same.
+/// Ends the schedule's branching once a thread has made its cycles but continues.
 class Cycles
 {
 public:
@@ -96,7 +96,7 @@ private:
     std::map<int, int> mPauses;
 };
 
-/// Brings the panel's one object back to where a process begins.
+/// Resets the panel's one object to its state at the start of a process.
 void forgetThreads()
 {
     LedManager::instance()->stopFlashRemoteAndMainInBlue();

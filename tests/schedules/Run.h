@@ -18,11 +18,11 @@ enum class Ending { NothingToUpdate, Updated, ReadFailure, InstallFailure };
 /// the flashing, and notify under the lock.
 ///
 /// The update begins with commands that take far longer than the main thread needs from there to its wait. The
-/// schedules in which the update outruns it all the same are known: the flashing is started `late`, and goes on, or the
-/// notification is `lost`, and main() does not return. In every other one main() must return, the panel's last state
-/// must be the outcome, and no other thread may send a byte once the update's thread has begun to show it.
+/// schedules in which the update outruns it nevertheless are known: the flashing is started `late` and continues, or
+/// the notification is `lost` and main() does not return. In all others main() must return, the panel's last state must
+/// be the outcome, and no other thread may send a byte once the update's thread has begun to show it.
 Found exploreUpdate(Ending ending);
 
-/// Explores two rounds of flashing: started, stopped, waited for. `late` counts the rounds whose thread found itself
-/// stopped before its first look.
+/// Explores two rounds of flashing: started, stopped, waited for. `late` counts the rounds whose thread was stopped
+/// before its first check.
 Found exploreFlashing();

@@ -8,7 +8,7 @@ namespace
 {
 
 const std::size_t stackSize = std::size_t{256} * 1024; // bytes; the updater's runner has a buffer of 64 KiB there
-const int pausesWithoutEnd = 8;                        // of a thread that nobody else is left to stop
+const int pausesWithoutEnd = 8;                        // of a thread that no other thread is left to stop
 Scheduler* scheduler = nullptr;
 
 } // namespace
@@ -96,7 +96,7 @@ void Scheduler::point()
 void Scheduler::sleep()
 {
     std::vector<int> options = runnable();
-    // Others first: a thread that only pauses would come first for ever.
+    // Others first: otherwise a thread that only pauses would always come first.
     std::stable_partition(options.begin(), options.end(), [this](int thread) { return thread != mCurrent; });
     Thread& self = *mThreads[static_cast<std::size_t>(mCurrent)];
     if (options.size() == 1 && ++self.pauses == pausesWithoutEnd) {
@@ -149,7 +149,7 @@ void Scheduler::switchTo(int thread)
                 &mThreads[static_cast<std::size_t>(thread)]->context);
 }
 
-/// Lets one of `options` go on; without any the schedule ends.
+/// Continues one of `options`; without any the schedule ends.
 void Scheduler::leave(const std::vector<int>& options)
 {
     if (options.empty()) {

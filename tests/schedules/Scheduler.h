@@ -9,7 +9,7 @@
 /// Runs a program's threads one at a time, in every order up to a bound.
 ///
 /// Each thread is a coroutine of the one real thread. The functions of pthreads and of the platform are replaced
-/// (Calls.cpp); each of them comes to point(), sleep() or block(), where another thread may go on. A switch at point()
+/// (Calls.cpp); each of them calls point(), sleep() or block(), where another thread may continue. A switch at point()
 /// is a preemption: there are at most `preemptions` of them in a schedule. A switch at a pause, at a wait or at a
 /// thread's end is free.
 class Scheduler
@@ -39,16 +39,16 @@ public:
 
     bool hasEnded(int thread) const { return mThreads.at(static_cast<std::size_t>(thread))->ended; }
 
-    /// Another thread may go on here, at the price of a preemption.
+    /// Another thread may continue here, at the cost of a preemption.
     void point();
 
-    /// The thread pauses: any thread may go on.
+    /// The thread pauses: any thread may continue.
     void sleep();
 
-    /// The thread cannot go on before `condition` holds.
+    /// The thread cannot continue before `condition` holds.
     void block(const std::function<bool()>& condition);
 
-    /// From here on the schedule is only run to its end: what follows is beyond the bound.
+    /// From here on the schedule only runs to its end, without branching: the rest is beyond the bound.
     void endBranching() { mBranching = false; }
 
 private:

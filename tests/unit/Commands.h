@@ -30,7 +30,7 @@ const char unmountCommand[] = "umount /root/USB_MOUNT/";
 const char passSoundCommand[] = "aplay /root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav";
 const char failSoundCommand[] = "aplay /root/RESOURCES/SOUNDS/SND_RESULT_FAIL.wav";
 
-/// LED codes and second bytes, as the command lines spell them.
+/// LED codes and second bytes, in the spelling of the command lines.
 const char ledRemote[] = "0x12";
 const char ledPass[] = "0x13";
 const char ledFail[] = "0x14";

@@ -87,7 +87,7 @@ TEST_F(Leds, AnyStatusButZeroIsAFailure)
 class Flashing : public Leds
 {
 protected:
-    /// Lets the flashing thread make `cycles` cycles: the stop comes within the pause of the last one.
+    /// Lets the flashing thread make `cycles` cycles: the stop comes during the pause of the last one.
     static void flash(int cycles)
     {
         std::atomic<int> pauses{0};
@@ -321,7 +321,7 @@ TEST_F(Sequences, SetEndsAtItsFirstFailedCommand)
 {
     for (std::size_t failed = 0; failed < passFor500ms.size(); ++failed) {
         platform::reset();
-        // The second and the fourth command are the same: fail the one that is meant.
+        // The second and the fourth command are the same: fail the right one.
         const bool fourth = failed == 3;
         script(passFor500ms[failed],
                fourth ? std::vector<platform::Answer>{exits(0), exits(1)} : std::vector<platform::Answer>{exits(1)});

@@ -73,7 +73,7 @@ TEST_F(LogTest, RecordUnderABraceLessIfBelongsToIt)
 
 TEST_F(LogTest, TimeIsLocalOnThe24HourClock)
 {
-    // Whatever the time of day, one of the two zones is in the afternoon: 24 hours, not 12.
+    // At any time of day, one of the two zones is in the afternoon: 24 hours, not 12.
     for (const char* zone : {"XXX+11:00", "XXX-01:00"}) {
         ASSERT_EQ(setenv("TZ", zone, 1), 0);
         tzset();

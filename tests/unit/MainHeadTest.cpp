@@ -34,7 +34,7 @@ protected:
 
     static Lines packageIs(const std::string& candidate) { return packageChecked(dhPolicy, "1.2.0", candidate); }
 
-    /// An installation of all three components, of which the one whose command is `command` ends with `answer`.
+    /// An installation of all three components, in which `command` ends with `answer`.
     static Lines installAll(const std::string& command, const platform::Answer& answer)
     {
         script(command, {answer});

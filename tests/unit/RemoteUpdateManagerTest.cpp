@@ -226,7 +226,7 @@ protected:
         script(stopHarlCommand, {{0, "", true, untilItIsWaitedFor}});
     }
 
-    /// Runs it. The journal is parted by threads: the caller's, the flashing thread's, and the update thread's.
+    /// Runs it. The journal is divided by thread: the caller's, the flashing thread's, and the update thread's.
     void run()
     {
         RemoteUpdateManager().update();
@@ -289,7 +289,7 @@ TEST_F(WholeUpdate, CallerWaitsForTheUpdateThreadAndJoinsIt)
     script(mirrorsCommand, {exits(100)});
     run();
     EXPECT_EQ(own, (Lines{"log:", "log:", "log:", "log:1"}));
-    // The first and the last record of the update thread: it had ended when the caller went on.
+    // The first and the last record of the update thread: it had ended when the caller continued.
     const std::vector<platform::Record> records = platform::records();
     EXPECT_EQ(std::count_if(records.begin(), records.end(),
                             [](const platform::Record& record) {

@@ -14,22 +14,22 @@ class UnitTest : public testing::Test
 protected:
     void SetUp() override;
 
-    /// Registers the callbacks that note what is reported, and forgets the record of that.
+    /// Registers the callbacks that note the reports, and forgets the record of the registration.
     static void registerCallbacks();
 };
 
-/// For a test whose EXPECT_EXIT must run in a process in which nothing was started yet.
+/// For a test whose EXPECT_EXIT must run in a process that has not started anything yet.
 #ifdef EMULATED // QEMU's user emulation cannot start the program once more
 #define NEEDS_A_FRESH_PROCESS() GTEST_SKIP()
 #else
 #define NEEDS_A_FRESH_PROCESS() GTEST_FLAG_SET(death_test_style, "threadsafe")
 #endif
 
-/// How many results, failures among them, the running test has so far.
+/// How many results, including failures, the running test has so far.
 int resultsSoFar();
 
-/// Ends the process of a death test, whose failures nobody prints: with 0 when there are none after the first `before`
-/// results, which the test had already when it made the process; else with 1 and what failed on standard error.
+/// Ends the process of a death test, whose failures nobody prints: with 0 if there are none after the first `before`
+/// results, which the test had before it made the process; otherwise with 1 and the failures on standard error.
 [[noreturn]] void endCase(int before);
 
 void noteResult(UpdateManager::Result result);

@@ -220,7 +220,7 @@ TEST_F(Manager, ClosingStepOfTheMainHeadDoesNotWaitForTheInstallation)
     manager->init(false);
     manager->update({{UpdateManager::COMPONENT_TEAMVIEWER, "TV", "1", "2"}}, false);
     manager->deinit(false);
-    // The statuses of the check and of the closing step: none is left for the next test.
+    // The statuses of the check and of the closing step, so that none is left for the next test.
     platform::waitFor([] { return noted("result:1") && entries("log:0").size() == 4; });
 }
 

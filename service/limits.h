@@ -31,8 +31,7 @@ inline constexpr Limit limits[] = {
     {"board-script", "ssh", nullptr, 1800, 1800, false, true},
     {"repair", "dpkg", nullptr, 600, 720, true, false},
     {"repair", "apt-get", nullptr, 600, 720, true, false},
-    {"verification", "gpgv", nullptr, 300, 300, true, false}, // of the stick
-    {"verification", "sha256sum", nullptr, 300, 300, true, false},
+    {"verification", "verify-stick", nullptr, 300, 300, false, false},
     {"journal", "journalctl", nullptr, 5, 20, false, false},
     {"other", nullptr, nullptr, 300, 300, false, false},
 };

@@ -454,6 +454,17 @@ class Sticks(ServiceTest):
         self.keyring.write_text("no keys")
         self.assert_refused("not signed by a known key")
 
+    def test_verification_that_never_ends(self) -> None:
+        self.sign()
+        self.install_keyring()
+        hand_over = "/usr/lib/harl-updater/hand-over"
+        self.inside("cp", "/opt/hand-over-short", hand_over)
+        self.addCleanup(self.inside, "cp", "/opt/hand-over", hand_over)
+        gpgv = self.unit.root() / "usr/local/sbin/gpgv"
+        write_script(gpgv, "sleep infinity")
+        self.addCleanup(gpgv.unlink)
+        self.assert_refused("it cannot be read")
+
     def test_stick_without_anything_for_the_board_is_nothing_to_verify(self) -> None:
         self.install_keyring()
         shutil.rmtree(self.stick / "debs")

@@ -15,8 +15,7 @@ inline constexpr Limit limits[] = {
     {"board-script", "ssh", nullptr, 6, 6, false, true},
     {"repair", "dpkg", nullptr, 15, 20, true, false},
     {"repair", "apt-get", nullptr, 15, 20, true, false},
-    {"verification", "gpgv", nullptr, 5, 5, true, false},
-    {"verification", "sha256sum", nullptr, 5, 5, true, false},
+    {"verification", "verify-stick", nullptr, 5, 5, false, false},
     {"journal", "journalctl", nullptr, 2, 6, false, false},
     {"other", nullptr, nullptr, 3, 3, false, false},
 };

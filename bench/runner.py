@@ -1,4 +1,4 @@
-"""Runs a scenario once, on the best unit that this machine can make, and leaves nothing behind."""
+"""Runs a scenario once, on the best unit that this machine can make, and cleans up."""
 
 import contextlib
 import os

@@ -1,7 +1,7 @@
-# Cross build for the unit; what it builds runs here under QEMU's user emulation.
+# Cross build for the unit; the results run here under QEMU's user emulation.
 set(CMAKE_SYSTEM_NAME Linux)
 set(CMAKE_SYSTEM_PROCESSOR armv7l)
-set(CMAKE_C_COMPILER arm-linux-gnueabihf-gcc-11) # googletest asks for one
+set(CMAKE_C_COMPILER arm-linux-gnueabihf-gcc-11) # googletest requires one
 set(CMAKE_CXX_COMPILER arm-linux-gnueabihf-g++-11)
 set(CMAKE_LIBRARY_ARCHITECTURE arm-linux-gnueabihf)
 find_program(QEMU_ARM qemu-arm-static REQUIRED)

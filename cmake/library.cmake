@@ -1,4 +1,4 @@
-# The package for a main head's program: the engine's library and headers, what finds them, and the example.
+# The package for a main head's program: the engine's library and headers, the files that find them, and the example.
 include(CMakePackageConfigHelpers)
 include(GNUInstallDirs)
 

@@ -1,7 +1,7 @@
 # add_python_test(NAME MODULE [ARGUMENT...]): a test that runs a module of this repository's Python packages. It ends
-# with 77 where the machine cannot have the unit that it needs, and says why.
+# with 77 where the machine cannot provide the unit that it needs, and prints why.
 find_package(Python3 3.11 REQUIRED COMPONENTS Interpreter)
-# What a version manager puts into the search path starts a shell before the interpreter; the tests start it directly.
+# A version manager's program on the search path starts a shell before the interpreter; the tests start it directly.
 execute_process(COMMAND ${Python3_EXECUTABLE} -c "import sys; print(sys.executable)"
   OUTPUT_VARIABLE python OUTPUT_STRIP_TRAILING_WHITESPACE COMMAND_ERROR_IS_FATAL ANY)
 

@@ -1,5 +1,5 @@
-# The packages' two variants. `cmake --install` takes the program of one from the component `dynamic` or `static`, and
-# what both have from `common`; without a component it installs the dynamic variant.
+# The two variants of the package. `cmake --install` takes a variant's programs from the component `dynamic` or
+# `static`, and the shared files from `common`; without a component it installs the dynamic variant.
 
 # add_static_variant(TARGET): with STATIC_VARIANT, links the target's object files once more, statically: TARGET-static.
 function(add_static_variant target)

@@ -15,6 +15,6 @@ void expectPrintable(const Report& report)
 {
     std::ostringstream out;
     report.write(false, out);
-    report.write(true, out); // throws when a text is no UTF-8
+    report.write(true, out); // throws when a text is not UTF-8
     expectPrintable(out.str());
 }

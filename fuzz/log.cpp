@@ -97,7 +97,7 @@ void expectFitReports(std::string_view log, std::size_t blockSize)
         explain(run);
         expect(!run.failure || run.stepOf(*run.failure) != nullptr, "a failure has its step");
         printRun(run, "log", report);
-        report << runToJson(run, "log").dump(); // throws when a text is no UTF-8
+        report << runToJson(run, "log").dump(); // throws when a text is not UTF-8
         page.writeRun(run, "log");
     });
     LogParser parser(builder);

@@ -127,7 +127,7 @@ double cpuTime()
 template <typename Function>
 Cost costOf(Function function)
 {
-    std::ofstream("/proc/self/clear_refs") << 5; // the peak begins anew, proc(5)
+    std::ofstream("/proc/self/clear_refs") << 5; // resets the peak, proc(5)
     const double memory = fromProc("/proc/self/status", "VmRSS:");
     const double cpu = cpuTime();
     const auto begin = std::chrono::steady_clock::now();

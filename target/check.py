@@ -92,7 +92,7 @@ def check(plan: Plan, evidence: Evidence) -> list[str]:
     found += same("give-back was killed and started again", killed, int(after["rescuer_restarts"]) > 0)
     starved = plan.settings.event.endswith("out-of-memory")
     killed_by_kernel = int(after["killed_out_of_memory"]) > int(before["killed_out_of_memory"])
-    found += same("the kernel killed a process for want of memory", starved, killed_by_kernel)
+    found += same("the kernel killed a process because it was out of memory", starved, killed_by_kernel)
     if plan.settings.script_seconds:
         found += same("package's maintainer script", ["began", "ended"], list(evidence.package_script))
         ended = evidence.package_script.get("ended", math.inf)

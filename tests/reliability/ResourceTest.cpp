@@ -1,4 +1,4 @@
-/// What ten thousand commands leave behind in the process.
+/// What ten thousand commands leave in the process.
 
 #include "UpdateManager.h"
 

@@ -52,7 +52,7 @@ exec {runner} /usr/bin/env LD_PRELOAD={wrapped}/bench/call_recorder.so {wrapped}
         super().start()
 
     def ended(self) -> int | None:
-        """None while the updater runs, or a command that it left behind, then its status."""
+        """None while the updater runs, or a command that it left running, then its status."""
         status = super().ended()
         return None if status is not None and self._updater and group_lives(self._updater.pid) else status
 

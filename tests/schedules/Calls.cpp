@@ -27,7 +27,7 @@ Function* replaced(const char* name)
     return reinterpret_cast<Function*>(dlsym(RTLD_NEXT, name));
 }
 
-// Threads have their number plus one for an id: 0 is no thread.
+// A thread's id is its number plus one: 0 means no thread.
 pthread_t idOf(int thread)
 {
     return static_cast<pthread_t>(thread) + 1;

@@ -5,7 +5,7 @@
 
 std::atomic<bool> applicationLockWaited{false};
 
-/// Takes the place of the C library's function, which std::condition_variable::wait() calls.
+/// Replaces the C library's function, which std::condition_variable::wait() calls.
 ///
 /// The caller holds the mutex until the wait has begun, so that a notification, which takes it as well, comes after.
 extern "C" int pthread_cond_wait(pthread_cond_t* condition, pthread_mutex_t* mutex)

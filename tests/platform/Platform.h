@@ -9,8 +9,8 @@
 #include <thread>
 #include <vector>
 
-/// A stand-in for the platform: linked into a test program, it takes the place of the C library's `system`, `popen`,
-/// `pclose` and `nanosleep`, and of std::cout's buffer.
+/// A stand-in for the platform: linked into a test program, it replaces the C library's `system`, `popen`, `pclose` and
+/// `nanosleep`, and std::cout's buffer.
 ///
 /// Every call and every log record becomes an entry of one journal, so that a test compares the whole course of events.
 /// A command that has no scripted answer prints nothing and exits with 0; a pause takes 10 ms. All operations may be
@@ -41,7 +41,7 @@ void script(const std::string& command, const std::vector<Answer>& answers);
 /// Replaces the pauses: `pause` has the parameters and the result of nanosleep(2), including errno.
 void scriptSleep(const std::function<int(const timespec* duration, timespec* remaining)>& pause);
 
-/// Runs `hook` on the thread that has just written a record, before it goes on.
+/// Runs `hook` on the thread that has just written a record, before the thread continues.
 void afterRecord(const std::function<void()>& hook);
 
 /// Adds an entry of the test's own, for example from a callback.

@@ -18,7 +18,7 @@ public:
     static const int preemptions = 2;
     static const int cycles = 2; ///< pauses of one thread, after which endBranching() may be called
 
-    /// Runs `program` as thread 0 until it returns or no thread can go on.
+    /// Runs `program` as thread 0 until it returns or no thread can continue.
     ///
     /// @return false when `program` did not return
     bool run(const std::function<void()>& program);
@@ -55,7 +55,7 @@ private:
     struct Thread
     {
         std::function<void()> body;
-        std::function<bool()> condition; ///< null: can go on
+        std::function<bool()> condition; ///< null: can continue
         bool ended = false;
         int pauses = 0;
         std::unique_ptr<char[]> stack;

@@ -279,7 +279,7 @@ class Limits(HandOverTest):
 
     @contextlib.contextmanager
     def frozen(self) -> Iterator[Path]:
-        """A mount point whose every access hangs for good."""
+        """A mount point whose every access hangs for ever."""
         if os.geteuid() != 0 or not Path("/dev/fuse").exists():
             self.skipTest("no root or no FUSE here")
         folder = self.folder / "frozen"

@@ -57,23 +57,6 @@ bool surelyBehind(const std::string& name, const std::string& other)
     return its == lowerOther.end() || (isLetterOrDigit(*mine) && isLetterOrDigit(*its) && *mine > *its);
 }
 
-/// Reads from `offset` on until `length` bytes, the end or an error.
-std::size_t readAt(int descriptor, std::uint64_t offset, char* buffer, std::size_t length)
-{
-    std::size_t done = 0;
-    while (done < length) {
-        const ssize_t count = pread(descriptor, buffer + done, length - done, static_cast<off_t>(offset + done));
-        if (count < 0 && errno == EINTR) {
-            continue;
-        }
-        if (count <= 0) {
-            break;
-        }
-        done += static_cast<std::size_t>(count);
-    }
-    return done;
-}
-
 const std::size_t firstLineBytes = 255; // what the kernel reads of it, execve(2)
 
 /// The interpreter that `line` names behind its "#!".
@@ -279,10 +262,7 @@ private:
         const Node node = mStick.node(path);
         const Descriptor file = openFile(path, node);
         if (file) {
-            const auto read = [&](std::uint64_t offset, char* buffer, std::size_t length) {
-                return readAt(file.number(), offset, buffer, length);
-            };
-            checkArchive({node.size, read}, shown(path), mReport);
+            checkArchive(file.number(), node.size, shown(path), mReport);
         }
     }
 
@@ -295,7 +275,7 @@ private:
             return;
         }
         std::string start(static_cast<std::size_t>(std::min<std::uint64_t>(node.size, scriptBytesChecked)), '\0');
-        if (readAt(file.number(), 0, start.data(), start.size()) != start.size()) {
+        if (read(file.number(), start.data(), start.size()) != static_cast<ssize_t>(start.size())) {
             addUnreadable(path, EIO, "upload-fails");
             return;
         }

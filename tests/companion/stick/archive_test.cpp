@@ -1,5 +1,6 @@
 #include "stick/archive.h"
 
+#include "descriptor.h"
 #include "finding_lines.h"
 #include "little_endian.h"
 #include "stick/zip_file.h"
@@ -7,28 +8,22 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include <cstring>
+#include <sys/mman.h>
+#include <unistd.h>
 
 using testing::HasSubstr;
 
 namespace
 {
 
-/// A medium that can be read up to `readable`.
-ArchiveSource sourceOf(const std::string& archive, std::size_t readable)
-{
-    return {archive.size(), [&archive, readable](std::uint64_t offset, char* buffer, std::size_t length) {
-                const auto from = static_cast<std::size_t>(offset);
-                const std::size_t count = std::min(length, readable > from ? readable - from : 0);
-                std::memcpy(buffer, archive.data() + from, count);
-                return count;
-            }};
-}
-
-Report check(const std::string& archive, std::uint64_t mostUnpacked = 1'000'000'000, std::size_t readable = SIZE_MAX)
+/// @param readable  of the medium (bytes)
+Report check(const std::string& archive, std::size_t readable = SIZE_MAX)
 {
     Report report("stick", "An archive");
-    checkArchive(sourceOf(archive, readable), "\"OSUpgrade.zip\"", report, mostUnpacked);
+    const Descriptor file(memfd_create("archive", MFD_CLOEXEC));
+    const std::string there = archive.substr(0, readable);
+    EXPECT_EQ(write(file.number(), there.data(), there.size()), static_cast<ssize_t>(there.size()));
+    checkArchive(file.number(), archive.size(), "\"OSUpgrade.zip\"", report);
     return report;
 }
 
@@ -57,7 +52,6 @@ TEST(StickArchive, IntactArchiveIsFitWhateverItsMethods)
     EXPECT_EQ(factOf(report, "archive_bytes"), std::to_string(archive.size()));
     EXPECT_EQ(factOf(report, "archive_entries"), "5");
     EXPECT_EQ(factOf(report, "archive_declared_bytes"), "1100000");
-    EXPECT_EQ(factOf(report, "archive_unpacked_bytes"), "1100000");
     EXPECT_EQ(factOf(report, "board_bytes"), std::to_string(archive.size() + 1'100'000));
 }
 
@@ -89,7 +83,7 @@ TEST(StickArchive, WrongChecksumIsNamedWithItsEntryAndOffset)
     const Report report = check(zipArchive({{"good", "good"}, {"bad", "bad", 0, 0, 0x12345678}}));
     EXPECT_EQ(findingsOf(report), Lines{"error archive-damaged"});
     EXPECT_THAT(whatOf(report, "archive-damaged"),
-                HasSubstr("the entry \"bad\" at offset 73 has the checksum 822b39fb instead of 12345678"));
+                HasSubstr("the entry \"bad\" at offset 73 does not have the checksum it declares"));
 }
 
 TEST(StickArchive, EveryFlippedBitOfTheDataIsFound)
@@ -113,26 +107,6 @@ TEST(StickArchive, EntryThatHoldsLessThanItDeclaresIsDamaged)
 {
     const Report report = check(zipArchive({{"a", "abc", 8, 0, {}, {}, 4}}));
     EXPECT_THAT(whatOf(report, "archive-damaged"), HasSubstr("declares 4 bytes but holds 3 bytes"));
-}
-
-TEST(StickArchive, DataBehindItsEndMarkIsDamaged)
-{
-    const std::string packed = deflated("abc") + "more";
-    std::string archive = zipArchive({{"a", packed, 0}});
-    // The method and the checksum of what is packed, in both records.
-    const std::string intact = zipArchive({{"a", "abc"}});
-    const auto patch = [&](std::size_t to, std::size_t from, std::size_t length) {
-        archive.replace(to, length, intact, from, length);
-    };
-    const std::size_t directory = 31 + packed.size();
-    const std::size_t intactDirectory = 31 + deflated("abc").size();
-    for (const auto& [to, from] : {std::pair<std::size_t, std::size_t>{8, 8}, {directory + 10, intactDirectory + 10}}) {
-        patch(to, from, 2);
-        patch(to + 6, from + 6, 4);
-        patch(to + 14, from + 14, 4);
-    }
-    const Report report = check(archive);
-    EXPECT_THAT(whatOf(report, "archive-damaged"), HasSubstr("has damaged data"));
 }
 
 TEST(StickArchive, DamagedHeaderOfAnEntryIsFound)
@@ -179,18 +153,9 @@ TEST(StickArchive, UnreadableMediumIsNamedWithTheOffset)
 {
     const std::string archive = zipArchive({{"a", noise(3'000'000)}});
     for (const std::size_t readable : {std::size_t{0}, std::size_t{1'500'000}, archive.size() - 1}) {
-        // The directory at the end is read first.
-        Report report("stick", "An archive");
-        const ArchiveSource source = {
-            archive.size(), [&](std::uint64_t offset, char* buffer, std::size_t length) -> std::size_t {
-                const bool end = offset > 2'000'000 && readable == 1'500'000;
-                return sourceOf(archive, end ? SIZE_MAX : readable).read(offset, buffer, length);
-            }};
-        checkArchive(source, "\"OSUpgrade.zip\"", report);
+        const Report report = check(archive, readable);
         EXPECT_EQ(findingsOf(report), Lines{"error archive-unreadable"}) << readable;
-        if (readable == 1'500'000) {
-            EXPECT_THAT(whatOf(report, "archive-unreadable"), HasSubstr("at offset 1500000:"));
-        }
+        EXPECT_THAT(whatOf(report, "archive-unreadable"), HasSubstr("at offset " + std::to_string(readable) + ":"));
     }
 }
 
@@ -199,16 +164,12 @@ TEST(StickArchive, BombThatDeclaresItsSizeIsNotUnpacked)
     const Report report =
         check(zipArchive({{"a", "x", 8, 0, {}, {}, 0xFFFFFFF0}, {"b", "x", 8, 0, {}, {}, 0xFFFFFFF0}}));
     EXPECT_EQ(findingsOf(report), Lines{"error archive-bomb"});
-    EXPECT_EQ(factOf(report, "archive_unpacked_bytes"), "");
 }
 
-TEST(StickArchive, BombThatDeclaresLittleIsStoppedAtTheLimit)
+TEST(StickArchive, EntryThatDeclaresLittleIsNotUnpackedBeyondThat)
 {
     const std::string zeros(50'000'000, '\0');
-    const Report report = check(zipArchive({{"a", zeros, 8, 0, {}, {}, 10}}), 1'000'000);
-    EXPECT_EQ(findingsOf(report), Lines{"error archive-bomb"});
-    EXPECT_THAT(whatOf(report, "archive-bomb"), HasSubstr("the test ended there"));
-    EXPECT_LT(std::stoull(factOf(report, "archive_unpacked_bytes")), 1'200'000U);
+    EXPECT_EQ(findingsOf(check(zipArchive({{"a", zeros, 8, 0, {}, {}, 10}}))), Lines{"error archive-damaged"});
 }
 
 TEST(StickArchive, EntriesThatShareTheirDataAreABomb)
@@ -244,25 +205,8 @@ TEST(StickArchive, TooManyEntriesAreABomb)
 TEST(StickArchive, MoreThanFourGigabytesAreNotTested)
 {
     Report report("stick", "An archive");
-    bool wasRead = false;
-    const ArchiveSource source = {(4ULL << 30U) + 1, [&](std::uint64_t, char*, std::size_t) -> std::size_t {
-                                      wasRead = true;
-                                      return 0;
-                                  }};
-    checkArchive(source, "\"OSUpgrade.zip\"", report);
+    checkArchive(-1, (4ULL << 30U) + 1, "\"OSUpgrade.zip\"", report);
     EXPECT_EQ(findingsOf(report), Lines{"error archive-too-large"});
-    EXPECT_FALSE(wasRead);
-}
-
-TEST(StickArchive, ContentsOfAHundredTimesTheSizeAreAWarning)
-{
-    EXPECT_EQ(findingsOf(check(zipArchive({{"a", std::string(101'000'000, '\0')}}))), Lines{"warning archive-ratio"});
-}
-
-TEST(StickArchive, MuchInFrontOfTheArchiveIsAWarning)
-{
-    EXPECT_EQ(findingsOf(check(std::string(101'000'000, '\0') + zipArchive({{"a", "abc"}}))),
-              (Lines{"warning archive-padding", "warning archive-prefix"}));
 }
 
 TEST(StickArchive, AFewBytesInFrontOfTheFirstEntryAreAWarning)

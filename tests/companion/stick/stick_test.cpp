@@ -58,7 +58,7 @@ TEST_F(Stick, CompleteStickIsFit)
     EXPECT_EQ(factOf(report, "version_folder"), "\"quorb2.2.0\"");
     EXPECT_EQ(factOf(report, "version"), "\"2.2.0\"");
     EXPECT_EQ(factOf(report, "archive_entries"), "1");
-    EXPECT_EQ(factOf(report, "archive_unpacked_bytes"), "16");
+    EXPECT_EQ(factOf(report, "archive_declared_bytes"), "16");
     EXPECT_EQ(factOf(report, "board_bytes"),
               std::to_string(fs::file_size(stick.path(board + std::string("quorb2.2.0/OSUpgrade.zip"))) + 16));
     EXPECT_EQ(factOf(report, "script_interpreter"), "\"/bin/sh\"");

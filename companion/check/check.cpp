@@ -8,7 +8,6 @@
 #include "unit/packages.h"
 #include "unit/unit_check.h"
 
-#include <cstring>
 #include <filesystem>
 #include <ostream>
 #include <sstream>
@@ -31,7 +30,7 @@ std::string plan(const std::string& installed, const std::string& candidate)
 void addPlans(const Unit& unit, Report& report)
 {
     const std::string board = plan(report.fact("board_version"), report.fact("version"));
-    const std::string candidate = candidateNow(unit, report);
+    const std::string candidate = report.fact("package_now");
     report.addFact(
         "package_plan", "Package",
         plan(report.fact("package_installed"), candidate.empty() ? report.fact("package_candidate") : candidate) +
@@ -147,27 +146,25 @@ std::string recordOf(const Report& report)
 
 } // namespace
 
+bool isUnit(const Unit& unit)
+{
+    return unit.property("harl-updater", "LoadState") == "loaded";
+}
+
 int runCheck(const std::string& path, bool json, const UnitSite& site, std::ostream& out, std::ostream& errors)
 {
     const StickFolder stick(path);
     if (stick.error() != 0) {
-        errors << "harl-updater-tool: " << shown(path) << " cannot be read: " << std::strerror(stick.error())
-               << ". Name the folder that the stick is mounted at.\n";
-        if (json) {
-            out << refusal("check", std::string("the stick cannot be read: ") + std::strerror(stick.error())).dump(2)
-                << '\n';
-        }
-        return Report::STATUS_UNCHECKED;
+        return refuseStick("check", path, stick.error(), json, out, errors);
     }
     const Unit unit(site);
     Report report("check", "This update", "likely to do what it should");
-    const bool isUnit = unit.property("harl-updater", "LoadState") == "loaded";
-    if (isUnit) {
+    if (isUnit(unit)) {
         checkUnit(unit, report);
     }
-    checkStick(stick, isUnit, report);
+    checkStick(stick, isUnit(unit), report);
     checkSignature(path, "", report);
-    if (isUnit) {
+    if (isUnit(unit)) {
         addPlans(unit, report);
         checkReplaced(path, report);
     } else {

@@ -5,6 +5,9 @@
 #include <iosfwd>
 #include <string>
 
+/// True for a machine that has the updater's service.
+bool isUnit(const Unit& unit);
+
 /// Checks before an update what it would do now: the unit, the stick at `path`, and what both together come to.
 ///
 /// Changes nothing. On a machine that is no unit, the stick alone is checked.

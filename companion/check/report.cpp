@@ -3,6 +3,7 @@
 #include "descriptor.h"
 #include "findings.h"
 #include "log/log_command.h"
+#include "stick/folder.h"
 #include "unit/unit_check.h"
 
 #include <cerrno>
@@ -26,8 +27,8 @@ const char readMe[] = R"(What harl-updater-tool report has gathered on this unit
 journal.txt   the journal of the update's services
 log.txt       what harl-updater-tool log says of it
 kept-logs/    runs that the service has kept, where the journal is lost with the power
-unit.txt      what harl-updater-tool unit says
-check.txt     what harl-updater-tool check says, with the stick that was plugged in
+check.txt     what harl-updater-tool check says of the unit and of the stick that was plugged in
+unit.txt      what harl-updater-tool unit says, where check.txt could not hold it
 verify.txt    what harl-updater-tool verify says
 system.txt    versions, clock, services, space and the state of the package database
 
@@ -78,7 +79,9 @@ void gather(const fs::path& folder, const std::string& stickPath, const Unit& un
         options.files = {(folder / "journal.txt").string()};
         runLog(options, out, out);
     });
-    saveOf("unit.txt", [&](std::ostream& out) { runUnit({}, site, out, out); });
+    if (!isUnit(unit) || StickFolder(stickPath).error() != 0) {
+        saveOf("unit.txt", [&](std::ostream& out) { runUnit({}, site, out, out); });
+    }
     saveOf("check.txt", [&](std::ostream& out) { runCheck(stickPath, false, site, out, out); });
     saveOf("verify.txt", [&](std::ostream& out) { runVerify({}, site, out); });
     saveOf("system.txt", [&](std::ostream& out) {
@@ -100,16 +103,13 @@ void gather(const fs::path& folder, const std::string& stickPath, const Unit& un
 
 int runReport(const ReportOptions& options, const UnitSite& site, std::ostream& out, std::ostream& errors)
 {
-    const auto refuse = [&](const std::string& text) {
-        if (options.json) {
-            out << refusal("report", text).dump(2) << '\n';
-        }
-        errors << "harl-updater-tool: " << escaped(options.file) << ": " << text << '\n';
-        return Report::STATUS_UNCHECKED;
+    const auto refused = [&](const std::string& text) {
+        return refuse("report", options.json, escaped(options.file) + ": " + text, out, errors);
     };
     const Descriptor made(open(options.file.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
     if (!made) {
-        return refuse(errno == EEXIST ? "exists already; name another file" : "cannot be written: " + errorText(errno));
+        return refused(errno == EEXIST ? "exists already; name another file"
+                                       : "cannot be written: " + errorText(errno));
     }
     const Unit unit(site);
     const TemporaryFolder temporary(unit);
@@ -117,7 +117,7 @@ int runReport(const ReportOptions& options, const UnitSite& site, std::ostream& 
     const fs::path folder = fs::path(temporary.path()) / folderName;
     if (temporary.path().empty() || !fs::create_directory(folder, error)) {
         fs::remove(options.file, error);
-        return refuse("no temporary folder can be made; check the space in /tmp: df /tmp");
+        return refused("no temporary folder can be made; check the space in /tmp: df /tmp");
     }
     gather(folder, options.stick, unit, site);
     const CommandResult packed = unit.run({"tar", "--create", "--gzip", "--file", fs::absolute(options.file).string(),
@@ -125,7 +125,7 @@ int runReport(const ReportOptions& options, const UnitSite& site, std::ostream& 
                                           packLimit);
     if (!packed.succeeded()) {
         fs::remove(options.file, error);
-        return refuse("cannot be written: " + complaint(packed));
+        return refused("cannot be written: " + complaint(packed));
     }
     if (options.json) {
         out << nlohmann::ordered_json{{"command", "report"}, {"version", jsonVersion}, {"file", escaped(options.file)}}

@@ -8,7 +8,9 @@
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
+#include <fstream>
 #include <set>
+#include <sstream>
 #include <system_error>
 #include <utility>
 
@@ -18,8 +20,6 @@ namespace
 {
 
 const auto refreshLimit = 120s;
-const auto mirrorLimit = 15s; // for all mirrors together
-const std::size_t mostAddresses = 32;
 const std::uint64_t littleSpace = 100'000'000; // bytes
 
 void checkLocks(const Unit& unit, Report& report)
@@ -140,54 +140,73 @@ std::string hostOf(const std::string& address)
     return begin == std::string::npos ? address : address.substr(begin + 2, address.find('/', begin + 2) - begin - 2);
 }
 
-void reportAddress(const std::string& address, bool hostAnswers, const CommandResult& fetch, Report& report)
+/// Makes lists of the package manager's own in `folder`, with what the unit's lists hold: only what is new has to be
+/// fetched. False when they cannot be made.
+bool makeLists(const Unit& unit, const std::string& folder)
 {
-    std::string reason = valueAfter(fetch.errors, "Failed to fetch " + address + ' ');
-    reason.erase(0, reason.find_first_not_of(' '));
-    const bool none = contains(reason, "404") || contains(reason, "not found") || contains(reason, "Not Found");
-    if (none || !hostAnswers) {
-        report.add(none ? "mirror-index" : "mirror-silent",
-                   {{"address", shown(address)},
-                    {"host", shown(hostOf(address))},
-                    {"reason", reason.empty() ? complaint(fetch) : shown(reason)}});
+    std::error_code error;
+    std::filesystem::create_directories(folder + "/lists/partial", error);
+    for (const auto& list : std::filesystem::directory_iterator(unit.path("/var/lib/apt/lists"), error)) {
+        if (list.is_regular_file(error) && list.path().filename() != "lock") {
+            std::filesystem::create_symlink(list.path(), folder + "/lists/" + list.path().filename().string(), error);
+        }
     }
+    // The last word on settings, apt.conf(5): also on the unit's hooks, which may do anything.
+    std::ofstream settings(folder + "/apt.conf");
+    settings << "#clear APT::Update::Pre-Invoke;\n#clear APT::Update::Post-Invoke;\n"
+             << "#clear APT::Update::Post-Invoke-Success;\n"
+             << "Dir::State::lists \"" << folder << "/lists\";\nDir::Cache \"" << folder << "\";\n"
+             << "APT::Sandbox::User \"root\";\nAcquire::Retries \"0\";\n"
+             << "Acquire::http::Timeout \"20\";\nAcquire::https::Timeout \"20\";\n";
+    return settings.flush().good();
 }
 
-/// Fetches the sources' release files with the package manager's own fetcher, proxies and certificates. The first bytes
-/// of one are an answer of its host.
-void fetchReleases(const std::vector<std::string>& addresses, const Unit& unit, Report& report)
+/// Reports what a refresh could not fetch: each list that its mirror does not have, each other mirror once. False when
+/// there is nothing of that.
+bool reportUnfetched(const std::string& errors, Report& report)
+{
+    const std::string words = "Failed to fetch ";
+    std::set<std::string> told;
+    for (const std::string& line : linesOf(errors)) {
+        const std::size_t begin = line.find(words);
+        if (begin == std::string::npos) {
+            continue;
+        }
+        std::istringstream rest(line.substr(begin + words.size()));
+        std::string address;
+        std::string reason;
+        std::getline(rest >> address >> std::ws, reason);
+        const bool none = contains(reason, "404") || contains(reason, "not found") || contains(reason, "Not Found");
+        if (told.insert(none ? address : hostOf(address)).second) {
+            report.add(none ? "mirror-index" : "mirror-silent",
+                       {{"address", shown(address)}, {"host", shown(hostOf(address))}, {"reason", shown(reason)}});
+        }
+    }
+    return !told.empty();
+}
+
+/// Refreshes the mirrors into lists of its own, so that nothing changes on the unit: the fact "package_now", or what
+/// keeps the updater from its refresh.
+void refreshPrivately(const Unit& unit, Report& report)
 {
     const TemporaryFolder folder(unit);
-    if (folder.path().empty()) {
+    if (folder.path().empty() || !makeLists(unit, folder.path())) {
         report.add("mirrors-unknown.folder", {{"error", errorText(errno)}});
         return;
     }
-    std::vector<std::string> arguments = {unit.path("/usr/lib/apt/apt-helper"), "-o", "APT::Sandbox::User=root"};
-    for (const char* option : {"Acquire::Retries=0", "Acquire::http::Timeout=2", "Acquire::https::Timeout=2"}) {
-        arguments.insert(arguments.end(), {"-o", option});
+    const std::string settings = folder.path() + "/apt.conf";
+    const CommandResult refresh = unit.run({"apt-get", "-c", settings, "update"}, refreshLimit);
+    const bool fetched = !reportUnfetched(refresh.errors, report);
+    if (!refresh.succeeded()) {
+        report.add(refresh.timedOut ? "mirrors-unknown.slow" : "refresh-fails", {{"complaint", complaint(refresh)}});
     }
-    arguments.push_back("download-file");
-    const auto target = [&](std::size_t number) { return folder.path() + '/' + std::to_string(number); };
-    for (std::size_t number = 0; number < addresses.size(); ++number) {
-        arguments.insert(arguments.end(), {addresses[number], target(number), ""}); // no checksum is known
-    }
-    const CommandResult fetch = unit.run(arguments, mirrorLimit);
-    if (!fetch.started) {
-        report.add("mirrors-unknown.fetcher");
+    if (!refresh.succeeded() || !fetched) {
         return;
     }
-    std::set<std::string> answering;
-    for (std::size_t number = 0; number < addresses.size(); ++number) {
-        if (std::filesystem::exists(target(number))) {
-            answering.insert(hostOf(addresses[number]));
-        }
-    }
-    std::set<std::string> told = answering;
-    for (std::size_t number = 0; number < addresses.size(); ++number) {
-        const std::string host = hostOf(addresses[number]);
-        if (!std::filesystem::exists(target(number)) && (answering.count(host) > 0 || told.insert(host).second)) {
-            reportAddress(addresses[number], answering.count(host) > 0, fetch, report);
-        }
+    const std::string policy = unit.run({"apt-cache", "-c", settings, "policy", unit.package()}, quick).output;
+    const std::string candidate = valueAfter(policy, "Candidate: ");
+    if (!candidate.empty()) {
+        report.addFact("package_now", "Package offered now", shown(candidate), escaped(candidate));
     }
 }
 
@@ -199,20 +218,18 @@ void checkMirrors(const Unit& unit, Report& report)
                    {{"complaint", complaint(list)}});
         return;
     }
-    std::vector<std::string> addresses;
     std::set<std::string> hosts;
     for (const std::string& line : linesOf(list.output)) {
-        if (!line.empty() && line.front() == '\'' && addresses.size() < mostAddresses) {
-            addresses.push_back(line.substr(1, line.find('\'', 1) - 1));
-            hosts.insert(hostOf(addresses.back()));
+        if (!line.empty() && line.front() == '\'') {
+            hosts.insert(hostOf(line.substr(1, line.find('\'', 1) - 1)));
         }
     }
     report.addFact("mirrors", "Mirrors", std::to_string(hosts.size()), hosts.size());
-    if (addresses.empty()) {
+    if (hosts.empty()) {
         report.add("mirrors-none");
         return;
     }
-    fetchReleases(addresses, unit, report);
+    refreshPrivately(unit, report);
 }
 
 } // namespace
@@ -225,35 +242,6 @@ void checkPackageManager(const Unit& unit, Report& report)
     checkSettings(unit, report);
     checkSpace(unit, report);
     checkMirrors(unit, report);
-}
-
-std::string candidateNow(const Unit& unit, Report& report)
-{
-    const TemporaryFolder folder(unit);
-    std::error_code error;
-    if (folder.path().empty() || !std::filesystem::create_directories(folder.path() + "/lists/partial", error)) {
-        report.add("mirrors-unknown.folder", {{"error", errorText(errno)}});
-        return "";
-    }
-    const auto privately = [&](const char* tool, const std::vector<std::string>& command) {
-        std::vector<std::string> arguments = {tool};
-        for (const std::string& option :
-             {"Dir::State::lists=" + folder.path() + "/lists", "Dir::Cache=" + folder.path(),
-              std::string("APT::Sandbox::User=root"), std::string("Acquire::Retries=0"),
-              std::string("Acquire::http::Timeout=20"), std::string("Acquire::https::Timeout=20")}) {
-            arguments.insert(arguments.end(), {"-o", option});
-        }
-        arguments.insert(arguments.end(), command.begin(), command.end());
-        return unit.run(arguments, refreshLimit);
-    };
-    const CommandResult refresh = privately("apt-get", {"update"});
-    if (!refresh.succeeded() || contains(refresh.errors, "Failed to fetch")) {
-        report.add(refresh.started ? "refresh-fails" : "mirrors-unreadable.unknown",
-                   {{"complaint", complaint(refresh)}});
-        return "";
-    }
-    const std::string policy = privately("apt-cache", {"policy", unit.package()}).output;
-    return escaped(valueAfter(policy, "Candidate: "));
 }
 
 void checkFreeSpace(const struct statvfs& system, std::uint64_t needed, Report& report)

@@ -7,12 +7,9 @@
 
 #include <sys/statvfs.h>
 
-/// Checks what the package manager needs: its locks, unfinished work, its words, free space, the mirrors.
+/// Checks what the package manager needs: its locks, unfinished work, its words, free space, the mirrors. These are
+/// refreshed into private lists, and the unit's hooks are not run: nothing changes.
 void checkPackageManager(const Unit& unit, Report& report);
-
-/// The version of the head's package that a refresh of the mirrors now would bring: into private lists, so that nothing
-/// changes. Empty, and reported, when they cannot be refreshed.
-std::string candidateNow(const Unit& unit, Report& report);
 
 /// Checks that no installation is unfinished.
 void checkUnfinishedWork(const Unit& unit, Report& report);

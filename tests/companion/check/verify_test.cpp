@@ -116,8 +116,8 @@ TEST(Check, AsksTheMirrorsIntoPrivateLists)
     const StandInUnit unit;
     // What the refresh brings is in the lists alone.
     unit.replaceTool("apt-get", R"(case $* in *--print-uris*) echo "'http://mirror.invalid/InRelease' a 0 "; exit;; esac
-        case $2 in Dir::State::lists=/*/lists) echo 1.4.0 >"${2#*=}/candidate";; *) exit 9;; esac)");
-    unit.replaceTool("apt-cache", R"(case $2 in *lists) read -r version <"${2#*=}/candidate";; *) version=1.3.0;; esac
+        case $1 in -c) echo 1.4.0 >"${2%/*}/lists/candidate";; *) exit 9;; esac)");
+    unit.replaceTool("apt-cache", R"(case $1 in -c) read -r version <"${2%/*}/lists/candidate";; *) version=1.3.0;; esac
         printf 'solvik4-rh:\n  Installed: 1.2.0\n  Candidate: %s\napt:\n' "$version")");
     const TestFolder stick;
     std::ostringstream out;
@@ -131,7 +131,7 @@ TEST(Check, AsksTheMirrorsIntoPrivateLists)
         echo 'W: Failed to fetch http://mirror.invalid/InRelease  Could not resolve' >&2)");
     out.str("");
     EXPECT_EQ(runCheck(stick.path(), false, unit.site(), out, out), Report::STATUS_NOT_FIT);
-    EXPECT_THAT(out.str(), HasSubstr("[refresh-fails]"));
+    EXPECT_THAT(out.str(), HasSubstr("[mirror-silent]"));
     EXPECT_THAT(out.str(), HasSubstr("1.2.0 -> 1.3.0, would be installed, as of the last refresh"));
 }
 
@@ -161,14 +161,21 @@ TEST_F(Verify, ReportHoldsWhatSupportNeedsAndNoLogin)
               "harl-updater-report/ harl-updater-report/README.txt harl-updater-report/check.txt "
               "harl-updater-report/journal.txt harl-updater-report/kept-logs/ "
               "harl-updater-report/kept-logs/2026-01-01_00-00-00.log harl-updater-report/log.txt "
-              "harl-updater-report/system.txt "
-              "harl-updater-report/unit.txt harl-updater-report/verify.txt ");
+              "harl-updater-report/system.txt harl-updater-report/verify.txt ");
+    const std::vector<std::string> calls = unit.calls();
+    EXPECT_EQ(std::count_if(calls.begin(), calls.end(),
+                            [](const std::string& call) { return call.rfind("apt-get -c", 0) == 0; }),
+              1);
     const std::string texts = shell("tar -xzOf " + file);
-    for (const char* text : {"Outcome:  PASSED: updated", "The unit is well.", "http://(login)@mirror.invalid/",
-                             "http://(login)@kept.invalid/", "The unit is fit for an update", "# dpkg --audit"}) {
+    for (const char* text :
+         {"Outcome:  PASSED: updated", "The unit is well.", "http://(login)@mirror.invalid/",
+          "http://(login)@kept.invalid/", "This update is NOT likely to do what it should", "# dpkg --audit"}) {
         EXPECT_THAT(texts, HasSubstr(text));
     }
     EXPECT_THAT(texts, testing::Not(HasSubstr("secret@")));
+
+    EXPECT_EQ(runReport({file + "2", folder.path("none"), false}, unit.site(), out, errors), Report::STATUS_FIT);
+    EXPECT_THAT(shell("tar -xzOf " + file + "2 harl-updater-report/unit.txt"), HasSubstr("fit for an update"));
 
     EXPECT_EQ(runReport({file, folder.path(), false}, unit.site(), out, errors), Report::STATUS_UNCHECKED);
     EXPECT_THAT(errors.str(), HasSubstr("exists already; name another file"));

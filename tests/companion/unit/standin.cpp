@@ -86,10 +86,6 @@ StandInUnit::StandInUnit()
     for (const std::string tool : tools) {
         folder.makeLink("bin/" + tool, UNIT_STANDINS);
     }
-    // Its tools find the settings in the folder above their own.
-    folder.makeFolder("root/usr/lib/apt");
-    folder.makeLink("root/usr/lib/apt/apt-helper", UNIT_STANDINS);
-    folder.makeLink("root/usr/lib/settings", "../../../settings");
     folder.makeFolder("root/tmp");
     folder.makeFolder("root/var/log/journal");
     for (const char* file : {"dev/i2c-0", "var/lib/apt/lists/lock", "var/lib/dpkg/lock-frontend", "var/lib/dpkg/lock",

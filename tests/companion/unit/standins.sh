@@ -89,7 +89,7 @@ dpkg_query() {
 }
 
 apt_cache() {
-    while [ "$1" = -o ]; do shift 2; done
+    [ "$1" != -c ] || shift 2
     case $1 in
     policy)
         if known "$2"; then
@@ -106,20 +106,11 @@ apt_cache() {
 }
 
 apt_get() {
-    echo "'http://mirror.invalid/dists/stable/InRelease' mirror.invalid_dists_stable_InRelease 0 "
-}
-
-apt_helper() {
-    while [ "$1" != download-file ]; do shift; done
-    while [ $# -gt 3 ]; do
-        if [ "$MIRRORS_REFRESH" = works ]; then
-            : >"$3"
-        else
-            echo "E: Failed to fetch $2  Could not resolve 'mirror.invalid'" >&2
-        fi
-        shift 3
-    done
-    [ "$MIRRORS_REFRESH" = works ] || fail 100 "E: Download Failed"
+    index=http://mirror.invalid/dists/stable/InRelease
+    case $* in
+    *--print-uris*) echo "'$index' mirror.invalid_dists_stable_InRelease 0 " ;;
+    *) [ "$MIRRORS_REFRESH" = works ] || echo "W: Failed to fetch $index  Could not resolve 'mirror.invalid'" >&2 ;;
+    esac
 }
 
 case " $TOOLS_KILLED " in
@@ -128,7 +119,6 @@ esac
 case $tool in
 apt-cache) apt_cache "$@" ;;
 apt-get) apt_get "$@" ;;
-apt-helper) apt_helper "$@" ;;
 dpkg-query) dpkg_query "$@" ;;
 umount | rm | ls | apt | scp) ;; # asked for, not run
 *) "$tool" "$@" ;;

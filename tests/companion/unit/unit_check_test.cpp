@@ -159,18 +159,13 @@ INSTANTIATE_TEST_SUITE_P(
               Lines{"warning package-not-offered"}},
         Fault{"UnitWithoutSourcesIsAnError", [](StandInUnit& unit) { unit.replaceTool("apt-get", ""); },
               Lines{"error mirrors-none"}},
-        Fault{
-            "MirrorWithoutTheIndexIsAWarning",
-            [](StandInUnit& unit) {
-                unit.folder.put(
-                    "root/usr/lib/apt/helper",
-                    "#!/bin/sh\necho 'E: Failed to fetch http://mirror.invalid/dists/stable/InRelease  404  Not Found "
-                    "[IP: 192.0.2.1 80]' >&2\nexit 100\n",
-                    0755);
-                fs::rename(unit.folder.path("root/usr/lib/apt/helper"),
-                           unit.folder.path("root/usr/lib/apt/apt-helper"));
-            },
-            Lines{"warning mirror-index"}},
+        Fault{"MirrorWithoutTheIndexIsNamed",
+              [](StandInUnit& unit) {
+                  unit.replaceTool("apt-get",
+                                   "echo \"'http://mirror.invalid/1' 1 0 \"; case $* in *print-uris) exit;; esac; "
+                                   "echo 'E: Failed to fetch http://mirror.invalid/1  404  Not Found' >&2; exit 100");
+              },
+              Lines{"warning mirror-index", "error refresh-fails"}},
         Fault{"VolatileJournalIsAWarning", [](StandInUnit& unit) { unit.remove("var/log/journal"); },
               Lines{"warning journal-volatile"}},
         Fault{"ClockBehindTheUpdaterIsAnError",
@@ -192,9 +187,9 @@ INSTANTIATE_TEST_SUITE_P(
               Lines{"warning apt-settings"}},
         Fault{"NineSilentAddressesOfOneMirrorAreOneError",
               [](StandInUnit& unit) {
-                  unit.set("MIRRORS_REFRESH", "unreachable");
                   unit.replaceTool("apt-get",
-                                   "for n in 1 2 3 4 5 6 7 8 9; do echo \"'http://mirror.invalid/$n' $n 0 \"; done");
+                                   "for n in 1 2 3 4 5 6 7 8 9; do echo \"'http://mirror.invalid/$n' $n 0 \"; "
+                                   "echo \"W: Failed to fetch http://mirror.invalid/$n  Timeout\" >&2; done");
               },
               Lines{"error mirror-silent"}},
         Fault{"WithoutServiceManagerItsToolIsMissing", [](StandInUnit& unit) { unit.removeTool("systemctl"); },
@@ -228,7 +223,7 @@ TEST_F(UnitCheck, ChangesNothing)
                                          "i2cset -y 0 0x07 0x100 c", testing::StartsWith("i2cdetect "),
                                          testing::StartsWith("ssh "), testing::StartsWith("dpkg-query --show "),
                                          testing::StartsWith("apt-cache "), "apt-get update --print-uris",
-                                         testing::StartsWith("apt-helper ")));
+                                         testing::StartsWith("apt-get -c " + unit.folder.path("root/tmp").string())));
     }
     EXPECT_TRUE(fs::is_empty(unit.folder.path("root/tmp")));
 }
@@ -265,20 +260,18 @@ TEST_F(UnitCheck, BoardThatRefusesAnotherUserThanRootIsUnchecked)
 
 TEST_F(UnitCheck, NothingIsLeftWhenASignalEndsIt)
 {
-    const fs::path fetcher = unit.folder.path("root/usr/lib/apt/apt-helper");
     const std::string processFile = unit.folder.path("process");
-    fs::remove(fetcher); // a link
     for (const int number : {SIGHUP, SIGINT, SIGTERM}) {
-        unit.folder.put("root/usr/lib/apt/apt-helper",
-                        "#!/bin/sh\necho $$ >" + processFile + "\nkill -" + std::to_string(number) +
-                            " $PPID\nexec sleep 60\n",
-                        0755);
+        unit.replaceTool("apt-get", "case $* in *print-uris) echo \"'http://mirror.invalid/1' 1 0 \"; exit;; esac\n"
+                                    "echo $$ >" +
+                                        processFile + "\nkill -" + std::to_string(number) +
+                                        " $PPID\nPATH=/bin exec sleep 60");
         EXPECT_EXIT((std::signal(number, SIG_DFL), check()), testing::KilledBySignal(number), "");
         EXPECT_TRUE(fs::is_empty(unit.folder.path("root/tmp"))) << number;
         pid_t process = 0;
         std::ifstream(processFile) >> process;
         EXPECT_GT(process, 0);
-        EXPECT_EQ(kill(process, 0), -1) << "The fetcher lives on.";
+        EXPECT_EQ(kill(process, 0), -1) << "The refresh lives on.";
     }
 }
 
@@ -424,7 +417,7 @@ TEST_F(UnitCheck, MissingAndBrokenSoundFilesAreWarnings)
     const CheckResult result = check();
     EXPECT_EQ(result.findings, (Lines{"warning sound-file", "warning sound-file"}));
     EXPECT_EQ(result.status, 0);
-    EXPECT_THAT(result.report["findings"][1]["what"].get<std::string>(), HasSubstr("456 of 1000 bytes of sound"));
+    EXPECT_THAT(result.report["findings"][1]["what"].get<std::string>(), HasSubstr("it is cut off: 500 of 1044 bytes"));
 }
 
 TEST_F(UnitCheck, SoundFileThatCannotBeReadIsUnchecked)
@@ -562,23 +555,42 @@ TEST(UnitDisk, DiskThatIsReadOnlyIsAnError)
 
 // Mirrors
 
-TEST_F(UnitCheck, MirrorsAreFetchedWithTheUpdatersTimeOut)
+TEST_F(UnitCheck, MirrorsAreRefreshedPrivatelyAndWithoutTheUnitsHooks)
 {
-    check();
-    EXPECT_THAT(unit.calls(),
-                Contains(testing::AllOf(HasSubstr("Acquire::http::Timeout=2 -o Acquire::https::Timeout=2 download-file "
-                                                  "http://mirror.invalid/dists/stable/InRelease "),
-                                        HasSubstr("Acquire::Retries=0"))));
+    // The real apt-get, with settings and a source that lie on the stand-in unit.
+    const std::string root = unit.folder.path("root");
+    unit.put("repository/Packages", "Package: solvik4-rh\nVersion: 1.4.0\nArchitecture: all\nFilename: ./none.deb\n"
+                                    "Size: 1\nMaintainer: none\nDescription: none\n");
+    unit.put("sources.list", "deb [trusted=yes] file:" + root + "/repository ./\n");
+    unit.put("var/lib/apt/lists/old", "kept");
+    const std::string hook = " { \"touch " + root + "/hook\"; }; ";
+    unit.put("apt.conf", "Dir::Etc { sourcelist \"" + root +
+                             "/sources.list\"; sourceparts \"-\"; main \"-\"; "
+                             "parts \"-\"; };\nDir::State::status \"/dev/null\";\nDir::Cache \"" +
+                             root +
+                             "/cache\";\n"
+                             "APT::Update { Pre-Invoke" +
+                             hook + "Post-Invoke" + hook + "Post-Invoke-Success" + hook + "};\n");
+    for (const std::string tool : {"apt-get", "apt-cache"}) {
+        unit.replaceTool(tool, "export PATH=/usr/bin:/bin APT_CONFIG=" + root + "/apt.conf\nexec " + tool + " \"$@\"");
+    }
+    EXPECT_EQ(check().report["facts"]["package_now"], "1.4.0");
+    EXPECT_FALSE(fs::exists(root + "/hook"));
+    EXPECT_EQ(std::distance(fs::directory_iterator(root + "/var/lib/apt/lists"), {}), 2); // with its lock
+    EXPECT_TRUE(fs::is_empty(root + "/tmp"));
+
+    // The updater's own refresh runs them.
+    fs::create_directories(root + "/lists/partial");
+    runCommand({"apt-get", "-o", "Dir::State::lists=" + root + "/lists", "update"},
+               {"PATH=" + unit.folder.path("bin").string()}, 60s);
+    EXPECT_TRUE(fs::exists(root + "/hook"));
 }
 
-TEST_F(UnitCheck, FirstBytesOfASlowMirrorAreAnAnswer)
+TEST_F(UnitCheck, RefreshThatFailsIsAnError)
 {
-    unit.folder.put("root/usr/lib/apt/helper",
-                    "#!/bin/sh\nfor word; do shift; case $word in http*) printf P >\"$1\";; esac; "
-                    "done\necho 'E: Download Failed' >&2\nexit 100\n",
-                    0755);
-    fs::rename(unit.folder.path("root/usr/lib/apt/helper"), unit.folder.path("root/usr/lib/apt/apt-helper"));
-    EXPECT_EQ(findings(), Lines());
+    unit.replaceTool("apt-get", "case $* in *print-uris) echo \"'http://mirror.invalid/1' 1 0 \"; exit;; esac; "
+                                "echo 'E: Release file is not valid yet' >&2; exit 100");
+    EXPECT_EQ(findings(), Lines{"error refresh-fails"});
 }
 
 TEST_F(UnitCheck, SilentMirrorIsAnErrorThatExplainsTheExitStatus)
@@ -599,10 +611,8 @@ TEST_F(UnitCheck, SourcesThatCannotBeReadAreAnError)
     EXPECT_EQ(findings(), Lines{"unchecked mirrors-unreadable"});
 }
 
-TEST_F(UnitCheck, WithoutFetcherOrTemporaryFolderTheMirrorsAreUnchecked)
+TEST_F(UnitCheck, WithoutTemporaryFolderTheMirrorsAreUnchecked)
 {
-    unit.remove("usr/lib/apt/apt-helper");
-    EXPECT_EQ(findings(), Lines{"unchecked mirrors-unknown"});
     unit.remove("tmp");
     EXPECT_EQ(findings(), Lines{"unchecked mirrors-unknown"});
 }

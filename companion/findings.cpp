@@ -3,9 +3,11 @@
 #include <algorithm>
 #include <array>
 #include <cstdio>
-#include <ostream>
+#include <iostream>
 #include <utility>
 
+#include <sys/ioctl.h>
+#include <unistd.h>
 #include <utf8.h>
 
 namespace
@@ -56,6 +58,31 @@ void appendEscaped(std::string& text, char32_t character, std::string_view bytes
     } else {
         text += bytes;
     }
+}
+
+/// The columns that a terminal needs for `text`: two for each wide character, Unicode's annex 11, none for one that
+/// combines with the one before.
+std::size_t columnsOf(std::string_view text)
+{
+    std::size_t columns = 0;
+    for (auto next = text.begin(); next != text.end();) {
+        const char32_t character = utf8::unchecked::next(next);
+        const bool wide =
+            (character >= 0x1100 && character <= 0x115F) || (character >= 0x2E80 && character <= 0xA4CF) ||
+            (character >= 0xAC00 && character <= 0xD7A3) || (character >= 0xF900 && character <= 0xFAFF) ||
+            (character >= 0xFF01 && character <= 0xFF60) || (character >= 0x1F300 && character <= 0x3FFFD);
+        const bool combines = character >= 0x300 && character <= 0x36F;
+        columns += combines ? 0 : wide ? 2 : 1;
+    }
+    return columns;
+}
+
+std::size_t widthOf(const std::ostream& out)
+{
+    winsize window = {};
+    const bool known =
+        out.rdbuf() == std::cout.rdbuf() && ioctl(STDOUT_FILENO, TIOCGWINSZ, &window) == 0 && window.ws_col > 0;
+    return known ? window.ws_col : 100;
 }
 
 std::string withSeparators(std::uint64_t number)
@@ -142,28 +169,26 @@ void Report::print(std::ostream& out) const
     for (const Fact& fact : mFacts) {
         width = std::max(width, fact.label.size());
     }
+    std::string text;
     for (const Fact& fact : mFacts) {
-        out << fact.label << ':' << std::string(width - fact.label.size() + 2, ' ') << fact.text << '\n';
+        text += fact.label + ':' + std::string(width - fact.label.size() + 2, ' ') + '\t' + fact.text + '\n';
     }
     for (Severity severity : {Severity::ERROR, Severity::UNCHECKED, Severity::WARNING, Severity::NOTE}) {
         for (const Finding& finding : mFindings) {
-            if (finding.severity != severity) {
-                continue;
-            }
-            out << '\n' << severityWord(severity) << ": " << finding.what << " [" << finding.check << "]\n";
-            if (!finding.effect.empty()) {
-                out << "  The updater: " << finding.effect << '\n';
-            }
-            if (!finding.remedy.empty()) {
-                out << "  Fix:         " << finding.remedy << '\n';
+            if (finding.severity == severity) {
+                text +=
+                    std::string("\n") + severityWord(severity) + ": \t" + finding.what + " [" + finding.check + "]\n";
+                text += finding.effect.empty() ? "" : "  The updater: \t" + finding.effect + '\n';
+                text += finding.remedy.empty() ? "" : "  Fix:         \t" + finding.remedy + '\n';
             }
         }
     }
     const std::size_t warnings = count(Severity::WARNING);
     const std::array<std::string, 3> verdicts = {
         " is " + mGood, " is NOT " + mGood, ": not everything could be checked, whether it is " + mGood + " is open"};
-    out << '\n'
-        << mSubject << verdicts.at(status()) << (warnings > 0 ? ", with " + counted(warnings, "warning") : "") << ".\n";
+    printText(text + '\n' + mSubject + verdicts.at(status()) +
+                  (warnings > 0 ? ", with " + counted(warnings, "warning") : "") + ".\n",
+              out);
 }
 
 nlohmann::ordered_json Report::toJson() const
@@ -186,9 +211,44 @@ nlohmann::ordered_json Report::toJson() const
             {"findings", findings}};
 }
 
-nlohmann::ordered_json refusal(const std::string& command, const std::string& error)
+Report::Status refuse(const std::string& command, bool json, const std::string& text, std::ostream& out,
+                      std::ostream& errors)
 {
-    return {{"command", command}, {"version", jsonVersion}, {"status", Report::STATUS_UNCHECKED}, {"error", error}};
+    if (json) {
+        const nlohmann::ordered_json object = {
+            {"command", command}, {"version", jsonVersion}, {"status", Report::STATUS_UNCHECKED}, {"error", text}};
+        out << object.dump(2) << '\n';
+    }
+    errors << "harl-updater-tool: " << text << '\n';
+    return Report::STATUS_UNCHECKED;
+}
+
+void printText(std::string_view text, std::ostream& out)
+{
+    const std::size_t width = widthOf(out);
+    std::size_t column = 0;
+    std::size_t begin = 0; // column of what goes on in a further line
+    while (!text.empty()) {
+        if (text.front() == '\n' || text.front() == '\t') {
+            begin = text.front() == '\t' ? column : 0;
+            out << (text.front() == '\n' ? "\n" : "");
+            column = begin;
+            text.remove_prefix(1);
+            continue;
+        }
+        const std::size_t blanks = std::min(text.find_first_not_of(' '), text.size());
+        const std::size_t end = std::min(text.find_first_of(" \t\n", blanks), text.size());
+        const std::string_view word = text.substr(blanks, end - blanks);
+        const std::size_t columns = columnsOf(word);
+        if (column > begin && column + blanks + columns > width) {
+            out << '\n' << std::string(begin, ' ') << word;
+            column = begin + columns;
+        } else {
+            out << text.substr(0, end);
+            column += blanks + columns;
+        }
+        text.remove_prefix(end);
+    }
 }
 
 std::string escaped(std::string_view text)

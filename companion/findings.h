@@ -101,8 +101,20 @@ private:
 /// Version of the JSON that every command prints: docs/harl-updater-tool.schema.json.
 inline constexpr int jsonVersion = 1;
 
-/// The object for a command that could not do its work.
-nlohmann::ordered_json refusal(const std::string& command, const std::string& error);
+/// Says why a command could not do its work: on `errors` behind the program's name, with `json` as an object on `out`
+/// too.
+///
+/// @param text  sentences, printable
+/// @return STATUS_UNCHECKED
+Report::Status refuse(const std::string& command, bool json, const std::string& text, std::ostream& out,
+                      std::ostream& errors);
+
+/// Prints lines, each no longer than the terminal is wide, or 100 columns where `out` is none. They break at blanks
+/// only, so that a path stays whole. What goes on in a further line begins below the place of the line's tab, which
+/// itself is not printed.
+///
+/// @param text  printable but for tabs and line ends
+void printText(std::string_view text, std::ostream& out);
 
 /// `text` made fit for a terminal and for JSON whatever bytes it holds.
 ///

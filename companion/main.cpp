@@ -62,19 +62,18 @@ std::string usageText(const CLI::App& app, const CLI::ParseError& error)
                (rest.front().rfind('-', 0) == 0 ? " is not an option of " : " is one argument too many for ") +
                parsed.front()->get_name() + '.';
     }
-    const std::string text = error.what(); // "--html: 1 required PAGE missing"
-    return text.substr(0, text.find(':')) + " needs a value that fits.";
+    const std::string text = error.what(); // "--html: 1 required PAGE missing", "FILE is required"
+    const std::string option = text.substr(0, text.find_first_of(": "));
+    return option == "FILE"     ? "Name the FILE to make."
+           : option == "--html" ? "Name the PAGE to write behind --html."
+                                : option + " needs a number from 1 on.";
 }
 
-/// Reports a wrong command line: in words, and to programs as an object.
-int refuse(const std::string& command, bool json, const std::string& text)
+/// Reports a wrong command line.
+int refuseUsage(const std::string& command, bool json, const std::string& text)
 {
-    if (json) {
-        std::cout << refusal(command, text).dump(2) << '\n';
-    }
-    std::cerr << "harl-updater-tool: " << text << " See: harl-updater-tool " << command << (command.empty() ? "" : " ")
-              << "--help\n";
-    return Report::STATUS_UNCHECKED;
+    return refuse(command, json, text + " See: harl-updater-tool " + command + (command.empty() ? "" : " ") + "--help",
+                  std::cout, std::cerr);
 }
 
 int run(std::vector<std::string> arguments)
@@ -177,7 +176,7 @@ int run(std::vector<std::string> arguments)
             return app.exit(error); // --help, --version
         }
         const std::vector<CLI::App*> parsed = app.get_subcommands();
-        return refuse(parsed.empty() ? "" : parsed.front()->get_name(), wantsJson, usageText(app, error));
+        return refuseUsage(parsed.empty() ? "" : parsed.front()->get_name(), wantsJson, usageText(app, error));
     }
     if (make->parsed()) {
         makeOptions.progress = isatty(STDERR_FILENO) == 1;
@@ -190,12 +189,12 @@ int run(std::vector<std::string> arguments)
         logOptions.json = json;
         logOptions.terminal = isatty(STDOUT_FILENO) == 1;
         const std::string wrong = conflictIn(logOptions);
-        return wrong.empty() ? runLog(logOptions, std::cout, std::cerr) : refuse("log", json, wrong);
+        return wrong.empty() ? runLog(logOptions, std::cout, std::cerr) : refuseUsage("log", json, wrong);
     }
     if (explain->parsed()) {
         return printCatalogue(failure, json, std::cout)
                    ? 0
-                   : refuse("explain", json, escaped(failure) + " is not a name of the catalogue.");
+                   : refuseUsage("explain", json, escaped(failure) + " is not a name of the catalogue.");
     }
     if (check->parsed()) {
         return runCheck(checkPath, json, thisUnit(), std::cout, std::cerr);

@@ -73,13 +73,14 @@ const std::vector<Failure>& failures()
     return all;
 }
 
+/// An entry that is there.
 const Failure* entry(const char* name)
 {
     return findFailure(name);
 }
 
 /// The entry for a step that failed, as specific as the log allows.
-const Failure* failureOf(const Run& run, const Step& step)
+const Failure* entryFor(const Run& run, const Step& step)
 {
     if (step.kind == S::UPLOAD_BOARD && run.statusesLost) {
         return entry("statuses-lost");
@@ -113,20 +114,11 @@ const Failure* failureOf(const Run& run, const Step& step)
     return found->general && step.pointsTo != nullptr ? step.pointsTo : found;
 }
 
+/// True for a step whose end decides the run's outcome.
 bool decides(const Step& step, Outcome outcome)
 {
-    const bool oneCommand = step.status && step.status->number != 0;
-    switch (outcome) {
-    case Outcome::MIRRORS_FAILED:
-        return step.kind == S::REFRESH_MIRRORS && (step.result == StepResult::FAILED || oneCommand);
-    case Outcome::PACKAGE_FAILED:
-        return step.kind == S::INSTALL_PACKAGE && (step.result == StepResult::FAILED || oneCommand);
-    case Outcome::BOARD_FAILED:
-        return step.kind == S::UPLOAD_BOARD && step.result == StepResult::FAILED;
-    default:
-        return step.result == StepResult::FAILED &&
-               (step.kind == S::CHECK_PACKAGE || step.kind == S::CHECK_BOARD || step.kind == S::CHECK_TEAMVIEWER);
-    }
+    const bool checks = outcome == Outcome::CHECK_FAILED || outcome == Outcome::FAILED;
+    return failureOf(step) == outcome || (checks && step.kind == S::CHECK_BOARD && step.result == StepResult::FAILED);
 }
 
 /// What the service's words point to.
@@ -153,7 +145,7 @@ void addFailure(Run& run)
     if (isFailure(run.outcome)) {
         for (std::size_t index = run.steps.size(); index-- > 0;) {
             if (decides(run.steps[index], run.outcome)) {
-                run.failure = {failureOf(run, run.steps[index]), index};
+                run.failure = {entryFor(run, run.steps[index]), index};
                 return;
             }
         }
@@ -202,7 +194,7 @@ void addBesides(Run& run)
             }
             continue;
         }
-        run.besides.push_back({failureOf(run, step), index, step.kind == S::CHECK_BOARD && !run.mainHead});
+        run.besides.push_back({entryFor(run, step), index, step.kind == S::CHECK_BOARD && !run.mainHead});
     }
     if (run.ledFailures > 0) {
         run.besides.push_back({entry("panel-failed"), 0});
@@ -310,25 +302,24 @@ bool printCatalogue(const std::string& name, bool json, std::ostream& out)
         out << Json{{"command", "explain"}, {"version", jsonVersion}, {"failures", entries}}.dump(2) << '\n';
         return true;
     }
+    std::string text;
+    const auto add = [&](const char* label, const std::string& words) {
+        text += words.empty() ? "" : label + words + '\n';
+    };
     for (const Json& one : entries) {
-        out << (&one == &entries.front() ? "" : "\n") << one["name"].get<std::string>() << '\n';
-        const auto print = [&](const char* label, const std::string& text) {
-            if (!text.empty()) {
-                printWrapped(label, text, out);
-            }
-        };
+        text += (text.empty() ? "" : "\n") + one["name"].get<std::string>() + '\n';
         std::string steps;
         for (const Json& step : one["steps"]) {
             steps += (steps.empty() ? "" : ", ") + step.get<std::string>();
         }
-        print("  Reported: ", one["reported"]);
-        print("  In step:  ", steps);
-        print("  Cause:    ", one["cause"]);
-        print("  Do now:   ", one["remedy"]);
+        add("  Reported: \t", one["reported"]);
+        add("  In step:  \t", steps);
+        add("  Cause:    \t", one["cause"]);
+        add("  Do now:   \t", one["remedy"]);
         for (const Json& phrase : one["phrases"]) {
-            out << "  Says so:  " << phrase["tool"].get<std::string>() << ": " << phrase["words"].get<std::string>()
-                << '\n';
+            add("  Says so:  \t", phrase["tool"].get<std::string>() + ": " + phrase["words"].get<std::string>());
         }
     }
+    printText(text, out);
     return !entries.empty();
 }

@@ -12,11 +12,6 @@ namespace
 const std::string_view binaryMessage = "MESSAGE";          // in a line of its own: its bytes follow
 const std::size_t enoughToJudge = std::size_t{128} * 1024; // bytes, to find out the order of the lines
 
-bool startsWith(std::string_view text, std::string_view start)
-{
-    return text.substr(0, start.size()) == start;
-}
-
 /// Counts the records that say something.
 class Counter : public LogSink
 {

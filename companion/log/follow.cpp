@@ -1,5 +1,6 @@
 #include "log/follow.h"
 
+#include "findings.h"
 #include "log/json.h"
 #include "log/text.h"
 #include "procedure.h"
@@ -187,45 +188,44 @@ void Follower::showChange(const Run* run, std::int64_t now)
         mOut << "\r\x1b[K"; // back to the line's start, and clear it
         mBar = false;
     }
-    if (!known) {
-        mOut << "No update is going on. Waiting for one.\n";
-        return;
+    const std::string text = known ? changeText(*run, over, overdue, now) : "No update is going on. Waiting for one.\n";
+    if (mTerminal) {
+        printText(text, mOut);
+    } else {
+        mOut << text; // a line for each change
     }
+    if (over && mEnded) {
+        Run ended = *run;
+        explain(ended);
+        printText(ended.failure ? problemText(ended, *ended.failure) : "", mOut);
+    }
+}
+
+std::string Follower::changeText(const Run& run, bool over, bool overdue, std::int64_t now) const
+{
     if (over) {
-        const OperatorView view = operatorView(*run);
-        mOut << (mEnded ? "Ended at " : "No update is going on. The last one ended at ")
-             << (mEnded ? clockText(run->end) : dateText(run->end)) << ": " << view.meaning << " (" << view.seen << ")."
-             << (mEnded ? "\n" : " Waiting for the next.\n");
-        if (mEnded) {
-            Run ended = *run;
-            explain(ended);
-            if (ended.failure) {
-                mOut << headingOf(ended, *ended.failure) << '\n';
-                printWrapped("  Why:     ", causeOf(ended, *ended.failure), mOut);
-                printWrapped("  Do now:  ", remedyOf(ended, *ended.failure), mOut);
-            }
-        }
-        return;
+        const OperatorView view = operatorView(run);
+        return (mEnded ? "Ended at " + clockText(run.end)
+                       : "No update is going on. The last one ended at " + dateText(run.end)) +
+               ": " + view.meaning + " (" + view.seen + (mEnded ? ").\n" : "). Waiting for the next.\n");
     }
-    const Step& step = run->steps.back();
-    mOut << clockText(step.start) << "  " << factsOf(step.kind).title << attemptText(step);
+    const Step& step = run.steps.back();
+    std::string text = clockText(step.start) + "  " + factsOf(step.kind).title + attemptText(step);
     if (step.took) {
-        mOut << ": " << resultText(*run, step);
+        text += ": " + resultText(run, step);
     } else if (const std::optional<std::int64_t> expected = mExpected.of(step.kind)) {
-        mOut << ", " << durationText(*expected) << " expected";
+        text += ", " + durationText(*expected) + " expected";
     }
     if (overdue) {
-        mOut << "; no record for " << durationText(now - run->end)
-             << ", longer than this step takes: the updater has most likely ended. Do now: "
-             << factsOf(step.kind).afterwards << '\n';
-        return;
+        return text + "; no record for " + durationText(now - run.end) +
+               ", longer than this step takes: the updater has most likely ended. Do now: " +
+               factsOf(step.kind).afterwards + '\n';
     }
-    if (const std::vector<StepKind> next = stepsToCome(*run); !next.empty()) {
-        const std::int64_t minutes = (remaining(*run, now) + 59) / 60;
-        mOut << "; then: " << factsOf(next[0]).title << (nextDependsOnCheck(*run) ? ", if they differ" : "");
-        mOut << "; in all at least " << minutes << " min more";
+    if (const std::vector<StepKind> next = stepsToCome(run); !next.empty()) {
+        text += std::string("; then: ") + factsOf(next[0]).title + (nextDependsOnCheck(run) ? ", if they differ" : "") +
+                "; in all at least " + std::to_string((remaining(run, now) + 59) / 60) + " min more";
     }
-    mOut << '\n';
+    return text + '\n';
 }
 
 void Follower::showBar(const Run& run, std::int64_t now)

@@ -47,6 +47,7 @@ public:
 
 private:
     void showChange(const Run* run, std::int64_t now);
+    std::string changeText(const Run& run, bool over, bool overdue, std::int64_t now) const;
     void showBar(const Run& run, std::int64_t now);
     std::int64_t remaining(const Run& run, std::int64_t now) const;
 

@@ -12,11 +12,6 @@ const std::string_view mark = "Updater | ";
 const std::size_t longestPrefix = 200; // bytes of a journal's prefix
 const std::size_t timeLength = 19;
 
-bool startsWith(std::string_view text, std::string_view start)
-{
-    return text.substr(0, start.size()) == start;
-}
-
 bool isDigit(char character)
 {
     return character >= '0' && character <= '9';

@@ -18,15 +18,38 @@ const std::int64_t longestGap = 86400;  // s between two records
 const std::string mainPackage = packageOf(true);
 const std::int64_t mostDelay = 60; // s by which a wait may end late
 
-bool startsWith(std::string_view text, std::string_view start)
-{
-    return text.substr(0, start.size()) == start;
-}
-
 bool contains(std::string_view text, std::string_view part)
 {
     return text.find(part) != std::string_view::npos;
 }
+
+/// A version check's result, and what stands between the two versions.
+struct VersionEvent
+{
+    Event event;
+    Versions Run::*versions;
+    Versions::State state;
+    const char* between;
+};
+
+const VersionEvent versionEvents[] = {
+    {Event::PACKAGE_DIFFERS, &Run::package, Versions::State::DIFFER, " -> "},
+    {Event::PACKAGE_SAME, &Run::package, Versions::State::SAME, " == "},
+    {Event::BOARD_DIFFERS, &Run::board, Versions::State::DIFFER, " -> "},
+    {Event::BOARD_SAME, &Run::board, Versions::State::SAME, " == "},
+    {Event::BOARD_NOT_READ, &Run::board, Versions::State::NOT_READ, " -> "},
+    {Event::STICK_NOT_READ, &Run::board, Versions::State::NOT_READ, " -> "},
+};
+const std::pair<Event, bool Run::*> factEvents[] = {
+    {Event::MAIN_INSTALLS, &Run::partsInstalled}, {Event::MARKER_REMOVED, &Run::markerRemoved},
+    {Event::RESULT, &Run::resultReported},        {Event::ERROR, &Run::errorReported},
+    {Event::SOUND_FAILED, &Run::soundFailed},
+};
+const std::pair<Event, Outcome> outcomeEvents[] = {
+    {Event::MAIN_FINISHED, Outcome::UPDATED},       {Event::MIRRORS_REPORTED, Outcome::MIRRORS_FAILED},
+    {Event::CHECK_REPORTED, Outcome::CHECK_FAILED}, {Event::PACKAGE_REPORTED, Outcome::PACKAGE_FAILED},
+    {Event::BOARD_REPORTED, Outcome::BOARD_FAILED},
+};
 
 /// Printable, and no longer than what is kept of a text.
 std::string kept(std::string_view text)
@@ -68,27 +91,6 @@ bool lightsOutcome(std::string_view command)
 bool isOneCommand(StepKind kind)
 {
     return kind == StepKind::REFRESH_MIRRORS || kind == StepKind::INSTALL_PACKAGE;
-}
-
-/// The failure that a step's own end decides; NONE for none.
-Outcome outcomeOf(const Step& step)
-{
-    if (step.result != StepResult::FAILED && !(isOneCommand(step.kind) && step.status && step.status->number != 0)) {
-        return Outcome::NONE;
-    }
-    switch (step.kind) {
-    case StepKind::REFRESH_MIRRORS:
-        return Outcome::MIRRORS_FAILED;
-    case StepKind::CHECK_PACKAGE:
-    case StepKind::CHECK_TEAMVIEWER:
-        return Outcome::CHECK_FAILED;
-    case StepKind::INSTALL_PACKAGE:
-        return Outcome::PACKAGE_FAILED;
-    case StepKind::UPLOAD_BOARD:
-        return Outcome::BOARD_FAILED;
-    default:
-        return Outcome::NONE;
-    }
 }
 
 Outcome mainHeadOutcome(const Run& run)
@@ -154,7 +156,7 @@ Outcome outcomeOf(const Run& run)
         return run.named;
     }
     for (auto step = run.steps.rbegin(); step != run.steps.rend(); ++step) {
-        if (const Outcome outcome = outcomeOf(*step); outcome != Outcome::NONE) {
+        if (const Outcome outcome = failureOf(*step); outcome != Outcome::NONE) {
             return outcome;
         }
     }
@@ -162,6 +164,26 @@ Outcome outcomeOf(const Run& run)
 }
 
 } // namespace
+
+Outcome failureOf(const Step& step)
+{
+    if (step.result != StepResult::FAILED && !(isOneCommand(step.kind) && step.status && step.status->number != 0)) {
+        return Outcome::NONE;
+    }
+    switch (step.kind) {
+    case StepKind::REFRESH_MIRRORS:
+        return Outcome::MIRRORS_FAILED;
+    case StepKind::CHECK_PACKAGE:
+    case StepKind::CHECK_TEAMVIEWER:
+        return Outcome::CHECK_FAILED;
+    case StepKind::INSTALL_PACKAGE:
+        return Outcome::PACKAGE_FAILED;
+    case StepKind::UPLOAD_BOARD:
+        return Outcome::BOARD_FAILED;
+    default:
+        return Outcome::NONE;
+    }
+}
 
 void OtherLines::add(std::string_view text)
 {
@@ -385,6 +407,18 @@ void RunBuilder::noteTime(const ParsedRecord& record, const Meaning& meaning)
 void RunBuilder::takeRunEvent(const ParsedRecord& record, const Meaning& meaning)
 {
     Run& run = *mRun;
+    for (const auto& [event, versions, state, between] : versionEvents) {
+        if (event == meaning.event) {
+            (run.*versions).state = state;
+            splitVersions(meaning.rest, between, run.*versions);
+        }
+    }
+    for (const auto& [event, fact] : factEvents) {
+        run.*fact = run.*fact || event == meaning.event;
+    }
+    for (const auto& [event, outcome] : outcomeEvents) {
+        run.named = event == meaning.event ? outcome : run.named;
+    }
     switch (meaning.event) {
     case Event::VERSION:
         run.version = kept(meaning.rest);
@@ -395,64 +429,15 @@ void RunBuilder::takeRunEvent(const ParsedRecord& record, const Meaning& meaning
     case Event::STOPS_UPDATER:
         run.ended = RunEnd::BY_SERVICE_MANAGER;
         break;
-    case Event::MAIN_INSTALLS:
-        run.partsInstalled = true;
-        break;
-    case Event::MAIN_FINISHED:
-        run.named = Outcome::UPDATED;
-        break;
-    case Event::PACKAGE_DIFFERS:
-        run.package.state = Versions::State::DIFFER;
-        splitVersions(meaning.rest, " -> ", run.package);
-        break;
-    case Event::PACKAGE_SAME:
-        run.package.state = Versions::State::SAME;
-        splitVersions(meaning.rest, " == ", run.package);
-        break;
-    case Event::BOARD_DIFFERS:
-        run.board.state = Versions::State::DIFFER;
-        splitVersions(meaning.rest, " -> ", run.board);
-        break;
-    case Event::BOARD_SAME:
-        run.board.state = Versions::State::SAME;
-        break;
     case Event::BOARD_VERSIONS: // of the lines shown, the last one before the verdict
         splitVersions(meaning.rest, "  ", run.board);
         run.board.unclear = !run.steps.empty() && run.steps.back().actions.size() > 1 && !meaning.rest.empty() &&
                             !contains(meaning.rest, "  "); // the blanks between are gone
         break;
-    case Event::BOARD_NOT_READ:
-    case Event::STICK_NOT_READ:
-        run.board.state = Versions::State::NOT_READ;
-        break;
     case Event::TEAMVIEWER_REQUESTED:
     case Event::TEAMVIEWER_NOT_REQUESTED:
         run.mainHead = true;
         run.teamViewer = meaning.event == Event::TEAMVIEWER_REQUESTED;
-        break;
-    case Event::MIRRORS_REPORTED:
-        run.named = Outcome::MIRRORS_FAILED;
-        break;
-    case Event::CHECK_REPORTED:
-        run.named = Outcome::CHECK_FAILED;
-        break;
-    case Event::PACKAGE_REPORTED:
-        run.named = Outcome::PACKAGE_FAILED;
-        break;
-    case Event::BOARD_REPORTED:
-        run.named = Outcome::BOARD_FAILED;
-        break;
-    case Event::MARKER_REMOVED:
-        run.markerRemoved = true;
-        break;
-    case Event::RESULT:
-        run.resultReported = true;
-        break;
-    case Event::ERROR:
-        run.errorReported = true;
-        break;
-    case Event::SOUND_FAILED:
-        run.soundFailed = true;
         break;
     case Event::PANEL_FAILED:
         ++run.ledFailures;

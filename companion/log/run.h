@@ -180,6 +180,9 @@ struct Run
 
 bool isFailure(Outcome outcome);
 
+/// The failure that a step's own end decides; NONE for none.
+Outcome failureOf(const Step& step);
+
 /// Gathers records into runs and steps. Memory stays bounded for a log of any size: each run is handed over when it is
 /// complete, and of a run only so many steps, actions and lines are kept.
 class RunBuilder : public LogSink

@@ -9,13 +9,11 @@
 #include <cstdio>
 #include <cstring>
 #include <ctime>
-#include <ostream>
+#include <iomanip>
 #include <sstream>
 
 namespace
 {
-
-const std::size_t width = 100; // columns
 
 /// What is shown for an outcome.
 struct OutcomeFacts
@@ -76,35 +74,14 @@ std::string exitCodeText(long code)
     return text;
 }
 
-void printSteps(const Run& run, std::ostream& out)
+/// A line for each of `lines`, as a quotation.
+std::string quoted(const OtherLines& lines)
 {
-    out << "\nStart     Took          Step                              Result\n";
-    for (const Step& step : run.steps) {
-        const std::string took = step.took ? durationText(*step.took) : "";
-        std::array<char, 256> line{};
-        std::snprintf(line.data(), line.size(), "%s  %-12s  %-32s  ", clockText(step.start).c_str(), took.c_str(),
-                      factsOf(step.kind).title);
-        out << line.data() << resultText(run, step) << '\n';
-    }
-}
-
-void printLines(const OtherLines& lines, std::ostream& out)
-{
+    std::string text;
     for (const std::string& line : shownLines(lines)) {
-        out << "    | " << line << '\n';
+        text += "    | \t" + line + '\n';
     }
-}
-
-void printProblem(const Run& run, const Problem& problem, std::ostream& out)
-{
-    const Step* step = run.stepOf(problem);
-    out << '\n' << headingOf(run, problem) << '\n';
-    printWrapped("  Why:     ", causeOf(run, problem), out);
-    printWrapped("  Do now:  ", remedyOf(run, problem), out);
-    if (step != nullptr && step->said.count > 0) {
-        out << "  The tools said:\n";
-        printLines(step->said, out);
-    }
+    return text;
 }
 
 /// What came out of a step that succeeded.
@@ -179,26 +156,6 @@ std::string versionsText(const Run& run, const Versions& versions, StepKind chec
 }
 
 } // namespace
-
-void printWrapped(const std::string& label, const std::string& text, std::ostream& out)
-{
-    std::istringstream words(text);
-    std::string word;
-    std::size_t column = label.size();
-    out << label;
-    for (bool first = true; words >> word; first = false) {
-        if (!first && column + 1 + word.size() > width) {
-            out << '\n' << std::string(label.size(), ' ');
-            column = label.size();
-        } else if (!first) {
-            out << ' ';
-            ++column;
-        }
-        out << word;
-        column += word.size();
-    }
-    out << '\n';
-}
 
 const char* outcomeName(Outcome outcome)
 {
@@ -438,38 +395,50 @@ OperatorView operatorView(const Run& run)
     return view;
 }
 
+std::string problemText(const Run& run, const Problem& problem)
+{
+    return headingOf(run, problem) + "\n  Why:     \t" + causeOf(run, problem) + "\n  Do now:  \t" +
+           remedyOf(run, problem) + '\n';
+}
+
 void printRun(const Run& run, const std::string& source, std::ostream& out)
 {
     const OperatorView view = operatorView(run);
-    out << "Run " << run.number << " of " << source << ", lines " << run.firstLine << " to " << run.lastLine << "\n\n";
+    std::ostringstream text;
+    text << "Run " << run.number << " of " << source << ", lines " << run.firstLine << " to " << run.lastLine << "\n\n";
     if (!run.steps.empty()) {
-        out << "Began:    " << dateText(run.begin) << (run.version.empty() ? "" : ", updater ") << run.version
-            << ", took " << durationText(run.elapsed)
-            << (run.clockJumps > 0 ? " (without what the clock was set by)\n" : "\n");
+        text << "Began:    \t" << dateText(run.begin) << (run.version.empty() ? "" : ", updater ") << run.version
+             << ", took " << durationText(run.elapsed)
+             << (run.clockJumps > 0 ? " (without what the clock was set by)\n" : "\n");
     }
-    out << "Outcome:  " << view.meaning << '\n';
-    out << "Operator: " << view.seen << '\n';
-    out << "Package:  " << packageText(run) << '\n';
-    out << "Board:    " << boardText(run) << '\n';
+    text << "Outcome:  \t" << view.meaning << "\nOperator: \t" << view.seen << "\nPackage:  \t" << packageText(run)
+         << "\nBoard:    \t" << boardText(run) << '\n';
     if (!run.steps.empty()) {
-        printSteps(run, out);
+        text << "\nStart     Took          Step                              Result\n" << std::left;
     }
-    if (run.failure) {
-        printProblem(run, *run.failure, out);
+    for (const Step& step : run.steps) {
+        text << clockText(step.start) << "  " << std::setw(14) << (step.took ? durationText(*step.took) : "") << '\t'
+             << std::setw(34) << factsOf(step.kind).title << resultText(run, step) << '\n';
     }
-    for (const Problem& problem : run.besides) {
-        printProblem(run, problem, out);
-    }
-    if (run.service.lines.count > 0) {
-        out << "\nThe service manager said:\n";
-        printLines(run.service.lines, out);
-    }
-    if (!run.gaps.empty()) {
-        out << "\nThis log cannot show:\n";
-        for (const std::string& text : gapTexts(run)) {
-            printWrapped("  - ", text, out);
+    const auto tell = [&](const Problem& problem) {
+        const Step* step = run.stepOf(problem);
+        text << '\n' << problemText(run, problem);
+        if (step != nullptr && step->said.count > 0) {
+            text << "  The tools said:\n" << quoted(step->said);
         }
+    };
+    if (run.failure) {
+        tell(*run.failure);
     }
+    std::for_each(run.besides.begin(), run.besides.end(), tell);
+    if (run.service.lines.count > 0) {
+        text << "\nThe service manager said:\n" << quoted(run.service.lines);
+    }
+    text << (run.gaps.empty() ? "" : "\nThis log cannot show:\n");
+    for (const std::string& gap : gapTexts(run)) {
+        text << "  - \t" << gap << '\n';
+    }
+    printText(text.str(), out);
 }
 
 std::string statusText(const CommandStatus& status)

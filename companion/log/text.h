@@ -26,9 +26,6 @@ OperatorView operatorView(const Run& run);
 /// @param source  where the log came from
 void printRun(const Run& run, const std::string& source, std::ostream& out);
 
-/// Prints `text` after `label`, its further lines indented as deep.
-void printWrapped(const std::string& label, const std::string& text, std::ostream& out);
-
 /// Name of an outcome for programs, such as "no-update"; "none" when a log does not reach it.
 const char* outcomeName(Outcome outcome);
 
@@ -74,6 +71,9 @@ std::string boardText(const Run& run);
 
 /// "Failed: Refresh the package mirrors (line 23) [mirrors-unreachable]".
 std::string headingOf(const Run& run, const Problem& problem);
+
+/// A problem's heading, cause and remedy for printText().
+std::string problemText(const Run& run, const Problem& problem);
 
 std::string causeOf(const Run& run, const Problem& problem);
 std::string remedyOf(const Run& run, const Problem& problem);

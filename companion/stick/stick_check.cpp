@@ -373,21 +373,23 @@ int runStick(const std::string& path, bool json, std::ostream& out, std::ostream
 {
     const StickFolder stick(path);
     if (stick.error() != 0) {
-        if (json) {
-            out << refusal("stick", std::string("the stick cannot be read: ") + std::strerror(stick.error())).dump(2)
-                << '\n';
-        }
-        errors << "harl-updater-tool: " << shown(path) << " cannot be read: " << std::strerror(stick.error()) << ". "
-               << (stick.error() == EACCES ? "Run this check as root.\n"
-                                           : "Name the folder that the stick is mounted at, the one that holds "
-                                             "\"debs\".\n");
-        return Report::STATUS_UNCHECKED;
+        return refuseStick("stick", path, stick.error(), json, out, errors);
     }
     Report report("stick", "The stick at " + shown(path));
     checkStick(stick, isUnitMountPoint(path), report);
     checkSignature(path, keyring, report);
     report.write(json, out);
     return report.status();
+}
+
+Report::Status refuseStick(const char* command, const std::string& path, int error, bool json, std::ostream& out,
+                           std::ostream& errors)
+{
+    return refuse(command, json,
+                  shown(path) + " cannot be read: " + std::strerror(error) + ". " +
+                      (error == EACCES ? "Run this check as root."
+                                       : "Name the folder that the stick is mounted at, the one that holds \"debs\"."),
+                  out, errors);
 }
 
 void checkStick(const StickFolder& stick, bool onUnit, Report& report)

@@ -24,6 +24,10 @@ inline constexpr char unfinishedPrefix[] = ".unfinished-"; ///< of the version f
 int runStick(const std::string& path, bool json, std::ostream& out, std::ostream& errors,
              const std::string& keyring = "");
 
+/// Says that there is no stick to read at `path` because of `error`, an errno: refuse() for `command`.
+Report::Status refuseStick(const char* command, const std::string& path, int error, bool json, std::ostream& out,
+                           std::ostream& errors);
+
 /// The check itself: adds to `report` what it finds.
 ///
 /// @param onUnit  the stick is where the unit mounts it

@@ -124,3 +124,24 @@ TEST(Counted, NounFollowsTheNumber)
     EXPECT_EQ(counted(2, "entry", "entries"), "2 entries");
     EXPECT_EQ(counted(1'234, "byte"), "1,234 bytes");
 }
+
+TEST(PrintText, LinesBreakAtBlanksBelowTheirTab)
+{
+    const auto printed = [](const std::string& text) {
+        std::ostringstream out;
+        printText(text, out);
+        return out.str();
+    };
+    const std::string words(45, 'a');
+    const std::string path = '/' + std::string(150, 'p');
+    EXPECT_EQ(printed("Fix:  \tone  two\n\nthree"), "Fix:  one  two\n\nthree");
+    EXPECT_EQ(printed("Fix: \t" + words + ' ' + words + "  b\n"), "Fix: " + words + ' ' + words + "  b\n");
+    EXPECT_EQ(printed("Fix: \t" + words + ' ' + words + "  bcde\n"), "Fix: " + words + ' ' + words + "\n     bcde\n");
+    EXPECT_EQ(printed(words + ' ' + path + " c\n"), words + '\n' + path + "\nc\n");
+    const std::string wide = "\xe6\x9d\xbf";  // two columns
+    const std::string combined = "e\xcc\x81"; // one
+    EXPECT_EQ(printed(words + ' ' + words + ' ' + wide + wide + wide + wide + " b"),
+              words + ' ' + words + ' ' + wide + wide + wide + wide + "\nb");
+    EXPECT_EQ(printed(words + ' ' + words + ' ' + combined + combined + combined + combined + " bcd"),
+              words + ' ' + words + ' ' + combined + combined + combined + combined + " bcd");
+}

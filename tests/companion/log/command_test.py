@@ -249,6 +249,44 @@ class Unit(Base):
         self.assertTrue(done.stdout.decode().splitlines()[-1].startswith("Ended at "), done.stdout)
 
 
+class Width(Base):
+    """Lines are as long as the terminal is wide, and 100 columns at most where there is none."""
+
+    def lines(self, *arguments: str, columns: int = 0) -> list[str]:
+        master, slave = pty.openpty()
+        fcntl.ioctl(slave, termios.TIOCSWINSZ, struct.pack("HHHH", 24, columns, 0, 0))
+        text = b""
+        with (self.folder / "output").open("wb+") as output:
+            with subprocess.Popen([TOOL, *arguments], stdout=slave if columns else output, cwd=GOLDEN) as tool:
+                os.close(slave)
+                while columns and (some := self.read(master)):
+                    text += some
+                tool.wait()
+            os.close(master)
+            output.seek(0)
+            return (text or output.read()).decode().splitlines()
+
+    def read(self, terminal: int) -> bytes:
+        """What comes; nothing at the end, which a terminal tells by an error."""
+        try:
+            return os.read(terminal, 65536)
+        except OSError:
+            return b""
+
+    def test_every_command_wraps(self) -> None:
+        (self.folder / "debs").mkdir()
+        commands = [("explain",), ("log", "board-upload-fails.log"), ("verify",)]
+        commands += [(name, str(self.folder)) for name in ("stick", "check")]
+        for command in commands:
+            for columns in (0, 60, 140):
+                with self.subTest(command, columns=columns):
+                    lines = self.lines(*command, columns=columns)
+                    self.assertTrue(lines)
+                    for line in lines:
+                        longest_word = max(len(word) for word in line.split() or [""])
+                        self.assertLessEqual(len(line), max(columns or 100, longest_word + 15), line)
+
+
 class Follow(Base):
     """A run that goes on."""
 
@@ -403,9 +441,10 @@ class Page(Base):
 
     def test_lanes_are_there(self) -> None:
         text = self.page("package-and-board.log")
-        lanes = ["Time", "Main thread", "Update thread", "Commands", "Waits", "Flashing thread", "LED pattern", "Sound"]
+        lanes = ["Time", "Main thread", "Update thread", "Commands and waits", "Flashing thread", "LED pattern", "Sound"]
         for lane in lanes:
-            self.assertIn(f">{lane}</div>", text)
+            self.assertIn(f"<th>{lane}</th>", text)
+        self.assertNotIn("Main thread", self.page("main-head-all.log"))
         self.assertIn("wait 780 s", text)
 
     def test_attempts_that_came_out_alike_are_one_line(self) -> None:

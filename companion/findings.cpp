@@ -85,6 +85,29 @@ std::size_t widthOf(const std::ostream& out)
     return known ? window.ws_col : 100;
 }
 
+void printLine(std::string_view line, std::size_t width, std::ostream& out)
+{
+    const std::size_t tab = line.find('\t');
+    const std::string_view label = line.substr(0, tab == std::string_view::npos ? 0 : tab);
+    const std::string_view rest = line.substr(tab + 1); // all of it without a tab
+    out << label;
+    if (line.size() <= width) { // no character has more columns than bytes
+        out << rest;
+        return;
+    }
+    const std::size_t begin = columnsOf(label); // of what goes on in a further line
+    std::size_t column = begin;
+    for (std::string_view words = rest; !words.empty();) {
+        const std::size_t blanks = std::min(words.find_first_not_of(' '), words.size());
+        const std::string_view word = words.substr(blanks, words.find(' ', blanks) - blanks);
+        const std::size_t columns = columnsOf(word);
+        const bool breaks = column > begin && column + blanks + columns > width;
+        out << (breaks ? '\n' + std::string(begin, ' ') : std::string(blanks, ' ')) << word;
+        column = (breaks ? begin : column + blanks) + columns;
+        words.remove_prefix(blanks + word.size());
+    }
+}
+
 std::string withSeparators(std::uint64_t number)
 {
     std::string digits = std::to_string(number);
@@ -226,28 +249,11 @@ Report::Status refuse(const std::string& command, bool json, const std::string& 
 void printText(std::string_view text, std::ostream& out)
 {
     const std::size_t width = widthOf(out);
-    std::size_t column = 0;
-    std::size_t begin = 0; // column of what goes on in a further line
     while (!text.empty()) {
-        if (text.front() == '\n' || text.front() == '\t') {
-            begin = text.front() == '\t' ? column : 0;
-            out << (text.front() == '\n' ? "\n" : "");
-            column = begin;
-            text.remove_prefix(1);
-            continue;
-        }
-        const std::size_t blanks = std::min(text.find_first_not_of(' '), text.size());
-        const std::size_t end = std::min(text.find_first_of(" \t\n", blanks), text.size());
-        const std::string_view word = text.substr(blanks, end - blanks);
-        const std::size_t columns = columnsOf(word);
-        if (column > begin && column + blanks + columns > width) {
-            out << '\n' << std::string(begin, ' ') << word;
-            column = begin + columns;
-        } else {
-            out << text.substr(0, end);
-            column += blanks + columns;
-        }
-        text.remove_prefix(end);
+        const std::size_t length = std::min(text.find('\n'), text.size());
+        printLine(text.substr(0, length), width, out);
+        out << (length < text.size() ? "\n" : "");
+        text.remove_prefix(std::min(length + 1, text.size()));
     }
 }
 

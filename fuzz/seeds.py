@@ -106,7 +106,7 @@ def main() -> None:
         folder.mkdir(parents=True, exist_ok=True)
         for name in scenario.names():
             (folder / name).write_bytes(seed(scenario.load(name).setup).encode())
-    for target, seeds in {"archive": archive_seeds(), "log": log_seeds()}.items():
+    for target, seeds in {"archive": archive_seeds(), "dress": log_seeds(), "log": log_seeds()}.items():
         folder = Path(sys.argv[1]) / target
         folder.mkdir(parents=True, exist_ok=True)
         for name, content in seeds.items():

@@ -10,6 +10,7 @@ namespace
 {
 
 const std::string_view binaryMessage = "MESSAGE";          // in a line of its own: its bytes follow
+const std::size_t enoughOfALine = 300;                     // bytes, to find out the format
 const std::size_t enoughToJudge = std::size_t{128} * 1024; // bytes, to find out the order of the lines
 
 /// Counts the records that say something.
@@ -73,14 +74,31 @@ std::string valueOf(const nlohmann::json& entry, const char* name)
 void Dress::feed(std::string_view block)
 {
     mBytes += block.size();
-    if (mFormat == Format::UNKNOWN) {
-        const std::string_view start = block.substr(0, 300);
-        const bool json = startsWith(start, "{") || startsWith(start, "data: {") || startsWith(start, "\x1e");
-        mFormat = startsWith(start, "__CURSOR=")                                            ? Format::FIELDS
-                  : json                                                                    ? Format::JSON
-                  : start.substr(0, start.find('\n')).find("[s=") != std::string_view::npos ? Format::VERBOSE
-                                                                                            : Format::PLAIN;
+    std::string start;
+    if (mFormat == Format::UNKNOWN) { // what the first line tells
+        mPartial.append(block);
+        if (mPartial.size() < enoughOfALine && mPartial.find('\n') == std::string::npos) {
+            return;
+        }
+        block = start = findFormat();
     }
+    take(block);
+}
+
+/// Finds the format out. Returns what was taken of the log so far.
+std::string Dress::findFormat()
+{
+    const std::string_view line = std::string_view(mPartial).substr(0, std::min(mPartial.find('\n'), enoughOfALine));
+    const bool json = startsWith(line, "{") || startsWith(line, "data: {") || startsWith(line, "\x1e");
+    mFormat = startsWith(line, "__CURSOR=")                ? Format::FIELDS
+              : json                                       ? Format::JSON
+              : line.find("[s=") != std::string_view::npos ? Format::VERBOSE
+                                                           : Format::PLAIN;
+    return std::exchange(mPartial, "");
+}
+
+void Dress::take(std::string_view block)
+{
     if (mFormat == Format::PLAIN) {
         hand(block);
         return;
@@ -105,6 +123,9 @@ void Dress::feed(std::string_view block)
 
 void Dress::finish()
 {
+    if (mFormat == Format::UNKNOWN) {
+        take(findFormat());
+    }
     if (mFormat != Format::PLAIN) {
         takeEntryLine(mPartial);
         endEntry();

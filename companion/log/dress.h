@@ -32,6 +32,8 @@ public:
 private:
     enum class Format { UNKNOWN, PLAIN, FIELDS, VERBOSE, JSON };
 
+    std::string findFormat();
+    void take(std::string_view block);
     void takeEntryLine(std::string_view line);
     void takeBinary(std::string_view& block);
     void takeField(std::string_view field);

@@ -61,7 +61,7 @@ bool nextDependsOnCheck(const Run& run)
 
 } // namespace
 
-void ExpectedTimes::learn(const Run& run)
+void Follower::runComplete(const Run& run)
 {
     for (const Step& step : run.steps) {
         if (step.took) {
@@ -70,7 +70,8 @@ void ExpectedTimes::learn(const Run& run)
     }
 }
 
-std::optional<std::int64_t> ExpectedTimes::of(StepKind kind) const
+/// How long a step takes: the updater's own wait, else as long as it took last time in the same log (s).
+std::optional<std::int64_t> Follower::expected(StepKind kind) const
 {
     const std::int64_t wait = factsOf(kind).wait;
     return wait > 0 ? wait : mLast.at(static_cast<std::size_t>(kind));
@@ -118,10 +119,10 @@ std::vector<StepKind> stepsToCome(const Run& run)
 std::int64_t Follower::remaining(const Run& run, std::int64_t now) const
 {
     const Step& step = run.steps.back();
-    const std::int64_t rest = step.took ? 0 : mExpected.of(step.kind).value_or(0) - (now - step.start);
+    const std::int64_t rest = step.took ? 0 : expected(step.kind).value_or(0) - (now - step.start);
     std::int64_t sum = std::max<std::int64_t>(rest, 0);
     for (const StepKind kind : stepsToCome(run)) {
-        sum += mExpected.of(kind).value_or(0);
+        sum += expected(kind).value_or(0);
     }
     return sum;
 }
@@ -162,14 +163,14 @@ void Follower::showChange(const Run* run, std::int64_t now)
         nlohmann::ordered_json object = {{"state", state}, {"time", isoText(now)}};
         if (known) {
             const Step& step = run->steps.back();
-            const std::optional<std::int64_t> expected = mExpected.of(step.kind);
+            const std::optional<std::int64_t> length = expected(step.kind);
             const std::vector<StepKind> next = stepsToCome(*run);
             object["run"] = run->number;
             object["step"] = factsOf(step.kind).name;
             object["title"] = factsOf(step.kind).title;
             object["since"] = isoText(step.start);
             object["elapsed_s"] = step.took.value_or(std::max<std::int64_t>(now - step.start, 0));
-            object["expected_s"] = expected ? nlohmann::ordered_json(*expected) : nlohmann::ordered_json();
+            object["expected_s"] = length ? nlohmann::ordered_json(*length) : nlohmann::ordered_json();
             object["result"] = step.took ? resultText(*run, step) : "";
             object["failed_attempts"] = step.failedAttempts;
             object["remaining_s"] = over || overdue ? 0 : remaining(*run, now);
@@ -213,8 +214,8 @@ std::string Follower::changeText(const Run& run, bool over, bool overdue, std::i
     std::string text = clockText(step.start) + "  " + factsOf(step.kind).title + attemptText(step);
     if (step.took) {
         text += ": " + resultText(run, step);
-    } else if (const std::optional<std::int64_t> expected = mExpected.of(step.kind)) {
-        text += ", " + durationText(*expected) + " expected";
+    } else if (const std::optional<std::int64_t> length = expected(step.kind)) {
+        text += ", " + durationText(*length) + " expected";
     }
     if (overdue) {
         return text + "; no record for " + durationText(now - run.end) +
@@ -232,12 +233,12 @@ void Follower::showBar(const Run& run, std::int64_t now)
 {
     const Step& step = run.steps.back();
     const std::int64_t elapsed = now - step.start;
-    const std::optional<std::int64_t> expected = mExpected.of(step.kind);
+    const std::optional<std::int64_t> length = expected(step.kind);
     mOut << "\r\x1b[K  ";
-    if (expected) {
-        mOut << barText(elapsed, *expected) << ' ';
+    if (length) {
+        mOut << barText(elapsed, *length) << ' ';
     }
-    mOut << elapsedText(elapsed, expected);
+    mOut << elapsedText(elapsed, length);
     mBar = true;
 }
 

@@ -9,19 +9,6 @@
 #include <string>
 #include <vector>
 
-/// How long each step takes: the updater's own waits, else as long as it took last time in the same log.
-class ExpectedTimes
-{
-public:
-    void learn(const Run& run);
-
-    /// In seconds; empty when nothing is known.
-    std::optional<std::int64_t> of(StepKind kind) const;
-
-private:
-    std::array<std::optional<std::int64_t>, stepKinds> mLast;
-};
-
 /// The steps that come after the one that goes on. While versions are compared: also the installation that comes if
 /// they differ.
 std::vector<StepKind> stepsToCome(const Run& run);
@@ -33,8 +20,8 @@ class Follower
 public:
     Follower(bool json, bool terminal, std::ostream& out) : mJson(json), mTerminal(terminal), mOut(out) {}
 
-    /// A run has come to its end in the log.
-    void runComplete(const Run& run) { mExpected.learn(run); }
+    /// A run has come to its end in the log: its steps tell how long they take.
+    void runComplete(const Run& run);
 
     /// Shows what has changed since the last call, and how the step gets on.
     ///
@@ -46,6 +33,7 @@ public:
     bool ended() const { return mEnded; }
 
 private:
+    std::optional<std::int64_t> expected(StepKind kind) const;
     void showChange(const Run* run, std::int64_t now);
     std::string changeText(const Run& run, bool over, bool overdue, std::int64_t now) const;
     void showBar(const Run& run, std::int64_t now);
@@ -54,9 +42,9 @@ private:
     bool mJson;
     bool mTerminal;
     std::ostream& mOut;
-    ExpectedTimes mExpected;
-    std::string mShown;                        // what a change is told by
-    std::optional<std::uint64_t> mFirstNumber; // of the run at the first call of show()
+    std::array<std::optional<std::int64_t>, stepKinds> mLast; // how long each step took (s)
+    std::string mShown;                                       // what a change is told by
+    std::optional<std::uint64_t> mFirstNumber;                // of the run at the first call of show()
     bool mRunning = false;
     bool mEnded = false;
     bool mBar = false; // a bar stands on the last line

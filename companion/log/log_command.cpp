@@ -176,25 +176,20 @@ bool openUnnamed(std::fstream& file)
     return file.is_open();
 }
 
-/// Puts `content` in the place of the file at `path` in one step. What is wrong, in words; empty for nothing.
-std::string replaceFile(const std::string& path, std::fstream& content)
+/// Writes `content` into the file at `path`. What is wrong, in words; empty for nothing.
+std::string writeFile(const std::string& path, std::fstream& content)
 {
-    const HeldSignals signals; // until the file has its name
-    std::string partPath = path + ".XXXXXX";
-    const Descriptor part(mkstemp(partPath.data()));
-    if (!part) {
+    const HeldSignals signals; // until all of it is there
+    std::ofstream file(path, std::ios::binary);
+    if (!file) {
         return std::strerror(errno);
     }
-    const mode_t withheld = umask(0);
-    umask(withheld);
-    fchmod(part.number(), 0666 & ~withheld);
-    std::ofstream file(partPath, std::ios::binary);
     content.seekg(0);
     file << content.rdbuf();
     file.close();
-    if (!content || !file || std::rename(partPath.c_str(), path.c_str()) != 0) {
+    if (!content || !file) {
         std::string wrong = std::strerror(errno);
-        std::remove(partPath.c_str());
+        std::remove(path.c_str());
         return wrong;
     }
     return "";
@@ -295,7 +290,7 @@ public:
         mPrinter.finish(mLines, mBytes, error.empty() ? mStatus : LOG_UNREADABLE, error);
         if (error.empty() && mPage) {
             mPage->finish();
-            error = pageError(replaceFile(mOptions.htmlFile, mPageText));
+            error = pageError(writeFile(mOptions.htmlFile, mPageText));
         }
         if (!error.empty()) {
             mErrors << "harl-updater-tool: " << error << '\n';

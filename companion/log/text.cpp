@@ -342,6 +342,10 @@ OperatorView operatorView(const Run& run)
     if (run.service.has(ServiceEvent::UNIT_NOT_WELL) && !isFailure(run.outcome)) {
         view.meaning += ", but " + run.service.unit;
     }
+    if (const Step* marker = run.find(StepKind::CHECK_TEAMVIEWER);
+        marker != nullptr && marker->result == StepResult::FAILED && run.outcome == Outcome::CHECK_FAILED) {
+        view.meaning = "FAILED: the TeamViewer marker could not be looked for";
+    }
     const bool over = run.isDecided() || run.ended == RunEnd::BY_SERVICE_MANAGER;
     if (run.outcome == Outcome::NONE && over) {
         view.meaning = "not in this log: the records of its outcome are missing";

@@ -190,11 +190,13 @@ class BadInput(Base):
 
     def test_page_replaces_no_other_file(self) -> None:
         page, part = self.folder / "page.html", self.folder / "page.html.part"
-        page.write_text("old")
         part.write_text("mine")
         self.assertEqual(run_tool("up-to-date.log", "--html", str(page), umask=0o027).returncode, 0)
         self.assertTrue(page.read_text().startswith("<!DOCTYPE html>"))
         self.assertEqual(page.stat().st_mode & 0o777, 0o640)
+        page.write_text("old" * 100_000)
+        self.assertEqual(run_tool("up-to-date.log", "--html", str(page)).returncode, 0)
+        self.assertTrue(page.read_text().endswith("</html>\n"))
         self.assertEqual(part.read_text(), "mine")
         self.assertEqual({file.name for file in self.folder.iterdir()}, {page.name, part.name})
 
@@ -441,7 +443,8 @@ class Page(Base):
 
     def test_lanes_are_there(self) -> None:
         text = self.page("package-and-board.log")
-        lanes = ["Time", "Main thread", "Update thread", "Commands and waits", "Flashing thread", "LED pattern", "Sound"]
+        lanes = ["Time", "Main thread", "Update thread", "Commands and waits", "Flashing thread", "LED pattern",
+                 "Sound"]
         for lane in lanes:
             self.assertIn(f"<th>{lane}</th>", text)
         self.assertNotIn("Main thread", self.page("main-head-all.log"))

@@ -48,6 +48,7 @@ class RealUnit:
         if no_systemd:
             self.name = f"real tools, but a stand-in for systemd: {no_systemd}"
         self.log_is_exact = bool(no_systemd)
+        self.errors = "errors"  # file beside the log that gets the standard error; without systemd "log" is possible
         self._has_systemd = not no_systemd
         self._setup = scenario.setup
         self._folder = folder
@@ -151,6 +152,7 @@ class RealUnit:
         values = variables(self._setup) | {
             "BENCH_COMMAND": command,
             "BENCH_CONTROL_GROUP": str(self._control_group or ""),
+            "BENCH_ERRORS": self.errors,
             "BENCH_MIRROR_PORT": str(MIRROR_PORT),
             "BENCH_PACKAGE": head_package(self._setup),
             "BENCH_PYTHON": sys.executable,

@@ -109,9 +109,10 @@ start_events() {
 # Runs the updater to its end, in a session of its own as a service is.
 run_updater() {
     echo active >"$head/run/harl"
+    : >"$folder/out/log"
     start_events
-    # shellcheck disable=SC2086 # several words, intended
-    setsid chroot "$head" $BENCH_COMMAND <"$head/opt/bench/input" >"$folder/out/log" 2>"$folder/out/errors" &
+    # shellcheck disable=SC2086 # words by intention
+    setsid chroot "$head" $BENCH_COMMAND <"$head/opt/bench/input" >>"$folder/out/log" 2>>"$folder/out/$BENCH_ERRORS" &
     updater=$!
     echo $updater >"$head/run/unit.pid"
     echo >"$folder/out/started"

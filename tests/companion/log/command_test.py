@@ -85,6 +85,39 @@ class Outcomes(Base):
         self.assertEqual(run_tool(text=both[1] + both[0]).returncode, 1)
 
 
+class Blindness(Base):
+    """The panel passes over units that are not well: the log says so of each."""
+
+    def test_log_names_what_the_panel_passes_over(self) -> None:
+        record = b"verify: the unit is not well: package-version\n"  # by the service, of each such unit
+        passed, named, left_open = 0, 0, []
+        for name in scenario.names():
+            what = scenario.load(name)
+            setup, expect = what.setup, what.expect
+            if setup.updater.program != "remote" or "pass" not in expect.panel.values():
+                continue
+            passed += 1
+            on_stick = min(setup.stick.directories, default="")[5:]
+            if (expect.package, expect.board, expect.harl) == (setup.package.offered, on_stick, "active"):
+                continue
+            with self.subTest(name):
+                log = (GOLDEN / f"{name}.log").read_bytes()
+                done = run_tool("--json", "--strict", text=log)
+                [run] = json.loads(done.stdout)["runs"]
+                if run["failure"] or run["besides"]:
+                    named += 1
+                    self.assertEqual(done.returncode, 1)
+                else:  # the updater was told that a command which was killed had done its work
+                    left_open.append(name)
+                    self.assertTrue([text for text in run["cannot_tell"] if "really installed" in text])
+                done = run_tool("--json", text=log + record)
+                self.assertEqual(done.returncode, 1)
+                self.assertIn("not well: package-version", json.loads(done.stdout)["runs"][0]["meaning"])
+        print(f"the panel passes in {passed} scenarios, in {named + len(left_open)} of them over a unit that is not "
+              f"well: the log names what is wrong in {named}; left open: {left_open}, by the verification's record")
+        self.assertEqual(left_open, ["apt-killed"])
+
+
 class Pieces(Base):
     """Logs of which next to nothing is left."""
 

@@ -65,7 +65,7 @@ void appendEscaped(std::string& text, char32_t character, std::string_view bytes
 std::size_t columnsOf(std::string_view text)
 {
     std::size_t columns = 0;
-    for (auto next = text.begin(); next != text.end();) {
+    for (const auto* next = text.begin(); next != text.end();) {
         const char32_t character = utf8::unchecked::next(next);
         const bool wide =
             (character >= 0x1100 && character <= 0x115F) || (character >= 0x2E80 && character <= 0xA4CF) ||

@@ -206,7 +206,7 @@ void LogParser::finish()
 void LogParser::takeLine(std::string_view line)
 {
     ++mLines;
-    line = plain(withoutLineEnd(line), mPlain);
+    line = withoutLineEnd(plain(line, mPlain)); // ssh(1) has a carriage return in front of a colour's end
 
     std::size_t position = startsWith(line, mark) ? 0 : line.find(mark);
     if (position == std::string_view::npos) {

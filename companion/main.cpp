@@ -62,11 +62,19 @@ std::string usageText(const CLI::App& app, const CLI::ParseError& error)
                (rest.front().rfind('-', 0) == 0 ? " is not an option of " : " is one argument too many for ") +
                parsed.front()->get_name() + '.';
     }
-    const std::string text = error.what(); // "--html: 1 required PAGE missing", "FILE is required"
+    // "--html: 1 required PAGE missing", "FILE is required", "--oldest requires --sign", "--run: Number less ..."
+    const std::string text = error.what();
     const std::string option = text.substr(0, text.find_first_of(": "));
-    return option == "FILE"     ? "Name the FILE to make."
-           : option == "--html" ? "Name the PAGE to write behind --html."
-                                : option + " needs a number from 1 on.";
+    const std::size_t value = text.find("required ");
+    if (text.find(" is required") != std::string::npos) {
+        return option + " is missing.";
+    }
+    if (text.find(" requires ") != std::string::npos) {
+        return text + '.';
+    }
+    return value == std::string::npos
+               ? option + " needs a number from 1 on."
+               : "Name " + text.substr(value + 9, text.rfind(' ') - value - 9) + " behind " + option + '.';
 }
 
 /// Reports a wrong command line.

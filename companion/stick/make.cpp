@@ -171,18 +171,13 @@ void checkSources(const MakeOptions& options, Report& report)
         version.find_first_not_of(' ') == std::string::npos || version.size() > 200) {
         fail(version, "cannot be in the name of a folder on a stick.");
     }
-    std::ifstream archive = openSource(options.archive);
+    openSource(options.archive);
     const std::uint64_t size = fs::file_size(options.archive);
     if (size == 0 || size > largestOnFat) {
         fail(options.archive, size == 0 ? "is empty." : "is larger than a file on a stick can be, 4 GiB.");
     }
-    const auto read = [&](std::uint64_t offset, char* buffer, std::size_t length) {
-        archive.clear();
-        archive.seekg(static_cast<std::streamoff>(offset));
-        archive.read(buffer, static_cast<std::streamsize>(length));
-        return static_cast<std::size_t>(archive.gcount());
-    };
-    checkArchive({size, read}, shown(options.archive), report);
+    const Descriptor archive(open(options.archive.c_str(), O_RDONLY | O_CLOEXEC));
+    checkArchive(archive.number(), size, shown(options.archive), report);
     std::ifstream script = openSource(options.script);
     checkScript(nextBlock(script, options.script), fs::file_size(options.script), shown(options.script), report);
 }
@@ -299,7 +294,6 @@ int makeStick(const MakeOptions& options, std::ostream& out, std::ostream& error
             << escaped(options.target) << '\n';
         return report.status();
     } catch (const std::exception& error) {
-        errors << "harl-updater-tool: the stick is not made: " << error.what() << '\n';
-        return Report::STATUS_UNCHECKED;
+        return refuse("stick", false, std::string("the stick is not made: ") + error.what(), out, errors);
     }
 }

@@ -74,9 +74,9 @@ TEST_F(ToolProgram, UnknownSubcommandIsNamed)
 {
     EXPECT_THAT(tool({"stik"}).errors, HasSubstr("harl-updater-tool: stik is not a command. Did you mean stick?"));
     EXPECT_THAT(tool({"nonsense"}).errors, HasSubstr("harl-updater-tool: nonsense is not a command. See: "));
-    EXPECT_THAT(tool({"log", "--html"}).errors, HasSubstr("harl-updater-tool: Name the PAGE to write behind --html."));
+    EXPECT_THAT(tool({"log", "--html"}).errors, HasSubstr("harl-updater-tool: Name PAGE behind --html."));
     EXPECT_THAT(tool({"log", "--run", "0"}).errors, HasSubstr("harl-updater-tool: --run needs a number from 1 on."));
-    EXPECT_THAT(tool({"report"}).errors, HasSubstr("harl-updater-tool: Name the FILE to make."));
+    EXPECT_THAT(tool({"report"}).errors, HasSubstr("harl-updater-tool: FILE is missing."));
     EXPECT_THAT(tool({}).errors, HasSubstr("Name a command: stick, unit, check, verify, log, explain or report."));
 }
 

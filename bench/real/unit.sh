@@ -111,7 +111,7 @@ run_updater() {
     echo active >"$head/run/harl"
     : >"$folder/out/log"
     start_events
-    # shellcheck disable=SC2086 # words by intention
+    # shellcheck disable=SC2086 # several words, intended
     setsid chroot "$head" $BENCH_COMMAND <"$head/opt/bench/input" >>"$folder/out/log" 2>>"$folder/out/$BENCH_ERRORS" &
     updater=$!
     echo $updater >"$head/run/unit.pid"

@@ -36,6 +36,7 @@ std::vector<std::string> ownEnvironment()
 bool runHere(std::vector<std::string> arguments)
 {
     std::vector<char*> pointers;
+    pointers.reserve(arguments.size() + 1);
     for (std::string& argument : arguments) {
         pointers.push_back(argument.data());
     }

@@ -136,8 +136,8 @@ void checkSignature(const std::string& stick, const std::string& keyring, Report
         report.add(isFile ? "stick-signature.file" : "stick-signature", {{"complaint", escaped(line)}});
     }
     if (result.succeeded() && isSigned) {
-        const std::string version = fieldOf(stick, "Version");
-        report.addFact("signature", "Signature", "good, of " + escaped(fieldOf(stick, "Date")), escaped(version));
+        const std::string date = escaped(fieldOf(stick, "Date"));
+        report.addFact("signature", "Signature", "good, of " + date, date);
     }
 }
 

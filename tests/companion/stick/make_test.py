@@ -83,6 +83,10 @@ class Make(Stick):
         self.assertTrue(os.access(self.stick / VERSIONS / "quorb2.2.0/unzipUpgrade.sh", os.X_OK))
         self.check()
 
+    def test_wrong_command_line(self) -> None:
+        self.assertIn("TARGET is missing.", self.run_tool([self.program, "stick", "make"], 2))
+        self.assertIn("--oldest", self.make("--oldest", "2.0.0", status=2))
+
     def test_teamviewer_is_a_plain_file(self) -> None:
         self.assertIn("requested", self.make("--teamviewer"))
         self.assertTrue((self.stick / "debs/installTV").is_file())

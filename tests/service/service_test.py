@@ -368,6 +368,8 @@ class Sticks(ServiceTest):
     """With the maker's keyring on the unit, only a stick signed by the maker is used."""
 
     def setUp(self) -> None:
+        if not self.tool.exists():
+            self.skipTest("harl-updater-tool, which signs, is not built")
         super().setUp()
         holder = tempfile.TemporaryDirectory(prefix="maker-")
         self.addCleanup(holder.cleanup)

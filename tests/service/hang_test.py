@@ -66,7 +66,8 @@ class HangTest(ServiceTest):
         super().setUp()
         self.restore_tools()
         self.set_speed(SPEED)
-        self.inside("sh", "-c", "echo 2.1.0 >/srv/board; cp /opt/hand-over-short /usr/lib/harl-updater/hand-over")
+        self.use_hand_over("hand-over-short")
+        self.inside("sh", "-c", "echo 2.1.0 >/srv/board")
         self.offer()
 
     def tearDown(self) -> None:
@@ -153,7 +154,7 @@ class ShippedLimits(HangTest):
 
     def setUp(self) -> None:
         super().setUp()
-        self.inside("cp", "/opt/hand-over", "/usr/lib/harl-updater/hand-over")
+        self.use_hand_over("hand-over")
 
 
 def add_cases(tests: type[HangTest], commands: Iterable[str]) -> None:

@@ -177,6 +177,10 @@ class ServiceTest(unittest.TestCase):
         write(folder / "test.conf", text)
         self.inside("systemctl", "daemon-reload")
 
+    def use_hand_over(self, name: str) -> None:
+        """Puts one of the hand-overs in the place of the one that is there, which may still be running."""
+        self.inside("cp", "--remove-destination", f"/opt/{name}", "/usr/lib/harl-updater/hand-over")
+
     def offer(self, script: str = "", depends: str = "") -> None:
         """Offers solvik4-rh 1.3.0, with a maintainer script of these lines, besides the repository's packages."""
         fields = {"Depends": depends} if depends else {}
@@ -459,9 +463,8 @@ class Sticks(ServiceTest):
     def test_verification_that_never_ends(self) -> None:
         self.sign()
         self.install_keyring()
-        hand_over = "/usr/lib/harl-updater/hand-over"
-        self.inside("cp", "/opt/hand-over-short", hand_over)
-        self.addCleanup(self.inside, "cp", "/opt/hand-over", hand_over)
+        self.use_hand_over("hand-over-short")
+        self.addCleanup(self.use_hand_over, "hand-over")
         gpgv = self.unit.root() / "usr/local/sbin/gpgv"
         write_script(gpgv, "sleep infinity")
         self.addCleanup(gpgv.unlink)

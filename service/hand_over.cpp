@@ -606,16 +606,22 @@ int play(char** arguments)
     return call("aplay", arguments);
 }
 
-/// Writes the journal of the run to the disk before the application starts.
+/// Before the application starts, writes the journal of the run to the disk. journalctl makes journald take in what is
+/// on its way; but the next record can cancel what journald of systemd 252 then writes, so the file system is told too.
 int controlServices(int count, char** arguments)
 {
     if (std::getenv("RUNTIME_DIRECTORY") != nullptr && equal(arguments[count - 1], "harl") &&
         equal(arguments[count - 2], "start")) {
-        char tool[] = "journalctl";
-        char option[] = "--sync";
-        char* sync[] = {tool, option, nullptr};
+        char journalctl[] = "journalctl";
+        char takeIn[] = "--sync";
+        char* first[] = {journalctl, takeIn, nullptr};
+        char sync[] = "sync";
+        char fileSystem[] = "--file-system";
+        char folder[] = "/var/log/journal"; // not there when the journal is in memory only
+        char* second[] = {sync, fileSystem, folder, nullptr};
         const int nothing = open("/dev/null", O_WRONLY | O_CLOEXEC);
-        call(tool, sync, {nothing, nothing});
+        call(journalctl, first, {nothing, nothing});
+        call(sync, second, {nothing, nothing});
     }
     return call("systemctl", arguments);
 }

@@ -33,6 +33,7 @@ inline constexpr Limit limits[] = {
     {"repair", "apt-get", nullptr, 600, 720, true, false},
     {"verification", "verify-stick", nullptr, 300, 300, false, false},
     {"journal", "journalctl", nullptr, 5, 20, false, false},
+    {"journal", "sync", nullptr, 5, 20, false, false},
     {"other", nullptr, nullptr, 300, 300, false, false},
 };
 /// From SIGTERM to SIGKILL, and from there until what does not die is left running.

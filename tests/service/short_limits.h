@@ -17,6 +17,7 @@ inline constexpr Limit limits[] = {
     {"repair", "apt-get", nullptr, 15, 20, true, false},
     {"verification", "verify-stick", nullptr, 5, 5, false, false},
     {"journal", "journalctl", nullptr, 2, 6, false, false},
+    {"journal", "sync", nullptr, 2, 6, false, false},
     {"other", nullptr, nullptr, 3, 3, false, false},
 };
 // clang-format on

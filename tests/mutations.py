@@ -1,13 +1,17 @@
-"""Usage: tests/mutation [--sample NUMBER [--seed NUMBER]] [--since COMMIT] [--jobs NUMBER]
+"""Usage: tests/mutation [--sample NUMBER] [--seed NUMBER] [--since COMMIT] [--jobs NUMBER] [PATH...]
 
-Makes single-line changes of the product, builds each and runs the tests on it. All this happens in a copy of the tree
-in a temporary folder: the tests are built there once, and for each change only the files that it affects.
+Makes single-line changes of the product, builds each and runs the tests that concern it. All this happens in copies of
+the checkout in build/mutation, one for each job, which stay for the next time.
 """
 
 import argparse
 import collections
 import concurrent.futures
+import contextlib
+import fcntl
+import itertools
 import os
+import queue
 import random
 import re
 import shutil
@@ -15,7 +19,6 @@ import signal
 import subprocess
 import sys
 import tempfile
-import threading
 import time
 from collections.abc import Iterator
 from dataclasses import dataclass
@@ -23,30 +26,14 @@ from pathlib import Path
 
 ROOT = Path(__file__).parent.parent
 ACCEPTED = ROOT / "tests/mutation.accepted"
-LIBRARY = [
-    "common/src/Log.cpp",
-    "common/src/UpdateManager.cpp",
-    "remote/LedManager.cpp",
-    "remote/RemoteUpdateManager.cpp",
-    "remote/SoundManager.cpp",
+BUILD = "build/default"
+CONFIGURE = [
+    *("cmake", "--preset", "default", "-DCMAKE_CXX_FLAGS_RELEASE=-O0", "-DCMAKE_CXX_FLAGS=-Werror=return-type"),
+    *("-DCMAKE_COMPILE_WARNING_AS_ERROR=OFF", "-DCMAKE_GTEST_DISCOVER_TESTS_DISCOVERY_MODE=PRE_TEST"),
 ]
-MAIN = "remote/main.cpp"
-HEADERS = [
-    "common/src/Log.h",
-    "common/src/Sleep.h",
-    "common/src/UpdateManager.h",
-    "remote/LedManager.h",
-    "remote/RemoteUpdateManager.h",
-    "remote/SoundManager.h",
-]
-SOURCES = [*HEADERS, *LIBRARY, MAIN]
-TESTS = ["unit-tests", "process-tests"]
-SCENARIOS = ["package-and-board", "not-a-service", "up-to-date", "i2cset-missing", "sound-absent"]
-EXPLORED = "--gtest_filter=*/NothingToUpdate:Flashing.*"  # the two explorations that represent the others
-FLAGS = ["-std=c++17", "-O0", "-Werror=return-type", "-pthread"]
-CONFIGURE = ["cmake", "--preset", "default", "-DCMAKE_CXX_FLAGS_RELEASE=-O0"]
-BUILD_LIMIT = 120  # s
-TEST_LIMIT = 120  # s
+BUILD_LIMIT = 300  # s
+SINCE_LIMIT = 90  # s, for the changes of --since
+SKIPPED = 77  # cmake/python_test.cmake
 
 
 @dataclass(frozen=True)
@@ -63,9 +50,115 @@ class Mutation:
         return f"{self.file}: {self.before}{self.place} -> {self.after}"
 
 
+@dataclass
+class Check:
+    """A command in the checkout's folder, which must succeed once the targets are built."""
+
+    name: str
+    command: str
+    targets: str
+    limit: float | None = None  # s; None: the machine cannot run it
+
+
+@dataclass(frozen=True)
+class Part:
+    """Files that the same tests concern, the quickest first."""
+
+    files: list[str]
+    checks: list[Check]
+
+
+def gtest(program: str, only: str = "*", folder: str = ".") -> Check:
+    name = Path(program).name
+    command = f"env --chdir={folder} $PWD/{BUILD}/tests/{program} --gtest_fail_fast --gtest_filter={only}"
+    return Check(name, command, name)
+
+
+def python(module: str, arguments: str = "", targets: str = "") -> Check:
+    return Check(module.split(".")[-1], f"python3 -B -m {module} {arguments}", targets)
+
+
+def at_once(module: str, arguments: str = "", targets: str = "", only: str = "") -> Check:
+    check = python(module, arguments, targets)
+    check.command = f"python3 -B -m tests.at_once --only '{only}' {module} {arguments}"
+    return check
+
+
+SCENARIOS = ["package-and-board", "not-a-service", "up-to-date", "i2cset-missing", "sound-absent"]
+TOOL = f"{BUILD}/companion/harl-updater-tool"
+GOLDEN_LOGS = "tests/companion/golden/log"
+LARGE = "Stick.FourGigabytesOfNothingAreRefusedAtOnce"
+PARTS = [
+    Part(
+        [
+            *("common/src/Log.h", "common/src/Sleep.h", "common/src/UpdateManager.h", "remote/LedManager.h"),
+            *("remote/RemoteUpdateManager.h", "remote/SoundManager.h", "common/src/Log.cpp"),
+            *("common/src/UpdateManager.cpp", "remote/LedManager.cpp", "remote/RemoteUpdateManager.cpp"),
+            *("remote/SoundManager.cpp", "remote/main.cpp"),
+        ],
+        [
+            gtest("unit-tests"),
+            gtest("process-tests"),
+            *(
+                python("tests.program.program_test", f"{scenario} {BUILD}", "harl-updater call_recorder")
+                for scenario in SCENARIOS
+            ),
+            gtest("schedules/schedules", "*/NothingToUpdate:Flashing.*"),  # they represent the others
+        ],
+    ),
+    Part(
+        ["service/hand_over.cpp", "service/limits.h"],
+        [
+            at_once(
+                "tests.service.hand_over_test",
+                f"{BUILD}/service/hand-over {BUILD}/tests/service/hand-over-short",
+                "hand-over hand-over-short",
+            )
+        ],
+    ),
+    Part(["service/give-back"], [at_once("tests.service.give_back_test")]),
+    Part(["service/prepare"], [at_once("tests.service.prepare_test")]),
+    Part(
+        ["service/verify-stick"],
+        [at_once("tests.companion.stick.make_test", TOOL, "harl-updater-tool", only="Signed")],
+    ),
+    Part(
+        ["companion/log/run.cpp", "companion/log/catalogue.cpp"],
+        [
+            gtest("companion/log-tests", "-Each/Knowledge.*", GOLDEN_LOGS),
+            at_once("tests.companion.log.command_test", TOOL, "harl-updater-tool"),
+            gtest("companion/log-tests", "Each/Knowledge.*", GOLDEN_LOGS),
+        ],
+    ),
+    Part(
+        ["companion/stick/stick_check.cpp", "companion/stick/archive.cpp", "companion/stick/signature.cpp"],
+        [
+            gtest("companion/stick-tests", f"-{LARGE}"),
+            at_once("tests.companion.stick.make_test", TOOL, "harl-updater-tool"),
+            gtest("companion/stick-tests", LARGE),
+        ],
+    ),
+    Part(
+        [
+            *("companion/check/check.cpp", "companion/unit/unit_check.cpp", "companion/unit/packages.cpp"),
+            "companion/unit/selftest.cpp",
+        ],
+        [
+            gtest("companion/unit-check-tests"),
+            gtest("companion/tool-tests"),
+            python(
+                "tests.companion.make_golden_checks",
+                f"--compare {BUILD}",
+                "harl-updater-tool unit-on-standin call_recorder harl-updater",
+            ),
+        ],
+    ),
+]
+
+
 # What can be changed
 
-SWAPS = {
+CPP_SWAPS = {
     "==": "!=",
     "!=": "==",
     "<=": "<",
@@ -84,37 +177,97 @@ SWAPS = {
     "join()": "detach()",
     "notify_one()": "notify_all()",
 }
-TEXT = re.compile(r'R"\(.*?\)"|"(?:[^"\\]|\\.)*"')
+SHELL_SWAPS = {
+    " = ": " != ",
+    " != ": " = ",
+    "&&": "||",
+    "||": "&&",
+    " -lt ": " -le ",
+    " -ge ": " -gt ",
+    " -n ": " -z ",
+    " -z ": " -n ",
+    " + ": " - ",
+    "if ": "if ! ",
+    "while ": "until ",
+    "until ": "while ",
+    "break": ":",
+}
 NUMBER = re.compile(r"(?<![\w.\"'])(?:0x[0-9A-Fa-f]+|\d+)(?![\w.\"'])")
-DECLARATION = re.compile(r"(static )?(const )?(std::)?(string|bool|int|int32_t|Color|Led) \w+( = [\w.-]+)?;")
-STATEMENT = re.compile(r"^(?!using|return;|break;|#|//|static_assert|friend|public|private|[}\]]).*;(\s*//.*)?$")
 
 
-def code_of(line: str) -> str:
+@dataclass(frozen=True)
+class Language:
+    """How the lines of a file are read."""
+
+    swaps: dict[str, str]
+    text: re.Pattern[str]
+    comment: re.Pattern[str]
+    passed_over: tuple[str, ...]
+    statement: re.Pattern[str]
+    declaration: re.Pattern[str]  # the order of two of them says nothing
+    before_statement: str  # one of these ends the line before
+    nothing: str  # in the place of a statement
+
+
+CPP = Language(
+    CPP_SWAPS,
+    re.compile(r'R"\(.*?\)"|"(?:[^"\\]|\\.)*"'),
+    re.compile("//.*"),
+    ("//", "#", "namespace", "using", "__attribute__"),
+    re.compile(r"(?!using|return;|break;|#|//|static_assert|friend|public|private|[}\]]).*;(\s*//.*)?"),
+    re.compile(r"(static )?(const )?(std::)?(string|bool|int|int32_t|Color|Led) \w+( = [\w.-]+)?;"),
+    r"[;{}:]",
+    "",
+)
+SHELL = Language(
+    SHELL_SWAPS,
+    re.compile(r"\"(?:[^\"\\]|\\.)*\"|'[^']*'"),
+    re.compile(r"(^|\s)#.*"),
+    ("#",),
+    re.compile(
+        r"(?!(if|elif|else|fi|for|while|until|do|done|case|esac|then|return|break|export)\b"
+        r"|[{}()]|[^\s(]*\)(\s|$)|\w+\(\))"
+        r".*(?<![|&\\({;])(?<!; do)(?<!; then)"
+    ),
+    re.compile(r"\w+=[\w./'-]*"),
+    r"[^|&\\]",
+    ":",
+)
+
+
+def language_of(file: str) -> Language:
+    return CPP if Path(file).suffix in (".cpp", ".h") else SHELL
+
+
+def code_of(line: str, language: Language) -> str:
     """The line with the insides of its texts and its comment blanked, so that columns stay."""
-    code = TEXT.sub(lambda match: '"' + " " * (len(match[0]) - 2) + '"', line)
-    comment = code.find("//")
-    return code if comment < 0 else code[:comment] + " " * (len(code) - comment)
+    code = language.text.sub(lambda match: match[0][0] + " " * (len(match[0]) - 2) + match[0][-1], line)
+    return language.comment.sub(lambda match: " " * len(match[0]), code)
 
 
-def changed_lines(line: str, dice: random.Random) -> Iterator[str]:
-    code = code_of(line)
-    for old, new in SWAPS.items():
-        for match in re.finditer(re.escape(old), code):
+def successor(number: str) -> str:
+    """The next number; in C++ one that begins with 0 is octal."""
+    return f"0{int(number, 8) + 1:o}" if re.fullmatch("0[0-7]+", number) else str(int(number, 0) + 1)
+
+
+def changed_lines(line: str, language: Language, dice: random.Random) -> Iterator[str]:
+    code = code_of(line, language)
+    for old, new in language.swaps.items():
+        for match in re.finditer((r"\b" if old[0].isalpha() else "") + re.escape(old), code):
             word = old.isalpha() and re.search(r"\w", code[match.end() : match.end() + 1])
             if not word:
                 yield line[: match.start()] + new + line[match.end() :]
-    for match in re.finditer(r"!(?!=)", code):
+    for match in re.finditer(r"!(?!=) ?", code):
         yield line[: match.start()] + line[match.end() :]
     for match in re.finditer(r"\bif \((.*)\) \{", code):
         yield line[: match.start(1)] + "!(" + line[match.start(1) : match.end(1)] + ")" + line[match.end(1) :]
     for match in NUMBER.finditer(code):
-        yield line[: match.start()] + str(int(match[0], 0) + 1) + line[match.end() :]
+        yield line[: match.start()] + successor(match[0]) + line[match.end() :]
     if not code.startswith("#"):
-        for match in TEXT.finditer(line):
+        for match in language.text.finditer(line):
             inside = range(match.start() + (3 if match[0][0] == "R" else 1), match.end() - 1)
             letters = [place for place in inside if line[place].isalnum() and line[place - 1] not in "\\%0"]
-            if letters:
+            if letters and code[match.start()] != " ":  # not in a comment
                 place = dice.choice(letters)
                 yield line[:place] + ("x" if line[place] != "x" else "y") + line[place + 1 :]
 
@@ -123,35 +276,37 @@ def balanced(code: str) -> bool:
     return all(code.count(left) == code.count(right) for left, right in (("(", ")"), ("{", "}"), ("[", "]")))
 
 
-def is_statement(lines: list[str], index: int) -> bool:
+def is_statement(lines: list[str], index: int, language: Language) -> bool:
     """A whole statement on one line: the one before has ended."""
-    code = code_of(lines[index].strip())
-    before = next((code_of(line).strip() for line in reversed(lines[:index]) if code_of(line).strip()), "")
-    return bool(STATEMENT.match(code.strip())) and balanced(code) and (before == "" or before[-1] in ";{}:")
+    code = code_of(lines[index], language).strip()
+    above = (code_of(line, language).strip() for line in reversed(lines[:index]))
+    before = next((line for line in above if line), "")
+    ended = before == "" or re.fullmatch(language.before_statement, before[-1]) is not None
+    return bool(code) and language.statement.fullmatch(code) is not None and balanced(code) and ended
 
 
 def mutations_of(file: str) -> Iterator[Mutation]:
     dice = random.Random(file)
-    lines = (ROOT / file).read_text().splitlines()
-    stripped = [line.strip() for line in lines]
-    for index, line in enumerate(stripped):
-        if not line or line.startswith(("//", "#", "namespace", "using")):
+    language = language_of(file)
+    lines = [line.strip() for line in (ROOT / file).read_text().splitlines()]
+    for index, line in enumerate(lines):
+        if not line or line.startswith(language.passed_over):
             continue
-        place = f" [{stripped[: index + 1].count(line)}]" if stripped.count(line) > 1 else ""
-        for after in changed_lines(line, dice):
+        place = f" [{lines[: index + 1].count(line)}]" if lines.count(line) > 1 else ""
+        for after in changed_lines(line, language, dice):
             yield Mutation(file, index + 1, line, after.strip(), place)
-        if not is_statement(lines, index):
+        if not is_statement(lines, index, language):
             continue
-        yield Mutation(file, index + 1, line, "", place)
-        if index + 1 < len(lines) and is_statement(lines, index + 1):
-            below = stripped[index + 1]
-            plain = DECLARATION.match(line) and DECLARATION.match(below)  # their order says nothing
+        yield Mutation(file, index + 1, line, language.nothing, place)
+        if index + 1 < len(lines) and is_statement(lines, index + 1, language):
+            below = lines[index + 1]
+            plain = language.declaration.match(line) and language.declaration.match(below)
             if below != line and not plain:
                 yield Mutation(file, index + 1, f"{line} {below}", f"{below} {line}", place)
 
 
-def apply(mutation: Mutation) -> str:
-    lines = (ROOT / mutation.file).read_text().splitlines()
+def apply(mutation: Mutation, original: str) -> str:
+    lines = original.splitlines()
     if mutation.before != lines[mutation.line - 1].strip():
         lines[mutation.line - 1 : mutation.line + 1] = reversed(lines[mutation.line - 1 : mutation.line + 1])
     else:
@@ -159,12 +314,12 @@ def apply(mutation: Mutation) -> str:
     return "\n".join(lines) + "\n"
 
 
-def lines_since(commit: str) -> set[tuple[str, int]]:
-    """Lines of the sources added or changed since this branch left that of `commit`."""
+def lines_since(commit: str, files: list[str]) -> set[tuple[str, int]]:
+    """Lines of the files added or changed since this branch left that of `commit`."""
     base = subprocess.run(["git", "merge-base", commit, "HEAD"], cwd=ROOT, capture_output=True, text=True)
     if base.returncode != 0:
         sys.exit(f"tests/mutation: {commit}: no commit to compare with: {base.stderr.strip()}")
-    command = ["git", "diff", "--unified=0", base.stdout.strip(), "--", *SOURCES]
+    command = ["git", "diff", "--unified=0", base.stdout.strip(), "--", *files]
     changed = set()
     file = ""
     for line in subprocess.run(command, cwd=ROOT, check=True, capture_output=True, text=True).stdout.splitlines():
@@ -179,136 +334,105 @@ def lines_since(commit: str) -> set[tuple[str, int]]:
 # Building and running
 
 
-class Trial:
-    """The copy of the tree, with its tests built."""
+def namespace() -> list[str]:
+    """The words before a command that end all of its processes with it; none where the machine does not allow that."""
+    words = ["unshare", "--mount", "--pid", "--fork", "--kill-child", "--mount-proc"]
+    words += [] if os.geteuid() == 0 else ["--map-root-user"]
+    return words if subprocess.run([*words, "true"], capture_output=True).returncode == 0 else []
 
-    def __init__(self, folder: Path) -> None:
-        self.tree = folder / "tree"
-        self.scratch = folder / "changes"
-        self.scratch.mkdir()
+
+class Tree:
+    """A copy of the checkout, with its build."""
+
+    def __init__(self, parts: list[Part]) -> None:
+        trees = ROOT / "build/mutation"
+        trees.mkdir(parents=True, exist_ok=True)
+        for number in itertools.count():
+            self.lock = (trees / f"{number}.lock").open("w")
+            with contextlib.suppress(BlockingIOError):  # another run's
+                fcntl.flock(self.lock, fcntl.LOCK_EX | fcntl.LOCK_NB)
+                break
+        self.folder = trees / str(number)
+        self.namespace = namespace()
         list_files = ["git", "ls-files", "-z", "--cached", "--others", "--exclude-standard"]
         files = subprocess.run(list_files, cwd=ROOT, check=True, capture_output=True, text=True).stdout.split("\0")
-        for file in filter(None, files):
-            if (ROOT / file).exists():
-                (self.tree / file).parent.mkdir(parents=True, exist_ok=True)
-                shutil.copy2(ROOT / file, self.tree / file, follow_symlinks=False)
-        self.build = self.tree / "build/default"
-        targets = [*TESTS, "harl-updater", "schedules"]
-        self.rebuilt_tree = folder / "rebuilt"
-        self.rebuilding = threading.Lock()
-        self.run_quietly(CONFIGURE, self.tree)
-        build = ["cmake", "--build", "--preset", "default", "--target", *targets, "call_recorder"]
-        self.run_quietly(build, self.tree)
-        self.links = {target: self.link_command(target) for target in targets}
+        for name in filter(None, files):
+            source, copy = ROOT / name, self.folder / name
+            same = copy.exists() and copy.read_bytes() == source.read_bytes()
+            if source.exists() and not same:
+                copy.parent.mkdir(parents=True, exist_ok=True)
+                shutil.copy(source, copy)
+        configured = (self.folder / BUILD / "build.ninja").exists()
+        if not configured:
+            self.demand(CONFIGURE)
+        targets = {target for part in parts for check in part.checks for target in check.targets.split()}
+        if targets:
+            self.demand(["ninja", "-C", BUILD, *sorted(targets)])
 
-    def run_quietly(self, command: list[str], tree: Path) -> None:
-        done = subprocess.run(command, cwd=tree, capture_output=True, text=True)
+    def demand(self, command: list[str]) -> None:
+        done = subprocess.run(command, cwd=self.folder, capture_output=True, text=True)
         if done.returncode != 0:
-            sys.exit(f"{' '.join(command)} failed in the copy of the tree:\n{done.stdout}{done.stderr}")
+            sys.exit(f"{' '.join(command)} failed in {self.folder}:\n{done.stdout}{done.stderr}")
 
-    def link_command(self, target: str) -> list[str]:
-        """The words of the command that links `target`, without its output and the product's own objects."""
-        show = ["ninja", "-t", "commands", target]
-        commands = subprocess.run(show, cwd=self.build, check=True, capture_output=True, text=True).stdout
-        words = commands.splitlines()[-1].split()
-        words = words[words.index("&&") + 1 :]
-        words = words[: words.index("&&")]
-        del words[words.index("-o") : words.index("-o") + 2]
-        return words
+    def measure(self, part: Part) -> None:
+        """Runs the tests of a part without a change, which must pass."""
+        for check in part.checks:
+            begin = time.monotonic()
+            status = self.status(check, BUILD_LIMIT)
+            if status == 0:
+                check.limit = 10 + 5 * (time.monotonic() - begin)
+            elif status == SKIPPED:
+                print(f"left out, as this machine cannot run it: {check.command}")
+            else:
+                sys.exit(f"tests/mutation: ends with status {status} without any change: {check.command}")
 
-    def compile(self, source: str, folder: Path, mutation: Mutation) -> Path | None:
-        """Compiles a file of the product with the change; the compiler finds the changed file before the original."""
-        result = folder / (Path(source).stem + ".o")
-        path = folder / Path(source).name
-        if source != mutation.file:
-            shutil.copy(self.tree / source, path)
-        command = ["g++-11", *FLAGS, f"-I{folder}", f"-I{self.tree / 'common/src'}", f"-I{self.tree / 'remote'}"]
-        done = subprocess.run([*command, "-c", str(path), "-o", str(result)], capture_output=True, timeout=BUILD_LIMIT)
-        return result if done.returncode == 0 else None
-
-    def link(self, target: str, objects: list[Path], folder: Path) -> Path | None:
-        replaced = tuple(f"/{each.stem}.cpp.o" for each in objects)
-        words = [word for word in self.links[target] if not word.endswith(replaced)]
-        program = folder / target
-        command = [words[0], *map(str, objects), *words[1:], "-o", str(program)]
-        done = subprocess.run(command, cwd=self.build, capture_output=True, timeout=BUILD_LIMIT)
-        return program if done.returncode == 0 else None
-
-    def verdict(self, mutation: Mutation) -> str:
-        """What detected the change: a test program, "compiler", or "" for nothing."""
-        with tempfile.TemporaryDirectory(dir=self.scratch) as name:
-            folder = Path(name)
-            (folder / Path(mutation.file).name).write_text(apply(mutation))
-            header = mutation.file in HEADERS
-            sources = [*LIBRARY, MAIN] if header else [mutation.file]
-            objects = [self.compile(source, folder, mutation) for source in sources]
-            if None in objects:
+    def verdict(self, mutation: Mutation, part: Part) -> str:
+        """What detected the change: a check, "compiler", or "" for nothing."""
+        path = self.folder / mutation.file
+        original = path.read_text()
+        path.write_text(apply(mutation, original))
+        try:
+            shell = language_of(mutation.file) is SHELL
+            if shell and subprocess.run(["dash", "-n", path], capture_output=True).returncode != 0:
                 return "compiler"
-            built = [each for each in objects if each]
-            library = [each for each in built if each.stem != "main"]
-            for target in TESTS if library else []:
-                program = self.link(target, library, folder)
-                if program is None:
-                    return "compiler"
-                if not self.passes([str(program), "--gtest_fail_fast"], folder):
-                    return target
-            program = self.link("harl-updater", built, folder)
-            if program is None:
-                return "compiler"
-            if not self.program_passes(program, folder):
-                return "harl-updater"
-            if header:
-                return self.verdict_of_rebuilt_tests(mutation)
-            program = self.link("schedules", library, folder) if library else None
-            return "schedules" if program and not self.passes([str(program), EXPLORED], folder) else ""
-
-    def verdict_of_rebuilt_tests(self, mutation: Mutation) -> str:
-        """The verdict when the tests, too, are built with a changed header, as those of a release are."""
-        tree = self.rebuilt_tree
-        with self.rebuilding:
-            if not tree.exists():
-                built = str(self.tree)
-                shutil.copytree(built, tree, ignore=lambda name, _: ["build"] if name == built else [], symlinks=True)
-                self.run_quietly(CONFIGURE, tree)
-            (tree / mutation.file).write_text(apply(mutation))
-            try:
-                for target in TESTS:
-                    command = ["cmake", "--build", "--preset", "default", "--target", target]
-                    if subprocess.run(command, cwd=tree, capture_output=True).returncode != 0:
+            for check in part.checks:
+                if check.targets:
+                    # Else some changed sources would let CMake configure anew.
+                    os.utime(self.folder / BUILD / "build.ninja")
+                    build = ["ninja", "-C", BUILD, *check.targets.split()]
+                    if subprocess.run(build, cwd=self.folder, capture_output=True, timeout=BUILD_LIMIT).returncode:
                         return "compiler"
-                    if not self.passes([str(tree / "build/default/tests" / target), "--gtest_fail_fast"], tree):
-                        return target
-            finally:
-                shutil.copy(self.tree / mutation.file, tree / mutation.file)
-                os.utime(tree / mutation.file)
+                if check.limit is not None and self.status(check, check.limit) != 0:
+                    return check.name
+        finally:
+            path.write_text(original)
         return ""
 
-    def passes(self, command: list[str], folder: Path) -> bool:
+    def status(self, check: Check, limit: float) -> int | None:
+        """The status of a check; None when it did not end in time. All of its processes end with it."""
         nothing = subprocess.DEVNULL
-        test = subprocess.Popen(
-            command, cwd=folder, stdin=nothing, stdout=nothing, stderr=nothing, start_new_session=True
-        )
-        try:
-            return test.wait(TEST_LIMIT) == 0
-        except subprocess.TimeoutExpired:
-            os.killpg(test.pid, signal.SIGKILL)  # with what it started
-            test.wait()
-            return False
-
-    def program_passes(self, program: Path, folder: Path) -> bool:
-        """The program tests, which look for the updater and the recorder in one build folder."""
-        build = folder / "program"
-        (build / "bench").mkdir(parents=True)
-        (build / "harl-updater").symlink_to(program)
-        (build / "bench/call_recorder.so").symlink_to(self.build / "bench/call_recorder.so")
-        command = [str(self.tree / "scripts/python"), "-m", "tests.program.program_test"]
-        return all(self.passes([*command, scenario, str(build)], self.tree) for scenario in SCENARIOS)
+        with tempfile.TemporaryDirectory(prefix="mutation-", ignore_cleanup_errors=True) as scratch:
+            test = subprocess.Popen(
+                [*self.namespace, "sh", "-c", f"{check.command}; exit $?"],
+                cwd=self.folder,
+                env=os.environ | {"PYTHONPATH": str(self.folder), "TMPDIR": scratch},
+                stdin=nothing,
+                stdout=nothing,
+                stderr=nothing,
+                start_new_session=True,
+            )
+            try:
+                return test.wait(limit)
+            except subprocess.TimeoutExpired:
+                return None
+            finally:
+                with contextlib.suppress(ProcessLookupError):
+                    os.killpg(test.pid, signal.SIGKILL)
+                test.wait()
 
 
 def accepted() -> dict[str, str]:
     """The survivors without a visible effect: the key of each, and why."""
-    if not ACCEPTED.exists():
-        return {}
     entries = [line.rsplit(" # ", 1) for line in ACCEPTED.read_text().splitlines() if line and line[0] != "#"]
     return {key: reason for key, reason in entries}
 
@@ -319,34 +443,61 @@ def main() -> int:
     parser.add_argument("--seed", type=int, default=1)
     parser.add_argument("--since")
     parser.add_argument("--jobs", type=int, default=2)
+    parser.add_argument("paths", nargs="*", default=[""])
     arguments = parser.parse_args()
 
-    changes = [mutation for file in SOURCES for mutation in mutations_of(file)]
+    part_of = {file: part for part in PARTS for file in part.files}
+    files = [file for file in part_of if file.startswith(tuple(arguments.paths))]
+    changes = [mutation for file in files for mutation in mutations_of(file)]
     if arguments.since:
-        lines = lines_since(arguments.since)
+        lines = lines_since(arguments.since, files)
         changes = [change for change in changes if (change.file, change.line) in lines]
-    if arguments.sample and arguments.sample < len(changes):
-        changes = sorted(random.Random(arguments.seed).sample(changes, arguments.sample), key=lambda one: one.key())
     if not changes:
         print("no line to change")
         return 0
+    found = len(changes)
+    if arguments.since or arguments.sample:
+        random.Random(arguments.seed).shuffle(changes)
+        changes = changes[: arguments.sample]
 
     begin = time.monotonic()
+    parts = [part for part in PARTS if any(change.file in part.files for change in changes)]
+    trees: queue.Queue[Tree] = queue.Queue()
+    first = Tree(parts)
+    for part in parts:
+        first.measure(part)
+    trees.put(first)
+    for _ in range(1, arguments.jobs):
+        trees.put(Tree(parts))
+    end = time.monotonic() + SINCE_LIMIT if arguments.since else float("inf")
+
+    def verdict(change: Mutation) -> str | None:
+        if time.monotonic() > end:
+            return None
+        tree = trees.get()
+        try:
+            return tree.verdict(change, part_of[change.file])
+        finally:
+            trees.put(tree)
+
     noticed: collections.Counter[str] = collections.Counter()
     survivors = []
-    with tempfile.TemporaryDirectory(prefix="mutation-") as folder:
-        trial = Trial(Path(folder))
-        with concurrent.futures.ThreadPoolExecutor(arguments.jobs) as workers:
-            for change, by in zip(changes, workers.map(trial.verdict, changes), strict=True):
-                noticed[by] += 1
-                if not by:
-                    survivors.append(change)
-                    print(f"{change.file}:{change.line}: not noticed: {change.key()}", file=sys.stderr, flush=True)
-    built = len(changes) - noticed["compiler"]
+    with concurrent.futures.ThreadPoolExecutor(arguments.jobs) as workers:
+        for change, by in zip(changes, workers.map(verdict, changes), strict=True):
+            if by is None:
+                continue
+            noticed[by] += 1
+            if not by:
+                survivors.append(change)
+                print(f"{change.file}:{change.line}: not noticed: {change.key()}", file=sys.stderr, flush=True)
+    tried = noticed.total()
+    built = tried - noticed.pop("compiler", 0)
     known = accepted()
     unknown = [change for change in survivors if change.key() not in known]
-    print(f"{len(changes)} changes, {built} of them build; noticed: {built - len(survivors)}", end="")
-    print("".join(f", {by} {noticed[by]}" for by in (*TESTS, "harl-updater", "schedules")), end="")
+    if tried < found:
+        print(f"of {found} changes only {tried}, chosen with seed {arguments.seed}")
+    print(f"{tried} changes, {built} of them build; noticed: {built - noticed.pop('', 0)}", end="")
+    print("".join(f", {by} {number}" for by, number in noticed.most_common()), end="")
     print(f"; accepted: {len(survivors) - len(unknown)}; {time.monotonic() - begin:.0f} s")
     for change in unknown:
         print(f"{change.file}:{change.line}: not noticed: {change.key()}")

@@ -3,21 +3,16 @@
 import re
 import shutil
 import subprocess
-import tempfile
 import time
 import unittest
 from pathlib import Path
 
-from bench.makers.files import write_script
 from bench.outcomes import CHECK_FAILED, ENDED_EARLY, UP_TO_DATE, UPDATED
 from bench.panel import COLOR_CODES, LED_CODES, Panel
 from tests.command_line import skip
-
-ROOT = Path(__file__).parents[2]
-
+from tests.service.stand_in import ROOT, StandInTest
 
 NAMESPACES = ["unshare", "--map-root-user", "--mount", "--pid", "--fork", "--kill-child", "--mount-proc"]
-GIVE_BACK = ROOT / "service/give-back"
 START = "systemctl --no-block start harl"
 TOOLS = {
     "systemctl": """
@@ -36,11 +31,15 @@ exit "$I2CSET_STATUS"
 """,
     "umount": """
 echo "umount $*" >>"$UNIT/calls"
+: >"$RUNTIME_DIRECTORY/note"
 [ ! -e "$UNIT/busy" ] || { rm "$UNIT/busy"; exit 32; }
 [ -e "$UNIT/stuck" ] && [ "$1" != --lazy ] && exit "$UMOUNT_STATUS"
 : >"$UNIT/mounts"
 """,
-    "journalctl": 'echo "journalctl $1" >>"$UNIT/calls"',
+    "journalctl": """
+echo "journalctl $*" >>"$UNIT/calls"
+[ "$1" = --sync ] || cat "$UNIT/journal"
+""",
     "sleep": "exec /usr/bin/sleep 0.05",
 }
 MOUNT = "/dev/sda1 /root/USB_MOUNT vfat rw 0 0\n"
@@ -49,44 +48,28 @@ CHANGES = {
     r"'/harl-updater\(-give-back\)*\.service$'": "''",  # every process here is the updater's
     "/proc/self/mounts": '"$UNIT/mounts"',
     "outcome_time=30 ": "outcome_time=0 ",
+    "logs=/var/lib/harl-updater\n": 'logs="$UNIT/logs"\n',
+    "/var/log/journal/$(cat /etc/machine-id)/": "$UNIT/journals/",
 }
 
 
-class GiveBack(unittest.TestCase):
+class GiveBack(StandInTest):
     """A unit whose updater has just ended, with the stick still in use."""
 
+    program = "give-back"
+    tools = TOOLS
+    changes = CHANGES
+
     def setUp(self) -> None:
-        folder = tempfile.TemporaryDirectory(prefix="give-back-")
-        self.addCleanup(folder.cleanup)
-        self.unit = Path(folder.name)
-        (self.unit / "bin").mkdir()
-        (self.unit / "run").mkdir()
+        super().setUp()
         (self.unit / "mounts").write_text(MOUNT)
         (self.unit / "run/notes").write_text("1.00 prepared\n")
-        self.environment = {
-            "PATH": f"{self.unit}/bin:/usr/bin:/bin",
-            "UNIT": str(self.unit),
-            "ACTIVE": "deactivating",
-            "RESULT": "signal",
-            "I2CSET_STATUS": "0",
-            "UMOUNT_STATUS": "32",
-            "RUNTIME_DIRECTORY": str(self.unit / "run"),
-        }
-        for name, text in TOOLS.items():
-            write_script(self.unit / "bin" / name, text)
+        (self.unit / "journal").write_text("first\nlast\n")
+        (self.unit / "logs").mkdir()
+        self.environment |= {"ACTIVE": "deactivating", "RESULT": "signal", "I2CSET_STATUS": "0", "UMOUNT_STATUS": "32"}
         # Copies of sleep(1) under the names of the programs that the updater may leave running.
         for name in ("apt", "dpkg", "scp", "ssh"):
             shutil.copy("/usr/bin/sleep", self.unit / name)
-        shutil.copy(GIVE_BACK, self.unit / "give-back")
-        self.change(CHANGES)
-
-    def change(self, changes: dict[str, str]) -> None:
-        """Changes lines of the program."""
-        program = self.unit / "give-back"
-        for old, new in changes.items():
-            text = program.read_text()
-            self.assertIn(old, text)
-            program.write_text(text.replace(old, new))
 
     def note(self, *notes: str) -> None:
         """Writes the notes of the run, as if made just now."""
@@ -102,12 +85,6 @@ class GiveBack(unittest.TestCase):
         done = subprocess.run(command, env=self.environment, capture_output=True, text=True, check=False, timeout=60)
         self.assertEqual((done.stderr, done.returncode), ("", status))
         return done.stdout
-
-    def calls(self, *tools: str) -> list[str]:
-        """The calls of the named tools, or of all."""
-        path = self.unit / "calls"
-        lines = path.read_text().splitlines() if path.exists() else []
-        return [line for line in lines if not tools or line.split()[0] in tools]
 
     def panel(self) -> dict[str, str]:
         """The LEDs that are lit after the sent bytes, if they flashed blue before."""
@@ -269,6 +246,43 @@ class GiveBack(unittest.TestCase):
         (self.unit / "no-systemctl").unlink()
         self.give_back()
         self.assertEqual(self.calls("systemctl"), [START, START])
+
+    def test_its_tools_have_notes_of_their_own(self) -> None:
+        self.give_back()
+        self.assertTrue((self.unit / "run/give-back/note").exists())
+
+    def kept_logs(self, cursor: str | None = "") -> dict[str, str]:
+        """Runs it after a run that began behind `cursor`; returns the kept logs."""
+        if cursor is not None:
+            (self.unit / "run/cursor").write_text(cursor)
+        self.give_back()
+        return {path.name: path.read_text() for path in (self.unit / "logs").iterdir()}
+
+    def test_log_is_kept_where_a_power_cut_loses_the_journal(self) -> None:
+        for cursor, option in (("", ""), ("s=1;i=2\n", " --after-cursor=s=1;i=2")):
+            ((name, text),) = self.kept_logs(cursor).items()
+            self.assertRegex(name, r"^\d{4}(-\d\d){2}_\d\d(-\d\d){2}\.log$")
+            self.assertEqual(text, "first\nlast\n")
+            read = f"journalctl --quiet --identifier=harl-updater{option}"
+            self.assertEqual(self.calls()[-3:], [START, "journalctl --sync", read])
+            self.setUp()
+
+    def test_log_is_left_to_a_journal_on_the_disk(self) -> None:
+        (self.unit / "journals").mkdir()
+        (self.unit / "journals/system.journal").touch()
+        self.assertEqual(self.kept_logs(), {})
+
+    def test_without_a_beginning_no_log_is_kept(self) -> None:
+        self.assertEqual(self.kept_logs(cursor=None), {})
+
+    def test_only_the_last_logs_are_kept_and_of_each_only_its_end(self) -> None:
+        (self.unit / "journal").write_text("first\n" + "x" * 4_000_000)
+        old = [f"2026-01-{day:02}_00-00-00.log" for day in range(1, 13)]
+        for name in old:
+            (self.unit / "logs" / name).touch()
+        kept = self.kept_logs()
+        self.assertEqual(sorted(kept)[:-1], old[3:])
+        self.assertEqual(kept[max(kept)], "x" * 4_000_000)
 
 
 class Units(unittest.TestCase):

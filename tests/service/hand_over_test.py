@@ -28,6 +28,25 @@ SENT = 'echo "$*" >>"$FOLDER/sent"\n[ "$4" != "$REFUSED" ] || exit 1\n'
 OLD = ASKED + OLDER + SENT
 NEW = ASKED + NEWER + SENT
 
+# What hangs at each limit, in docs/reliability.md.
+DOCUMENTED = {
+    "panel": "every byte",
+    "sound": "the sound",
+    "stick": "reading the stick",
+    "detach": "detaching the stick",
+    "services": "`systemctl stop harl`",
+    "mirrors": "`apt update`",
+    "versions": "`apt-cache policy`",
+    "installation": "`apt install`, a maintainer script",
+    "board-version": "reading the board's version",
+    "upload": "the upload, one of its attempts or all",
+    "board-script": "the board's script",
+    "repair": "the same again before the next run",
+    "verification": "verifying a signed stick",
+    "journal": "writing the journal to the disk",
+    "other": "any other tool",
+}
+
 
 def running(marker: str) -> list[int]:
     """The processes whose environment has the marker, except those that have ended."""
@@ -383,6 +402,26 @@ class Table(unittest.TestCase):
         rows = [re.findall(row, (ROOT / path).read_text()) for path in tables]
         self.assertEqual(*rows)
         self.assertGreater(len(rows[0]), 10)
+
+    def test_documented_limits_are_those_of_the_table(self) -> None:
+        units = {"s": 1, "min": 60}
+        documented = {}
+        for line in (ROOT / "docs/reliability.md").read_text().splitlines():
+            if line.startswith("| ") and line.count(" | ") == 3:
+                row, bound = line.split(" | ")[:2]
+                amounts = re.findall(r"(\d+) (?:(s|min)\b|in all)", bound.removesuffix(" the usual 13 min"))
+                documented[row[2:]] = [int(amount) * units[unit or "min"] for amount, unit in amounts]
+        text = (ROOT / "service/limits.h").read_text()
+        limits = re.findall(r'^    \{"([\w-]+)", .*, (\d+), (\d+), \w+, \w+\}', text, re.MULTILINE)
+        for name, *seconds in limits:
+            with self.subTest(name=name):
+                expected = sorted({int(amount) for amount in seconds})
+                self.assertEqual(sorted(set(documented[DOCUMENTED[name]])), expected)
+        self.assertEqual({name for name, *_ in limits}, set(DOCUMENTED))
+        said = " ".join((ROOT / "docs/packaging.md").read_text().split())
+        times = re.findall(r"SIGKILL (\d+) seconds later|is cut (\d+) second after", said)
+        grace, silence = re.findall(r"constexpr double \w+ = (\d+);", text)
+        self.assertEqual(times, [(grace, ""), ("", silence)])
 
 
 class Panel(HandOverTest):

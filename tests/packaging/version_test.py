@@ -13,8 +13,29 @@ def find(path: str, pattern: str) -> str:
     return match[1] if match else f"none in {path}"
 
 
+def read_changelog(path: str, head: str, bullet: str) -> dict[str, list[str]]:
+    """The items of each version; `head` and `bullet` are the patterns of their first lines."""
+    versions: dict[str, list[str]] = {}
+    for line in (ROOT / path).read_text().splitlines():
+        if match := re.match(head, line):
+            items = versions.setdefault(match[1], [])
+        elif match := re.match(bullet, line):
+            items.append(match[1])
+        elif line.startswith("  "):
+            items[-1] += " " + line.strip()
+    return versions
+
+
 class Version(unittest.TestCase):
     """The banner is the reference for the others."""
+
+    def test_changelogs_agree(self) -> None:
+        whole = read_changelog("CHANGELOG.md", r"## (\S+)", r"- (.*)")
+        packages = read_changelog("debian/changelog", r"harl-updater \(([\d.]+)", r"  \* (.*)")
+        self.assertEqual(list(packages), list(whole))
+        for version, items in packages.items():
+            self.assertTrue(items)
+            self.assertEqual([item for item in items if item not in whole[version]], [])
 
     def test_all_follow_the_banner(self) -> None:
         banner = find("remote/main.cpp", r"TavrenUpdater version: ([\d.]+)")

@@ -28,7 +28,7 @@ ROOT = Path(__file__).parent.parent
 ACCEPTED = ROOT / "tests/mutation.accepted"
 BUILD = "build/default"
 CONFIGURE = [
-    *("cmake", "--preset", "default", "-DCMAKE_CXX_FLAGS_RELEASE=-O0", "-DCMAKE_CXX_FLAGS=-Werror=return-type"),
+    *("cmake", "--preset", "default", "-DCMAKE_CXX_FLAGS_RELEASE=-O1", "-DCMAKE_CXX_FLAGS=-Werror=return-type"),
     *("-DCMAKE_COMPILE_WARNING_AS_ERROR=OFF", "-DCMAKE_GTEST_DISCOVER_TESTS_DISCOVERY_MODE=PRE_TEST"),
 ]
 BUILD_LIMIT = 300  # s

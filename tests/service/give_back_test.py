@@ -3,9 +3,7 @@
 import re
 import shutil
 import subprocess
-import time
 import unittest
-from pathlib import Path
 
 from bench.outcomes import CHECK_FAILED, ENDED_EARLY, UP_TO_DATE, UPDATED
 from bench.panel import COLOR_CODES, LED_CODES, Panel
@@ -21,6 +19,7 @@ case $* in
 *--value*) echo "$ACTIVE" ;;
 show*) printf 'Result=%s\\nExecMainCode=2\\nExecMainStatus=15\\n' "$RESULT" ;;
 *) for tool in apt dpkg; do ! pgrep -x $tool >/dev/null || echo "beside $tool" >>"$UNIT/calls"; done
+   cp "$UNIT/uptime" "$UNIT/started"
    [ ! -e "$UNIT/no-systemctl" ] || exit 1 ;;
 esac
 """,
@@ -31,7 +30,7 @@ exit "$I2CSET_STATUS"
 """,
     "umount": """
 echo "umount $*" >>"$UNIT/calls"
-: >"$RUNTIME_DIRECTORY/note"
+{ : >"$RUNTIME_DIRECTORY/note"; } 2>/dev/null
 [ ! -e "$UNIT/busy" ] || { rm "$UNIT/busy"; exit 32; }
 [ -e "$UNIT/stuck" ] && [ "$1" != --lazy ] && exit "$UMOUNT_STATUS"
 : >"$UNIT/mounts"
@@ -40,14 +39,25 @@ echo "umount $*" >>"$UNIT/calls"
 echo "journalctl $*" >>"$UNIT/calls"
 [ "$1" = --sync ] || cat "$UNIT/journal"
 """,
-    "sleep": "exec /usr/bin/sleep 0.05",
+    # Only it lets time pass. At ENDS, what is at work ends, of a signal that the shell does not mention, and its last
+    # note is written.
+    "sleep": """
+read -r now _ <"$UNIT/uptime"
+now=$((${now%.*} + $1))
+echo "$now.00 0.00" >"$UNIT/uptime"
+[ "$now" = "$ENDS" ] || exit 0
+[ ! -e "$UNIT/late" ] || cat "$UNIT/late" >>"$UNIT/run/notes"
+while pkill -PIPE -x "$AT_WORK"; do :; done
+""",
 }
+BEGIN = 1000  # s since boot
+READ = 30  # s, the time of an outcome
 MOUNT = "/dev/sda1 /root/USB_MOUNT vfat rw 0 0\n"
-# The parts of the program that depend on the unit, and the time of an outcome (s).
+# The parts of the program that depend on the unit.
 CHANGES = {
     r"'/harl-updater\(-give-back\)*\.service$'": "''",  # every process here is the updater's
     "/proc/self/mounts": '"$UNIT/mounts"',
-    "outcome_time=30 ": "outcome_time=0 ",
+    "/proc/uptime": '"$UNIT/uptime"',
     "logs=/var/lib/harl-updater\n": 'logs="$UNIT/logs"\n',
     "/var/log/journal/$(cat /etc/machine-id)/": "$UNIT/journals/",
 }
@@ -66,22 +76,28 @@ class GiveBack(StandInTest):
         (self.unit / "run/notes").write_text("1.00 prepared\n")
         (self.unit / "journal").write_text("first\nlast\n")
         (self.unit / "logs").mkdir()
+        (self.unit / "uptime").write_text(f"{BEGIN}.50 0.00\n")
         self.environment |= {"ACTIVE": "deactivating", "RESULT": "signal", "I2CSET_STATUS": "0", "UMOUNT_STATUS": "32"}
+        self.environment["ENDS"] = "never"
         # Copies of sleep(1) under the names of the programs that the updater may leave running.
-        for name in ("apt", "dpkg", "scp", "ssh"):
+        for name in ("apt", "apt-get", "dpkg", "i2cset", "scp", "ssh"):
             shutil.copy("/usr/bin/sleep", self.unit / name)
 
-    def note(self, *notes: str) -> None:
-        """Writes the notes of the run, as if made just now."""
-        now = Path("/proc/uptime").read_text().split()[0]
+    def note(self, *notes: str, before: int = 0) -> None:
+        """Writes notes of the run, made just now, or this many seconds before."""
         with (self.unit / "run/notes").open("a") as file:
-            file.writelines(f"{now} {note}\n" for note in notes)
+            file.writelines(f"{BEGIN - before}.00 {note}\n" for note in notes)
+
+    def started(self) -> int:
+        """When the application was started (s since the beginning)."""
+        return int(float((self.unit / "started").read_text().split()[0])) - BEGIN
 
     def give_back(self, beside: str = ":", after: str = ":", at_work: tuple[str, ...] = (), status: int = 0) -> str:
         """Runs it once the processes of the shell line `beside` are `at_work`, then `after`; returns its output."""
         waits = "".join(f"until pgrep -x {name} >/dev/null; do /usr/bin/sleep 0.01; done\n" for name in at_work)
         line = f'cd "$UNIT"\n{beside}\n{waits}./give-back; status=$?\n{after}\nexit $status'
         command = [*NAMESPACES, "sh", "-c", line]
+        self.environment["AT_WORK"] = " ".join(at_work)
         done = subprocess.run(command, env=self.environment, capture_output=True, text=True, check=False, timeout=60)
         self.assertEqual((done.stderr, done.returncode), ("", status))
         return done.stdout
@@ -100,7 +116,7 @@ class GiveBack(StandInTest):
         """The stick is released and the application started, in this order."""
         self.assertEqual((self.unit / "mounts").read_text(), "")
         last = self.calls("umount", "systemctl")
-        self.assertEqual((last[0].split()[0], last[-1]), ("umount", START))
+        self.assertEqual((last[0], last[-1]), ("umount /root/USB_MOUNT", START))
 
     def test_after_a_normal_end_nothing_is_left_to_do(self) -> None:
         self.note("lit 0x13 0x2 0")
@@ -143,14 +159,13 @@ class GiveBack(StandInTest):
             self.setUp()
 
     def test_outcome_stays_readable_before_the_application_starts(self) -> None:
-        cases: list[list[str]] = [[], ["lit 0x13 0x2 0"]]
-        for notes in cases:
-            self.change({"outcome_time=0 ": "outcome_time=3 "})
-            self.note(*notes)
-            begin = time.monotonic()
-            self.give_back()
-            self.assertGreater(time.monotonic() - begin, 2)
+        self.give_back()
+        self.assertEqual(self.started(), READ)
+        for before, left in ((0, READ), (10, READ - 10), (40, 0)):
             self.setUp()
+            self.note("lit 0x13 0x2 0", before=before)
+            self.give_back()
+            self.assertEqual(self.started(), left)
 
     def test_without_notes_the_end_of_the_service_decides(self) -> None:
         for result, panel in (("success", {}), ("signal", ENDED_EARLY.panel)):
@@ -159,6 +174,11 @@ class GiveBack(StandInTest):
             self.give_back()
             self.assertEqual({led: color for led, color in self.panel().items() if color != "blue"}, panel)
             self.setUp()
+
+    def test_good_end_of_the_service_is_no_outcome(self) -> None:
+        self.environment["RESULT"] = "success"
+        self.give_back()
+        self.assertEqual(self.panel(), ENDED_EARLY.panel)
 
     def test_second_time_does_nothing(self) -> None:
         self.give_back()
@@ -179,29 +199,55 @@ class GiveBack(StandInTest):
         self.assertEqual(self.calls(), [])
 
     def test_package_tools_are_waited_for(self) -> None:
-        for tool in ("apt", "dpkg"):
-            said = self.give_back(f"./{tool} 2 &", at_work=(tool,))
+        for tool in ("apt", "apt-get", "dpkg"):
+            self.environment["ENDS"] = str(BEGIN + 3)
+            said = self.give_back(f"./{tool} 60 &", at_work=(tool,))
             self.assertIn("give-back: a package tool is still at work, waiting for it", said)
-            self.assertNotIn(f"beside {tool}", self.calls())
+            self.assertEqual(self.started(), 3 + READ)
             self.setUp()
 
     def test_package_tool_that_hangs_does_not_keep_the_instrument(self) -> None:
         self.change({"longest_wait=2100 ": "longest_wait=3 "})
-        said = self.give_back("./dpkg 30 &", 'kill -0 $! && echo "it lives"', at_work=("dpkg",))
-        self.assertIn("give-back: a package tool is still at work, going on beside it", said)
-        self.assertIn("it lives", said)
-        self.assertEqual(self.calls("systemctl", "beside"), [START, "beside dpkg"])
+        for before in (0, 1):
+            self.note("give-back", before=before)
+            said = self.give_back("./dpkg 60 &", 'kill -0 $! && echo "it lives"', at_work=("dpkg",))
+            self.assertIn("give-back: a package tool is still at work, going on beside it", said)
+            self.assertIn("it lives", said)
+            self.assertEqual(self.calls("systemctl", "beside"), [START, "beside dpkg"])
+            self.assertEqual(self.started(), 3 - before + READ)
+            self.setUp()
+            self.change({"longest_wait=2100 ": "longest_wait=3 "})
 
     def test_board_is_waited_for(self) -> None:
-        self.change({"board_time=780 ": "board_time=4 "})
-        self.note("began board-script", "ended board-script 0")
-        begin = time.monotonic()
-        said = self.give_back("./ssh 2 &", at_work=("ssh",))
-        self.assertIn("give-back: the board is still at work, waiting for it", said)
-        self.assertGreater(time.monotonic() - begin, 3)
-        self.setUp()
-        self.note("began board-script", "ended board-script 0", "sound pass", "lit 0x13 0x2 0")
-        self.assertEqual(self.give_back(), "")  # the updater has waited
+        for notes, ssh, waited in (
+            (("began board-script",), 0, 4),  # its end could not be noted
+            (("began board-script", "ended board-script 0"), 0, 4),
+            (("began board-script",), 10, 14),
+            (("began installation", "ended installation 0"), 0, 0),
+            (("began board-script", "ended board-script 0", "sound pass"), 0, 0),  # the updater has waited
+            (("began board-script", "ended board-script 0", "lit 0x13 0x2 0"), 0, 0),
+        ):
+            with self.subTest(notes=notes, ssh=ssh):
+                self.change({"board_time=780 ": "board_time=4 "})
+                self.note(*notes)
+                self.environment["ENDS"] = str(BEGIN + ssh)
+                (self.unit / "late").write_text(f"{BEGIN + ssh}.00 ended board-script 0\n")
+                said = self.give_back("./ssh 60 &", at_work=("ssh",)) if ssh else self.give_back()
+                self.assertEqual("give-back: the board is still at work, waiting for it" in said, waited > 0)
+                self.assertEqual(self.started(), waited + READ)
+            self.setUp()
+
+    def test_byte_that_is_being_sent_is_waited_for(self) -> None:
+        self.environment["ENDS"] = str(BEGIN + 3)
+        said = self.give_back("./i2cset 60 &", at_work=("i2cset",))
+        self.assertIn("give-back: the panel is still at work, waiting for it", said)
+        self.assertEqual(self.started(), 3 + READ)
+
+    def test_notes_that_cannot_be_written(self) -> None:
+        self.environment["RESULT"] = "success"
+        notes = 'notes=$(cat run/notes); mount -t tmpfs notes run; mkdir run/give-back; echo "$notes" >run/notes'
+        self.give_back(f"{notes}; mount -o remount,ro run")
+        self.assertEqual(self.calls("i2cset"), [])
 
     def test_upload_is_ended_and_the_board_script_is_not(self) -> None:
         said = self.give_back(
@@ -213,17 +259,22 @@ class GiveBack(StandInTest):
         self.assertIn("upload 143", said)
 
     def test_busy_stick_is_tried_again(self) -> None:
+        self.note("lit 0x13 0x2 0", before=READ)
         (self.unit / "busy").touch()
-        self.give_back()
+        self.assertEqual(self.give_back(), "")
         self.assertEqual(len(self.calls("umount")), 2)
+        self.assertEqual(self.started(), 1)
         self.assert_instrument_is_given_back()
 
     def test_stick_that_stays_is_detached(self) -> None:
         for status, attempts in (("32", 5), ("124", 1)):
+            self.note("lit 0x13 0x2 0", before=READ)
             (self.unit / "stuck").touch()
             self.environment["UMOUNT_STATUS"] = status
-            self.assertIn("give-back: the stick is in use, detaching it", self.give_back())
-            self.assertEqual(len(self.calls("umount")), attempts + 1)
+            self.assertEqual(self.give_back(), "give-back: the stick is in use, detaching it\n")
+            detached = "umount --lazy --no-canonicalize /root/USB_MOUNT"
+            self.assertEqual(self.calls("umount"), ["umount /root/USB_MOUNT"] * attempts + [detached])
+            self.assertEqual(self.started(), attempts - 1)
             self.assert_instrument_is_given_back()
             self.setUp()
 
@@ -231,12 +282,14 @@ class GiveBack(StandInTest):
         (self.unit / "lost").touch()
         self.assertNotIn("does not take", self.give_back())
         self.assertEqual(self.calls("i2cset")[1:3], ["i2cset -y 0 0x07 0x10 c", "i2cset -y 0 0x07 0x0 c"])
+        self.assertEqual(self.started(), 1 + READ)
 
     def test_absent_or_hanging_panel_does_not_keep_the_application(self) -> None:
         for status, bytes_sent in (("1", 3), ("124", 1)):
             self.environment["I2CSET_STATUS"] = status
             self.assertIn("give-back: the panel does not take the outcome", self.give_back())
             self.assertEqual(len(self.calls("i2cset")), bytes_sent)
+            self.assertEqual(self.started(), bytes_sent - 1)
             self.assert_instrument_is_given_back()
             self.setUp()
 

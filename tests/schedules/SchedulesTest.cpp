@@ -17,11 +17,12 @@ TEST_P(Update, ShowsItsOutcomeInEverySchedule)
 {
     const Found found = exploreUpdate(GetParam());
     std::printf("%ld schedules; update ahead of the main thread: flashing stopped before its start %ld, notification "
-                "before the wait %ld, no return %ld\n",
-                found.schedules, found.late, found.lost, found.hangs);
+                "before the wait %ld, no return %ld, of these in the wait for the flashing %ld\n",
+                found.schedules, found.late, found.lost, found.hangs, found.stuck);
     EXPECT_EQ(found.finding, "");
     EXPECT_GT(found.schedules, 1000);
     EXPECT_GT(found.lost, 0) << "the bare wait is not explored";
+    EXPECT_EQ(found.hangs, found.lost + found.stuck);
 }
 
 std::string nameOf(const testing::TestParamInfo<Ending>& info)

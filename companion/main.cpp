@@ -1,5 +1,6 @@
 #include "check/check.h"
 #include "findings.h"
+#include "fleet/fleet_command.h"
 #include "log/catalogue.h"
 #include "log/log_command.h"
 #include "procedure.h"
@@ -46,7 +47,7 @@ std::string usageText(const CLI::App& app, const CLI::ParseError& error)
     const std::vector<CLI::App*> parsed = app.get_subcommands();
     const std::vector<std::string> rest = app.remaining(true);
     if (parsed.empty() && rest.empty()) {
-        return "Name a command: stick, unit, check, verify, log, explain or report.";
+        return "Name a command: stick, unit, check, verify, log, fleet, explain or report.";
     }
     if (parsed.empty()) {
         std::string text = rest.front() + " is not a command.";
@@ -157,6 +158,24 @@ int run(std::vector<std::string> arguments)
     log->add_option("--html", logOptions.htmlFile, "also write a page with each run's timeline")->type_name("PAGE");
     log->footer("Exit status: 0 the last run went well, 1 it failed or did not finish, 2 wrong usage or no log.\n");
 
+    FleetOptions fleetOptions;
+    CLI::App* fleet = app.add_subcommand("fleet", "Show which of many units failed, why, and what runs on them.");
+    fleet
+        ->add_option("FILE", fleetOptions.paths,
+                     "logs, journals and reports of units, or folders with them; - for "
+                     "standard input")
+        ->required();
+    fleet->add_option("--since", fleetOptions.since, "count only runs since then, and show which units had none")
+        ->type_name("DATE");
+    fleet->add_option("--failed", fleetOptions.failed, "only units whose last run met this failure")->type_name("NAME");
+    fleet->add_flag("--json", json,
+                    "print one JSON object for the fleet, then one for each unit, on lines of their own");
+    fleet->add_flag("--csv", fleetOptions.csv, "print a line for each unit, as a spreadsheet reads it");
+    fleet->add_option("--html", fleetOptions.htmlFile, "also write a page with charts and a table")->type_name("PAGE");
+    fleet->footer(
+        "Exit status: 0 all units are well, 1 a unit needs somebody, 2 wrong usage or not everything could be "
+        "read.\n");
+
     std::string failure;
     CLI::App* explain = app.add_subcommand("explain", "Explain a failure by its name, or list all of them.");
     explain->add_option("NAME", failure, "as in brackets in a report, such as mirrors-unreachable");
@@ -198,6 +217,11 @@ int run(std::vector<std::string> arguments)
         logOptions.terminal = isatty(STDOUT_FILENO) == 1;
         const std::string wrong = conflictIn(logOptions);
         return wrong.empty() ? runLog(logOptions, std::cout, std::cerr) : refuseUsage("log", json, wrong);
+    }
+    if (fleet->parsed()) {
+        fleetOptions.json = json;
+        const std::string wrong = conflictIn(fleetOptions);
+        return wrong.empty() ? runFleet(fleetOptions, std::cout, std::cerr) : refuseUsage("fleet", json, wrong);
     }
     if (explain->parsed()) {
         return printCatalogue(failure, json, std::cout)

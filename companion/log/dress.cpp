@@ -9,9 +9,19 @@
 namespace
 {
 
-const std::string_view binaryMessage = "MESSAGE";          // in a line of its own: its bytes follow
 const std::size_t enoughOfALine = 300;                     // bytes, to find out the format
 const std::size_t enoughToJudge = std::size_t{128} * 1024; // bytes, to find out the order of the lines
+
+const std::pair<std::string_view, std::string JournalEntry::*> fields[] = {
+    {"MESSAGE", &JournalEntry::message},
+    {"SYSLOG_IDENTIFIER", &JournalEntry::program},
+    {"_PID", &JournalEntry::process},
+    {"_MACHINE_ID", &JournalEntry::machine},
+    {"_HOSTNAME", &JournalEntry::host},
+    {"_BOOT_ID", &JournalEntry::boot},
+    {"__REALTIME_TIMESTAMP", &JournalEntry::realtime},
+    {"__MONOTONIC_TIMESTAMP", &JournalEntry::monotonic},
+};
 
 /// Counts the records that say something.
 class Counter : public LogSink
@@ -74,6 +84,7 @@ std::string valueOf(const nlohmann::json& entry, const char* name)
 void Dress::feed(std::string_view block)
 {
     mBytes += block.size();
+    mCut = block.empty() ? mCut : block.back() != '\n';
     std::string start;
     if (mFormat == Format::UNKNOWN) { // what the first line tells
         mPartial.append(block);
@@ -104,7 +115,7 @@ void Dress::take(std::string_view block)
         return;
     }
     while (!block.empty()) {
-        if (mMessage == binaryMessage) {
+        if (!mBinary.empty()) {
             takeBinary(block);
             continue;
         }
@@ -126,6 +137,7 @@ void Dress::finish()
     if (mFormat == Format::UNKNOWN) {
         take(findFormat());
     }
+    mCut = mCut || mInEntry || !mBinary.empty();
     if (mFormat != Format::PLAIN) {
         takeEntryLine(mPartial);
         endEntry();
@@ -152,9 +164,10 @@ void Dress::takeEntryLine(std::string_view line)
         }
         const nlohmann::json entry = nlohmann::json::parse(mObject, nullptr, false);
         if (entry.is_object()) {
-            mProgram = valueOf(entry, "SYSLOG_IDENTIFIER");
-            mProcess = valueOf(entry, "_PID");
-            mMessage = valueOf(entry, "MESSAGE") + '\n';
+            for (const auto& [name, member] : fields) {
+                mEntry.*member = valueOf(entry, name.data());
+            }
+            mEntry.message += '\n';
             mObject.clear();
             endEntry();
         } else if (startsWith(line, "{")) {
@@ -170,7 +183,7 @@ void Dress::takeEntryLine(std::string_view line)
     }
 }
 
-/// Takes what `block` has of a message that is no plain text: its length in eight bytes, the lowest first, itself, and
+/// Takes what `block` has of a field that is no plain text: its length in eight bytes, the lowest first, its bytes, and
 /// a line end.
 void Dress::takeBinary(std::string_view& block)
 {
@@ -186,33 +199,56 @@ void Dress::takeBinary(std::string_view& block)
     mPartial.append(block.substr(0, taken));
     block.remove_prefix(taken);
     if (mPartial.size() == wanted && wanted > lengthSize) {
-        mMessage = mPartial.substr(lengthSize);
+        mPartial.pop_back();
+        setField(mBinary, mPartial.substr(lengthSize));
+        mBinary.clear();
         mPartial.clear();
     }
 }
 
 void Dress::takeField(std::string_view field)
 {
-    if (field == binaryMessage) {
-        mMessage = field;
-    } else if (startsWith(field, "MESSAGE=")) {
-        mMessage = std::string(field.substr(8)) + '\n';
-    } else if (startsWith(field, "SYSLOG_IDENTIFIER=")) {
-        mProgram = field.substr(18);
-    } else if (startsWith(field, "_PID=")) {
-        mProcess = field.substr(5);
+    static const std::string_view nameBytes = "ABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789_";
+    const std::size_t end = field.find('=');
+    const std::string_view name = field.substr(0, end);
+    if (name == "__CURSOR" && mInEntry) { // the entry before lacks its end
+        mUndamaged = false;
+        mEntry = {};
+    }
+    mInEntry = true;
+    if (name.empty() || name.find_first_not_of(nameBytes) != std::string_view::npos) {
+        mUndamaged = mUndamaged && mFormat != Format::FIELDS;
+    } else if (end != std::string_view::npos) {
+        setField(name, std::string(field.substr(end + 1)));
+    } else if (mFormat == Format::FIELDS) {
+        mBinary = name;
+    }
+}
+
+void Dress::setField(std::string_view name, std::string value)
+{
+    for (const auto& [known, member] : fields) {
+        if (name == known) {
+            mEntry.*member = std::move(value);
+            mEntry.message += name == "MESSAGE" ? "\n" : "";
+            return;
+        }
     }
 }
 
 /// Hands over an entry as journalctl's short formats show it.
 void Dress::endEntry()
 {
-    if (!mMessage.empty()) {
-        hand("0.0 - " + mProgram + '[' + (mProcess.empty() ? "0" : mProcess) + "]: " + mMessage);
+    LogParser* const chosen = mChoose && !mEntry.message.empty() ? mChoose(mEntry) : nullptr;
+    if (!mEntry.message.empty() && (chosen != nullptr || !mChoose)) {
+        const std::string process = mEntry.process.empty() ? "0" : mEntry.process;
+        const std::string line = "0.0 - " + mEntry.program + '[' + process + "]: " + mEntry.message;
+        mChoose ? chosen->feed(line) : hand(line);
     }
-    mProgram.clear();
-    mProcess.clear();
-    mMessage.clear();
+    for (const auto& [name, member] : fields) {
+        (mEntry.*member).clear();
+    }
+    mInEntry = false;
 }
 
 /// Hands text to the parser once the order of its lines is known.

@@ -38,13 +38,6 @@ data toData(const Json& value)
     return data(value.is_string() ? value.get<std::string>() : value.dump());
 }
 
-/// Writes the part of the page's template that shows the data of this name.
-void render(const char* part, const Json& content, std::ostream& out)
-{
-    static kainjow::mustache::mustache page(embeddedPage);
-    page.render(data(part, toData(content)), out);
-}
-
 /// A step's commands and waits; attempts that came out alike are one line.
 Json actionsOf(const Step& step)
 {
@@ -94,9 +87,16 @@ Json problemData(const Run& run, const Problem& problem, const char* style)
 
 } // namespace
 
+void renderPart(const char* page, const char* part, const nlohmann::ordered_json& content, std::ostream& out)
+{
+    static kainjow::mustache::mustache log(embeddedPage);
+    static kainjow::mustache::mustache fleet(embeddedFleetPage);
+    (page == embeddedPage ? log : fleet).render(data(part, toData(content)), out);
+}
+
 HtmlPage::HtmlPage(std::ostream& out) : mOut(out)
 {
-    render("begin", true, mOut);
+    renderPart(embeddedPage, "begin", true, mOut);
 }
 
 void HtmlPage::writeRun(const Run& run, const std::string& source)
@@ -125,11 +125,11 @@ void HtmlPage::writeRun(const Run& run, const std::string& source)
     }
     content["timeline"] = !run.steps.empty();
     content["open"] = !run.gaps.empty();
-    render("run", content, mOut);
+    renderPart(embeddedPage, "run", content, mOut);
 }
 
 void HtmlPage::finish()
 {
-    render("end", true, mOut);
+    renderPart(embeddedPage, "end", true, mOut);
     mOut.flush();
 }

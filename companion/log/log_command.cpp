@@ -1,6 +1,5 @@
 #include "log/log_command.h"
 
-#include "command.h"
 #include "descriptor.h"
 #include "findings.h"
 #include "log/catalogue.h"
@@ -12,6 +11,7 @@
 #include "log/run.h"
 #include "log/source.h"
 #include "log/text.h"
+#include "page_file.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -176,25 +176,6 @@ bool openUnnamed(std::fstream& file)
     return file.is_open();
 }
 
-/// Writes `content` into the file at `path`. What is wrong, in words; empty for nothing.
-std::string writeFile(const std::string& path, std::fstream& content)
-{
-    const HeldSignals signals; // until all of it is there
-    std::ofstream file(path, std::ios::binary);
-    if (!file) {
-        return std::strerror(errno);
-    }
-    content.seekg(0);
-    file << content.rdbuf();
-    file.close();
-    if (!content || !file) {
-        std::string wrong = std::strerror(errno);
-        std::remove(path.c_str());
-        return wrong;
-    }
-    return "";
-}
-
 /// Prints explained runs one by one: for people, as one line each, or as one JSON object.
 class Printer
 {
@@ -237,26 +218,6 @@ private:
     std::ostream& mOut;
     bool mPrinted = false;
 };
-
-/// Why the page must not take the place of what is at `path`, in words; empty when it may.
-std::string objectionTo(const std::string& path, const LogOptions& options)
-{
-    struct stat page = {};
-    if (lstat(path.c_str(), &page) != 0) {
-        return "";
-    }
-    if (!S_ISREG(page.st_mode)) {
-        return "not a plain file; name another one for the page";
-    }
-    const auto isPage = [&](const std::string& file) {
-        struct stat log = {};
-        const int result = file == "-" ? fstat(STDIN_FILENO, &log) : stat(file.c_str(), &log);
-        return result == 0 && page.st_dev == log.st_dev && page.st_ino == log.st_ino;
-    };
-    const bool same =
-        options.files.empty() ? isPage("-") : std::any_of(options.files.begin(), options.files.end(), isPage);
-    return same ? "the log itself; name another file for the page" : "";
-}
 
 /// True when a run leaves nothing to be done.
 bool isClean(const Run& run)
@@ -309,7 +270,7 @@ private:
         if (mOptions.htmlFile.empty()) {
             return "";
         }
-        const std::string objection = objectionTo(mOptions.htmlFile, mOptions);
+        const std::string objection = objectionTo(mOptions.htmlFile, mOptions.files);
         if (!objection.empty() || !openUnnamed(mPageText)) {
             return pageError(objection.empty() ? std::strerror(errno) : objection);
         }

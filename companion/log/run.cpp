@@ -27,18 +27,18 @@ bool contains(std::string_view text, std::string_view part)
 struct VersionEvent
 {
     Event event;
-    Versions Run::*versions;
     Versions::State state;
+    Versions Run::*versions;
     const char* between;
 };
 
 const VersionEvent versionEvents[] = {
-    {Event::PACKAGE_DIFFERS, &Run::package, Versions::State::DIFFER, " -> "},
-    {Event::PACKAGE_SAME, &Run::package, Versions::State::SAME, " == "},
-    {Event::BOARD_DIFFERS, &Run::board, Versions::State::DIFFER, " -> "},
-    {Event::BOARD_SAME, &Run::board, Versions::State::SAME, " == "},
-    {Event::BOARD_NOT_READ, &Run::board, Versions::State::NOT_READ, " -> "},
-    {Event::STICK_NOT_READ, &Run::board, Versions::State::NOT_READ, " -> "},
+    {Event::PACKAGE_DIFFERS, Versions::State::DIFFER, &Run::package, " -> "},
+    {Event::PACKAGE_SAME, Versions::State::SAME, &Run::package, " == "},
+    {Event::BOARD_DIFFERS, Versions::State::DIFFER, &Run::board, " -> "},
+    {Event::BOARD_SAME, Versions::State::SAME, &Run::board, " == "},
+    {Event::BOARD_NOT_READ, Versions::State::NOT_READ, &Run::board, " -> "},
+    {Event::STICK_NOT_READ, Versions::State::NOT_READ, &Run::board, " -> "},
 };
 const std::pair<Event, bool Run::*> factEvents[] = {
     {Event::MAIN_INSTALLS, &Run::partsInstalled}, {Event::MARKER_REMOVED, &Run::markerRemoved},
@@ -201,7 +201,7 @@ void OtherLines::add(std::string_view text)
     last.push_back(std::move(line));
     if (last.size() > mostLinesAtEnds) {
         leftOut += last.front().times;
-        last.pop_front();
+        last.erase(last.begin());
     }
 }
 
@@ -407,7 +407,7 @@ void RunBuilder::noteTime(const ParsedRecord& record, const Meaning& meaning)
 void RunBuilder::takeRunEvent(const ParsedRecord& record, const Meaning& meaning)
 {
     Run& run = *mRun;
-    for (const auto& [event, versions, state, between] : versionEvents) {
+    for (const auto& [event, state, versions, between] : versionEvents) {
         if (event == meaning.event) {
             (run.*versions).state = state;
             splitVersions(meaning.rest, between, run.*versions);

@@ -5,7 +5,6 @@
 
 #include <bitset>
 #include <cstdint>
-#include <deque>
 #include <functional>
 #include <optional>
 #include <string>
@@ -50,7 +49,7 @@ struct OtherLine
 struct OtherLines
 {
     std::vector<OtherLine> first;
-    std::deque<OtherLine> last;
+    std::vector<OtherLine> last;
     std::uint64_t count = 0;
     std::uint64_t leftOut = 0; ///< between the first and the last
 

@@ -30,16 +30,8 @@ std::string LogSource::openFile(const std::string& path)
 
 std::string LogSource::openJournal(bool follow)
 {
-    mName = "the journal of harl-updater";
-    std::array<int, 2> ends = {-1, -1};
-    if (pipe2(ends.data(), O_CLOEXEC) != 0) {
-        return std::strerror(errno);
-    }
-    mDescriptor = Descriptor(ends[0]);
-    const Descriptor writeEnd(ends[1]);
-
     // All entries, with their times and programs; --all keeps tabs as they are.
-    std::vector<const char*> arguments = {"journalctl",
+    std::vector<std::string> arguments = {"journalctl",
                                           "--unit=harl-updater",
                                           "--unit=harl-updater-give-back",
                                           "--unit=harl-updater-verify",
@@ -50,20 +42,39 @@ std::string LogSource::openJournal(bool follow)
     if (follow) {
         arguments.insert(arguments.end(), {"--follow", "--no-tail"});
     }
-    arguments.push_back(nullptr);
+    return openProgram(arguments, "the journal of harl-updater", true);
+}
+
+std::string LogSource::openProgram(const std::vector<std::string>& arguments, const std::string& name, bool complains)
+{
+    mName = name;
+    std::array<int, 2> ends = {-1, -1};
+    if (pipe2(ends.data(), O_CLOEXEC) != 0) {
+        return std::strerror(errno);
+    }
+    mDescriptor = Descriptor(ends[0]);
+    const Descriptor writeEnd(ends[1]);
     posix_spawn_file_actions_t actions;
     posix_spawn_file_actions_init(&actions);
     posix_spawn_file_actions_adddup2(&actions, writeEnd.number(), STDOUT_FILENO);
-    const int error = posix_spawnp(&mJournal, arguments.front(), &actions, nullptr,
-                                   const_cast<char* const*>(arguments.data()), // not changed, posix_spawn(3)
-                                   environ);
+    if (!complains) {
+        posix_spawn_file_actions_addopen(&actions, STDERR_FILENO, "/dev/null", O_WRONLY, 0);
+    }
+    std::vector<char*> words;
+    words.reserve(arguments.size() + 1);
+    for (const std::string& argument : arguments) {
+        words.push_back(const_cast<char*>(argument.c_str())); // not changed, posix_spawn(3)
+    }
+    words.push_back(nullptr);
+    const int error = posix_spawnp(&mProgram, words.front(), &actions, nullptr, words.data(), environ);
     posix_spawn_file_actions_destroy(&actions);
     if (error == 0) {
         return "";
     }
-    mJournal = -1;
-    return error == ENOENT ? "journalctl is not on the search path. On a machine without it, give the log as a file."
-                           : "journalctl cannot be run: " + std::string(std::strerror(error));
+    mProgram = -1;
+    return error == ENOENT ? arguments.front() + " is not on the search path. On a machine without it, give the log as "
+                                                 "a file."
+                           : arguments.front() + " cannot be run: " + std::strerror(error);
 }
 
 bool LogSource::isRegularFile() const
@@ -75,15 +86,15 @@ bool LogSource::isRegularFile() const
 int LogSource::close(bool allRead)
 {
     mDescriptor = Descriptor();
-    if (mJournal < 0) {
+    if (mProgram < 0) {
         return 0;
     }
     int status = 0;
     if (!allRead) {
-        kill(mJournal, SIGTERM);
+        kill(mProgram, SIGTERM);
     }
-    while (waitpid(mJournal, &status, 0) < 0 && errno == EINTR) {
+    while (waitpid(mProgram, &status, 0) < 0 && errno == EINTR) {
     }
-    mJournal = -1;
+    mProgram = -1;
     return WIFEXITED(status) ? WEXITSTATUS(status) : 0;
 }

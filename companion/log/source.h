@@ -3,9 +3,11 @@
 #include "descriptor.h"
 
 #include <string>
+#include <vector>
+
 #include <sys/types.h>
 
-/// Where a log comes from: a file, standard input, or the journal of the updater's service.
+/// Where a log comes from: a file, standard input, the journal of the updater's service, or what a program prints.
 class LogSource
 {
 public:
@@ -22,18 +24,26 @@ public:
     /// @return what is wrong, in words; empty when it is open
     std::string openJournal(bool follow);
 
+    /// Reads what a program prints.
+    ///
+    /// @param arguments  the program, looked for on the search path, and its arguments
+    /// @param name       for messages
+    /// @param complains  its standard error is this program's; else it is lost
+    /// @return what is wrong, in words; empty when it is open
+    std::string openProgram(const std::vector<std::string>& arguments, const std::string& name, bool complains);
+
     /// Name for messages, printable.
     const std::string& name() const { return mName; }
     int descriptor() const { return mDescriptor.number(); }
     bool isRegularFile() const;
 
-    /// Waits for journalctl's end, which it brings about unless all of its output was read.
+    /// Waits for the program's end, which it brings about unless all of its output was read.
     ///
-    /// @return journalctl's exit code; 0 for the other sources and when it was ended
+    /// @return the program's exit code; 0 for the other sources and when it was ended
     int close(bool allRead);
 
 private:
     std::string mName;
     Descriptor mDescriptor;
-    pid_t mJournal = -1;
+    pid_t mProgram = -1;
 };

@@ -32,7 +32,8 @@ class Schema(unittest.TestCase):
         self.validator = jsonschema.Draft202012Validator(SCHEMA)
 
     def expect_valid(self, *arguments: str) -> None:
-        for text in printed(*arguments).splitlines() if "--follow" in arguments else [printed(*arguments)]:
+        lines = "--follow" in arguments or arguments[0] == "fleet"
+        for text in printed(*arguments).splitlines() if lines else [printed(*arguments)]:
             with self.subTest(arguments):
                 self.validator.validate(json.loads(text))
 
@@ -42,6 +43,10 @@ class Schema(unittest.TestCase):
         self.expect_valid("log", "--json", "/dev/null")
         self.expect_valid("log", "--json", "/nonexistent")
         self.expect_valid("log", "--json", "--follow", "/dev/null")
+
+    def test_fleets(self) -> None:
+        self.expect_valid("fleet", "--json", str(GOLDEN))
+        self.expect_valid("fleet", "--json", "--since", "2026-11-21", "/dev/null", "/nonexistent")
 
     def test_sticks_and_catalogue(self) -> None:
         with tempfile.TemporaryDirectory() as folder:

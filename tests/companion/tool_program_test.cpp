@@ -77,7 +77,8 @@ TEST_F(ToolProgram, UnknownSubcommandIsNamed)
     EXPECT_THAT(tool({"log", "--html"}).errors, HasSubstr("harl-updater-tool: Name PAGE behind --html."));
     EXPECT_THAT(tool({"log", "--run", "0"}).errors, HasSubstr("harl-updater-tool: --run needs a number from 1 on."));
     EXPECT_THAT(tool({"report"}).errors, HasSubstr("harl-updater-tool: FILE is missing."));
-    EXPECT_THAT(tool({}).errors, HasSubstr("Name a command: stick, unit, check, verify, log, explain or report."));
+    EXPECT_THAT(tool({}).errors,
+                HasSubstr("Name a command: stick, unit, check, verify, log, fleet, explain or report."));
 }
 
 TEST_F(ToolProgram, WrongUsageIsAnObjectForPrograms)

@@ -32,8 +32,8 @@ helped() { # [COMMAND]
 }
 
 commands=$("$tool" --help | sed -n '/^Subcommands:/,$s/^  \([a-z]*\) .*/\1/p' | sort | paste -sd ' ')
-[[ $commands == 'check explain log report stick unit verify' ]] || { echo "the tool's commands are \"$commands\"" && wrong=1; }
-expect "$(helped | sed 's/$/ check explain help log report stick unit verify/')" ''
+[[ $commands == 'check explain fleet log report stick unit verify' ]] || { echo "the tool's commands are \"$commands\"" && wrong=1; }
+expect "$(helped | sed 's/$/ check explain fleet help log report stick unit verify/')" ''
 for command in $commands; do
     expect "$(helped "$command")" "$command" --
     expect "$(helped "$command")" "$command" --json --
@@ -48,6 +48,7 @@ expect '' stick --panel
 expect --follow log --journal --f
 expect '--html' log --ht
 expect '--last --list' log --l
+expect '--failed' fleet --f
 expect '' nonsense --
 
 folder=$(mktemp -d)

@@ -40,7 +40,7 @@ PANELS = {
 
 def fleet(*arguments: str | Path, folder: Path | None = None, text: str = "") -> subprocess.CompletedProcess[str]:
     """What the command prints."""
-    command = [TOOL, "fleet", *arguments]
+    command: list[str | Path] = [TOOL, "fleet", *arguments]
     return subprocess.run(command, cwd=folder, input=text, capture_output=True, text=True, timeout=60, check=False)
 
 
@@ -262,7 +262,7 @@ class Journals(FleetTest):
 
     def add(self, name: str, text: str) -> None:
         """Adds entries to a journal."""
-        command = [REMOTE, "--output", self.journals / name, "-"]
+        command: list[str | Path] = [REMOTE, "--output", self.journals / name, "-"]
         subprocess.run(command, input=text, text=True, stderr=subprocess.DEVNULL, check=True)
 
     def test_same_as_the_exports(self) -> None:

@@ -16,7 +16,7 @@ import unittest
 from collections.abc import Iterator
 from pathlib import Path
 
-from bench.makers.files import write_script
+from bench.makers.files import write, write_script
 from bench.makers.i2cset import NEWER, OLDER
 from tests.command_line import take_path
 
@@ -161,6 +161,26 @@ class PassedOn(HandOverTest):
         self.assertEqual(done.returncode, 126)
         self.assertIn("apt: not to be run", done.stderr)
 
+    def test_first_one_that_can_be_run_is_the_real_one(self) -> None:
+        for name in "abcd":
+            (self.folder / name).mkdir()
+        (self.folder / "a/apt").mkdir()
+        (self.folder / "b/apt").write_text("no program\n")
+        for name in "cd":
+            write_script(self.folder / name / "apt", f"echo {name}")
+        for folders in ("abcd", "acbd"):
+            search = ":".join(str(self.folder / name) for name in folders)
+            self.direct["PATH"] = f"{search}:/usr/bin:/bin"
+            self.environment["PATH"] = f"{self.folder}/bin:{self.direct['PATH']}"
+            self.assert_same("apt update")
+
+    def test_empty_folder_of_the_path_is_the_present_one(self) -> None:
+        self.tool("apt", 'echo "$PATH"')
+        for path in ("", "/nowhere:"):
+            self.environment["PATH"] = f"{self.folder}/bin:{path}"
+            done = self.shell(f"cd {self.folder}/tools; ../bin/apt update", "/bin/dash")
+            self.assertEqual((done.returncode, done.stdout), (0, f"{path}\n"))
+
     def test_script_without_a_first_line(self) -> None:
         (self.folder / "tools/apt").write_text('echo "$@"; exit 3\n')
         (self.folder / "tools/apt").chmod(0o755)
@@ -204,16 +224,39 @@ class PassedOn(HandOverTest):
         own = str(self.folder / "bin")
         for path in (own, f"{own}:{own}/", f"{own}/.:{own}"):
             done = subprocess.run(
-                [f"{own}/aplay", "x"], env={"PATH": path}, capture_output=True, text=True, check=False, timeout=10
+                [f"{own}/apt", "install"],
+                env=self.environment | {"PATH": path},
+                capture_output=True,
+                text=True,
+                check=False,
+                timeout=10,
             )
             self.assertEqual((done.returncode, done.stdout), (127, ""))
+            self.assertEqual(self.notes(), [])  # not even once
+
+    def test_successor_that_has_just_replaced_it_is_not_the_real_one(self) -> None:
+        # As after an upgrade, the file under the called path is another: a script whose interpreter runs.
+        shutil.copy(self.folder / "hand-over", self.folder / "apt")
+        (self.folder / "bin/apt").unlink()
+        write(self.folder / "bin/apt", f"#!{self.folder}/apt\n", 0o755)
+        self.tool("apt", 'echo "$PATH"')
+        self.assertEqual(self.shell("timeout 10 apt update").stdout, f"{self.direct['PATH']}\n")
 
     def test_without_a_folder_for_notes(self) -> None:
         del self.environment["RUNTIME_DIRECTORY"]
         self.tool("aplay", "exit 3")
         self.assertEqual(self.shell("aplay SND_RESULT_PASS.wav").returncode, 3)
         self.environment["RUNTIME_DIRECTORY"] = "/nowhere"
-        self.assertEqual(self.shell("aplay SND_RESULT_PASS.wav").returncode, 3)
+        done = self.shell("aplay SND_RESULT_PASS.wav")
+        self.assertEqual((done.returncode, done.stderr), (3, ""))
+
+    def test_notes_that_cannot_be_written(self) -> None:
+        self.tool("aplay", "exit 3")
+        notes = self.folder / "run/notes"
+        notes.symlink_to("/dev/full")
+        done = self.shell("aplay SND_RESULT_PASS.wav")
+        said = f"hand-over: cannot write {notes}: No space left on device\n"
+        self.assertEqual((done.returncode, done.stderr), (3, said))
 
     def test_no_more_descriptors(self) -> None:
         shutil.copy("/usr/bin/echo", self.folder / "tools/apt")
@@ -339,11 +382,14 @@ class Limits(HandOverTest):
 
     def test_budget(self) -> None:
         self.tool("i2cset", "echo called >>$FOLDER/called; [ $1 != -h ] || exit 1; exec sleep 60")
+        used_up = []
         for limit in (1, 1, 1, 0, 0):
             begin = time.monotonic()
             done = self.shell("i2cset -y 0 0x07 0x12 c")
             self.assertEqual(done.returncode, 124)
             self.assertLess(time.monotonic() - begin, limit + 0.9)
+            used_up.append("hand-over: panel: 3 s are used up; further calls fail at once\n" in done.stderr)
+        self.assertEqual(used_up, [False, False, True, False, False])
         self.assertEqual(len((self.folder / "called").read_text().split()), 4)  # one of them asks for the usage text
         self.assertEqual(done.stderr, "")
         self.assertEqual([note.split()[:2] for note in self.notes()[1:]], [["spent", "panel"]] * 3)
@@ -371,18 +417,24 @@ class Limits(HandOverTest):
         self.assertEqual(self.notes(), expected)
 
     def test_journal_is_synced_before_the_application_starts(self) -> None:
-        for tool in ("journalctl", "sync", "systemctl"):
-            self.tool(tool, f'echo "{tool} $*" >>$FOLDER/calls')
-        self.shell("systemctl stop harl; systemctl start harl")
-        self.assertEqual(
-            (self.folder / "calls").read_text().splitlines(),
-            ["systemctl stop harl", "journalctl --sync", "sync --file-system /var/log/journal", "systemctl start harl"],
-        )
-        for tool in ("journalctl", "sync"):
-            self.tool(tool, "exec sleep 60")
+        self.tool("journalctl", 'echo "journalctl $*" >>$FOLDER/calls; echo text; echo error >&2')
+        self.tool("systemctl", 'echo "systemctl $*" >>$FOLDER/calls')
+        synced = ["journalctl --sync", "systemctl start harl"]
+        for line, calls in (
+            ("systemctl stop harl", ["systemctl stop harl"]),
+            ("systemctl start other", ["systemctl start other"]),
+            ("systemctl harl", ["systemctl harl"]),
+            ("systemctl start harl", synced),
+            ("env --unset RUNTIME_DIRECTORY systemctl start harl", synced[1:]),
+        ):
+            done = self.shell(line)
+            self.assertEqual((done.returncode, done.stdout, done.stderr), (0, "", ""))
+            self.assertEqual((self.folder / "calls").read_text().splitlines(), calls)
+            (self.folder / "calls").unlink()
+        self.tool("journalctl", "exec sleep 60")
         begin = time.monotonic()
         self.assertEqual(self.shell("systemctl start harl").returncode, 0)
-        self.assertLess(time.monotonic() - begin, 8)
+        self.assertLess(time.monotonic() - begin, 5)
 
 
 class Table(unittest.TestCase):
@@ -456,7 +508,9 @@ class Panel(HandOverTest):
 
     def test_outcome_is_noted_with_its_led(self) -> None:
         self.tool("i2cset", NEW)
+        os.umask(0o022)
         self.send("0x12", "0x0", "0x13", "0x2", "0x12", "0x8")
+        self.assertEqual((self.folder / "run/select").stat().st_mode & 0o777, 0o644)
         self.assertEqual(self.notes()[1:], ["lit 0x13 0x2 0", "lit 0x12 0x8 0"])
 
     def test_outcome_of_which_a_byte_failed_is_noted_as_such(self) -> None:
@@ -465,6 +519,19 @@ class Panel(HandOverTest):
         self.send("0x13", "0x2", refused="0x13")
         self.assertEqual(self.notes()[1:], ["lit 0x13 0x2 1", "lit 0x13 0x2 1"])
 
+    def test_outcome_belongs_to_the_led_before_it(self) -> None:
+        self.tool("i2cset", NEW)
+        self.send("0x2", "0x10", "0x2", "0xf", "0x8", "0x1d", "0x2", "0x1e", "0x8")
+        lit = ["unknown 0x2 1", "0x10 0x2 0", "0x10 0x8 0", "0x1d 0x2 0", "0x1d 0x8 0"]
+        self.assertEqual(self.notes()[1:], [f"lit {each}" for each in lit])
+
+    def test_selected_led_that_cannot_be_noted(self) -> None:
+        self.tool("i2cset", NEW)
+        (self.folder / "run/select").symlink_to("/dev/full")
+        done = self.shell("i2cset -y 0 0x07 0x13 c")
+        said = f"hand-over: cannot write {self.folder}/run/select: No space left on device\n"
+        self.assertEqual((done.returncode, done.stderr), (0, said))
+
     def test_nothing_else_is_noted(self) -> None:
         self.tool("i2cset", NEW)
         self.send("0x12", "0x14", "0x0", "0x1", "0x40", "0x80", "0xC0", "0xc2", "0x1f", "0x19")
@@ -472,8 +539,13 @@ class Panel(HandOverTest):
 
     def test_sound_is_noted(self) -> None:
         self.tool("aplay", "exit 1")
-        self.shell("aplay /root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav; aplay /root/RESOURCES/SOUNDS/SND_RESULT_FAIL.wav")
+        os.umask(0o022)
+        sounds = "/root/RESOURCES/SOUNDS/SND_RESULT"
+        self.shell(f"aplay {sounds}_PASS.wav; aplay {sounds}_FAIL.wav")
         self.assertEqual(self.notes(), ["sound pass", "sound fail"])
+        self.assertEqual((self.folder / "run/notes").stat().st_mode & 0o777, 0o644)
+        self.assertEqual(self.shell("aplay").returncode, 1)
+        self.assertEqual(len(self.notes()), 2)
 
     def test_installed_tool_accepts_the_address(self) -> None:
         real = Path("/usr/sbin/i2cset")

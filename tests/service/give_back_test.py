@@ -6,7 +6,7 @@ import subprocess
 import unittest
 
 from bench.outcomes import CHECK_FAILED, ENDED_EARLY, UP_TO_DATE, UPDATED
-from bench.panel import COLOR_CODES, LED_CODES, Panel
+from bench.panel import COLOR_CODES, FIRST_LED, LAST_LED, Panel
 from tests.command_line import skip
 from tests.service.stand_in import ROOT, StandInTest
 
@@ -102,14 +102,17 @@ class GiveBack(StandInTest):
         self.assertEqual((done.stderr, done.returncode), ("", status))
         return done.stdout
 
-    def panel(self) -> dict[str, str]:
-        """The LEDs that are lit after the sent bytes, if they flashed blue before."""
+    def panel(self, half_sent: bool = False) -> dict[str, str]:
+        """The LEDs that are lit after the sent bytes; before, all were blue, or one even waited for its next colour."""
         panel = Panel()
-        for byte in (LED_CODES["REMOTE"], COLOR_CODES["blue"]):
-            panel.send(byte, 0)
+        for led in range(FIRST_LED, LAST_LED + 1):
+            panel.send(led, 0)
+            panel.send(COLOR_CODES["blue"], 0)
+        if half_sent:
+            panel.send(FIRST_LED + 2, 0)
         for line in self.calls("i2cset"):
             panel.send(int(line.split()[4], 16), 0)
-        self.assertEqual(panel.faults, [])
+        self.assertEqual(len(panel.faults), 1 if half_sent else 0)
         return panel.pattern(0)
 
     def assert_instrument_is_given_back(self) -> None:
@@ -129,6 +132,7 @@ class GiveBack(StandInTest):
         ended = "Result=signal ExecMainCode=2 ExecMainStatus=15"
         self.assertIn(f"give-back: the updater ended ({ended}) before it had an outcome: showing the failure", said)
         self.assertEqual(self.panel(), ENDED_EARLY.panel)
+        self.assertEqual(self.panel(half_sent=True), ENDED_EARLY.panel)
         self.assert_instrument_is_given_back()
 
     def test_end_after_the_outcome_leaves_the_panel_alone(self) -> None:

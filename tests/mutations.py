@@ -362,9 +362,7 @@ class Tree:
             if source.exists() and not same:
                 copy.parent.mkdir(parents=True, exist_ok=True)
                 shutil.copy(source, copy)
-        configured = (self.folder / BUILD / "build.ninja").exists()
-        if not configured:
-            self.demand(CONFIGURE)
+        self.demand(CONFIGURE)
         targets = {target for part in parts for check in part.checks for target in check.targets.split()}
         if targets:
             self.demand(["ninja", "-C", BUILD, *sorted(targets)])

@@ -150,8 +150,11 @@ class GiveBack(StandInTest):
             (UP_TO_DATE, ["lit 0x12 0x2 1", "lit 0x15 0x2 0"]),
             (UP_TO_DATE, ["lit 0x12 0x2 0"]),  # the updater ended before the second
             (CHECK_FAILED, ["lit 0x12 0x8 0", "lit 0x15 0x8 1"]),
+            (CHECK_FAILED, ["lit 0x12 0x8 0"]),
+            (CHECK_FAILED, ["lit unknown 0x8 1", "lit 0x15 0x8 0"]),
             (UPDATED, ["began installation", "ended installation 0", "sound pass"]),
             (UPDATED, ["began installation", "sound pass", "lit unknown 0x2 1"]),
+            (UPDATED, ["began installation", "lit unknown 0x2 1"]),
             (UP_TO_DATE, ["sound pass"]),
             (ENDED_EARLY, ["sound fail"]),
         ):

@@ -7,13 +7,13 @@ import unittest
 from tests.service.stand_in import StandInTest
 
 CALL = 'call="${0##*/} $*"; echo "$call" >>"$UNIT/calls"\n'
-# A call that the unit's `mended` names leaves every package installed.
-MENDS = CALL + 'case $call in "$MENDED"*) rm -f "$UNIT/updates/"*; echo "ii solvik4-rh" >"$UNIT/packages" ;; esac\n'
+# The call that MENDED names leaves these packages.
+MENDS = CALL + 'case $call in "$MENDED"*) rm -f "$UNIT/updates/"*; echo "$LEFT" >"$UNIT/packages" ;; esac\n'
 TOOLS = {
     "apt-cache": CALL + 'cat "$UNIT/policy"',
     "apt-get": MENDS,
     "dpkg": MENDS + 'cat >"$UNIT/selections"',
-    "dpkg-query": 'cat "$UNIT/packages"',
+    "dpkg-query": r"""[ "$*" != '--show --showformat ${db:Status-Abbrev}${Package}\n' ] || cat "$UNIT/packages" """,
     "journalctl": CALL + 'echo "a line"; echo "-- cursor: s=1;i=2"; echo "a warning" >&2',
     "sleep": CALL,
     "systemctl": CALL + 'if [ "$1" = show ]; then head -n 1 "$UNIT/jobs"; sed -i 1d "$UNIT/jobs"; fi',
@@ -44,7 +44,7 @@ class Prepare(StandInTest):
 
     def setUp(self) -> None:
         super().setUp()
-        self.environment["MENDED"] = "nothing"
+        self.environment |= {"MENDED": "nothing", "LEFT": "ii solvik4-rh"}
         (self.unit / "updates").mkdir()
         self.write(packages="ii solvik4-rh\nrc solvik4-old\nun other\nhi held\n", jobs="", wrong="")
         self.offer("1.3.0")
@@ -110,6 +110,8 @@ class Prepare(StandInTest):
         self.write(jobs="".join(f"ActiveState={state}\n" for state in ("activating", "active", "deactivating")))
         self.assertEqual(self.prepare(), "prepare: a job of apt's own timers is at work, waiting for it\n")
         self.assertEqual(self.calls("systemctl", "sleep"), [JOBS, "sleep 1"] * 3 + [JOBS])
+        self.write(jobs="ActiveState=active\n")
+        self.assertEqual(self.prepare(), "prepare: a job of apt's own timers is at work, waiting for it\n")
         for state in ("inactive", "failed"):
             self.write(jobs=f"ActiveState={state}\n")
             self.assertEqual(self.prepare(), "")
@@ -171,6 +173,9 @@ class Prepare(StandInTest):
         self.offer("1.2.0")
         self.prepare(status=1)
         self.assertEqual(self.calls("apt-get")[-1], f"{REINSTALL} solvik4-rh solvik4-rh-data other")
+        self.environment |= {"MENDED": MEND, "LEFT": BROKEN}
+        self.prepare(status=1)
+        self.assertEqual(self.calls("apt-get")[-1], f"{REINSTALL} solvik4-rh")
 
     def test_other_package_that_stays_broken_does_not_keep_the_updater(self) -> None:
         self.write(packages="ii solvik4-rh\niU other\n")

@@ -155,20 +155,21 @@ class PassedOn(HandOverTest):
             for shell in shells.values():
                 codes = [self.shell(line, shell or "", direct).returncode for direct in (False, True)]
                 self.assertEqual(codes[0], codes[1])
-        self.assertIn("aplay: not found in ", self.shell("aplay x", shells["dash"] or "").stderr)
+        said = f"hand-over: aplay: not found in {self.folder}/tools\n"
+        self.assertEqual(self.shell("aplay x", shells["dash"] or "").stderr, said)
         (self.folder / "tools/apt").write_text("no program\n")
         done = self.shell("apt update", shells["dash"] or "")
         self.assertEqual(done.returncode, 126)
-        self.assertIn("apt: not to be run", done.stderr)
+        self.assertEqual(done.stderr, f"hand-over: apt: not to be run in {self.folder}/tools\n")
 
     def test_first_one_that_can_be_run_is_the_real_one(self) -> None:
-        for name in "abcd":
+        for name in ("a", "b", "nib", "bin2"):
             (self.folder / name).mkdir()
         (self.folder / "a/apt").mkdir()
         (self.folder / "b/apt").write_text("no program\n")
-        for name in "cd":
+        for name in ("nib", "bin2"):
             write_script(self.folder / name / "apt", f"echo {name}")
-        for folders in ("abcd", "acbd"):
+        for folders in (("a", "b", "nib", "bin2"), ("a", "bin2", "b", "nib")):
             search = ":".join(str(self.folder / name) for name in folders)
             self.direct["PATH"] = f"{search}:/usr/bin:/bin"
             self.environment["PATH"] = f"{self.folder}/bin:{self.direct['PATH']}"
@@ -176,7 +177,7 @@ class PassedOn(HandOverTest):
 
     def test_empty_folder_of_the_path_is_the_present_one(self) -> None:
         self.tool("apt", 'echo "$PATH"')
-        for path in ("", "/nowhere:"):
+        for path in ("", "/nowhere:", "."):
             self.environment["PATH"] = f"{self.folder}/bin:{path}"
             done = self.shell(f"cd {self.folder}/tools; ../bin/apt update", "/bin/dash")
             self.assertEqual((done.returncode, done.stdout), (0, f"{path}\n"))

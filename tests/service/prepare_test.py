@@ -98,12 +98,13 @@ class Prepare(StandInTest):
 
     def test_stick_that_is_not_the_makers_keeps_the_updater_from_running(self) -> None:
         for wrong, said in (("changed: x\nadded: y\n", ("changed: x", "added: y")), ("", ("it cannot be read",))):
-            self.write(keyring="", wrong=wrong, packages=BROKEN)
+            self.write(keyring="", wrong=wrong, packages=BROKEN, jobs="ActiveState=active\n")
             with (self.unit / "bin/verify-stick").open("a") as tool:
                 tool.write("exit 1\n")
             lines = [f"prepare: the stick is not as the maker signed it: {what}\n" for what in said]
             self.assertEqual(self.prepare(status=1), "".join(lines) + "prepare: the updater is not run\n")
-            self.assertEqual(self.repairs(), [])
+            self.assertEqual(self.calls("systemctl", "dpkg", "apt-get"), [])
+            self.assertTrue((self.unit / "run/notes").exists())
             self.setUp()
 
     def test_jobs_of_apts_own_timers_are_waited_for(self) -> None:

@@ -13,10 +13,12 @@ import time
 import unittest
 from pathlib import Path
 
+from bench.makers.files import write_script
 from bench.makers.keys import make_key
 from bench.makers.sticks import VERSIONS, zip_archive
 from tests.command_line import skip, take_path
 
+ROOT = Path(__file__).parents[3]
 SCRIPT = "#!/bin/sh\nunzip -o root/OSUpgrade.zip\n"
 MANIFEST = "harl-updater.manifest"
 
@@ -230,6 +232,22 @@ class Signed(Stick):
         script.rename(self.stick / "moved")
         script.symlink_to("../../../../../moved")
         self.wrong(f"missing: {VERSIONS}/quorb2.2.0/unzipUpgrade.sh")
+        script.unlink()
+        script.symlink_to("../../../../moved")  # even one that leads to the signed file
+        self.wrong(f"missing: {VERSIONS}/quorb2.2.0/unzipUpgrade.sh")
+
+    def test_file_that_cannot_be_read(self) -> None:
+        write_script(self.folder / "bin/sha256sum", "exit 1")
+        done = subprocess.run(
+            [ROOT / "service/verify-stick", self.stick, self.keyring],
+            env={"PATH": f"{self.folder}/bin:{os.environ['PATH']}"},
+            capture_output=True,
+            text=True,
+            check=False,
+        )
+        names = ("OSUpgrade.zip", "unzipUpgrade.sh")
+        self.assertEqual(done.stdout, "".join(f"unreadable: {VERSIONS}/quorb2.2.0/{name}\n" for name in names))
+        self.assertEqual(done.returncode, 1)
 
     def test_changed_manifest(self) -> None:
         manifest = self.stick / MANIFEST

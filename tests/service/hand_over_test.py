@@ -381,6 +381,16 @@ class Limits(HandOverTest):
         process.terminate()
         self.assertEqual(process.wait(10), 7)
 
+    def test_signal_that_the_caller_ignores(self) -> None:
+        dies = "import signal, time; signal.signal(signal.SIGTERM, signal.SIG_DFL); open('ready', 'w'); time.sleep(0.5)"
+        self.tool("apt", f'exec python3 -c "{dies}"')
+        line = "trap '' TERM; exec bin/apt update"
+        process = subprocess.Popen(["dash", "-c", line], cwd=self.folder, env=self.environment)
+        while not (self.folder / "ready").exists():
+            time.sleep(0.05)
+        process.terminate()
+        self.assertEqual(process.wait(10), 0)
+
     def test_budget(self) -> None:
         self.tool("i2cset", "echo called >>$FOLDER/called; [ $1 != -h ] || exit 1; exec sleep 60")
         used_up = []

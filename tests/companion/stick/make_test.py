@@ -236,8 +236,10 @@ class Signed(Stick):
         script.symlink_to("../../../../moved")  # even one that leads to the signed file
         self.wrong(f"missing: {VERSIONS}/quorb2.2.0/unzipUpgrade.sh")
 
-    def test_file_that_cannot_be_read(self) -> None:
-        write_script(self.folder / "bin/sha256sum", "exit 1")
+    def verify(self, **tools: str) -> tuple[str, str, int]:
+        """What the service's verification alone prints, its errors and its status, with tools of these lines."""
+        for name, lines in tools.items():
+            write_script(self.folder / "bin" / name, lines)
         done = subprocess.run(
             [ROOT / "service/verify-stick", self.stick, self.keyring],
             env={"PATH": f"{self.folder}/bin:{os.environ['PATH']}"},
@@ -245,9 +247,26 @@ class Signed(Stick):
             text=True,
             check=False,
         )
-        names = ("OSUpgrade.zip", "unzipUpgrade.sh")
-        self.assertEqual(done.stdout, "".join(f"unreadable: {VERSIONS}/quorb2.2.0/{name}\n" for name in names))
-        self.assertEqual(done.returncode, 1)
+        return done.stdout, done.stderr, done.returncode
+
+    def test_verification_names_every_fault(self) -> None:
+        self.assertEqual(self.verify(), ("", "", 0))
+        folder = f"{VERSIONS}/quorb2.2.0"
+        (self.stick / folder / "unzipUpgrade.sh").write_text("")
+        (self.stick / folder / "more").touch()
+        wrong = f"changed: {folder}/unzipUpgrade.sh\nadded: {folder}/more\n"
+        self.assertEqual(self.verify(), (wrong, "", 1))
+        wrong = f"unreadable: {folder}/OSUpgrade.zip\nunreadable: {folder}/unzipUpgrade.sh\nadded: {folder}/more\n"
+        self.assertEqual(self.verify(sha256sum="exit 1"), (wrong, "", 1))
+
+    def test_verification_that_gpgv_does_not_end(self) -> None:
+        for printed, status in (("[GNUPG:] VALIDSIG", 2), ("", 127)):
+            wrong = f"the signature cannot be checked: gpgv ended with status {status}\n"
+            self.assertEqual(self.verify(gpgv=f"echo '{printed}'; exit {status}"), (wrong, "", 1))
+        shutil.rmtree(self.stick)
+        said, errors, status = self.verify()
+        self.assertEqual((said, status), ("", 1))
+        self.assertIn("cd: can't cd to", errors)
 
     def test_changed_manifest(self) -> None:
         manifest = self.stick / MANIFEST

@@ -31,6 +31,7 @@ exit "$I2CSET_STATUS"
     "umount": """
 echo "umount $*" >>"$UNIT/calls"
 { : >"$RUNTIME_DIRECTORY/note"; } 2>/dev/null
+cp "$UNIT/uptime" "$UNIT/released"
 [ ! -s "$UNIT/busy" ] || { sed -i 1d "$UNIT/busy"; exit 32; }
 [ -e "$UNIT/stuck" ] && [ "$1" != --lazy ] && exit "$UMOUNT_STATUS"
 : >"$UNIT/mounts"
@@ -88,9 +89,9 @@ class GiveBack(StandInTest):
         with (self.unit / "run/notes").open("a") as file:
             file.writelines(f"{BEGIN - before}.00 {note}\n" for note in notes)
 
-    def started(self) -> int:
-        """When the application was started (s since the beginning)."""
-        return int(float((self.unit / "started").read_text().split()[0])) - BEGIN
+    def started(self, what: str = "started") -> int:
+        """When the application was started (s since the beginning), or the stick released."""
+        return int(float((self.unit / what).read_text().split()[0])) - BEGIN
 
     def give_back(self, beside: str = ":", after: str = ":", at_work: tuple[str, ...] = (), status: int = 0) -> str:
         """Runs it once the processes of the shell line `beside` are `at_work`, then `after`; returns its output."""
@@ -133,6 +134,8 @@ class GiveBack(StandInTest):
         self.assertIn(f"give-back: the updater ended ({ended}) before it had an outcome: showing the failure", said)
         self.assertEqual(self.panel(), ENDED_EARLY.panel)
         self.assertEqual(self.panel(half_sent=True), ENDED_EARLY.panel)
+        self.assertEqual(self.calls("i2cset", "umount")[-1], "umount /root/USB_MOUNT")  # the outcome comes first
+        self.assertEqual(self.started("released"), 0)
         self.assert_instrument_is_given_back()
 
     def test_end_after_the_outcome_leaves_the_panel_alone(self) -> None:
@@ -246,8 +249,9 @@ class GiveBack(StandInTest):
 
     def test_byte_that_is_being_sent_is_waited_for(self) -> None:
         self.environment["ENDS"] = str(BEGIN + 3)
+        (self.unit / "late").write_text(f"{BEGIN + 3}.00 lit 0x13 0x2 0\n")
         said = self.give_back("./i2cset 60 &", at_work=("i2cset",))
-        self.assertIn("give-back: the panel is still at work, waiting for it", said)
+        self.assertEqual(said, "give-back: the panel is still at work, waiting for it\n")
         self.assertEqual(self.started(), 3 + READ)
 
     def test_notes_that_cannot_be_written(self) -> None:

@@ -292,6 +292,7 @@ class Signed(Stick):
     def test_nothing_for_the_board_is_nothing_to_verify(self) -> None:
         shutil.rmtree(self.stick / "debs/QUORB")
         self.assertNotIn("stick-signature", self.check("--keyring", self.keyring, status=1))
+        self.assertEqual(self.verify(), ("", "", 0))
 
 
 if __name__ == "__main__":

@@ -122,8 +122,9 @@ bool HeldSignals::any() const
 }
 
 CommandResult runCommand(const std::vector<std::string>& arguments, const std::vector<std::string>& environment,
-                         std::chrono::milliseconds limit)
+                         std::chrono::milliseconds limit, const std::function<bool(std::chrono::milliseconds)>& goesOn)
 {
+    using Clock = std::chrono::steady_clock;
     CommandResult result;
     const std::string program = findProgram(arguments.front(), searchPathOf(environment));
     const Descriptor output = makeOutput();
@@ -132,7 +133,7 @@ CommandResult runCommand(const std::vector<std::string>& arguments, const std::v
         return result;
     }
     const HeldSignals signals;
-    const auto deadline = std::chrono::steady_clock::now() + limit;
+    const Clock::time_point begin = Clock::now();
     const pid_t child = spawn(program, arguments, environment, output.number(), errors.number());
     if (child < 0) {
         return result;
@@ -143,7 +144,8 @@ CommandResult runCommand(const std::vector<std::string>& arguments, const std::v
     for (std::chrono::milliseconds pause{1}; !hasEnded(child) && !result.timedOut;
          pause = std::min(2 * pause, longestPause)) {
         std::this_thread::sleep_for(pause);
-        result.timedOut = std::chrono::steady_clock::now() >= deadline || signals.any();
+        const auto time = std::chrono::duration_cast<std::chrono::milliseconds>(Clock::now() - begin);
+        result.timedOut = time >= limit || signals.any() || (goesOn && !goesOn(time));
     }
     if (result.timedOut) {
         kill(-child, SIGKILL);

@@ -2,6 +2,7 @@
 
 #include <chrono>
 #include <csignal>
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -9,7 +10,7 @@
 struct CommandResult
 {
     bool started = false;
-    bool timedOut = false; ///< It was killed at its time limit.
+    bool timedOut = false; ///< It was killed.
     int exitCode = -1;     ///< -1 when it was not started, timed out or was ended by a signal
     std::string output;    ///< standard output, the first 256 KiB of it
     std::string errors;    ///< standard error, likewise
@@ -36,12 +37,14 @@ private:
 };
 
 /// Runs a program without a shell, as a service runs it: no terminal, no input. It and its children are killed at
-/// `limit`, and when this program is to end.
+/// `limit`, when `goesOn` says no, and when this program is to end.
 ///
 /// @param arguments    the program, looked for on the PATH of `environment` when it holds no slash, and its arguments
 /// @param environment  all of its environment, as NAME=value
+/// @param goesOn       asked a hundred times a second, with the time since the start; empty: the limit alone counts
 CommandResult runCommand(const std::vector<std::string>& arguments, const std::vector<std::string>& environment,
-                         std::chrono::milliseconds limit);
+                         std::chrono::milliseconds limit,
+                         const std::function<bool(std::chrono::milliseconds)>& goesOn = {});
 
 /// The program that `name` stands for on `searchPath` (folders with colons between); empty when there is none.
 std::string findProgram(const std::string& name, const std::string& searchPath);

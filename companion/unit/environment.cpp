@@ -5,6 +5,7 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <iostream>
 #include <iterator>
 #include <sstream>
 #include <system_error>
@@ -16,6 +17,7 @@ namespace
 {
 
 const char defaultSearchPath[] = "/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin"; // systemd.exec(5)
+const auto patience = 2s; // before a word on what is waited for
 
 std::string assignment(const std::string& name, const std::string& value)
 {
@@ -27,7 +29,8 @@ std::string assignment(const std::string& name, const std::string& value)
 UnitSite thisUnit()
 {
     return {"", defaultSearchPath, geteuid() == 0,
-            [](int seconds) { std::this_thread::sleep_for(std::chrono::seconds(seconds)); }};
+            [](int seconds) { std::this_thread::sleep_for(std::chrono::seconds(seconds)); },
+            isatty(STDERR_FILENO) == 1 ? &std::cerr : nullptr};
 }
 
 Unit::Unit(const UnitSite& site) : mSite(site)
@@ -46,13 +49,22 @@ Unit::Unit(const UnitSite& site) : mSite(site)
     mMainHead = isInstalled(packageOf(true)) && !isInstalled(packageOf(false));
 }
 
-CommandResult Unit::run(const std::vector<std::string>& arguments, std::chrono::milliseconds limit) const
+CommandResult Unit::run(const std::vector<std::string>& arguments, std::chrono::milliseconds limit,
+                        const std::function<bool(std::chrono::milliseconds)>& goesOn) const
 {
     std::vector<std::string> environment = {"RES_OPTIONS=timeout:1 attempts:2"}; // resolv.conf(5)
     for (const auto& [name, value] : mEnvironment) {
         environment.push_back(assignment(name, value));
     }
-    return runCommand(arguments, environment, limit);
+    bool told = mSite.waits == nullptr;
+    return runCommand(arguments, environment, limit, [&](std::chrono::milliseconds time) {
+        if (!told && time > patience) {
+            const auto most = std::chrono::duration_cast<std::chrono::seconds>(limit).count();
+            *mSite.waits << "harl-updater-tool: waiting for " << arguments.front() << ", " << most << " s at most\n";
+            told = true;
+        }
+        return !goesOn || goesOn(time);
+    });
 }
 
 std::string Unit::locale() const

@@ -20,7 +20,9 @@ struct UnitSite
     std::string root;       ///< Goes in front of every absolute path that is read; empty for the machine itself.
     std::string searchPath; ///< The services' PATH where the service manager does not tell it.
     bool isRoot = true;     ///< The check has root's rights.
-    std::function<void(int seconds)> pause; ///< Waits while a lamp colour is shown.
+    std::function<void(int seconds)> pause;  ///< Waits while a lamp colour is shown.
+    std::ostream* waits = nullptr;           ///< A terminal, which is told what is waited for.
+    std::chrono::milliseconds silence = 25s; ///< A refresh ends when nothing comes for longer.
 };
 
 /// The unit that the program runs on.
@@ -33,8 +35,9 @@ public:
     /// Asks the service manager, and the package manager which head it is.
     explicit Unit(const UnitSite& site);
 
-    /// Runs `arguments` with the service's search path and locale.
-    CommandResult run(const std::vector<std::string>& arguments, std::chrono::milliseconds limit) const;
+    /// Runs `arguments` with the service's search path and locale; see runCommand().
+    CommandResult run(const std::vector<std::string>& arguments, std::chrono::milliseconds limit,
+                      const std::function<bool(std::chrono::milliseconds)>& goesOn = {}) const;
 
     /// The program that the service's search path leads to; empty when there is none.
     std::string program(const std::string& name) const { return findProgram(name, searchPath()); }
@@ -48,6 +51,7 @@ public:
     std::string path(const std::string& absolute) const { return mSite.root + absolute; }
 
     bool isRoot() const { return mSite.isRoot; }
+    std::chrono::milliseconds silence() const { return mSite.silence; }
 
     /// True for a main head: its package is installed and the remote head's is not. Its own program shows the outcome;
     /// the panel and the sounds are the remote head's.

@@ -157,7 +157,7 @@ bool makeLists(const Unit& unit, const std::string& folder)
              << "#clear APT::Update::Post-Invoke-Success;\n"
              << "Dir::State::lists \"" << folder << "/lists\";\nDir::Cache \"" << folder << "\";\n"
              << "APT::Sandbox::User \"root\";\nAcquire::Retries \"0\";\n"
-             << "Acquire::http::Timeout \"20\";\nAcquire::https::Timeout \"20\";\n";
+             << "Acquire::http::Timeout \"10\";\nAcquire::https::Timeout \"10\";\n";
     return settings.flush().good();
 }
 
@@ -185,9 +185,21 @@ bool reportUnfetched(const std::string& errors, Report& report)
     return !told.empty();
 }
 
+/// Bytes of the lists in `folder` that were fetched or are being fetched.
+std::uint64_t bytesFetched(const std::string& folder)
+{
+    std::uint64_t bytes = 0;
+    std::error_code error;
+    for (const auto& list : std::filesystem::recursive_directory_iterator(folder + "/lists", error)) {
+        const bool plain = !list.is_symlink(error) && list.is_regular_file(error);
+        bytes += plain ? list.file_size(error) : 0;
+    }
+    return bytes;
+}
+
 /// Refreshes the mirrors into lists of its own, so that nothing changes on the unit: the fact "package_now", or what
 /// keeps the updater from its refresh.
-void refreshPrivately(const Unit& unit, Report& report)
+void refreshPrivately(const Unit& unit, const std::vector<std::string>& hosts, Report& report)
 {
     const TemporaryFolder folder(unit);
     if (folder.path().empty() || !makeLists(unit, folder.path())) {
@@ -195,10 +207,21 @@ void refreshPrivately(const Unit& unit, Report& report)
         return;
     }
     const std::string settings = folder.path() + "/apt.conf";
-    const CommandResult refresh = unit.run({"apt-get", "-c", settings, "update"}, refreshLimit);
+    std::uint64_t bytes = 0;
+    std::chrono::milliseconds since{0};
+    bool silent = false;
+    const CommandResult refresh = unit.run({"apt-get", "-c", settings, "update"}, refreshLimit, [&](auto time) {
+        const std::uint64_t now = bytesFetched(folder.path());
+        since = std::exchange(bytes, now) == now ? since : time;
+        silent = time - since >= unit.silence();
+        return !silent;
+    });
     const bool fetched = !reportUnfetched(refresh.errors, report);
     if (!refresh.succeeded()) {
-        report.add(refresh.timedOut ? "mirrors-unknown.slow" : "refresh-fails", {{"complaint", complaint(refresh)}});
+        report.add(silent             ? "mirrors-unknown.silent"
+                   : refresh.timedOut ? "mirrors-unknown.slow"
+                                      : "refresh-fails",
+                   {{"complaint", complaint(refresh)}, {"hosts", listed(hosts)}});
     }
     if (!refresh.succeeded() || !fetched) {
         return;
@@ -229,7 +252,7 @@ void checkMirrors(const Unit& unit, Report& report)
         report.add("mirrors-none");
         return;
     }
-    refreshPrivately(unit, report);
+    refreshPrivately(unit, {hosts.begin(), hosts.end()}, report);
 }
 
 } // namespace

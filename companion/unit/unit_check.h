@@ -22,7 +22,8 @@ void checkBoard(const Unit& unit, Report& report);
 /// Checks whether the unit is fit for an update, and prints the report to `out`.
 ///
 /// Starts no service and lights no LED; writes only a temporary folder, which it removes, and what the package tool
-/// caches of its own accord. Mirrors that do not answer cost up to two minutes. With `panel` or `sound` it does what
+/// caches of its own accord. A mirror that gives nothing costs 25 s, a slow one up to
+/// two minutes. With `panel` or `sound` it does what
 /// these ask for instead, unless the updater is running.
 ///
 /// @return a Report::Status; STATUS_UNCHECKED, with a message on `errors`, when a test is refused

@@ -572,7 +572,8 @@ TEST_F(UnitCheck, MirrorsAreRefreshedPrivatelyAndWithoutTheUnitsHooks)
                              "APT::Update { Pre-Invoke" +
                              hook + "Post-Invoke" + hook + "Post-Invoke-Success" + hook + "};\n");
     for (const std::string tool : {"apt-get", "apt-cache"}) {
-        unit.replaceTool(tool, "export PATH=/usr/bin:/bin APT_CONFIG=" + root + "/apt.conf\nexec " + tool + " \"$@\"");
+        std::string script = "export PATH=/usr/bin:/bin APT_CONFIG=";
+        unit.replaceTool(tool, script.append(root).append("/apt.conf\nexec ").append(tool).append(" \"$@\""));
     }
     EXPECT_EQ(check().report["facts"]["package_now"], "1.4.0");
     EXPECT_FALSE(fs::exists(root + "/hook"));
@@ -601,6 +602,39 @@ TEST_F(UnitCheck, SilentMirrorIsAnErrorThatExplainsTheExitStatus)
     EXPECT_THAT(result.report["findings"][0]["what"].get<std::string>(),
                 HasSubstr("does not answer: \"Could not resolve 'mirror.invalid'\""));
     EXPECT_THAT(result.report["findings"][0]["effect"].get<std::string>(), HasSubstr("\"apt update\" ends with 0"));
+}
+
+TEST_F(UnitCheck, MirrorThatGivesNothingIsNotWaitedForToTheEnd)
+{
+    const std::string silent = "case $* in *print-uris) echo \"'http://mirror.invalid/1' 1 0 \"; exit;; esac\n";
+    unit.replaceTool("apt-get", silent + "PATH=/bin exec sleep 60");
+    UnitSite site = unit.site();
+    site.silence = 100ms;
+    const CheckResult result = check(site);
+    EXPECT_EQ(result.findings, Lines{"unchecked mirrors-unknown"});
+    EXPECT_THAT(result.report["findings"][0]["what"].get<std::string>(), HasSubstr("\"mirror.invalid\""));
+}
+
+TEST_F(UnitCheck, MirrorThatGoesOnIsWaitedFor)
+{
+    const std::string settings = "while [ $# -gt 0 ]; do [ \"$1\" != -c ] || lists=${2%/*}/lists; shift; done\n";
+    unit.replaceTool("apt-get", "case $* in *print-uris) echo \"'http://mirror.invalid/1' 1 0 \"; exit;; esac\n" +
+                                    settings +
+                                    "for n in 1 2 3 4 5 6 7 8 9 10; do echo $n >>$lists/partial/list; "
+                                    "PATH=/bin sleep 0.3; done");
+    UnitSite site = unit.site();
+    site.silence = 2s;
+    EXPECT_EQ(check(site).findings, Lines());
+}
+
+TEST_F(UnitCheck, TerminalIsToldWhatIsWaitedFor)
+{
+    unit.replaceTool("apt-cache", "PATH=/bin sleep 2.2");
+    UnitSite site = unit.site();
+    std::ostringstream terminal;
+    site.waits = &terminal;
+    check(site);
+    EXPECT_THAT(terminal.str(), HasSubstr("harl-updater-tool: waiting for apt-cache, 10 s at most\n"));
 }
 
 TEST_F(UnitCheck, SourcesThatCannotBeReadAreAnError)

@@ -5,6 +5,7 @@ service_test.py), with shortened limits, and a few with the shipped ones. Each t
 panel must show the outcome of that failure, and the next run must end normally.
 """
 
+import json
 import time
 from collections.abc import Iterable
 from dataclasses import dataclass
@@ -61,6 +62,16 @@ BOARD_TOOLS = {
 
 class HangTest(ServiceTest):
     """A unit with a package and a board to update."""
+
+    passed = not_well = 0  # cases in which the panel passes, and passes over a unit that is not well
+
+    @classmethod
+    def tearDownClass(cls) -> None:
+        if cls.passed:
+            print(
+                f"{cls.__name__}: the panel passes in {cls.passed} cases, in {cls.not_well} of them over a unit that "
+                "is not well: the log says so each time"
+            )
 
     def setUp(self) -> None:
         super().setUp()
@@ -131,6 +142,19 @@ class HangTest(ServiceTest):
         self.assertEqual(self.ended_as(), ("success", "2", "15"))
         self.assertEqual(self.package_state(), "install ok installed 1.3.0")
 
+    def check_log(self) -> None:
+        """The panel passes: the log says that the unit is not well if it is not, and only then."""
+        wait_for("the verification", lambda: "verify: " in self.journal(), 90)
+        found = (self.package_state(), self.read("/srv/board"), self.inside("systemctl", "is-active", "harl"))
+        well = found == ("install ok installed 1.3.0", "2.2.0\n", "active\n")
+        log = self.inside("sh", "-c", "harl-updater-tool log --journal --last --json; echo $?")
+        said, status = log.rstrip().rsplit("\n", 1)
+        meaning = json.loads(said)["runs"][0]["meaning"]
+        self.assertEqual("not well" in meaning, not well, meaning)
+        self.assertTrue(well or status == "1", f"status {status}: {meaning}")
+        type(self).passed += 1
+        type(self).not_well += not well
+
     def check(self, command: Command, how: str) -> None:
         """One case of the matrix."""
         outcome = UPDATED if how == KINDS["leaves_its_output_open"] else command.outcome
@@ -142,6 +166,8 @@ class HangTest(ServiceTest):
         lost = command.once and how != KINDS["leaves_its_output_open"]  # one byte of a pair
         self.assertEqual(self.panel(faults=lost), outcome.panel)
         self.assertEqual(self.unit.status("systemctl", "is-active", "--quiet", "harl"), 0)
+        if outcome == UPDATED:
+            self.check_log()
         self.check_next_run()
 
 

@@ -2,6 +2,8 @@
 
 #include "log/text.h"
 
+#include <array>
+
 namespace
 {
 
@@ -49,20 +51,7 @@ Json versionsToJson(const Versions& versions, const std::string& text)
             {"text", text}};
 }
 
-const char* endName(RunEnd end)
-{
-    switch (end) {
-    case RunEnd::NOT_SEEN:
-        return "not-seen";
-    case RunEnd::BY_SERVICE_MANAGER:
-        return "by-service-manager";
-    case RunEnd::BY_ITSELF:
-        return "by-itself";
-    case RunEnd::EARLY:
-        return "early";
-    }
-    return "";
-}
+const std::array<const char*, 4> endNames = {"not-seen", "by-service-manager", "by-itself", "early"}; // of RunEnd
 
 } // namespace
 
@@ -108,7 +97,7 @@ nlohmann::ordered_json runToJson(const Run& run, const std::string& source)
             {"panel", leds},
             {"sound", view.sound},
             {"operator", view.seen},
-            {"ended", endName(run.ended)},
+            {"ended", endNames.at(static_cast<std::size_t>(run.ended))},
             {"package", versionsToJson(run.package, packageText(run))},
             {"board", versionsToJson(run.board, boardText(run))},
             {"steps", steps},

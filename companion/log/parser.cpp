@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <cstring>
+#include <ctime>
 
 namespace
 {
@@ -28,15 +29,6 @@ int number(std::string_view text, std::size_t position, std::size_t digits)
         value = value * 10 + (text[index] - '0');
     }
     return value;
-}
-
-/// Days from 1970-01-01 to a date of the Gregorian calendar.
-std::int64_t daysSinceEpoch(std::int64_t year, int month, int day)
-{
-    // The year is made to begin in March, so that the leap day is its last.
-    year -= month <= 2 ? 1 : 0;
-    const std::int64_t dayOfYear = (153 * (month + (month > 2 ? -3 : 9)) + 2) / 5 + day - 1;
-    return year * 365 + year / 4 - year / 100 + year / 400 + dayOfYear - 719468;
 }
 
 bool isBlank(char character)
@@ -353,7 +345,11 @@ bool LogParser::parseTime(std::string_view text)
             return false;
         }
         mDate = text.substr(0, 10);
-        mMidnight = daysSinceEpoch(year, month, day) * 86400;
+        std::tm date = {};
+        date.tm_mday = day;
+        date.tm_mon = month - 1;
+        date.tm_year = year - 1900;
+        mMidnight = timegm(&date);
     }
     mHead.time = mMidnight + hour * std::int64_t{3600} + minute * std::int64_t{60} + second;
     return true;

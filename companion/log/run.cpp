@@ -51,6 +51,12 @@ const std::pair<Event, Outcome> outcomeEvents[] = {
     {Event::BOARD_REPORTED, Outcome::BOARD_FAILED},
 };
 
+const std::pair<StepKind, Outcome> stepFailures[] = {
+    {StepKind::REFRESH_MIRRORS, Outcome::MIRRORS_FAILED}, {StepKind::CHECK_PACKAGE, Outcome::CHECK_FAILED},
+    {StepKind::CHECK_TEAMVIEWER, Outcome::CHECK_FAILED},  {StepKind::INSTALL_PACKAGE, Outcome::PACKAGE_FAILED},
+    {StepKind::UPLOAD_BOARD, Outcome::BOARD_FAILED},
+};
+
 /// Printable, and no longer than what is kept of a text.
 std::string kept(std::string_view text)
 {
@@ -93,14 +99,19 @@ bool isOneCommand(StepKind kind)
     return kind == StepKind::REFRESH_MIRRORS || kind == StepKind::INSTALL_PACKAGE;
 }
 
+/// True for a step that comes only when the package or the board is installed.
+bool installs(StepKind kind)
+{
+    return kind == StepKind::INSTALL_PACKAGE || (kind >= StepKind::UPLOAD_BOARD && kind <= StepKind::WAIT_FOR_BOARD);
+}
+
 Outcome mainHeadOutcome(const Run& run)
 {
-    const bool boardFailed = run.board.state == Versions::State::NOT_READ;
-    if (boardFailed && !run.partsInstalled) {
-        return Outcome::CHECK_FAILED;
-    }
     if (run.partsInstalled) {
         return Outcome::NONE; // until it is reported as finished
+    }
+    if (run.board.state == Versions::State::NOT_READ) {
+        return Outcome::CHECK_FAILED;
     }
     if (!run.markerRemoved) {
         return Outcome::NONE;
@@ -122,9 +133,9 @@ Outcome remoteHeadOutcome(const Run& run)
     }
     const bool same = run.package.state == Versions::State::SAME;
     if (run.resultReported) {
-        if (run.package.differ() || run.board.differ() || run.markerRemoved ||
-            run.find(StepKind::INSTALL_PACKAGE) != nullptr || run.find(StepKind::UPLOAD_BOARD) != nullptr ||
-            run.find(StepKind::RUN_BOARD_SCRIPT) != nullptr || run.find(StepKind::WAIT_FOR_BOARD) != nullptr) {
+        const bool installed =
+            std::any_of(run.steps.begin(), run.steps.end(), [](const Step& step) { return installs(step.kind); });
+        if (run.package.differ() || run.board.differ() || run.markerRemoved || installed) {
             return Outcome::UPDATED;
         }
         return same && run.board.state != Versions::State::UNKNOWN ? Outcome::NO_UPDATE : Outcome::PASSED;
@@ -170,19 +181,9 @@ Outcome failureOf(const Step& step)
     if (step.result != StepResult::FAILED && !(isOneCommand(step.kind) && step.status && step.status->number != 0)) {
         return Outcome::NONE;
     }
-    switch (step.kind) {
-    case StepKind::REFRESH_MIRRORS:
-        return Outcome::MIRRORS_FAILED;
-    case StepKind::CHECK_PACKAGE:
-    case StepKind::CHECK_TEAMVIEWER:
-        return Outcome::CHECK_FAILED;
-    case StepKind::INSTALL_PACKAGE:
-        return Outcome::PACKAGE_FAILED;
-    case StepKind::UPLOAD_BOARD:
-        return Outcome::BOARD_FAILED;
-    default:
-        return Outcome::NONE;
-    }
+    const auto* const found = std::find_if(std::begin(stepFailures), std::end(stepFailures),
+                                           [&](const auto& failure) { return failure.first == step.kind; });
+    return found == std::end(stepFailures) ? Outcome::NONE : found->second;
 }
 
 void OtherLines::add(std::string_view text)
@@ -280,9 +281,7 @@ bool RunBuilder::beginsRun(const Meaning& meaning, bool whole) const
     if (!meaning.step || *meaning.step >= last) {
         return false;
     }
-    const bool part = *meaning.step == StepKind::INSTALL_PACKAGE || *meaning.step == StepKind::UPLOAD_BOARD ||
-                      *meaning.step == StepKind::RUN_BOARD_SCRIPT || *meaning.step == StepKind::WAIT_FOR_BOARD ||
-                      *meaning.step == StepKind::INSTALL_TEAMVIEWER;
+    const bool part = installs(*meaning.step) || *meaning.step == StepKind::INSTALL_TEAMVIEWER;
     return !(mRun->mainHead && part && last < StepKind::GIVE_BACK);
 }
 

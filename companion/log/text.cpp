@@ -87,15 +87,14 @@ std::string quoted(const OtherLines& lines)
 /// What came out of a step that succeeded.
 std::string doneText(const Run& run, const Step& step)
 {
+    const Versions& versions = step.kind == StepKind::CHECK_PACKAGE ? run.package : run.board;
     switch (step.event) {
     case Event::PACKAGE_DIFFERS:
-        return "an update: " + run.package.installed + " -> " + run.package.candidate;
-    case Event::PACKAGE_SAME:
-        return "up to date: " + run.package.installed;
     case Event::BOARD_DIFFERS:
-        return "an update: " + run.board.installed + " -> " + run.board.candidate;
+        return "an update: " + versions.installed + " -> " + versions.candidate;
+    case Event::PACKAGE_SAME:
     case Event::BOARD_SAME:
-        return "up to date" + (run.board.installed.empty() ? "" : ": " + run.board.installed);
+        return "up to date" + (versions.installed.empty() ? "" : ": " + versions.installed);
     case Event::TEAMVIEWER_REQUESTED:
         return "an installation is requested";
     case Event::TEAMVIEWER_NOT_REQUESTED:
@@ -145,9 +144,8 @@ std::string versionsText(const Run& run, const Versions& versions, StepKind chec
         return "versions not read";
     }
     if (!versions.found()) {
-        return step == nullptr ? (run.beginningMissing ? "not in this log" : "not checked")
-               : step->took    ? "not in this log"
-                               : "not checked";
+        const bool checked = step == nullptr ? run.beginningMissing : step->took.has_value();
+        return checked ? "not in this log" : "not checked";
     }
     if (!versions.differ()) {
         return (versions.installed.empty() ? "" : versions.installed + ", ") + "up to date";
@@ -382,12 +380,11 @@ OperatorView operatorView(const Run& run)
         view.seen =
             "REMOTE and MAIN, or " + std::string(color == "pass" ? "PASS" : "FAIL") + ", in " + color + " colour";
     } else {
+        view.leds = {{facts.bothLeds ? "REMOTE" : color == "pass" ? "PASS" : "FAIL", color}};
+        view.seen = view.leds.front().first + (facts.bothLeds ? " and MAIN" : "") + " lit in " + color + " colour";
         if (facts.bothLeds) {
-            view.leds = {{"REMOTE", color}, {"MAIN", color}};
-        } else {
-            view.leds = {{color == "pass" ? "PASS" : "FAIL", color}};
+            view.leds.emplace_back("MAIN", color);
         }
-        view.seen = (facts.bothLeds ? "REMOTE and MAIN" : view.leds.front().first) + " lit in " + color + " colour";
     }
     if (run.outcomeLedFailures > 0 && !run.statusesLost) {
         view.leds.clear();

@@ -19,11 +19,6 @@ namespace
 const char defaultSearchPath[] = "/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin"; // systemd.exec(5)
 const auto patience = 2s; // before a word on what is waited for
 
-std::string assignment(const std::string& name, const std::string& value)
-{
-    return name + '=' + value;
-}
-
 } // namespace
 
 UnitSite thisUnit()
@@ -54,7 +49,7 @@ CommandResult Unit::run(const std::vector<std::string>& arguments, std::chrono::
 {
     std::vector<std::string> environment = {"RES_OPTIONS=timeout:1 attempts:2"}; // resolv.conf(5)
     for (const auto& [name, value] : mEnvironment) {
-        environment.push_back(assignment(name, value));
+        environment.push_back(name + '=' + value);
     }
     bool told = mSite.waits == nullptr;
     return runCommand(arguments, environment, limit, [&](std::chrono::milliseconds time) {
@@ -72,8 +67,7 @@ std::string Unit::locale() const
     std::string result;
     for (const auto& [name, value] : mEnvironment) {
         if (name != "PATH") {
-            result += result.empty() ? "" : " ";
-            result += assignment(name, value);
+            result += (result.empty() ? "" : " ") + name + '=' + value;
         }
     }
     return result;

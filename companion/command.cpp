@@ -4,7 +4,6 @@
 
 #include <algorithm>
 #include <array>
-#include <cerrno>
 #include <csignal>
 #include <sstream>
 #include <thread>
@@ -21,6 +20,7 @@ namespace
 const std::size_t mostKept = std::size_t{256} * 1024;          // bytes of an output
 const std::size_t mostWritten = std::size_t{64} * 1024 * 1024; // bytes; a program that writes more gets an error
 const std::chrono::milliseconds longestPause(10);              // between two looks at whether a program has ended
+const std::chrono::milliseconds killLimit(2000);               // for a killed program to be gone
 const std::array<int, 3> endings = {SIGHUP, SIGINT, SIGTERM};  // from outside
 
 /// A file in memory for what a program writes, which so waits for nobody and cannot fill the memory. Its length is that
@@ -149,9 +149,13 @@ CommandResult runCommand(const std::vector<std::string>& arguments, const std::v
     }
     if (result.timedOut) {
         kill(-child, SIGKILL);
+        for (auto tries = killLimit / longestPause; tries > 0 && !hasEnded(child); --tries) {
+            std::this_thread::sleep_for(longestPause);
+        }
     }
     int status = 0;
-    while (waitpid(child, &status, 0) == -1 && errno == EINTR) {
+    if (hasEnded(child)) { // else it waits for a file system or a device that does not answer
+        waitpid(child, &status, 0);
     }
     result.output = contentOf(output);
     result.errors = contentOf(errors);

@@ -1,13 +1,13 @@
 #include "findings.h"
 
+#include "terminal.h"
+
 #include <algorithm>
 #include <array>
 #include <cstdio>
-#include <iostream>
+#include <ostream>
 #include <utility>
 
-#include <sys/ioctl.h>
-#include <unistd.h>
 #include <utf8.h>
 
 namespace
@@ -75,14 +75,6 @@ std::size_t columnsOf(std::string_view text)
         columns += combines ? 0 : wide ? 2 : 1;
     }
     return columns;
-}
-
-std::size_t widthOf(const std::ostream& out)
-{
-    winsize window = {};
-    const bool known =
-        out.rdbuf() == std::cout.rdbuf() && ioctl(STDOUT_FILENO, TIOCGWINSZ, &window) == 0 && window.ws_col > 0;
-    return known ? window.ws_col : 100;
 }
 
 void printLine(std::string_view line, std::size_t width, std::ostream& out)

@@ -6,6 +6,7 @@
 #include "procedure.h"
 #include "stick/make.h"
 #include "stick/stick_check.h"
+#include "terminal.h"
 #include "unit/unit_check.h"
 
 #include <algorithm>
@@ -16,6 +17,7 @@
 #include <iostream>
 #include <new>
 #include <numeric>
+#include <sstream>
 #include <string>
 #include <vector>
 
@@ -41,27 +43,42 @@ std::size_t distance(const std::string& from, const std::string& to)
     return row.back();
 }
 
+/// "stick make", the command that a command line names; empty without one.
+std::string commandIn(const CLI::App& app)
+{
+    std::string name;
+    for (const CLI::App* command = &app; !command->get_subcommands().empty();) {
+        command = command->get_subcommands().front();
+        name += (name.empty() ? "" : " ") + command->get_name();
+    }
+    return name;
+}
+
 /// What is wrong with a command line, in plain words.
 std::string usageText(const CLI::App& app, const CLI::ParseError& error)
 {
-    const std::vector<CLI::App*> parsed = app.get_subcommands();
+    const std::string parsed = commandIn(app);
     const std::vector<std::string> rest = app.remaining(true);
     if (parsed.empty() && rest.empty()) {
         return "Name a command: stick, unit, check, verify, log, fleet, explain or report.";
     }
     if (parsed.empty()) {
+        if (rest.front().rfind('-', 0) == 0) {
+            return "Name a command before " + rest.front() + '.';
+        }
         std::string text = rest.front() + " is not a command.";
         for (const CLI::App* command : app.get_subcommands([](const CLI::App*) { return true; })) {
-            if (distance(rest.front(), command->get_name()) <= 2) {
-                text += " Did you mean " + command->get_name() + '?';
+            const std::string name = command->get_name();
+            if (distance(rest.front(), name) <= std::min<std::size_t>(2, name.size() / 2)) {
+                text += " Did you mean " + name + '?';
             }
         }
         return text;
     }
     if (!rest.empty()) {
         return rest.front() +
-               (rest.front().rfind('-', 0) == 0 ? " is not an option of " : " is one argument too many for ") +
-               parsed.front()->get_name() + '.';
+               (rest.front().rfind('-', 0) == 0 ? " is not an option of " : " is one argument too many for ") + parsed +
+               '.';
     }
     // "--html: 1 required PAGE missing", "FILE is required", "--oldest requires --sign", "--run: Number less ..."
     const std::string text = error.what();
@@ -81,8 +98,23 @@ std::string usageText(const CLI::App& app, const CLI::ParseError& error)
 /// Reports a wrong command line.
 int refuseUsage(const std::string& command, bool json, const std::string& text)
 {
-    return refuse(command, json, text + " See: harl-updater-tool " + command + (command.empty() ? "" : " ") + "--help",
-                  std::cout, std::cerr);
+    return refuse(command.substr(0, command.find(' ')), json,
+                  text + " See: harl-updater-tool " + command + (command.empty() ? "" : " ") + "--help", std::cout,
+                  std::cerr);
+}
+
+/// Prints the help that was asked for at the terminal's width: what goes on in a further line begins below its column.
+void printHelp(const CLI::App& app)
+{
+    const std::size_t column = widthOf(std::cout) < 60 ? 16 : 30;
+    app.get_formatter()->column_width(column);
+    std::istringstream lines(app.help());
+    for (std::string line; std::getline(lines, line);) {
+        if (line.size() > column && line.front() == ' ' && line[column - 1] == ' ') {
+            line.insert(column, "\t");
+        }
+        printText(line + '\n', std::cout);
+    }
 }
 
 int run(std::vector<std::string> arguments)
@@ -96,7 +128,9 @@ int run(std::vector<std::string> arguments)
     std::string stickPath = stickMountPoint;
     bool json = false;
     CLI::App* stick = app.add_subcommand("stick", "Show what the updater would do with a stick. Reads only.");
-    stick->add_option("PATH", stickPath, "the folder that the stick is mounted at")->capture_default_str();
+    stick->add_option("PATH", stickPath, "the folder that the stick is mounted at")
+        ->type_name("")
+        ->capture_default_str();
     stick->add_flag("--json", json, "print one JSON object");
     std::string keyring;
     stick->add_option("--keyring", keyring, "verify the stick with these keys instead of the installed ones")
@@ -106,6 +140,7 @@ int run(std::vector<std::string> arguments)
     MakeOptions makeOptions;
     CLI::App* make = stick->add_subcommand("make", "Make a stick: write it, read it back, sign it.");
     make->add_option("TARGET", makeOptions.target, "the folder that the stick is mounted at, or any folder")
+        ->type_name("")
         ->required();
     make->add_option("--archive", makeOptions.archive, "the board's upgrade archive")->type_name("ZIP")->required();
     make->add_option("--script", makeOptions.script, "the board's install script")->type_name("SCRIPT")->required();
@@ -131,7 +166,9 @@ int run(std::vector<std::string> arguments)
 
     std::string checkPath = stickMountPoint;
     CLI::App* check = app.add_subcommand("check", "Show what an update would do now: unit and stick. Run it as root.");
-    check->add_option("PATH", checkPath, "the folder that the stick is mounted at")->capture_default_str();
+    check->add_option("PATH", checkPath, "the folder that the stick is mounted at")
+        ->type_name("")
+        ->capture_default_str();
     check->add_flag("--json", json, "print one JSON object");
     check->footer(
         "Exit status: 0 the update will likely succeed, 1 it will not, 2 wrong usage or not everything could be "
@@ -145,12 +182,13 @@ int run(std::vector<std::string> arguments)
 
     LogOptions logOptions;
     CLI::App* log = app.add_subcommand("log", "Explain the updater's log: what happened, why, and what to do now.");
-    log->add_option("FILE", logOptions.files, "the log, or several in their order; - for standard input");
+    log->add_option("FILE", logOptions.files, "the log, or several in their order; - for standard input")
+        ->type_name("");
     log->add_flag("--journal", logOptions.journal, "read the journal of the service harl-updater");
     log->add_flag("--list", logOptions.list, "print one line for each run");
     log->add_option("--run", logOptions.run, "explain only the run with this number")
         ->type_name("N")
-        ->check(CLI::PositiveNumber);
+        ->check(CLI::Validator(CLI::PositiveNumber).description(""));
     log->add_flag("--last", logOptions.last, "explain only the last run");
     log->add_flag("--strict", logOptions.strict, "a warning is not status 0 either");
     log->add_flag("--follow", logOptions.follow, "show the run that goes on, until it ends");
@@ -178,16 +216,18 @@ int run(std::vector<std::string> arguments)
 
     std::string failure;
     CLI::App* explain = app.add_subcommand("explain", "Explain a failure by its name, or list all of them.");
-    explain->add_option("NAME", failure, "as in brackets in a report, such as mirrors-unreachable");
+    explain->add_option("NAME", failure, "as in brackets in a report, such as mirrors-unreachable")->type_name("");
     explain->add_flag("--json", json, "print one JSON object");
-    explain->footer("Exit status: 0, 2 wrong usage or no such name.\n");
+    explain->footer("Exit status: 0 explained, 2 wrong usage or no such name.\n");
 
     ReportOptions reportOptions;
     reportOptions.stick = stickMountPoint;
     CLI::App* report = app.add_subcommand("report", "Pack what support needs into one archive. Run it as root.");
-    report->add_option("FILE", reportOptions.file, "the archive to make, such as /tmp/report.tar.gz")->required();
+    report->add_option("FILE", reportOptions.file, "the archive to make, such as /tmp/report.tar.gz")
+        ->type_name("")
+        ->required();
     report->add_flag("--json", json, "print one JSON object");
-    report->footer("Exit status: 0, 2 wrong usage or the archive cannot be made.\n");
+    report->footer("Exit status: 0 made, 2 wrong usage or the archive cannot be made.\n");
 
     if (!arguments.empty() && arguments.front() == "help") { // "help log" is "log --help"
         arguments.erase(arguments.begin());
@@ -199,11 +239,14 @@ int run(std::vector<std::string> arguments)
     try {
         app.parse(std::move(arguments));
     } catch (const CLI::ParseError& error) {
-        if (error.get_exit_code() == 0) {
-            return app.exit(error); // --help, --version
+        if (error.get_name() == "CallForHelp") {
+            printHelp(app);
+            return 0;
         }
-        const std::vector<CLI::App*> parsed = app.get_subcommands();
-        return refuseUsage(parsed.empty() ? "" : parsed.front()->get_name(), wantsJson, usageText(app, error));
+        if (error.get_exit_code() == 0) {
+            return app.exit(error); // --version
+        }
+        return refuseUsage(commandIn(app), wantsJson, usageText(app, error));
     }
     if (make->parsed()) {
         makeOptions.progress = isatty(STDERR_FILENO) == 1;

@@ -418,7 +418,8 @@ std::string conflictIn(const LogOptions& options)
     if (options.last && options.run > 0) {
         return "--last and --run name one run each: leave one of them out.";
     }
-    return options.list && options.json ? "--list is for people: --json prints a list anyway." : "";
+    return options.list && options.json ? "--list is for people; --json prints a list anyway: leave one of them out."
+                                        : "";
 }
 
 int runLog(const LogOptions& options, std::ostream& out, std::ostream& err)

@@ -73,6 +73,11 @@ TEST_F(ToolProgram, WrongUsageGivesTwoAndSaysWhatToDo)
 TEST_F(ToolProgram, UnknownSubcommandIsNamed)
 {
     EXPECT_THAT(tool({"stik"}).errors, HasSubstr("harl-updater-tool: stik is not a command. Did you mean stick?"));
+    EXPECT_THAT(tool({"foo"}).errors, HasSubstr("harl-updater-tool: foo is not a command. See: "));
+    EXPECT_THAT(tool({"--json"}).errors, HasSubstr("harl-updater-tool: Name a command before --json. See: "));
+    EXPECT_THAT(tool({"stick", "make"}).errors,
+                HasSubstr("TARGET is missing. See: harl-updater-tool stick make --help"));
+    EXPECT_THAT(tool({"log", "--run"}).errors, HasSubstr("harl-updater-tool: Name N behind --run."));
     EXPECT_THAT(tool({"nonsense"}).errors, HasSubstr("harl-updater-tool: nonsense is not a command. See: "));
     EXPECT_THAT(tool({"log", "--html"}).errors, HasSubstr("harl-updater-tool: Name PAGE behind --html."));
     EXPECT_THAT(tool({"log", "--run", "0"}).errors, HasSubstr("harl-updater-tool: --run needs a number from 1 on."));
@@ -121,4 +126,23 @@ TEST_F(ToolProgram, HelpNamesThePlaceOfTheStickAndTheExitStatuses)
     EXPECT_THAT(result.output, HasSubstr("/root/USB_MOUNT"));
     EXPECT_THAT(result.output, HasSubstr("Exit status: 0 fit for an update, 1 not fit, 2 "));
     EXPECT_EQ(result.output.back(), '\n');
+}
+
+TEST_F(ToolProgram, HelpFitsTheTerminal)
+{
+    const std::string commands[] = {"", "stick", "stick make", "unit", "check", "verify", "log", "explain", "report"};
+    for (const std::string& command : commands) {
+        for (const std::size_t width : {40, 80}) {
+            const std::string line = "stty cols " + std::to_string(width) + "; " TOOL " " + command + " --help";
+            const CommandResult result = runCommand({"script", "--quiet", "--command", line, "/dev/null"},
+                                                    {"PATH=/usr/bin:/bin"}, std::chrono::seconds(20));
+            std::istringstream lines(result.output);
+            std::size_t longest = 0;
+            for (std::string one; std::getline(lines, one, '\r'); std::getline(lines, one)) {
+                longest = std::max(longest, one.size());
+            }
+            EXPECT_GT(longest, width / 2) << command;
+            EXPECT_LE(longest, width) << command << result.output;
+        }
+    }
 }

@@ -13,8 +13,8 @@ from bench.cleanup import remove_control_group
 from bench.real.systemd import make_control_group, obstacle
 
 # The machine ends with the process that made it, however that ends.
-NAMESPACES = ["setpriv", "--pdeathsig", "KILL", "unshare", "--mount", "--net", "--ipc", "--uts", "--pid", "--fork"]
-NAMESPACES += ["--kill-child", "--mount-proc"]
+PARENT = ["setpriv", "--pdeathsig", "KILL"]
+NAMESPACES = ["--mount", "--ipc", "--uts", "--pid", "--fork", "--kill-child", "--mount-proc"]
 MACHINE = Path(__file__).with_name("machine.sh")
 LONGEST_START = 60  # s
 LONGEST_COMMAND = 120  # s
@@ -27,12 +27,16 @@ class MachineError(Exception):
 class Machine:
     """A running machine. `files` holds its files besides the /usr of the root file system `system`.
 
-    What the machine writes stays in memory, or goes to the file system in the file `disk`.
+    What the machine writes stays in memory, or goes to the file system in the file `disk`. Its network is its own, or
+    that of `neighbour`.
     """
 
-    def __init__(self, folder: Path, system: Path, disk: Path | None = None) -> None:
+    def __init__(
+        self, folder: Path, system: Path, disk: Path | None = None, neighbour: "Machine | None" = None
+    ) -> None:
         self._folder = folder
         self.system = system
+        self._neighbour = neighbour
         self._disk = [disk] if disk else []
         self.files = folder / "files"
         self.files.mkdir()
@@ -45,9 +49,13 @@ class Machine:
         if reason := obstacle():
             raise MachineError(reason)
         self._control_group = make_control_group(self._folder)
+        command = [*PARENT, "unshare", "--net", *NAMESPACES]
+        if self._neighbour:
+            network = f"/proc/{self._neighbour._first_process()}/ns/net"
+            command = [*PARENT, "nsenter", f"--net={network}", "unshare", *NAMESPACES]
         with (self._folder / "console").open("wb") as console:
             self._namespaces = subprocess.Popen(
-                [*NAMESPACES, MACHINE, self._folder, self.system, self._control_group, *self._disk],
+                [*command, MACHINE, self._folder, self.system, self._control_group, *self._disk],
                 stdin=subprocess.DEVNULL,
                 stdout=console,
                 stderr=console,
@@ -111,10 +119,10 @@ class Machine:
 
 
 @contextlib.contextmanager
-def machine(system: Path, disk: Path | None = None) -> Iterator[Machine]:
+def machine(system: Path, disk: Path | None = None, neighbour: Machine | None = None) -> Iterator[Machine]:
     """A machine with the programs of `system`, see Machine: not started yet, and removed at the end of the block."""
     with tempfile.TemporaryDirectory(prefix="machine-") as folder:
-        made = Machine(Path(folder), system, disk)
+        made = Machine(Path(folder), system, disk, neighbour)
         try:
             yield made
         finally:

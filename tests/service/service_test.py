@@ -74,7 +74,8 @@ FOLDERS = [*DATABASE, "var/log/journal", "opt", "root/RESOURCES/SOUNDS", "root/U
 def built_package(name: str) -> Path | None:
     """The package of packaging/build for this machine."""
     architecture = subprocess.check_output(["dpkg", "--print-architecture"], text=True).strip()
-    found = sorted((ROOT / "build/package").glob(f"{name}_*_{architecture}.deb"))
+    folder = ROOT / "build/package"
+    found = sorted([*folder.glob(f"{name}_*_{architecture}.deb"), *folder.glob(f"{name}_*_all.deb")])
     return found[-1] if found else None
 
 
@@ -98,12 +99,14 @@ def make_files(unit: Machine, package: Path, programs: Path) -> None:
     shutil.copy(unit.system / "usr/bin/sleep", files / "opt/scp")
 
 
-def install(unit: Machine) -> None:
-    """Installs the package under test, and one package in place of all its dependencies."""
-    depends = unit.run("dpkg-deb", "--field", "/srv/updater.deb", "Depends")
-    names = ", ".join(f"{item.split()[0]} (= 9999)" for item in depends.split(","))
-    tools = build(Package("tools", "1.0", {"Provides": names}), unit.root() / "srv")
-    unit.run("dpkg", "--install", f"/srv/{tools.name}", "/srv/updater.deb")
+def install(unit: Machine, *more: str) -> None:
+    """Installs the package under test and `more` packages, and one package in place of all their dependencies."""
+    files = ["/srv/updater.deb", *more]
+    depends = ",".join(unit.run("dpkg-deb", "--field", file, "Depends") for file in files)
+    others = sorted({item.split()[0] for item in depends.split(",")} - {"harl-updater"})
+    tools = build(Package("tools", "1.0", {"Provides": ", ".join(f"{name} (= 9999)" for name in others)}),
+                  unit.root() / "srv")
+    unit.run("dpkg", "--install", f"/srv/{tools.name}", *files)
 
 
 def shorten(unit: Machine, **times: int) -> None:

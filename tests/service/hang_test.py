@@ -24,6 +24,8 @@ KINDS = {
     "is_uninterruptible": f"exec cat {FROZEN}/x",
     "leaves_its_output_open": "sleep 600 &",
 }
+# A call that does this kills the one who made it.
+KILL_GIVE_BACK = "kill -s {} $(/usr/bin/systemctl show --value --property=MainPID harl-updater-give-back)"
 SPEED = 200
 LONGEST = 75  # s, from the start to the application, with shortened limits on a busy machine
 
@@ -267,24 +269,21 @@ class Rescuer(HangTest):
 
     def kill_at(self, tool: str, arguments: str, signal: str = "KILL") -> None:
         """Kills give-back while it calls the tool."""
-        self.hang(tool, arguments, "touch /run/harl-at; sleep 1; [ -e /run/harl-killed ]", once=True)
+        self.hang(tool, arguments, f"{KILL_GIVE_BACK.format(signal)}; sleep 1", once=True)
         self.crash()
-        self.inside("systemctl", "stop", "harl")
-        self.wait_for_file("/run/hung")
-        self.inside("kill", "-s", signal, str(self.main_of_give_back()))
         self.assert_given_back_at_last()
+        self.assertTrue((self.unit.root() / "run/hung").exists(), "give-back was not killed")
         self.assertNotEqual(self.unit.status("grep", "-q", " /root/USB_MOUNT ", "/proc/mounts"), 0)
 
     def test_killed_before_its_first_step(self) -> None:
         self.kill_at("systemctl", "*ActiveState*harl-updater")
 
     def test_killed_while_it_shows_the_outcome(self) -> None:
-        slow = "[ ! -d /run/harl-updater/give-back ] || [ -e /run/hung ] || { touch /run/hung; sleep 0.7; }"
-        self.hang("i2cset", "*' 0x14 c'", slow)
+        kill = f"touch /run/hung; {KILL_GIVE_BACK.format('KILL')}; sleep 0.7"
+        self.hang("i2cset", "*' 0x14 c'", f"[ ! -d /run/harl-updater/give-back ] || [ -e /run/hung ] || {{ {kill}; }}")
         self.crash()
-        self.wait_for_file("/run/hung")
-        self.inside("kill", "-s", "KILL", str(self.main_of_give_back()))
         self.assert_given_back_at_last()
+        self.assertTrue((self.unit.root() / "run/hung").exists(), "give-back was not killed")
         # After the interrupted pair, the controller gets one byte that it does not understand.
         self.assertEqual(self.panel(faults=True), INSTALLATION_FAILED.panel)
 

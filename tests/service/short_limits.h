@@ -7,10 +7,10 @@ inline constexpr Limit limits[] = {
     {"detach", "umount", "--lazy", 2, 2, false, false},
     {"stick", "umount", nullptr, 2, 2, false, false},
     {"services", "systemctl", nullptr, 5, 5, false, false},
-    {"mirrors", "apt", "update", 6, 6, false, false},
-    {"versions", "apt-cache", nullptr, 4, 4, false, false},
+    {"mirrors", "apt", "update", 12, 12, false, false},
+    {"versions", "apt-cache", nullptr, 8, 8, false, false},
     {"installation", "apt", nullptr, 20, 20, false, true},
-    {"board-version", "ssh", "version.txt", 3, 3, false, false},
+    {"board-version", "ssh", "version.txt", 6, 6, false, false},
     {"upload", "scp", nullptr, 6, 6, true, false}, // 20 attempts of two copies
     {"board-script", "ssh", nullptr, 6, 6, false, true},
     {"repair", "dpkg", nullptr, 15, 20, true, false},

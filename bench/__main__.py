@@ -12,11 +12,11 @@ from bench import scenario
 from bench.build import BUILD, build
 from bench.command import status_of
 from bench.compare import differences
+from bench.interactive import Watch, play
 from bench.show.text import PlainDisplay, Summary, print_summary, terminal
 from bench.show.page import page, write_page
 from bench.runner import KINDS, UnitMaker, run_on, temporary_folder
 from bench.run_all import run_all
-from bench.show.terminal import LiveDisplay
 from bench.unit import PROGRAMS
 
 
@@ -25,15 +25,23 @@ def run(maker: UnitMaker, what: scenario.Scenario, page_file: Path | None) -> in
     with temporary_folder() as folder:
         unit = maker.make(what, folder)
         print(f"{what.name}: {what.summary}\nUnit: {unit.name}\n", flush=True)
-        shown: LiveDisplay | PlainDisplay = LiveDisplay(unit) if terminal() else PlainDisplay()
+        shown: Watch | PlainDisplay = Watch(unit, what, maker.speed) if terminal() else PlainDisplay()
         with shown as display:
             result = run_on(unit, display.show, maker.speed)
     summary = Summary(what, unit.name, result, differences(what, result))
     print_summary(summary)
     if page_file:
-        write_page(page_file, page(summary, maker.speed))
+        write_page(page_file, page(summary, maker.speed, maker.build))
         print(f"Page: {page_file}")
     return 1 if summary.wrong else 0
+
+
+def play_with(maker: UnitMaker, what: scenario.Scenario) -> int:
+    """Lets the user play with the scenario's unit. Returns the status of the command."""
+    with temporary_folder() as folder:
+        lines = play(maker.make(what, folder), what, maker.speed)
+    print("\n".join(lines))
+    return 0
 
 
 def writable(file: Path) -> bool:
@@ -50,6 +58,7 @@ def arguments() -> argparse.Namespace:
     which.add_argument("scenario", nargs="?", default="package-and-board", help="default: %(default)s")
     which.add_argument("--list", action="store_true", help="show all scenarios")
     which.add_argument("--all", action="store_true", help="run all scenarios and show a table")
+    parser.add_argument("--interactive", action="store_true", help="play with the unit while the updater runs on it")
     parser.add_argument(
         "--jobs", type=int, default=os.cpu_count(), metavar="N", help="with --all: N at a time (default: %(default)s)"
     )
@@ -92,6 +101,10 @@ def arguments() -> argparse.Namespace:
             parser.error(f"--record: {given.record} cannot be a folder: {error.strerror}")
     elif given.record and not writable(given.record):
         parser.error(f"--record: {given.record} cannot be written")
+    if given.interactive and (given.all or given.list or given.record):
+        parser.error("--interactive: not together with --all, --list or --record")
+    if given.interactive and not (sys.stdin.isatty() and sys.stdout.isatty()):
+        parser.error("--interactive: needs a terminal for input and output")
     if given.jobs < 1:
         parser.error("--jobs: must be 1 or more")
     if given.full_length:
@@ -104,7 +117,8 @@ def main() -> int:
     given = arguments()
     if isinstance(sys.stdout, io.TextIOWrapper):
         sys.stdout.reconfigure(errors="replace")
-    signal.signal(signal.SIGTERM, lambda *_: sys.exit(143))
+    for number in (signal.SIGTERM, signal.SIGHUP):
+        signal.signal(number, lambda number, _: sys.exit(128 + number))
     return status_of(lambda: show(given))
 
 
@@ -116,10 +130,12 @@ def show(given: argparse.Namespace) -> int:
         return 0
     wanted = [scenario.load(name) for name in (scenario.names() if given.all else [given.scenario])]
     if not given.build:
-        build()
+        build(*(["harl-updater-tool"] if given.record else []))
     maker = UnitMaker(given.unit, given.speed, (given.build or BUILD).resolve())
     if given.all:
         return 0 if run_all(maker, wanted, given.jobs, given.record) else 1
+    if given.interactive:
+        return play_with(maker, wanted[0])
     return run(maker, wanted[0], given.record)
 
 

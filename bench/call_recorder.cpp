@@ -3,14 +3,16 @@
 /// Writes the start and the end of every command and every wait to the file named by BENCH_CALLS, one line each, with
 /// tabs between the columns:
 ///
-///   seconds of CLOCK_BOOTTIME, thread id, "system" | "popen" | "nanosleep", "start" | "end", value, text
+///   seconds of CLOCK_BOOTTIME, thread id, "system" | "popen" | "nanosleep", "start" | "rest" | "end", value, text
 ///
 /// For a command the text is its command line and the value at its end the raw status. For a wait the value is the
-/// requested time (s) and the text the time that it really takes (s).
+/// requested time (s) and the text the time that it really takes (s); "rest" has what remains of both after a change of
+/// the speed.
 ///
 /// Shortens the waits: BENCH_SPEED times (1: full length), but to no less than BENCH_SHORTEST_WAIT (s; 0.2 when it is
-/// not set) so that the panel's flashing stays visible; a longer one makes its pauses longer. The wall clock that the
-/// updater sees advances by the time cut from waits of 2 s and more, so that the log reads like a run at full length.
+/// not set) so that the panel's flashing stays visible; a longer one makes its pauses longer. BENCH_SPEED may also be
+/// the absolute path of a file with the number, which may change while the updater runs. The wall clock that the updater
+/// sees advances by the time cut from waits of 2 s and more, so that the log reads like a run at full length.
 
 #include <algorithm>
 #include <atomic>
@@ -21,6 +23,7 @@
 #include <ctime>
 #include <dlfcn.h>
 #include <fcntl.h>
+#include <fstream>
 #include <mutex>
 #include <string>
 #include <unistd.h>
@@ -28,7 +31,8 @@
 namespace
 {
 
-const double clockWait = 2; // s, the shortest wait whose shortening moves the wall clock
+const double clockWait = 2;     // s, the shortest wait whose shortening moves the wall clock
+const double longestSleep = 0.1; // s, between two looks at the file with the speed
 
 std::atomic<double> clockOffset{0};   // s, by which the updater's wall clock is ahead
 std::mutex writing;                   // both threads use one descriptor, as the updater may have no more
@@ -50,6 +54,33 @@ double number(const char* variable, double otherwise)
 {
     const char* text = getenv(variable);
     return text == nullptr ? otherwise : std::atof(text);
+}
+
+double seconds(const timespec& time)
+{
+    return static_cast<double>(time.tv_sec) + static_cast<double>(time.tv_nsec) / 1e9;
+}
+
+timespec timeOf(double seconds)
+{
+    return {static_cast<std::time_t>(seconds), static_cast<long>((seconds - std::floor(seconds)) * 1e9)};
+}
+
+/// The file with the speed, null when BENCH_SPEED is the number itself.
+const char* speedFile()
+{
+    const char* speed = getenv("BENCH_SPEED");
+    return speed != nullptr && *speed == '/' ? speed : nullptr;
+}
+
+/// How many times shorter the waits are now.
+double speed()
+{
+    double result = number("BENCH_SPEED", 1);
+    if (speedFile() != nullptr) {
+        std::ifstream(speedFile()) >> result;
+    }
+    return std::max(1.0, result);
 }
 
 void writeLine(const char* call, const char* phase, long value, const std::string& text)
@@ -105,24 +136,33 @@ int pclose(FILE* pipe)
 
 int nanosleep(const timespec* asked, timespec* remaining)
 {
-    const double length = static_cast<double>(asked->tv_sec) + static_cast<double>(asked->tv_nsec) / 1e9;
-    const double shortestWait = number("BENCH_SHORTEST_WAIT", 0.2);
-    const double speed = std::max(1.0, number("BENCH_SPEED", 1));
-    const double factor = std::max(shortestWait / length, 1 / speed);
-    const double shortened = length * factor;
-    timespec wait = {static_cast<std::time_t>(shortened), 0};
-    wait.tv_nsec = static_cast<long>((shortened - std::floor(shortened)) * 1e9);
-
-    writeLine("nanosleep", "start", asked->tv_sec, std::to_string(shortened));
-    const int result = next("nanosleep", &nanosleep)(&wait, remaining);
+    const double length = seconds(*asked);
+    const double shortest = number("BENCH_SHORTEST_WAIT", 0.2) / length;
+    double left = length; // of the wait as requested
+    double taken = 0;
+    double factor = 0;
+    int result = 0;
+    do {
+        const double now = std::max(shortest, 1 / speed());
+        if (now != factor) {
+            const char* phase = factor == 0 ? "start" : "rest";
+            factor = now;
+            writeLine("nanosleep", phase, std::lround(left), std::to_string(left * factor));
+        }
+        const double whole = left * factor;
+        const double sleep = speedFile() != nullptr ? std::min(whole, longestSleep) : whole;
+        const timespec wait = timeOf(sleep);
+        timespec rest = {};
+        result = next("nanosleep", &nanosleep)(&wait, &rest);
+        const double slept = sleep - (result == 0 ? 0 : seconds(rest));
+        taken += slept;
+        left = result == 0 && sleep == whole ? 0 : left - slept / factor;
+    } while (result == 0 && left > 0);
     if (result == -1 && errno == EINTR && remaining != nullptr) {
-        const double left =
-            (static_cast<double>(remaining->tv_sec) + static_cast<double>(remaining->tv_nsec) / 1e9) / factor;
-        remaining->tv_sec = static_cast<std::time_t>(left);
-        remaining->tv_nsec = static_cast<long>((left - std::floor(left)) * 1e9);
+        *remaining = timeOf(left);
         errno = EINTR;
     } else if (length >= clockWait) {
-        clockOffset = clockOffset + length - shortened; // one thread at a time waits that long
+        clockOffset = clockOffset + length - taken; // one thread at a time waits that long
     }
     writeLine("nanosleep", "end", 0, "");
     return result;

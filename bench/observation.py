@@ -37,6 +37,14 @@ class Record:
         return re.sub(r"\(.*", "", self.function).split("::")[-1].split()[-1]
 
 
+def records_of(log: str) -> list[Record]:
+    """The whole records of a log."""
+    return [
+        Record(match["time"], match["thread"], match["file"], match["function"], match["message"][:-1])
+        for match in RECORD.finditer(log)
+    ]
+
+
 @dataclass
 class Call:
     """One command, or one wait, of the updater. `end` and `status` are None when it never returned."""
@@ -47,8 +55,15 @@ class Call:
     text: str  # command line
     seconds: int = 0  # asked for by a wait
     real: float = 0.0  # s, that the wait really takes
+    rest: tuple[float, float] = (0.0, 0.0)  # of a wait: what remained of `seconds`, from which moment on (s)
     end: float | None = None
     status: int | None = None
+
+    def left(self, moment: float) -> float:
+        """How much of the seconds that a wait was asked for remains at `moment` (s)."""
+        rest, since = self.rest
+        until = self.start + self.real
+        return rest * max(0.0, until - moment) / (until - since) if until > since else 0.0
 
 
 @dataclass
@@ -88,10 +103,7 @@ class Run:
 
     def records(self) -> list[Record]:
         """The log's records."""
-        return [
-            Record(match["time"], match["thread"], match["file"], match["function"], match["message"][:-1])
-            for match in RECORD.finditer(self.log)
-        ]
+        return records_of(self.log)
 
     def commands(self) -> list[Call]:
         """All commands except those of the panel and the sound, in order."""
@@ -120,9 +132,14 @@ class Run:
             entry = Call(call, thread, float(moment), text)
             if call == "nanosleep":
                 entry.seconds, entry.real, entry.text = int(value), float(text), ""
+                entry.rest = float(value), entry.start
             self.calls.append(entry)
             return
         for entry in reversed(self.calls):
             if entry.thread == thread and entry.end is None:
-                entry.end, entry.status = float(moment), int(value)
+                if phase == "rest":  # the speed has changed
+                    entry.rest = float(value), float(moment)
+                    entry.real = float(moment) + float(text) - entry.start
+                else:
+                    entry.end, entry.status = float(moment), int(value)
                 return

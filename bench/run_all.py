@@ -71,7 +71,7 @@ def run_all(maker: UnitMaker, scenarios: list[Scenario], at_once: int, gallery: 
                 print(end="", flush=True)
                 rows.append(row)
                 if gallery and row.summary:
-                    write_page(gallery / page_name(row.scenario), page(row.summary, maker.speed))
+                    write_page(gallery / page_name(row.scenario), page(row.summary, maker.speed, maker.build))
         finally:
             stop.set()
     wrong = sum(bool(row.wrong) for row in rows)

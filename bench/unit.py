@@ -4,8 +4,23 @@ from dataclasses import dataclass, field
 from pathlib import Path
 from typing import Protocol
 
+from bench.scenario import Setup
+
 # The program that runs on a unit, in the folder of the programs, by what `updater.program` in a scenario says.
 PROGRAMS = {"remote": Path("harl-updater"), "main": Path("bench/main-head")}
+
+
+# What a user can change while a unit runs: its two states, the one in order first. Without power nothing runs on the
+# head, which keeps its disk. A board that hangs answers nobody; its link stays up.
+PARTS = {
+    "power": ("on", "off"),
+    "stick": ("in", "out"),
+    "board": ("works", "hangs"),
+    "link": ("up", "down"),
+    "mirrors": ("up", "down"),
+    "sound": ("on", "off"),
+    "bus": ("up", "down"),
+}
 
 
 @dataclass
@@ -62,8 +77,40 @@ class Unit(Protocol):
     def state(self) -> State:
         """The unit as it is now; called several times a second while the updater runs, and once after it."""
 
+    def parts(self) -> dict[str, bool]:
+        """Which of the PARTS are in order, before the start as the scenario says."""
+
+    def switch(self, part: str) -> None:
+        """Puts one of the PARTS into its other state. Raises UnitError."""
+
+    def set_speed(self, speed: float) -> None:
+        """How many times faster the updater's clock and waits run from now on. To be called before `start`, too, where
+        the speed is to change later."""
+
+    def update(self) -> None:
+        """Starts the updater again, once it has ended; `files` begin anew. Raises UnitError."""
+
+    def updater(self) -> int | None:
+        """The process id of the updater, as this machine numbers it; None when it does not run."""
+
+    def shell(self) -> tuple[list[str], dict[str, str]]:
+        """A command that runs a shell on the head, and its environment."""
+
     def close(self) -> None:
         """Ends every process of the unit and undoes everything. May be called at any time and more than once."""
+
+
+def parts_of(setup: Setup) -> dict[str, bool]:
+    """Which of the PARTS are in order before the start."""
+    return {
+        "power": True,
+        "stick": setup.stick.inserted,
+        "board": setup.board.link != "hangs",
+        "link": setup.board.link != "down",
+        "mirrors": setup.mirrors.refresh != "unreachable",
+        "sound": setup.head.sound == "present",
+        "bus": setup.head.panel == "present",
+    }
 
 
 def with_pid_file(folder: Path, command: list[str | Path]) -> list[str | Path]:

@@ -116,3 +116,11 @@ def kept_package(name: str, version: str, scripts: str, kept: Path) -> Path:
     finally:
         shutil.rmtree(work)
     return folder
+
+
+def candidate(installed: str, offered: str, downgrades: bool) -> str:
+    """The version that apt picks: an older one than the installed only where `downgrades` are configured."""
+    older = ["dpkg", "--compare-versions", offered, "lt", installed]
+    if downgrades or installed == "(none)" or subprocess.run(older, check=False).returncode != 0:
+        return offered
+    return installed

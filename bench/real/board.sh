@@ -18,11 +18,20 @@ esac
 echo 0 >/proc/sys/net/ipv4/ip_unprivileged_port_start
 LD_LIBRARY_PATH=/opt/bench/lib unshare --user --map-user=1000 --map-group=1000 --root="$board" --wd=/ "$sshd" -D -e &
 
+# Everything that runs on the board has its root.
+signal_all() { # SIGNAL
+    for process in /proc/[0-9]*; do
+        if [ "$(readlink "$process/root")" = "$board" ]; then kill -s "$1" "${process#/proc/}"; fi
+    done
+}
+
 # Events on the board that others request.
 while read -r request <"$board/run/requests"; do
     case $request in
     link-down) ip link set eth0 down ;;
-    hang) kill -s STOP "$(cat "$board/run/sshd.pid")" ;;
+    link-up) ip link set eth0 up ;;
+    hang) signal_all STOP ;;
+    go-on) signal_all CONT ;;
     esac
     echo >"$board/run/answers"
 done

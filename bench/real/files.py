@@ -41,10 +41,9 @@ def write_head(folder: Path, setup: Setup, kept: Path, has_systemd: bool) -> Non
     if setup.head.teamviewer_script != "absent":
         script = (HERE / "teamviewer" / f"{setup.head.teamviewer_script}.sh").read_text()
         write(folder / "root/RESOURCES/teamviewer_updatescript.sh", script, 0o755)
-    if setup.head.sound == "present":
-        # ALSA has no sound card here: the default device is a file, or rather a program that reads the samples.
-        device = 'pcm.!default { type file slave.pcm null file "|/opt/bench/bin/play" format raw }\n'
-        write(folder / "etc/asound.conf", device)
+    # ALSA has no sound card here: the default device is a file, or rather a program that reads the samples.
+    device = 'pcm.!default { type file slave.pcm null file "|/opt/bench/bin/play" format raw }\n'
+    write(folder / ("etc/asound.conf" if setup.head.sound == "present" else "etc/asound.absent"), device)
     _write_tools(folder / "opt/bench", setup, has_systemd)
 
 
@@ -95,13 +94,14 @@ def _write_packages(folder: Path, setup: Setup, kept: Path) -> None:
     if wanted.install == "locked":
         [file] = kept_package("other", "1.0", "holds-lock", kept).glob("*.deb")
         shutil.copy(file, folder / "srv/other.deb")
-    where = "repository" if setup.mirrors.refresh == "works" else "gone"
     if setup.mirrors.server == "file":
-        write(folder / "etc/apt/sources.list", SOURCES.format(folder=where))
+        write(folder / "etc/apt/sources.list", SOURCES.format(folder="repository"))
     else:
         sign_index(folder / "srv/repository", folder / "etc/apt/mirror.gpg", setup.mirrors.refresh)
         write(folder / "etc/apt/sources.list", SIGNED_SOURCES)
         write(folder / "etc/apt/apt.conf.d/60mirror", 'Acquire::Retries "0"; Acquire::http::Timeout "5";\n')
+    if setup.mirrors.refresh == "unreachable":
+        (folder / "srv/repository").rename(folder / "srv/unreachable")
     if wanted.downgrades:
         write(folder / "etc/apt/preferences", 'Package: *\nPin: origin ""\nPin-Priority: 1001\n')
         write(folder / "etc/apt/apt.conf.d/60downgrade", 'APT::Get::allow-downgrades "true";\n')

@@ -91,17 +91,19 @@ def updater_service(setup: Setup) -> str:
 def write_services(folder: Path, setup: Setup, command: str) -> None:
     """The head's services, with `command` as the updater."""
     services = folder / "etc/systemd/system"
-    wanted = [updater_service(setup)]
+    instrument: list[str] = []
     write(services / "harl-updater.service", APPLICATION)
     write(services / updater_service(setup), UPDATER.format(command=command))
     if setup.head.harl == "known":
         write(services / "harl.service", APPLICATION)
-        wanted.append("harl.service")
+        instrument.append("harl.service")
+    wanted = [updater_service(setup), *instrument]
     if setup.updater.stopped == "in-install":
         write(services / "stop-in-install.path", STOP_WHEN)
         write(services / "stop-in-install.service", STOP)
         wanted.append("stop-in-install.path")
-    write(services / "bench.target", TARGET.format(services=" ".join(wanted)))
+    for target, names in {"bench": wanted, "instrument": instrument}.items():
+        write(services / f"{target}.target", TARGET.format(services=" ".join(names)))
     write(folder / "etc/systemd/journald.conf", JOURNAL)
 
 
@@ -118,6 +120,13 @@ class Journal:
         self._offset = 0
         self._in_head = False  # past the first line of a record
         self.ended = ""  # how the updater ended: "exited 0", "killed TERM"
+
+    def begin_again(self) -> None:
+        """Leaves out what has not been read; the updater is about to start again."""
+        self.update()
+        self._target.write_text("")
+        self._in_head = False
+        self.ended = ""
 
     def update(self) -> None:
         """Reads what is new."""

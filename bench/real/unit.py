@@ -17,10 +17,12 @@ from pathlib import Path
 from bench.cleanup import remove_control_group
 from bench.makers import board as board_files
 from bench.makers import sounds
+from bench.makers.files import replace_text
+from bench.processes import find
 from bench.real import sshd, systemd
 from bench.real.files import HERE, MIRROR_PORT, head_package, search_path, write_board, write_head, write_stick
 from bench.scenario import Scenario, variables
-from bench.unit import PROGRAMS, Files, State, UnitError, with_pid_file
+from bench.unit import PARTS, PROGRAMS, Files, State, UnitError, parts_of, with_pid_file
 
 NAMESPACES = ["unshare", "--mount", "--net", "--ipc", "--uts", "--pid", "--fork", "--kill-child", "--mount-proc"]
 ONE_USER = "--map-root-user"  # needs no privilege; systemd does
@@ -56,7 +58,9 @@ class RealUnit:
         self._build = build
         self._namespaces: subprocess.Popen[bytes] | None = None
         self._out = folder / "out"
+        self._speed_file = self._out / "speed"  # where the speed may change
         self._control_group: Path | None = None
+        self._parts = parts_of(scenario.setup)
         self.files = Files(log=self._out / "log", calls=self._out / "calls", panel=self._out / "panel")
         self._journal = systemd.Journal(self._out / "journal", self.files.log)
 
@@ -64,7 +68,7 @@ class RealUnit:
         """Makes the unit and starts the updater. Raises UnitError."""
         server = sshd.find(self._build / "bench")
         for name in ("out", "unit"):
-            (self._folder / name).mkdir()
+            (self._folder / name).mkdir(exist_ok=True)
         if self._has_systemd:
             self._control_group = systemd.make_control_group(self._folder)
         write_head(self._folder / "head", self._setup, self._build / "bench/packages", self._has_systemd)
@@ -102,6 +106,43 @@ class RealUnit:
             return None
         how, value = ended.split()
         return int(value) if how == "exited" else -signal.Signals[f"SIG{value}"]
+
+    def parts(self) -> dict[str, bool]:
+        """Which of the PARTS are in order."""
+        return dict(self._parts)
+
+    def switch(self, part: str) -> None:
+        """Puts a part into its other state. Raises UnitError."""
+        on = not self._parts[part]
+        if part != "stick" or self._parts["power"]:  # without power it is not mounted
+            self._act(f"{part}_{PARTS[part][0 if on else 1]}")
+        self._parts[part] = on
+        if part == "power" and on and self._parts["stick"]:
+            self._act("stick_in")
+
+    def set_speed(self, speed: float) -> None:
+        """How many times faster the updater's clock and waits run from now on."""
+        self._speed = speed
+        self._speed_file.parent.mkdir(exist_ok=True)
+        replace_text(self._speed_file, f"{speed}\n")
+
+    def update(self) -> None:
+        """Starts the updater again, once it has ended; `files` begin anew. Raises UnitError."""
+        (self._out / "status").unlink(missing_ok=True)
+        for played in self._out.glob("played-*"):
+            played.unlink()
+        for file in (self.files.calls, self.files.panel):
+            file.write_text("")
+        self._journal.begin_again()
+        self._act("update_again")
+
+    def updater(self) -> int | None:
+        """The process id of the updater, as this machine numbers it; None when it does not run."""
+        return find(self._first_process(), PROGRAMS[self._setup.updater.program].name)
+
+    def shell(self) -> tuple[list[str], dict[str, str]]:
+        """A command that runs a shell on the head, and its environment."""
+        return self._action("in_head", f"TERM={os.environ.get('TERM', 'dumb')}", "PS1=head# ", "sh", "-i"), {}
 
     def state(self) -> State:
         """The unit as it is now."""
@@ -141,9 +182,8 @@ class RealUnit:
             words.append("--ignore-signal=CHLD")
         words += ["HOME=/root", "LANG=C.UTF-8", f"PATH={search_path(self._setup)}"]
         words += ["LD_PRELOAD=/opt/bench/call_recorder.so", "BENCH_CALLS=/opt/bench/out/calls"]
-        words.append(f"BENCH_SPEED={self._speed}")
-        if self._setup.head.panel == "present":
-            words.append("BENCH_PANEL=/opt/bench/out/panel")
+        speed = "/opt/bench/out/speed" if self._speed_file.exists() else self._speed
+        words += [f"BENCH_SPEED={speed}", "BENCH_PANEL=/opt/bench/bus/panel"]
         return " ".join([*words, f"/opt/bench/{program.name}", *self._setup.updater.arguments])
 
     def _write_variables(self, server: sshd.Server, command: str) -> None:
@@ -170,12 +210,27 @@ class RealUnit:
             return "unknown"
         if self._control_group:
             return "active" if systemd.service_active(self._control_group, "harl") else "inactive"
-        return (self._root() / "head/run/harl").read_text().strip()
+        harl = self._root() / "head/run/harl"
+        return harl.read_text().strip() if harl.exists() else "inactive"
 
     def _updater_active(self) -> bool:
         if self._control_group:
             return systemd.service_active(self._control_group, "harl-updater")
         return self._setup.updater.stopped != "never" and not (self._out / "status").exists()
+
+    def _action(self, *words: str) -> list[str]:
+        """The command that runs an action of unit.sh."""
+        # Without its own user's namespace there is none to enter, and no credentials to keep.
+        enter = ["nsenter", "--all", "--preserve-credentials", f"--target={self._first_process()}"]
+        return [*enter, str(HERE / "unit.sh"), str(self._folder), *words]
+
+    def _act(self, *words: str) -> None:
+        # A file, not a pipe: what an action leaves running would keep that open.
+        with (self._out / "action").open("w+") as said:
+            done = subprocess.run(self._action(*words), stdin=subprocess.DEVNULL, stdout=said, stderr=said, check=False)
+            said.seek(0)
+            if done.returncode != 0:
+                raise UnitError(f"{words[0]}: {(said.read().strip().splitlines() or ['no reason given'])[-1]}")
 
     def _check_alive(self) -> None:
         assert self._namespaces

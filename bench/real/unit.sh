@@ -1,13 +1,15 @@
 #!/bin/sh
 # The real unit, in namespaces of its own: unit.py runs this as their first process, and everything ends with it.
 #
-# Usage: unit.sh FOLDER
+# Usage: unit.sh FOLDER [ACTION WORD...]
 # FOLDER holds what unit.py has prepared: `head`, `board` and `stick` with the files of each, `variables` with the
 # scenario, and `out` for what the unit writes. The roots lie in a tmpfs that only these namespaces see.
+# An ACTION is one of the functions below, on the unit whose namespaces the caller has entered.
 set -eu
 
 PATH=$PATH:/usr/sbin:/sbin # a plain user's goes without
 folder=$1
+shift
 here=$(dirname "$0")
 makers=$here/../makers
 head=$folder/unit/head
@@ -53,8 +55,8 @@ wait_for_board() {
         sleep 0.01
     done
     case $BOARD_LINK in
-    down) request_of_board link-down ;;
-    hangs) request_of_board hang ;;
+    down) link_down ;;
+    hangs) board_hangs ;;
     esac
 }
 
@@ -85,14 +87,72 @@ install_package() {
     cd /
 }
 
-insert_stick() {
-    [ "$STICK_INSERTED" = true ] || return 0
+in_head() {
+    set -- env -i HOME=/root LANG=C.UTF-8 PATH=/opt/bench/bin:/usr/sbin:/usr/bin:/sbin:/bin "$@"
+    if [ -e "$folder/out/systemd.pid" ]; then
+        read -r parent <"$folder/out/systemd.pid"
+        nsenter --all --target "$(tr -d ' ' <"/proc/$parent/task/$parent/children")" --root --wd "$@"
+    else
+        chroot "$head" "$@"
+    fi
+}
+
+# The unit's parts, each in its two states: before the updater starts as the scenario says, later as the user does.
+stick_in() {
     mount -t tmpfs stick "$head/root/USB_MOUNT"
     cp -r "$folder/stick/." "$head/root/USB_MOUNT"
 }
+stick_out() {
+    # Lazily: a copy from it may be running. The updater may have released it.
+    if mountpoint --quiet "$head/root/USB_MOUNT"; then umount --lazy "$head/root/USB_MOUNT"; fi
+}
+link_up() { request_of_board link-up; }
+link_down() { request_of_board link-down; }
+board_works() { request_of_board go-on; }
+board_hangs() { request_of_board hang; }
+mirrors_up() { mv "$head/srv/unreachable" "$head/srv/repository"; }
+mirrors_down() { mv "$head/srv/repository" "$head/srv/unreachable"; }
+sound_on() { mv "$head/etc/asound.absent" "$head/etc/asound.conf"; }
+sound_off() { mv "$head/etc/asound.conf" "$head/etc/asound.absent"; }
+bus_up() { ln -s out "$head/opt/bench/bus"; }
+bus_down() { rm "$head/opt/bench/bus"; }
 
-in_head() {
-    chroot "$head" env -i HOME=/root LANG=C.UTF-8 PATH=/opt/bench/bin:/usr/sbin:/usr/bin:/sbin:/bin "$@"
+power_on() {
+    if [ -n "$BENCH_CONTROL_GROUP" ]; then
+        echo >"$folder/out/again"
+    elif [ "$HEAD_HARL" = known ]; then
+        echo active >"$head/run/harl"
+    fi
+}
+
+# Everything that runs on the head has its root. Its disk stays.
+power_off() {
+    rm -f "$folder/out/systemd.pid"
+    until [ -z "$(end_head)" ]; do sleep 0.02; done
+    [ -n "$BENCH_CONTROL_GROUP" ] || until [ -e "$folder/out/status" ]; do sleep 0.01; done
+    stick_out
+    umount --lazy --recursive "$head/run"
+    mount -t tmpfs -o mode=755 run "$head/run"
+    if [ -n "$BENCH_CONTROL_GROUP" ]; then
+        umount --lazy --recursive "$head/sys"
+        find "$BENCH_CONTROL_GROUP" -mindepth 1 -depth -type d -exec rmdir {} +
+    fi
+}
+
+end_head() {
+    for process in /proc/[0-9]*; do
+        [ "$(readlink "$process/root")" != "$head" ] || kill -s KILL "${process#/proc/}" || continue
+        [ "$(readlink "$process/root")" != "$head" ] || echo "$process"
+    done
+}
+
+update_again() {
+    if [ -n "$BENCH_CONTROL_GROUP" ]; then
+        in_head systemctl reset-failed "$BENCH_SERVICE" 2>"$folder/out/systemctl" || true
+        in_head systemctl start --no-block "$BENCH_SERVICE"
+    else
+        echo >"$folder/out/again"
+    fi
 }
 
 # Other events on the head while the updater runs.
@@ -108,9 +168,7 @@ start_events() {
 
 # Runs the updater to its end, in a session of its own as a service is.
 run_updater() {
-    echo active >"$head/run/harl"
     : >"$folder/out/log"
-    start_events
     # shellcheck disable=SC2086 # several words, intended
     setsid chroot "$head" $BENCH_COMMAND <"$head/opt/bench/input" >>"$folder/out/log" 2>>"$folder/out/$BENCH_ERRORS" &
     updater=$!
@@ -122,19 +180,28 @@ run_updater() {
     mv "$folder/out/status.part" "$folder/out/status"
 }
 
-# Runs systemd as the first process of the head's own process namespace, with the updater as one of its services.
-run_systemd() {
-    start_events
-    (become_systemd "$BENCH_CONTROL_GROUP" "$head" bench.target --pid --ipc --fork --kill-child) \
+# Runs systemd as the first process of the head's own process namespace, until the power is cut. TARGET is "bench" to
+# run the updater as one of its services, "instrument" for the others alone.
+run_systemd() { # TARGET
+    (become_systemd "$BENCH_CONTROL_GROUP" "$head" "$1.target" --pid --ipc --fork --kill-child) \
         </dev/null >"$folder/out/systemd" 2>&1 &
     systemd=$!
+    echo $systemd >"$folder/out/systemd.pid"
     echo >"$folder/out/started"
-    # journalctl fails until the journal has its first entry.
-    until journalctl --directory="$head/run/log/journal" --follow --no-tail --quiet --output=cat \
-        "_SYSTEMD_UNIT=$BENCH_SERVICE" >"$folder/out/journal" 2>"$folder/out/journalctl"; do sleep 0.02; done &
+    # journalctl fails until the journal has its first entry. It ends with the head.
+    until in_head journalctl --directory=/run/log/journal --follow --no-tail --quiet --output=cat \
+        "_SYSTEMD_UNIT=$BENCH_SERVICE" >>"$folder/out/journal" 2>"$folder/out/journalctl"; do
+        [ -e "$folder/out/systemd.pid" ] || exit
+        sleep 0.02
+    done &
     wait $systemd || true
-    fail "systemd has ended: $(tail -n 1 "$folder/out/systemd")"
+    [ ! -e "$folder/out/systemd.pid" ] || fail "systemd has ended: $(tail -n 1 "$folder/out/systemd")"
 }
+
+if [ $# -gt 0 ]; then
+    "$@"
+    exit
+fi
 
 mount -t tmpfs unit "$folder/unit"
 start_board
@@ -144,12 +211,17 @@ mount --bind "$folder/out" "$head/opt/bench/out"
 mount --bind "$board/run" "$head/opt/bench/board"
 start_mirror
 install_package
-insert_stick
+[ "$STICK_INSERTED" = false ] || stick_in
+[ "$HEAD_PANEL" = absent ] || bus_up
 wait_for_board
+mkfifo "$folder/out/again"
 if [ -n "$BENCH_CONTROL_GROUP" ]; then
-    run_systemd
+    start_events
+    run_systemd bench
+    while read -r _ <"$folder/out/again"; do run_systemd instrument; done
 else
-    mkfifo "$folder/out/again"
+    echo active >"$head/run/harl"
+    start_events
     run_updater
     # unit.py reads the unit's state, then ends it. A line in `again` requests one more run on the unit as it is.
     while read -r _ <"$folder/out/again"; do run_updater; done

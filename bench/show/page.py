@@ -1,65 +1,34 @@
-"""Writes a run as a page of its own: the panel's LEDs and the commands against time, the summary and the log."""
+"""Writes a run as a page: what the bench observed, then what the companion program draws from the run's log.
+
+The design of both is that of the companion program's page.
+"""
 
 import re
+import subprocess
+import tempfile
 from collections.abc import Iterator
 from html import escape
 from itertools import pairwise
 from pathlib import Path
-from string import Template
 
-from bench.show.text import Summary
-from bench.observation import Call, Run, now
+from bench.build import ROOT
+from bench.observation import Run, now
 from bench.panel import STEP_UNIT, Panel, color_name, led_name
 from bench.scenario import Scenario
 from bench.show.panel import fill_of, panel_picture
+from bench.show.steps import taken
+from bench.show.text import Summary
 
-WIDTH = 1200  # of the timeline; all lengths are in the drawing's own unit
+TEMPLATE = (ROOT / "companion/log/page.mustache").read_text(encoding="utf-8")
+TOOL = Path("companion/harl-updater-tool")  # in the folder of the programs
+WIDTH = 1168  # of the chart; all lengths are in the drawing's own unit
 LEFT = 90  # of the time axis; the names of the LEDs are before it
 RIGHT = 16  # margin after the axis
 ROW = 20
 LETTER = 6.2  # about the width of one
-DARK = "#e4e6ea"
-COMMAND, WAIT = "#57606a", "#c9a227"
+LANE, COMMAND, WAIT = "var(--lane)", "var(--bar)", "var(--wait)"
 TICKS = [0.1, 0.2, 0.5, 1, 2, 5, 10, 20, 30, 60, 120, 300]  # s
 MOST_TICKS = 16
-
-# Style of the pages of all runs and of their index: light and dark, for a screen of 1,200 pixels and for paper.
-STYLE = """
-:root { color-scheme: light dark; --text: #1c1f24; --line: #d8dbe0; --wrong: #b01020; --bar: #57606a; }
-@media (prefers-color-scheme: dark) { :root { --text: #e6e8eb; --line: #3c4148; --wrong: #ff7b82; --bar: #9aa4b0; } }
-@media print { :root { color-scheme: light; --text: #000000; } a { color: inherit; } tr, svg { break-inside: avoid; } }
-body { font: 14px/1.4 sans-serif; margin: 24px auto; max-width: 1168px; padding: 0 16px; color: var(--text); }
-h1 { font-size: 22px; margin: 0; } h2 { font-size: 16px; margin: 28px 0 8px; }
-table { border-collapse: collapse; } th { text-align: left; font-weight: 600; }
-td, th { padding: 2px 16px 2px 0; vertical-align: top; }
-svg { max-width: 100%; height: auto; }
-#timeline text { font-size: 11px; fill: var(--text); } #timeline line { stroke: var(--line); }
-code, pre { font: 12px monospace; white-space: pre-wrap; overflow-wrap: anywhere; }
-.number { text-align: right; white-space: nowrap; } .wrong { color: var(--wrong); }
-"""
-PAGE = Template(
-    """<!DOCTYPE html>
-<html lang="en">
-<meta charset="utf-8">
-<meta name="viewport" content="width=device-width">
-<title>$name: $outcome</title>
-<style>$style</style>
-<h1>$name: $outcome</h1>
-<p>$summary<br>Unit: $unit. $speed</p>
-$wrong<h2>Panel at the end</h2>
-$panel
-<h2>Timeline</h2>
-$timeline
-<h2>Summary</h2>
-<table>$rows</table>
-<h2>Commands</h2>
-<table><tr><th class="number">after</th><th class="number">took</th><th class="number">status</th><th>command</th></tr>
-$commands</table>
-<h2>Log</h2>
-<pre>$log</pre>
-</html>
-"""
-)
 
 
 def page_name(scenario: Scenario) -> str:
@@ -67,27 +36,29 @@ def page_name(scenario: Scenario) -> str:
     return f"{scenario.name}.html"
 
 
-def page(summary: Summary, speed: float) -> str:
-    """The page for a run whose waits were `speed` times shorter."""
+def frame(title: str, content: str) -> str:
+    """A page with this title and this content of its body."""
+    begin = _part("begin")
+    for text in (">Update log<", ">Updates<"):
+        begin = begin.replace(text, f">{escape(title)}<")
+    return f"{begin}{content}{_part('end')}"
+
+
+def page(summary: Summary, speed: float, build: Path) -> str:
+    """The page for a run whose waits were `speed` times shorter, with the programs in the folder `build`."""
     run, scenario = summary.result.run, summary.scenario
     begin = run.calls[0].start if run.calls else now()
     ends = [call.end or call.start for call in run.calls] + [moment for moment, _ in run.sent]
     end = max([begin + 0.1, *ends])
     speeded = f"The updater's waits are {speed:g} times shorter, commands take their real time." if speed > 1 else ""
-    wrong = "".join(f'<p class="wrong">Not as the scenario says: {escape(line)}</p>\n' for line in summary.wrong)
-    return PAGE.substitute(
-        style=STYLE,
-        name=escape(scenario.name),
-        outcome=escape(summary.outcome),
-        summary=escape(scenario.summary),
-        unit=escape(summary.unit),
-        speed=speeded,
-        wrong=wrong,
-        panel=panel_picture(run.panel.shown(now())),
-        timeline=_timeline(run, begin, end),
-        rows="".join(f"<tr><th>{escape(name)}<td>{escape(value)}\n" for name, value in summary.rows()),
-        commands="".join(_command(call, begin) for call in run.commands()),
-        log=escape(run.log),
+    wrong = "".join(f'<p class="bad">Not as the scenario says: {escape(line)}</p>\n' for line in summary.wrong)
+    rows = "".join(f"<tr><th>{escape(name)}</th><td>{escape(value)}</td></tr>\n" for name, value in summary.rows())
+    return frame(
+        f"{scenario.name}: {summary.outcome}",
+        f"<p>{escape(scenario.summary)}<br>Unit: {escape(summary.unit)}. {speeded}</p>\n{wrong}"
+        f"{panel_picture(run.panel.shown(now()))}\n<table>\n{rows}</table>\n"
+        f"<h2>Panel, commands and waits as they were</h2>\n{_chart(run, begin, end)}\n"
+        f"{_explained(run.log, build / TOOL)}<h2>Log</h2>\n<pre>{escape(run.log)}</pre>\n",
     )
 
 
@@ -110,6 +81,30 @@ def lit(run: Run, end: float) -> dict[int, list[tuple[float, float, int]]]:
     return found
 
 
+def _part(name: str) -> str:
+    """A part of the companion program's template."""
+    part = re.search(f"{{{{#{name}}}}}\n(.*?){{{{/{name}}}}}\n", TEMPLATE, re.DOTALL)
+    assert part, name
+    return part[1]
+
+
+def _explained(log: str, tool: Path) -> str:
+    """The runs of a log as the companion program draws them; "" for a log without a record, or without the program."""
+    if not tool.exists():
+        return ""
+    with tempfile.TemporaryDirectory() as folder:
+        drawn = Path(folder) / "page.html"
+        (Path(folder) / "log").write_text(log, encoding="utf-8", errors="replace")
+        command: list[str | Path] = [tool, "log", "--html", drawn.name, "log"]
+        subprocess.run(command, cwd=folder, capture_output=True, check=False)
+        if not drawn.exists():
+            return ""
+        text = drawn.read_text(encoding="utf-8")
+    runs = re.search("</h1>\n(.*)</body>", text, re.DOTALL)
+    assert runs
+    return runs[1]
+
+
 def _shown(run: Run, end: float) -> Iterator[tuple[float, float, dict[int, int]]]:
     """Times from, to (s), and what the LEDs show between."""
     panel = Panel()
@@ -122,7 +117,8 @@ def _shown(run: Run, end: float) -> Iterator[tuple[float, float, dict[int, int]]
             moment = stop
 
 
-def _timeline(run: Run, begin: float, end: float) -> str:
+def _chart(run: Run, begin: float, end: float) -> str:
+    """The LEDs, the commands and the waits against time."""
     scale = (WIDTH - LEFT - RIGHT) / (end - begin)
 
     def across(moment: float) -> float:
@@ -136,20 +132,21 @@ def _timeline(run: Run, begin: float, end: float) -> str:
     drawn, top = "", 4
     for led, spans in lit(run, end).items():
         drawn += f'<text x="{LEFT - 8}" y="{top + 11}" text-anchor="end">{led_name(led).removeprefix("0x")}</text>'
-        drawn += bar(begin, end, top, DARK, f"{led_name(led)} dark")
+        drawn += bar(begin, end, top, LANE, f"{led_name(led)} dark")
         for start, stop, color in spans:
             title = f"{led_name(led)} {color_name(color)} from {start - begin:.2f} s to {stop - begin:.2f} s"
             drawn += bar(start, stop, top, fill_of(color), title)
         top += ROW
     top += 10
-    waits = run.waits()
-    for call in [call for call in run.calls if call in waits or _is_command(call)]:
-        text = f"wait of {call.seconds} s" if call in waits else call.text
-        stop = call.end if call.end is not None else end
-        fill = WAIT if call in waits else COMMAND
-        drawn += bar(call.start, stop, top, fill, f"{text}: {stop - call.start:.2f} s")
-        left = across(call.start)
-        drawn += _label(re.sub(r"( +-o \S+)+", " …", text), left, max(across(stop), left + 1), top + 11)
+    for calls in taken(run):
+        is_wait = calls[0].call == "nanosleep"
+        text = f"wait of {calls[0].seconds} s" if is_wait else calls[0].text
+        for call in calls:
+            stop = call.end if call.end is not None else end
+            drawn += bar(call.start, stop, top, WAIT if is_wait else COMMAND, f"{text}: {stop - call.start:.2f} s")
+        took = f"{f'{len(calls)} times, ' if len(calls) > 1 else ''}{stop - calls[0].start:.2f} s"
+        left = across(calls[0].start)
+        drawn += _label(re.sub(r"( +-o \S+)+", " …", text), took, left, max(across(stop), left + 1), top + 11)
         top += ROW
     step = next((tick for tick in TICKS if (end - begin) / tick <= MOST_TICKS), TICKS[-1])
     grid = ""
@@ -157,24 +154,13 @@ def _timeline(run: Run, begin: float, end: float) -> str:
         x = across(begin + number * step)
         grid += f'<line x1="{x:.1f}" y1="0" x2="{x:.1f}" y2="{top}"/>'
         grid += f'<text x="{x:.1f}" y="{top + 14}" text-anchor="middle">{number * step:g} s</text>\n'
-    return f'<svg id="timeline" viewBox="0 0 {WIDTH} {top + 20}">\n{grid}{drawn}</svg>'
+    return f'<svg id="chart" viewBox="0 0 {WIDTH} {top + 20}">\n{grid}{drawn}</svg>'
 
 
-def _label(text: str, left: float, right: float, baseline: float) -> str:
-    """`text` after its bar, or before it where there is more space; cut to what fits."""
+def _label(text: str, took: str, left: float, right: float, baseline: float) -> str:
+    """What was done and how long it took, after its bar, or before it where there is more space; cut to what fits."""
     after = WIDTH - right >= left - LEFT
-    room = int(((WIDTH - right if after else left - LEFT) - 12) / LETTER)
+    room = int(((WIDTH - right if after else left - LEFT) - 12) / LETTER) - len(took) - 2
     shown = text if len(text) <= room else f"{text[: max(room - 1, 0)]}…"
     place = f'x="{right + 5:.1f}"' if after else f'x="{left - 5:.1f}" text-anchor="end"'
-    return f'<text {place} y="{baseline}">{escape(shown)}</text>\n'
-
-
-def _is_command(call: Call) -> bool:
-    return call.call != "nanosleep" and not call.text.startswith("i2cset ")
-
-
-def _command(call: Call, begin: float) -> str:
-    took = f"{call.end - call.start:.2f} s" if call.end is not None else "ended"
-    status = "" if call.status is None else str(call.status)
-    cells = "".join(f'<td class="number">{value}' for value in (f"{call.start - begin:.2f} s", took, status))
-    return f"<tr>{cells}<td><code>{escape(call.text)}</code>\n"
+    return f'<text {place} y="{baseline}">{escape(f"{shown}: {took}")}</text>\n'

@@ -1,8 +1,10 @@
 """Shows a run as lines of text: the log as it grows, each change of the panel, and the summary at the end."""
 
+import curses
 import os
 import sys
 from dataclasses import dataclass
+from functools import cache
 
 from bench.observation import Run, now
 from bench.outcomes import meaning_of
@@ -14,14 +16,21 @@ ANSI = {"off": "2", "blue": "1;34", "pass": "1;32", "fail": "1;31"}
 OTHER_COLOR = "1;35"
 
 
+@cache
 def terminal() -> bool:
     """Whether the output is a terminal that can move its cursor."""
-    return sys.stdout.isatty() and os.environ.get("TERM", "dumb") != "dumb"
+    if not sys.stdout.isatty():
+        return False
+    try:
+        curses.setupterm()
+    except curses.error:  # a terminal that nobody knows
+        return False
+    return curses.tigetstr("cup") is not None
 
 
 def colored() -> bool:
     """Whether the output supports colours. NO_COLOR: see https://no-color.org"""
-    return terminal() and not os.environ.get("NO_COLOR")
+    return terminal() and curses.tigetnum("colors") > 0 and not os.environ.get("NO_COLOR")
 
 
 def paint(text: str, color: str) -> str:

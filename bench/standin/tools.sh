@@ -20,6 +20,18 @@ fail() { # STATUS MESSAGE
     exit "$1"
 }
 
+# What a user has changed since the updater started, and a time (s) in which to change more.
+read_changes() {
+    # shellcheck disable=SC1091 # made by unit.py
+    [ ! -e "$UNIT/changes" ] || . "$UNIT/changes"
+}
+
+take_time() {
+    [ -n "${BENCH_PACE-}" ] || return 0
+    /bin/sleep "$BENCH_PACE"
+    read_changes
+}
+
 board_answers() {
     case $BOARD_LINK in
     down | hangs) fail 255 "ssh: connect to host 192.168.9.2 port 22: Connection timed out" ;;
@@ -29,6 +41,10 @@ board_answers() {
     key-refused) fail 255 "root@192.168.9.2: Permission denied (publickey)." ;;
     host-key-changed) fail 255 "Host key verification failed." ;;
     esac
+    # The session stays while the board hangs, and breaks when the link is cut.
+    take_time
+    while [ "$BOARD_LINK" = hangs ]; do take_time; done
+    [ "$BOARD_LINK" != down ] || fail 255 "client_loop: send disconnect: Broken pipe"
 }
 
 umount() {
@@ -43,7 +59,8 @@ rm() {
 }
 
 ls() {
-    [ "$STICK_TEAMVIEWER" != unreadable ] || [ "$1" != /root/USB_MOUNT/debs/installTV ] || fail 1 "ls: $1: failure"
+    [ "$STICK_TEAMVIEWER" != unreadable ] || [ "${1-}" != /root/USB_MOUNT/debs/installTV ] || fail 1 "ls: $1: failure"
+    [ $# -gt 0 ] || set -- /root/ # by hand
     path=$head/${1#/root/}
     if [ -d "$path" ]; then
         /bin/ls "$path"
@@ -158,6 +175,8 @@ case " $TOOLS_KILLED " in
     exec "$BENCH_TOOLS/killed"
     ;;
 esac
+read_changes
+[ "$tool" = i2cset ] || take_time
 case $tool in
 apt-cache) apt_cache "$@" ;;
 systemctl) exec "$BENCH_TOOLS/systemctl" "$@" ;;

@@ -7,13 +7,16 @@ import subprocess
 from pathlib import Path
 
 from bench.makers import board, sticks
+from bench.makers.files import replace_text
+from bench.makers.packages import candidate
 from bench.makers.sounds import FOLDER as SOUND_FOLDER
 from bench.makers.sounds import SOUNDS
 from bench.scenario import TOOLS, Scenario, variables
-from bench.unit import PROGRAMS, Files, State, with_pid_file
+from bench.unit import PROGRAMS, Files, State, parts_of, with_pid_file
 
 HERE = Path(__file__).parent
 TOOLS_FOLDER = HERE.parent / "makers/tools"
+LONGEST_PACE = 3  # s, that a tool takes where a user watches
 UNPACK = f"/bin/cp root/OSUpgrade.zip {board.VERSION_FILE}\n"  # where there is no unzip
 
 
@@ -37,20 +40,56 @@ class StandInUnit:
         self._speed = speed
         self._build = build
         self._updater: subprocess.Popen[bytes] | None = None
+        self._parts = parts_of(scenario.setup)
+        self._speed_file = folder / "speed"  # where the speed may change
         self.files = Files(log=folder / "log", calls=folder / "calls", panel=folder / "panel")
 
     def start(self) -> None:
         """Makes the unit and starts the updater."""
-        for file in (self.files.log, self.files.calls, self.files.panel, self._folder / "sounds"):
-            file.touch()
         self._make_head()
         self._make_board()
         self._make_stick()
+        self.update()
+
+    def update(self) -> None:
+        """Starts the updater, again once it has ended; `files` begin anew."""
+        for file in (self.files.log, self.files.calls, self.files.panel, self._folder / "sounds"):
+            file.write_text("")
         self._start_updater()
 
     def ended(self) -> int | None:
         """None while the updater runs, then its status."""
         return self._updater.poll() if self._updater else None
+
+    def parts(self) -> dict[str, bool]:
+        """Which of the PARTS are in order."""
+        return dict(self._parts)
+
+    def switch(self, part: str) -> None:
+        """Puts a part into its other state."""
+        on = self._parts[part] = not self._parts[part]
+        if part == "power":
+            self.close()
+            (self._folder / "harl").write_text("active\n" if on else "inactive\n")
+        if part in ("power", "stick"):
+            self._mount_stick(self._parts["power"] and self._parts["stick"])
+        self._tell_tools()
+
+    def set_speed(self, speed: float) -> None:
+        """How many times faster the updater's clock and waits run from now on; the tools take their time, too."""
+        self._speed = speed
+        replace_text(self._speed_file, f"{speed}\n")
+        self._tell_tools()
+
+    def updater(self) -> int | None:
+        """The process id of the updater, None when it does not run."""
+        if not self._updater or self._updater.poll() is not None:
+            return None
+        return self._updater.pid
+
+    def shell(self) -> tuple[list[str], dict[str, str]]:
+        """A command that runs a shell with the stand-in tools, and its environment."""
+        return ["/bin/sh", "-i"], self._environment() | {"PS1": "stand-in# ", "TERM": os.environ.get("TERM", "dumb")}
 
     def state(self) -> State:
         """The unit as it is now."""
@@ -62,7 +101,7 @@ class StandInUnit:
             marker=(self._folder / "head/RESOURCES/tavren1stboot").exists(),
             stick=(self._folder / "head/USB_MOUNT").is_symlink(),
             harl=self._read("harl") if known else "unknown",
-            updater="active" if is_service and self.ended() is None else "inactive",
+            updater="active" if is_service and self.updater() else "inactive",
             sounds=(self._folder / "sounds").read_text().split(),
         )
 
@@ -100,37 +139,51 @@ class StandInUnit:
 
     def _make_stick(self) -> None:
         stick = self._setup.stick
-        if not stick.inserted:
-            (self._folder / "head/USB_MOUNT").mkdir()
-            return
         script = "exit 3\n" if self._setup.board.script == "fails" else UNPACK
         sticks.write_stick(
             self._folder / "stick", stick.directories, script, sticks.version_file_archive, stick.teamviewer
         )
-        (self._folder / "head/USB_MOUNT").symlink_to(self._folder / "stick")
+        (self._folder / "head/USB_MOUNT").mkdir()
+        self._mount_stick(stick.inserted)
 
-    def _candidate(self) -> str:
-        """The version that apt picks as the candidate: an older one only if configured."""
-        package = self._setup.package
-        older = ["dpkg", "--compare-versions", package.offered, "lt", package.installed]
-        if package.downgrades or package.installed == "(none)" or subprocess.run(older, check=False).returncode != 0:
-            return package.offered
-        return package.installed
+    def _mount_stick(self, mounted: bool) -> None:
+        mount = self._folder / "head/USB_MOUNT"
+        if mounted and not mount.is_symlink():
+            mount.rmdir()
+            mount.symlink_to(self._folder / "stick")
+        elif not mounted and mount.is_symlink():
+            mount.unlink()
+            mount.mkdir()
 
     def _environment(self) -> dict[str, str]:
         """What the tools need."""
+        package = self._setup.package
         return {
             **variables(self._setup),
             "PATH": str(self._folder / "bin"),
             "UNIT": str(self._folder),
             "BENCH_TOOLS": str(TOOLS_FOLDER),
-            "PACKAGE_OFFERED": self._candidate(),
+            "PACKAGE_OFFERED": candidate(package.installed, package.offered, package.downgrades),
         }
+
+    def _tell_tools(self) -> None:
+        """What the tools need to know of changes while they run."""
+        setup, parts = self._setup, self._parts
+        usual = setup.board.link if setup.board.link not in ("down", "hangs") else "up"
+        refresh = setup.mirrors.refresh if setup.mirrors.refresh != "unreachable" else "works"
+        values = {
+            "BOARD_LINK": "down" if not parts["link"] else usual if parts["board"] else "hangs",
+            "MIRRORS_REFRESH": refresh if parts["mirrors"] else "unreachable",
+            "HEAD_SOUND": "present" if parts["sound"] else "absent",
+            "HEAD_PANEL": "present" if parts["bus"] else "absent",
+            "BENCH_PACE": f"{min(60 / self._speed, LONGEST_PACE):.3f}",
+        }
+        replace_text(self._folder / "changes", "".join(f"{name}={value}\n" for name, value in values.items()))
 
     def _start_updater(self) -> None:
         environment = self._environment() | {
             "BENCH_CALLS": str(self.files.calls),
-            "BENCH_SPEED": str(self._speed),
+            "BENCH_SPEED": str(self._speed_file if self._speed_file.exists() else self._speed),
         }
         env = ["/usr/bin/env"]
         if self._setup.updater.children == "ignored":

@@ -120,9 +120,22 @@ class Page(unittest.TestCase):
         commands = elements.filled(page_module.COMMAND)
         self.assertEqual(len(commands), 13)  # that of the sound, and those of the table
         self.assertRegex(commands[3], r"^apt --assume-yes install solvik4-rh: \d+\.\d\d s$")
-        self.assertEqual(len(elements.texts("code")), 12)
-        self.assertIn("BEFORE UPDATE", elements.texts("pre")[0])
-        self.assertNotIn('class="wrong"', page)
+        self.assertIn("BEFORE UPDATE", elements.texts("pre")[-1])
+        self.assertNotIn("Not as the scenario says", page)
+
+    @unittest.skipUnless((BUILD / page_module.TOOL).exists(), "without the companion program nothing explains the log")
+    def test_explained_as_the_companion_program_does(self) -> None:
+        page = written("board-upload-fails", self.folder)
+        self.assertIn("[board-upload-failed]</b>", page)
+        self.assertIn("<th>Flashing thread</th>", page)
+        for once in ("<!DOCTYPE html>", "<style>", "<h1>", "</html>"):
+            self.assertEqual(page.count(once), 1, once)
+
+    def test_attempts_share_a_row(self) -> None:
+        elements = Elements(written("board-upload-fails", self.folder))
+        self.assertEqual(sum(title.startswith("scp ") for title in elements.filled(page_module.COMMAND)), 20)
+        [row] = [text for text in elements.texts("text") if text.startswith("scp ")]
+        self.assertRegex(row, r"…: 20 times, \d\.\d\d s$")
 
     def test_needs_nothing_else(self) -> None:
         page = written("up-to-date", self.folder)
@@ -136,11 +149,11 @@ class Page(unittest.TestCase):
     def test_run_that_differs_from_the_scenario(self) -> None:
         file = Path(self.folder) / "wrong.toml"
         text = (ROOT / "bench/scenarios/up-to-date.toml").read_text()
-        file.write_text(text.replace('summary = "', 'summary = "<b>', 1).replace("marker = true", "marker = false"))
+        file.write_text(text.replace('summary = "', 'summary = "<u>', 1).replace("marker = true", "marker = false"))
         page = written(str(file), self.folder)
         self.assertIn("Not as the scenario says: marker: expected False, not True", page)
-        self.assertIn("&lt;b&gt;", page)
-        self.assertNotIn("<b>", page)
+        self.assertIn("&lt;u&gt;", page)
+        self.assertNotIn("<u>", page)
 
 
 class Gallery(unittest.TestCase):

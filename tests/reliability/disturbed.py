@@ -44,9 +44,7 @@ exec {runner} /usr/bin/env LD_PRELOAD={wrapped}/bench/call_recorder.so {wrapped}
     def start(self) -> None:
         """Makes the unit the first time, and starts the updater."""
         if self._made:
-            for file in (self.files.log, self.files.calls, self.files.panel, self._folder / "sounds"):
-                file.write_text("")
-            self._start_updater()
+            self.update()
             return
         self._made = True
         super().start()

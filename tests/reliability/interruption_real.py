@@ -56,11 +56,7 @@ class InterruptedReal(RealUnit):
             self._started = True
             super().start()
             return
-        for name in ("log", "calls", "panel", "status"):
-            (self._out / name).unlink(missing_ok=True)
-        for played in self._out.glob("played-*"):
-            played.unlink()
-        (self._out / "again").write_text("\n")
+        self.update()
 
     def ended(self) -> int | None:
         """None while anything runs on the head, or on the board besides its server, then the updater's status."""

@@ -11,8 +11,8 @@
 ///
 /// Shortens the waits: BENCH_SPEED times (1: full length), but to no less than BENCH_SHORTEST_WAIT (s; 0.2 when it is
 /// not set) so that the panel's flashing stays visible; a longer one makes its pauses longer. BENCH_SPEED may also be
-/// the absolute path of a file with the number, which may change while the updater runs. The wall clock that the updater
-/// sees advances by the time cut from waits of 2 s and more, so that the log reads like a run at full length.
+/// the absolute path of a file with the number, which may change while the updater runs. The wall clock that the
+/// updater sees advances by the time cut from waits of 2 s and more, so that the log reads like a run at full length.
 
 #include <algorithm>
 #include <atomic>
@@ -31,7 +31,7 @@
 namespace
 {
 
-const double clockWait = 2;     // s, the shortest wait whose shortening moves the wall clock
+const double clockWait = 2;      // s, the shortest wait whose shortening moves the wall clock
 const double longestSleep = 0.1; // s, between two looks at the file with the speed
 
 std::atomic<double> clockOffset{0};   // s, by which the updater's wall clock is ahead

@@ -56,8 +56,7 @@ def page(summary: Summary, speed: float, build: Path) -> str:
     return frame(
         f"{scenario.name}: {summary.outcome}",
         f"<p>{escape(scenario.summary)}<br>Unit: {escape(summary.unit)}. {speeded}</p>\n{wrong}"
-        f"{panel_picture(run.panel.shown(now()))}\n<table>\n{rows}</table>\n"
-        f"<h2>Panel, commands and waits as they were</h2>\n{_chart(run, begin, end)}\n"
+        f"{panel_picture(run.panel.shown(now()))}\n{_chart(run, begin, end)}\n<table>\n{rows}</table>\n"
         f"{_explained(run.log, build / TOOL)}<h2>Log</h2>\n<pre>{escape(run.log)}</pre>\n",
     )
 

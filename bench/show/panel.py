@@ -1,7 +1,7 @@
 """Usage: scripts/python -m bench.show.panel FOLDER
 
-Draws the front panel as the operator sees it. The command writes a picture of each outcome and of the flashing into
-FOLDER: docs/panel has those of the operator's page.
+Draws the front panel as the operator sees it. The command writes a picture of each outcome, of the flashing and of
+the dark panel into FOLDER: docs/panel has those of the operator's page.
 """
 
 import sys
@@ -18,8 +18,8 @@ MARKS = {
     "pass": '<path d="M-6 0 L-2 5 L6 -5" fill="none" stroke="#ffffff" stroke-width="3"/>',
     "fail": '<path d="M-5 -5 L5 5 M-5 5 L5 -5" fill="none" stroke="#ffffff" stroke-width="3"/>',
 }
-PITCH, MARGIN = 52, 30  # from LED to LED, from the edge to the first
-HEIGHT = 64
+PITCH, MARGIN = 45, 28  # from LED to LED, from the edge to the first
+HEIGHT = 62
 OUTCOMES = {
     "up-to-date": UP_TO_DATE,
     "updated": UPDATED,
@@ -63,6 +63,7 @@ def after(*commands: tuple[str, str]) -> dict[int, int]:
 def pictures() -> dict[str, str]:
     """The pictures by file name."""
     made = {name: panel_picture(after(*outcome.panel.items())) for name, outcome in OUTCOMES.items()}
+    made["dark"] = panel_picture(after())
     made["flashing"] = panel_picture(after(("REMOTE", "blue")), after(("MAIN", "blue")))
     # Attributes that only a separate file needs.
     file = '<svg xmlns="http://www.w3.org/2000/svg"'

@@ -132,6 +132,9 @@ class Patterns(unittest.TestCase):
         kept = {file.name: file.read_text() for file in (ROOT / "docs/panel").iterdir()}
         self.assertEqual(kept, pictures())
 
+    def test_operator_has_all_pictures(self) -> None:
+        self.assertEqual(set(re.findall(r"\(panel/(\S+?)\)", OPERATOR)), set(pictures()))
+
     def test_golden_logs_show_each_report_like_this(self) -> None:
         seen = set()
         for name in scenario.names():

@@ -11,9 +11,10 @@ tool=${0##*/}
 head=$UNIT/head   # the head's files below /root
 board=$UNIT/board # the board's root
 calls=$UNIT/tools
+call="$tool $*"
 
 read -r now _ </proc/uptime
-echo "$now $tool $*" >>"$calls"
+echo "$now $call" >>"$calls"
 
 fail() { # STATUS MESSAGE
     echo "$2" >&2
@@ -26,14 +27,27 @@ read_changes() {
     [ ! -e "$UNIT/changes" ] || . "$UNIT/changes"
 }
 
+# A test holds the calls that match the pattern in the file BENCH_HOLD, as long as that is there.
+is_held() {
+    { read -r pattern <"${BENCH_HOLD:-/dev/null}"; } 2>/dev/null || return 1
+    # shellcheck disable=SC2254 # a pattern, intended
+    case $call in
+    $pattern) ;;
+    *) return 1 ;;
+    esac
+}
+
 take_time() {
     [ -n "${BENCH_PACE-}" ] || return 0
     /bin/sleep "$BENCH_PACE"
+    while is_held; do /bin/sleep 0.02; done
     read_changes
 }
 
 board_answers() {
-    case $BOARD_LINK in
+    link=$BOARD_LINK # of the connection; it may change during the session
+    take_time
+    case $link in
     down | hangs) fail 255 "ssh: connect to host 192.168.9.2 port 22: Connection timed out" ;;
     slow) /bin/sleep 0.3 ;;
     esac
@@ -42,7 +56,6 @@ board_answers() {
     host-key-changed) fail 255 "Host key verification failed." ;;
     esac
     # The session stays while the board hangs, and breaks when the link is cut.
-    take_time
     while [ "$BOARD_LINK" = hangs ]; do take_time; done
     [ "$BOARD_LINK" != down ] || fail 255 "client_loop: send disconnect: Broken pipe"
 }
@@ -176,7 +189,10 @@ case " $TOOLS_KILLED " in
     ;;
 esac
 read_changes
-[ "$tool" = i2cset ] || take_time
+case $tool in
+i2cset | ssh | scp) ;; # the board's tools take their time during the session
+*) take_time ;;
+esac
 case $tool in
 apt-cache) apt_cache "$@" ;;
 systemctl) exec "$BENCH_TOOLS/systemctl" "$@" ;;

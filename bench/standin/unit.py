@@ -164,6 +164,7 @@ class StandInUnit:
             "UNIT": str(self._folder),
             "BENCH_TOOLS": str(TOOLS_FOLDER),
             "PACKAGE_OFFERED": candidate(package.installed, package.offered, package.downgrades),
+            "BENCH_HOLD": os.environ.get("BENCH_HOLD", ""),
         }
 
     def _tell_tools(self) -> None:

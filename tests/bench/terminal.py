@@ -78,8 +78,10 @@ class Terminal:
 
     def wait_for_end(self) -> int:
         """Waits until the program ends. Returns its exit status, or minus the signal's number."""
+        end = time.monotonic() + LONGEST_WAIT
         while self._read():
-            pass
+            if time.monotonic() > end:
+                raise AssertionError(f"did not end:\n{self.text()}")
         self.process.wait()
         return int(-self.process.signalstatus if self.process.signalstatus else self.process.exitstatus)
 

@@ -1,25 +1,27 @@
-"""Usage: fleet_test.py BUILD_FOLDER [TEST...]
+"""Usage: fleet_test.py BUILD_FOLDER UNITS [TEST...]
 
-Units with the built packages harl-updater and harl-updater-fleet, and a server as docs/fleet.md sets it up, each a
-machine of its own (see service_test.py) with the services of both sides, TLS and client certificates. They share one
-network, in which the server is `localhost`.
+UNITS units (8 for all tests) with the built packages harl-updater and harl-updater-fleet, and a server as docs/fleet.md
+sets it up, each a machine of its own (see service_test.py) with the services of both sides, TLS and client
+certificates. They share one network, in which the server is `localhost`.
 """
 
 import contextlib
 import json
+import os
 import re
 import shutil
 import subprocess
 import tempfile
-import time
 import unittest
+from collections.abc import Iterator
+from functools import partial
 from pathlib import Path
 from typing import Any
 
-from bench.machine.machine import Machine, machine
+from bench.machine.machine import Machine, MachineError, machine
 from bench.makers.files import write, write_script
 from bench.makers.packages import SOURCES, Package, build, write_index
-from tests.command_line import skip, take_path
+from tests.command_line import skip, take_path, take_word
 from tests.service.service_test import TOOLS, ServiceTest, built_package, install, make_files, wait_for
 
 ROOT = Path(__file__).parents[2]
@@ -29,6 +31,11 @@ SERVICE = "harl-updater-fleet"
 RETRY = "[Service]\nRestartSec=1\n"
 SPEED = 300  # times shorter waits of the updater
 PROGRAMS = Path()
+RECEIVER = Path("/lib/systemd/systemd-journal-remote")
+# What the unit's service says when it could not send.
+CANNOT_COPY, CANNOT_SEND = "the disk is full", "upload failed"
+# Where the maker's server can be, or not, when an update runs.
+PLACES = ("none", "away", "silent", "there, the unit's disk full", "there, its disk full", "there")
 LAST = "fleet /var/log"  # in the page's command that answers
 CHANGING = (r"\b[0-9a-f]{32}\b", r"\d\d-\d\d-\d{4} \d\d:\d\d:\d\d")
 # What the maker's tool must say of each unit.
@@ -87,6 +94,17 @@ class Unit(ServiceTest):
         """The application runs again, and the updater does not."""
         return self.states() <= {"inactive", "failed"} and not self.unit.status("systemctl", "is-active", "-q", "harl")
 
+    def time_of_run(self) -> float:
+        """s from the start of the last run until the application ran again, by the clock of the service manager."""
+        times = [self.inside("systemctl", "show", "--value", f"--property={name}TimestampMonotonic", unit)
+                 for unit, name in (("harl-updater", "InactiveExit"), ("harl", "ActiveEnter"))]
+        return (int(times[1]) - int(times[0])) / 1e6
+
+    def says(self, text: str) -> bool:
+        """The service that sends has said this since the start of the last run."""
+        log = self.inside("journalctl", "--quiet", "--output=cat", f"--unit={SERVICE}", *self.before)
+        return text in log
+
     def sent(self) -> bool:
         """All records are with the server."""
         state = self.inside("systemctl", "show", "--value", "--property=ActiveState", SERVICE).strip()
@@ -98,7 +116,6 @@ class FleetTest(unittest.TestCase):
 
     server: Machine
     units: list[Unit]
-    work: Path
 
     def setUp(self) -> None:
         self.maxDiff = None
@@ -118,6 +135,19 @@ class FleetTest(unittest.TestCase):
         facts, *units = map(json.loads, lines)
         return facts, {unit["unit"]: unit for unit in units}
 
+    def expect_all_records(self, units: list[Unit]) -> None:
+        """The server has every record of these units' runs, and no other of theirs."""
+        own = ("harl-updater", "harl-updater-give-back", "harl-updater-verify")
+        for unit in units:
+            unit.inside("journalctl", "--sync")
+            wanted = records(unit.unit, *(f"--unit={name}" for name in own))
+            there = records(self.server, f"--directory=/{RECEIVED}", f"_HOSTNAME={unit.inside('hostname').strip()}")
+            self.assertGreater(len(wanted), 10)
+            # What the service manager says of the verification says nothing of the run.
+            self.assertEqual({record for record in wanted - there if "Look whether the unit" not in record[2]
+                              and "harl-updater-verify.service" not in record[2]}, set())
+            self.assertEqual(there - wanted, set())
+
     def test_eight_units_while_the_server_is_away(self) -> None:
         self.serve(False)
         for unit, outcome in zip(self.units, OUTCOMES):
@@ -127,67 +157,117 @@ class FleetTest(unittest.TestCase):
         for unit, outcome in zip(self.units, OUTCOMES):
             if outcome != "never-ended":
                 wait_for(outcome, unit.given_back, 120)
-        failed = "systemctl show --value --property=NRestarts harl-updater-fleet"
-        wait_for("an attempt without the server", lambda: self.units[0].inside("sh", "-c", failed).strip() != "0", 60)
+        wait_for("attempts without the server", lambda: self.units[0].says(CANNOT_SEND), 60)
         self.assertEqual(list((self.server.root() / RECEIVED).glob("*")), [])
         self.serve(True)
         self.units[-1].inside("systemctl", "start", SERVICE)
         for unit, outcome in zip(self.units, OUTCOMES):
             wait_for(f"records of {outcome}", unit.sent, 120)
+        self.expect_all_records(self.units[: len(OUTCOMES) - 1])  # the last one's run goes on
         facts, units = self.answer()
         found = {name: (unit["outcome"], unit["state"], unit["failure"]) for name, unit in units.items()}
         self.assertEqual(found, {f"unit-{number:04}": told for number, told in enumerate(OUTCOMES.values(), 1)})
         self.assertEqual(facts["runs"], len(OUTCOMES))
         self.assertEqual(facts["packages"]["solvik4-rh 1.3.0"], 5)
-        print(f"{facts['repeated_lines']} records came twice")
+        self.assertEqual(facts["unread"], [])
+
+    @contextlib.contextmanager
+    def place(self, unit: Unit, place: str) -> Iterator[None]:
+        """The server is there, or not, as PLACES says, until the end of the block."""
+        with contextlib.ExitStack() as after:
+            if place == "none":
+                (unit.unit.root() / f"etc/{SERVICE}/server").rename(unit.unit.root() / "root/server")
+                after.callback(unit.inside, "mv", "/root/server", f"/etc/{SERVICE}")
+            elif not place.startswith("there"):
+                self.serve(False)
+                after.callback(self.serve, True)
+            if place == "silent":  # it takes connections, and never answers
+                listener = ["systemd-socket-activate", "--listen=19532", "sleep", "infinity"]
+                self.server.run("systemd-run", "--quiet", "--unit=silent", *listener)
+                after.callback(self.server.run, "systemctl", "stop", "silent")
+            elif place.endswith("the unit's disk full"):
+                after.enter_context(full_disk(unit.unit, f"/var/lib/{SERVICE}"))
+            elif place.endswith("its disk full"):
+                self.server.run("systemctl", "stop", "systemd-journal-remote")
+                after.callback(self.server.run, "systemctl", "stop", "systemd-journal-remote")  # its files are there
+                after.enter_context(full_disk(self.server, f"/{RECEIVED}"))
+            yield
+            unit.inside("systemctl", "stop", SERVICE)
 
     def test_update_is_not_held_up(self) -> None:
         [unit] = self.units[:1]
-        took = {}
-        for server in ("none", "away", "there"):
-            (unit.unit.root() / "etc/harl-updater-fleet/server").unlink(missing_ok=True)
-            if server != "none":
-                write(unit.unit.root() / "etc/harl-updater-fleet/server", "https://localhost:19532\n")
-            self.serve(server == "there")
-            times = []
-            for _ in range(3):
+        least = dict.fromkeys(PLACES, 1e9)
+        for attempt in range(6):  # a machine that others use gets further ones
+            for place in PLACES:
                 unit.prepare("up-to-date")
-                begin = time.monotonic()
-                unit.start()
-                wait_for(server, unit.given_back)
-                times.append(time.monotonic() - begin)
-                unit.inside("systemctl", "stop", SERVICE)
-            took[server] = min(times)
-        print(", ".join(f"{server}: {seconds:.1f} s" for server, seconds in took.items()))
-        self.assertLess(max(took.values()) - took["none"], 1)
+                with self.place(unit, place):
+                    unit.start()
+                    wait_for(place, unit.given_back)
+                    least[place] = min(least[place], unit.time_of_run())
+                    wait_for(place, partial(self.tried, unit, place))
+            if attempt > 0 and max(least.values()) - least["none"] < 1:
+                break
+        print("; ".join(f"{place}: {seconds:.2f} s" for place, seconds in least.items()))
+        self.assertLess(max(least.values()) - least["none"], 1)
+
+    def tried(self, unit: Unit, place: str) -> bool:
+        """The unit has tried to send, with the end that this place of the server lets it have."""
+        if place == "silent":
+            return unit.unit.status("pgrep", "--full", "systemd-journal-upload --follow") == 0
+        said = {"away": CANNOT_SEND, "there, the unit's disk full": CANNOT_COPY, "there, its disk full": CANNOT_SEND}
+        return place == "none" or unit.says(said.get(place, "Deactivated successfully"))
 
     def test_full_disk_of_the_unit(self) -> None:
         [unit] = self.units[:1]
-        unit.inside("sh", "-c", f"mkdir -p /var/lib/{SERVICE}; mount -t tmpfs -o size=300k full /var/lib/{SERVICE}")
-        self.addCleanup(unit.unit.status, "umount", "-l", f"/var/lib/{SERVICE}")
-        unit.prepare("updated")
-        unit.run_to("updated")
-        wait_for("the instrument", unit.given_back)
-        said = f"journalctl -q --unit={SERVICE} | grep -q 'the disk is full'"
-        wait_for("an attempt", lambda: unit.unit.status("sh", "-c", said) == 0)
-        self.assertEqual(unit.panel(), {"PASS": "pass"})
-        unit.inside("mount", "-o", "remount,size=64m", f"/var/lib/{SERVICE}")
-        wait_for("the records", unit.sent)
-        self.assertEqual(self.answer()[1]["unit-0001"]["state"], "well")
+        self.expect_nothing_lost_on(unit, unit.unit, f"/var/lib/{SERVICE}", CANNOT_COPY)
 
     def test_full_disk_of_the_server(self) -> None:
         [unit] = self.units[:1]
         self.server.run("systemctl", "stop", "systemd-journal-remote")
-        self.server.run("mount", "-t", "tmpfs", "-o", "size=300k,mode=777", "full", f"/{RECEIVED}")
-        self.addCleanup(self.server.status, "umount", "-l", f"/{RECEIVED}")
+        self.expect_nothing_lost_on(unit, self.server, f"/{RECEIVED}", CANNOT_SEND)
+
+    def expect_nothing_lost_on(self, unit: Unit, full: Machine, folder: str, says: str) -> None:
+        """An update ends well and its records arrive later, when this folder is on a full disk meanwhile."""
+        with full_disk(full, folder):
+            unit.prepare("updated")
+            unit.run_to("updated")
+            wait_for("the instrument", unit.given_back)
+            wait_for("an attempt", lambda: unit.says(says))
+            self.assertEqual(unit.panel(), {"PASS": "pass"})
+            full.run("mount", "-o", "remount,size=64m", folder)
+            wait_for("the records", unit.sent)
+            self.expect_all_records([unit])
+            self.assertEqual(self.answer()[1]["unit-0001"]["state"], "well")
+            unit.inside("systemctl", "stop", SERVICE)
+
+    def test_sending_is_cut_off(self) -> None:
+        [unit] = self.units[:1]
+        with self.place(unit, "silent"):
+            unit.prepare("updated")
+            unit.run_to("updated")
+            wait_for("an upload", lambda: self.tried(unit, "silent"))
+            unit.inside("systemctl", "kill", "--signal=KILL", SERVICE)
+        unit.inside("systemctl", "start", SERVICE)
+        self.expect_all_records([unit])
+        unit.inside("sh", "-c", f"rm /var/lib/{SERVICE}/place; systemctl start {SERVICE}")  # as if it were not noted
+        facts, units = self.answer()
+        self.assertEqual((facts["units"], facts["runs"], units["unit-0001"]["state"]), (1, 1, "well"))
+        self.assertGreater(facts["repeated_lines"], 10)
+
+    def test_first_start_sends_what_is_left(self) -> None:
+        [unit] = self.units[:1]
         unit.prepare("updated")
-        unit.run_to("updated")
-        wait_for("the instrument", unit.given_back)
-        said = f"journalctl -q --unit={SERVICE} | grep -q 'upload failed'"
-        wait_for("an attempt", lambda: unit.unit.status("sh", "-c", said) == 0)
-        self.server.run("mount", "-o", "remount,size=64m", f"/{RECEIVED}")
-        wait_for("the records", unit.sent)
-        self.assertEqual(self.answer()[1]["unit-0001"]["state"], "well")
+        with self.place(unit, "away"):
+            unit.run_to("updated")
+            wait_for("the instrument", unit.given_back)
+            wait_for("an attempt", lambda: unit.says(CANNOT_SEND))
+        self.assertIn(f"{SERVICE}.timer", unit.inside("systemctl", "show", "--property=Wants", "timers.target"))
+        write(unit.unit.root() / f"etc/systemd/system/{SERVICE}.timer.d/test.conf", "[Timer]\nOnActiveSec=1\n")
+        self.addCleanup(unit.inside, "rm", "-r", f"/etc/systemd/system/{SERVICE}.timer.d")
+        unit.inside("systemctl", "daemon-reload")
+        unit.inside("systemctl", "start", f"{SERVICE}.timer")
+        wait_for("the records", lambda: any((self.server.root() / RECEIVED).iterdir()) and unit.sent())
+        self.expect_all_records([unit])
 
     def test_nobody_without_a_certificate(self) -> None:
         unit = self.units[0].unit
@@ -217,6 +297,23 @@ class FleetTest(unittest.TestCase):
                 for pattern in CHANGING:
                     printed = re.sub(pattern, "...", printed)
                 self.assertEqual(printed.strip(), wanted.strip())
+
+
+@contextlib.contextmanager
+def full_disk(where: Machine, folder: str) -> Iterator[None]:
+    """A disk at this folder on which no journal has room, until the end of the block."""
+    where.run("sh", "-c", f"mkdir -p {folder}; mount -t tmpfs -o size=300k,mode=777 full {folder}")
+    try:
+        yield
+    finally:
+        where.run("umount", "-l", folder)
+
+
+def records(where: Machine, *options: str) -> set[tuple[str, str, str]]:
+    """The records of a journal: time, program, message."""
+    lines = where.run("journalctl", "--quiet", "--all", "--output=json", *options).splitlines()
+    names = ("__MONOTONIC_TIMESTAMP", "SYSLOG_IDENTIFIER", "MESSAGE")
+    return {tuple(str(json.loads(line)[name]) for name in names) for line in lines}  # type: ignore[misc]
 
 
 def commands() -> list[tuple[str, str, str]]:
@@ -253,33 +350,45 @@ def make_unit(unit: Machine, name: str, fleet: Path) -> None:
     unit.run("systemctl", "daemon-reload")
 
 
+def start_all(stack: contextlib.ExitStack, package: Path, fleet: Path, units: int) -> None:
+    """Starts the server and the units, and sets them up as the page says."""
+    work = Path(stack.enter_context(tempfile.TemporaryDirectory(prefix="fleet-")))
+    server = stack.enter_context(machine(Path("/")))
+    shutil.copy(PROGRAMS / "companion/harl-updater-tool", server.files)
+    (server.files / "etc/stunnel").mkdir(parents=True)
+    (server.files / RECEIVED).mkdir(parents=True)
+    server.start()
+    server.run("sh", "-c", f"ip link set lo up; cp /harl-updater-tool /usr/bin; chmod 777 /{RECEIVED}")
+    server.run("sh", "-c", "echo systemd-journal-remote:x:995:995::/:/bin/false >>/etc/passwd")
+    FleetTest.server, FleetTest.units = server, []
+    for number in range(1, units + 1):
+        unit = stack.enter_context(machine(Path("/"), None, server))
+        make_files(unit, package, PROGRAMS)
+        unit.start()
+        make_unit(unit, f"unit-{number:04}", fleet)
+        FleetTest.units.append(Unit(unit, "harl-updater"))
+    run_page(work, server, FleetTest.units[0].unit)
+    settings = FleetTest.units[0].unit.root() / f"etc/{SERVICE}"
+    for one in FleetTest.units[1:]:
+        shutil.copytree(settings, one.unit.root() / f"etc/{SERVICE}")
+
+
 def main() -> None:
     """Runs the tests of the program, as its usage says."""
     global PROGRAMS
-    PROGRAMS = take_path()
+    PROGRAMS, units = take_path(), int(take_word())
     package, fleet = built_package("harl-updater"), built_package("harl-updater-fleet")
     if not package or not fleet:
         skip("there is no package for this machine: packaging/build")
+    if os.geteuid() != 0:
+        skip("systemd as the first process of a machine of its own needs root")
+    if not all(map(shutil.which, ("stunnel", "openssl"))) or not RECEIVER.exists():
+        skip("stunnel4 or systemd-journal-remote is missing: tests/run installs them")
     with contextlib.ExitStack() as stack:
-        work = Path(stack.enter_context(tempfile.TemporaryDirectory(prefix="fleet-")))
-        server = stack.enter_context(machine(Path("/")))
-        shutil.copy(PROGRAMS / "companion/harl-updater-tool", server.files)
-        (server.files / "etc/stunnel").mkdir(parents=True)
-        (server.files / RECEIVED).mkdir(parents=True)
-        server.start()
-        server.run("sh", "-c", "ip link set lo up; cp /harl-updater-tool /usr/bin; chmod 777 /var/log/journal/remote")
-        server.run("sh", "-c", "echo systemd-journal-remote:x:995:995::/:/bin/false >>/etc/passwd")
-        FleetTest.server, FleetTest.work, FleetTest.units = server, work, []
-        for number in range(1, len(OUTCOMES) + 1):
-            unit = stack.enter_context(machine(Path("/"), None, server))
-            make_files(unit, package, PROGRAMS)
-            unit.start()
-            make_unit(unit, f"unit-{number:04}", fleet)
-            FleetTest.units.append(Unit(unit, "harl-updater"))
-        run_page(work, server, FleetTest.units[0].unit)
-        settings = FleetTest.units[0].unit.root() / f"etc/{SERVICE}"
-        for one in FleetTest.units[1:]:
-            shutil.copytree(settings, one.unit.root() / f"etc/{SERVICE}")
+        try:
+            start_all(stack, package, fleet, units)
+        except MachineError as error:
+            skip(f"this machine allows no machine of its own: {error}")
         unittest.main(verbosity=2)
 
 

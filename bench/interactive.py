@@ -14,7 +14,7 @@ from bench.processes import children, descendants, words
 from bench.scenario import Scenario
 from bench.show.screen import Screen, View
 from bench.show.steps import plan
-from bench.show.text import panel_line
+from bench.show.text import panel_line, shortened
 from bench.unit import PARTS, Unit, UnitError
 
 LOOK = 0.2  # s, between two readings of the unit's state
@@ -163,7 +163,7 @@ class Play:
     def _set_speed(self, factor: float) -> str:
         self._view.speed = max(1.0, self._view.speed * factor)
         self._unit.set_speed(self._view.speed)
-        return f"waits are {self._view.speed:g} times shorter"
+        return f"waits are {shortened(self._view.speed)}"
 
     def _shell(self) -> str:
         if not self._view.parts["power"]:

@@ -215,7 +215,8 @@ class RealUnit:
 
     def _updater_active(self) -> bool:
         if self._control_group:
-            return systemd.service_active(self._control_group, "harl-updater")
+            # What a killed updater has started stays in the control group.
+            return not self._journal.ended and systemd.service_active(self._control_group, "harl-updater")
         return self._setup.updater.stopped != "never" and not (self._out / "status").exists()
 
     def _action(self, *words: str) -> list[str]:

@@ -17,7 +17,7 @@ from bench.panel import STEP_UNIT, Panel, color_name, led_name
 from bench.scenario import Scenario
 from bench.show.panel import fill_of, panel_picture
 from bench.show.steps import taken
-from bench.show.text import Summary
+from bench.show.text import Summary, shortened
 
 TEMPLATE = (ROOT / "companion/log/page.mustache").read_text(encoding="utf-8")
 TOOL = Path("companion/harl-updater-tool")  # in the folder of the programs
@@ -50,7 +50,7 @@ def page(summary: Summary, speed: float, build: Path) -> str:
     begin = run.calls[0].start if run.calls else now()
     ends = [call.end or call.start for call in run.calls] + [moment for moment, _ in run.sent]
     end = max([begin + 0.1, *ends])
-    speeded = f"The updater's waits are {speed:g} times shorter, commands take their real time." if speed > 1 else ""
+    speeded = f"The updater's waits are {shortened(speed)}, commands take their real time." if speed > 1 else ""
     wrong = "".join(f'<p class="bad">Not as the scenario says: {escape(line)}</p>\n' for line in summary.wrong)
     rows = "".join(f"<tr><th>{escape(name)}</th><td>{escape(value)}</td></tr>\n" for name, value in summary.rows())
     return frame(

@@ -12,7 +12,7 @@ from bench.observation import Run, now, records_of
 from bench.panel import color_name, led_name
 from bench.scenario import Scenario
 from bench.show.steps import Row, headline, rows
-from bench.show.text import colored, terminal
+from bench.show.text import colored, shortened, terminal
 from bench.unit import PARTS, State, UnitError
 
 WIDTH, HEIGHT = 80, 24  # that everything fits into
@@ -124,7 +124,7 @@ class Screen:
         """The lines above the log."""
         moment, state = now(), view.state
         title = f" {view.scenario.name}: {view.unit}"
-        speed = f"waits {view.speed:g} times shorter "
+        speed = f"waits {shortened(view.speed)} "
         title = title[: WIDTH - len(speed) - 1].ljust(WIDTH - len(speed)) + speed
         lines: list[list[Segment]] = [[(title, curses.A_REVERSE)], *self._panel(view.run.panel.shown(moment))]
         if state:

@@ -43,6 +43,11 @@ def panel_line(leds: dict[int, int]) -> str:
     return ", ".join(f"{led} {color}" for led, color in lit(leds).items()) or "dark"
 
 
+def shortened(speed: float) -> str:
+    """How long the waits are at this speed."""
+    return f"{f'{speed:.1f}'.removesuffix('.0')} times shorter" if speed > 1 else "at full length"
+
+
 class PlainDisplay:
     """One line after the other, for a pipe or a plain terminal."""
 

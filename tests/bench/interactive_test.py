@@ -163,13 +163,13 @@ class Keys(Interactive):
         terminal = self.bench("board-only", 1000)
         terminal.wait_until("run the board's script .* so far")
         terminal.press(*"-------")  # seven times three times slower: 780 s take their time
-        terminal.wait_for("waits 1 times shorter")
+        terminal.wait_for("waits are at full length")
         self.let_go()
         first, since = self.next_left(terminal), time.monotonic()
         passed = first - self.next_left(terminal)
         self.assertLessEqual(passed, 2 + 2 * (time.monotonic() - since))
         terminal.press(*"++++++++")
-        terminal.wait_for("waits 6561 times shorter")
+        terminal.wait_for("waits are 6561 times shorter")
         terminal.wait_for("updated", OUTCOME)
 
     def next_left(self, terminal: Terminal) -> int:

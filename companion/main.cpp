@@ -202,6 +202,7 @@ int run(std::vector<std::string> arguments)
         ->add_option("FILE", fleetOptions.paths,
                      "logs, journals and reports of units, or folders with them; - for "
                      "standard input")
+        ->type_name("")
         ->required();
     fleet->add_option("--since", fleetOptions.since, "count only runs since then, and show which units had none")
         ->type_name("DATE");

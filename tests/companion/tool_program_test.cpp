@@ -130,7 +130,8 @@ TEST_F(ToolProgram, HelpNamesThePlaceOfTheStickAndTheExitStatuses)
 
 TEST_F(ToolProgram, HelpFitsTheTerminal)
 {
-    const std::string commands[] = {"", "stick", "stick make", "unit", "check", "verify", "log", "explain", "report"};
+    const std::string commands[] = {"",       "stick", "stick make", "unit",    "check",
+                                    "verify", "log",   "fleet",      "explain", "report"};
     for (const std::string& command : commands) {
         for (const std::size_t width : {40, 80}) {
             const std::string line = "stty cols " + std::to_string(width) + "; " TOOL " " + command + " --help";

@@ -1,6 +1,7 @@
 #include "command.h"
 
 #include "descriptor.h"
+#include "texts.h"
 
 #include <algorithm>
 #include <array>
@@ -42,21 +43,10 @@ std::string contentOf(const Descriptor& output)
     return text;
 }
 
-std::vector<char*> pointers(const std::vector<std::string>& texts)
-{
-    std::vector<char*> result;
-    result.reserve(texts.size() + 1);
-    for (const std::string& text : texts) {
-        result.push_back(const_cast<char*>(text.c_str())); // posix_spawn(3) does not change them
-    }
-    result.push_back(nullptr);
-    return result;
-}
-
 std::string searchPathOf(const std::vector<std::string>& environment)
 {
     for (const std::string& variable : environment) {
-        if (variable.rfind("PATH=", 0) == 0) {
+        if (startsWith(variable, "PATH=")) {
             return variable.substr(5);
         }
     }
@@ -79,8 +69,8 @@ pid_t spawn(const std::string& program, const std::vector<std::string>& argument
     posix_spawnattr_setsigmask(&attributes, &none);
     posix_spawnattr_setflags(&attributes, POSIX_SPAWN_SETSID | POSIX_SPAWN_SETSIGMASK);
     pid_t child = -1;
-    const int error = posix_spawn(&child, program.c_str(), &actions, &attributes, pointers(arguments).data(),
-                                  pointers(environment).data());
+    const int error = posix_spawn(&child, program.c_str(), &actions, &attributes, pointersTo(arguments).data(),
+                                  pointersTo(environment).data());
     posix_spawn_file_actions_destroy(&actions);
     posix_spawnattr_destroy(&attributes);
     return error == 0 ? child : -1;
@@ -165,13 +155,24 @@ CommandResult runCommand(const std::vector<std::string>& arguments, const std::v
     return result;
 }
 
+std::vector<char*> pointersTo(const std::vector<std::string>& texts)
+{
+    std::vector<char*> result;
+    result.reserve(texts.size() + 1);
+    for (const std::string& text : texts) {
+        result.push_back(const_cast<char*>(text.c_str())); // exec(3) does not change them
+    }
+    result.push_back(nullptr);
+    return result;
+}
+
 std::string findProgram(const std::string& name, const std::string& searchPath)
 {
     const auto canRun = [](const std::string& path) {
         struct stat status = {};
         return stat(path.c_str(), &status) == 0 && S_ISREG(status.st_mode) && access(path.c_str(), X_OK) == 0;
     };
-    if (name.find('/') != std::string::npos) {
+    if (contains(name, "/")) {
         return canRun(name) ? name : "";
     }
     std::istringstream folders(searchPath);

@@ -46,5 +46,8 @@ CommandResult runCommand(const std::vector<std::string>& arguments, const std::v
                          std::chrono::milliseconds limit,
                          const std::function<bool(std::chrono::milliseconds)>& goesOn = {});
 
+/// `texts` as exec(3) takes them, for as long as they are there.
+std::vector<char*> pointersTo(const std::vector<std::string>& texts);
+
 /// The program that `name` stands for on `searchPath` (folders with colons between); empty when there is none.
 std::string findProgram(const std::string& name, const std::string& searchPath);

@@ -1,13 +1,13 @@
 #include "findings.h"
 
-#include "terminal.h"
-
 #include <algorithm>
 #include <array>
 #include <cstdio>
-#include <ostream>
+#include <iostream>
 #include <utility>
 
+#include <sys/ioctl.h>
+#include <unistd.h>
 #include <utf8.h>
 
 namespace
@@ -236,6 +236,14 @@ Report::Status refuse(const std::string& command, bool json, const std::string& 
     }
     errors << "harl-updater-tool: " << text << '\n';
     return Report::STATUS_UNCHECKED;
+}
+
+std::size_t widthOf(const std::ostream& out)
+{
+    winsize window = {};
+    const bool known =
+        out.rdbuf() == std::cout.rdbuf() && ioctl(STDOUT_FILENO, TIOCGWINSZ, &window) == 0 && window.ws_col > 0;
+    return known ? window.ws_col : 100;
 }
 
 void printText(std::string_view text, std::ostream& out)

@@ -109,6 +109,9 @@ inline constexpr int jsonVersion = 1;
 Report::Status refuse(const std::string& command, bool json, const std::string& text, std::ostream& out,
                       std::ostream& errors);
 
+/// The columns of the terminal that `out` is, or 100 where it is none.
+std::size_t widthOf(const std::ostream& out);
+
 /// Prints lines, each no longer than the terminal is wide, or 100 columns where `out` is none. They break at blanks
 /// only, so that a path stays whole. What goes on in a further line begins below the place of the line's tab, which
 /// itself is not printed.

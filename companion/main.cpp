@@ -6,12 +6,11 @@
 #include "procedure.h"
 #include "stick/make.h"
 #include "stick/stick_check.h"
-#include "terminal.h"
+#include "texts.h"
 #include "unit/unit_check.h"
 
 #include <algorithm>
 #include <cerrno>
-#include <cstdio>
 #include <cstring>
 #include <exception>
 #include <iostream>
@@ -19,6 +18,8 @@
 #include <numeric>
 #include <sstream>
 #include <string>
+#include <type_traits>
+#include <utility>
 #include <vector>
 
 #include <CLI/CLI.hpp>
@@ -63,7 +64,7 @@ std::string usageText(const CLI::App& app, const CLI::ParseError& error)
         return "Name a command: stick, unit, check, verify, log, fleet, explain or report.";
     }
     if (parsed.empty()) {
-        if (rest.front().rfind('-', 0) == 0) {
+        if (startsWith(rest.front(), "-")) {
             return "Name a command before " + rest.front() + '.';
         }
         std::string text = rest.front() + " is not a command.";
@@ -77,17 +78,17 @@ std::string usageText(const CLI::App& app, const CLI::ParseError& error)
     }
     if (!rest.empty()) {
         return rest.front() +
-               (rest.front().rfind('-', 0) == 0 ? " is not an option of " : " is one argument too many for ") + parsed +
+               (startsWith(rest.front(), "-") ? " is not an option of " : " is one argument too many for ") + parsed +
                '.';
     }
     // "--html: 1 required PAGE missing", "FILE is required", "--oldest requires --sign", "--run: Number less ..."
     const std::string text = error.what();
     const std::string option = text.substr(0, text.find_first_of(": "));
     const std::size_t value = text.find("required ");
-    if (text.find(" is required") != std::string::npos) {
+    if (contains(text, " is required")) {
         return option + " is missing.";
     }
-    if (text.find(" requires ") != std::string::npos) {
+    if (contains(text, " requires ")) {
         return text + '.';
     }
     return value == std::string::npos
@@ -117,6 +118,29 @@ void printHelp(const CLI::App& app)
     }
 }
 
+/// A command with the texts that the catalogue has for its help.
+CLI::App* addCommand(CLI::App& parent, const std::string& name)
+{
+    const auto& texts = catalogue("commands").at(name);
+    CLI::App* const command = parent.add_subcommand(name, unfilled(texts.at("does")));
+    command->footer("Exit status: " + unfilled(texts.at("status")) + ".\n");
+    return command;
+}
+
+/// @param name  as in the catalogue: "--list", "--run N", or "FILE" for an argument
+template <typename Value>
+CLI::Option* addOption(CLI::App* command, const std::string& name, Value& value)
+{
+    const std::string text = unfilled(catalogue("commands").at(command->get_name()).at("options").at(name));
+    if constexpr (std::is_same_v<Value, bool>) {
+        return command->add_flag(name, value, text);
+    } else {
+        const std::size_t blank = name.find(' ');
+        return command->add_option(name.substr(0, blank), value, text)
+            ->type_name(blank == std::string::npos ? "" : name.substr(blank + 1));
+    }
+}
+
 int run(std::vector<std::string> arguments)
 {
     CLI::App app("Answers what a technician asks before and after an update. It never changes the updater.",
@@ -126,109 +150,68 @@ int run(std::vector<std::string> arguments)
                          "Print the program's name and version and exit");
 
     std::string stickPath = stickMountPoint;
-    bool json = false;
-    CLI::App* stick = app.add_subcommand("stick", "Show what the updater would do with a stick. Reads only.");
-    stick->add_option("PATH", stickPath, "the folder that the stick is mounted at")
-        ->type_name("")
-        ->capture_default_str();
-    stick->add_flag("--json", json, "print one JSON object");
     std::string keyring;
-    stick->add_option("--keyring", keyring, "verify the stick with these keys instead of the installed ones")
-        ->type_name("FILE");
-    stick->footer("Exit status: 0 fit for an update, 1 not fit, 2 wrong usage or not everything could be read.\n");
+    CLI::App* stick = addCommand(app, "stick");
+    addOption(stick, "PATH", stickPath)->capture_default_str();
+    addOption(stick, "--keyring FILE", keyring);
 
     MakeOptions makeOptions;
-    CLI::App* make = stick->add_subcommand("make", "Make a stick: write it, read it back, sign it.");
-    make->add_option("TARGET", makeOptions.target, "the folder that the stick is mounted at, or any folder")
-        ->type_name("")
-        ->required();
-    make->add_option("--archive", makeOptions.archive, "the board's upgrade archive")->type_name("ZIP")->required();
-    make->add_option("--script", makeOptions.script, "the board's install script")->type_name("SCRIPT")->required();
-    make->add_option("--version", makeOptions.version, "the version, as the board will report it")
-        ->type_name("VERSION")
-        ->required();
-    make->add_flag("--replace", makeOptions.replace, "replace the version that is on the stick");
-    make->add_flag("--teamviewer", makeOptions.teamViewer, "request TeamViewer on a main head");
-    CLI::Option* sign =
-        make->add_option("--sign", makeOptions.key, "sign the stick with this key of gpg's")->type_name("KEY");
-    make->add_option("--oldest", makeOptions.oldest, "the oldest version that this one may replace")
-        ->type_name("VERSION")
-        ->needs(sign);
-    make->footer("Exit status: 0 made and fit, 1 not fit, 2 wrong usage or it could not be made.\n");
+    CLI::App* make = addCommand(*stick, "make");
+    addOption(make, "TARGET", makeOptions.target)->required();
+    addOption(make, "--archive ZIP", makeOptions.archive)->required();
+    addOption(make, "--script SCRIPT", makeOptions.script)->required();
+    addOption(make, "--version VERSION", makeOptions.version)->required();
+    addOption(make, "--replace", makeOptions.replace);
+    addOption(make, "--teamviewer", makeOptions.teamViewer);
+    CLI::Option* sign = addOption(make, "--sign KEY", makeOptions.key);
+    addOption(make, "--oldest VERSION", makeOptions.oldest)->needs(sign);
 
     UnitOptions unitOptions;
-    CLI::App* unit = app.add_subcommand("unit", "Show whether this unit is fit for an update. Run it as root.");
-    unit->add_flag("--panel", unitOptions.panel, "lamp test instead: all 14 LEDs in every colour");
-    unit->add_flag("--sound", unitOptions.sound, "play both sounds instead");
-    unit->add_flag("--json", json, "print one JSON object");
-    unit->footer("Exit status: 0 fit or test passed, 1 not fit or test failed, 2 wrong usage, test refused or not "
-                 "everything could be checked.\n");
+    CLI::App* unit = addCommand(app, "unit");
+    addOption(unit, "--panel", unitOptions.panel);
+    addOption(unit, "--sound", unitOptions.sound);
 
     std::string checkPath = stickMountPoint;
-    CLI::App* check = app.add_subcommand("check", "Show what an update would do now: unit and stick. Run it as root.");
-    check->add_option("PATH", checkPath, "the folder that the stick is mounted at")
-        ->type_name("")
-        ->capture_default_str();
-    check->add_flag("--json", json, "print one JSON object");
-    check->footer(
-        "Exit status: 0 the update will likely succeed, 1 it will not, 2 wrong usage or not everything could be "
-        "checked.\n");
+    CLI::App* check = addCommand(app, "check");
+    addOption(check, "PATH", checkPath)->capture_default_str();
 
     VerifyOptions verifyOptions;
-    CLI::App* verify = app.add_subcommand("verify", "Show whether this unit is well after an update. Run it as root.");
-    verify->add_flag("--record", verifyOptions.record, "print one line for the service's journal");
-    verify->add_flag("--json", json, "print one JSON object");
-    verify->footer("Exit status: 0 well, 1 not well, 2 wrong usage or not everything could be checked.\n");
+    CLI::App* verify = addCommand(app, "verify");
+    addOption(verify, "--record", verifyOptions.record);
 
+    bool json = false;
     LogOptions logOptions;
-    CLI::App* log = app.add_subcommand("log", "Explain the updater's log: what happened, why, and what to do now.");
-    log->add_option("FILE", logOptions.files, "the log, or several in their order; - for standard input")
-        ->type_name("");
-    log->add_flag("--journal", logOptions.journal, "read the journal of the service harl-updater");
-    log->add_flag("--list", logOptions.list, "print one line for each run");
-    log->add_option("--run", logOptions.run, "explain only the run with this number")
-        ->type_name("N")
-        ->check(CLI::Validator(CLI::PositiveNumber).description(""));
-    log->add_flag("--last", logOptions.last, "explain only the last run");
-    log->add_flag("--strict", logOptions.strict, "a warning is not status 0 either");
-    log->add_flag("--follow", logOptions.follow, "show the run that goes on, until it ends");
-    log->add_flag("--json", json, "print one JSON object; with --follow one for each change");
-    log->add_option("--html", logOptions.htmlFile, "also write a page with each run's timeline")->type_name("PAGE");
-    log->footer("Exit status: 0 the last run went well, 1 it failed or did not finish, 2 wrong usage or no log.\n");
+    CLI::App* log = addCommand(app, "log");
+    addOption(log, "FILE", logOptions.files);
+    addOption(log, "--journal", logOptions.journal);
+    addOption(log, "--list", logOptions.list);
+    addOption(log, "--run N", logOptions.run)->check(CLI::Validator(CLI::PositiveNumber).description(""));
+    addOption(log, "--last", logOptions.last);
+    addOption(log, "--strict", logOptions.strict);
+    addOption(log, "--follow", logOptions.follow);
+    addOption(log, "--json", json);
+    addOption(log, "--html PAGE", logOptions.htmlFile);
 
     FleetOptions fleetOptions;
-    CLI::App* fleet = app.add_subcommand("fleet", "Show which of many units failed, why, and what runs on them.");
-    fleet
-        ->add_option("FILE", fleetOptions.paths,
-                     "logs, journals and reports of units, or folders with them; - for "
-                     "standard input")
-        ->type_name("")
-        ->required();
-    fleet->add_option("--since", fleetOptions.since, "count only runs since then, and show which units had none")
-        ->type_name("DATE");
-    fleet->add_option("--failed", fleetOptions.failed, "only units whose last run met this failure")->type_name("NAME");
-    fleet->add_flag("--json", json,
-                    "print one JSON object for the fleet, then one for each unit, on lines of their own");
-    fleet->add_flag("--csv", fleetOptions.csv, "print a line for each unit, as a spreadsheet reads it");
-    fleet->add_option("--html", fleetOptions.htmlFile, "also write a page with charts and a table")->type_name("PAGE");
-    fleet->footer(
-        "Exit status: 0 all units are well, 1 a unit needs somebody, 2 wrong usage or not everything could be "
-        "read.\n");
+    CLI::App* fleet = addCommand(app, "fleet");
+    addOption(fleet, "FILE", fleetOptions.paths)->required();
+    addOption(fleet, "--since DATE", fleetOptions.since);
+    addOption(fleet, "--failed NAME", fleetOptions.failed);
+    addOption(fleet, "--json", json);
+    addOption(fleet, "--csv", fleetOptions.csv);
+    addOption(fleet, "--html PAGE", fleetOptions.htmlFile);
 
     std::string failure;
-    CLI::App* explain = app.add_subcommand("explain", "Explain a failure by its name, or list all of them.");
-    explain->add_option("NAME", failure, "as in brackets in a report, such as mirrors-unreachable")->type_name("");
-    explain->add_flag("--json", json, "print one JSON object");
-    explain->footer("Exit status: 0 explained, 2 wrong usage or no such name.\n");
+    CLI::App* explain = addCommand(app, "explain");
+    addOption(explain, "NAME", failure);
 
     ReportOptions reportOptions;
-    reportOptions.stick = stickMountPoint;
-    CLI::App* report = app.add_subcommand("report", "Pack what support needs into one archive. Run it as root.");
-    report->add_option("FILE", reportOptions.file, "the archive to make, such as /tmp/report.tar.gz")
-        ->type_name("")
-        ->required();
-    report->add_flag("--json", json, "print one JSON object");
-    report->footer("Exit status: 0 made, 2 wrong usage or the archive cannot be made.\n");
+    CLI::App* report = addCommand(app, "report");
+    addOption(report, "FILE", reportOptions.file)->required();
+
+    for (CLI::App* command : {stick, unit, check, verify, explain, report}) {
+        addOption(command, "--json", json);
+    }
 
     if (!arguments.empty() && arguments.front() == "help") { // "help log" is "log --help"
         arguments.erase(arguments.begin());
@@ -256,14 +239,13 @@ int run(std::vector<std::string> arguments)
     if (stick->parsed()) {
         return runStick(stickPath, json, std::cout, std::cerr, keyring);
     }
+    unitOptions.json = verifyOptions.json = logOptions.json = fleetOptions.json = reportOptions.json = json;
     if (log->parsed()) {
-        logOptions.json = json;
         logOptions.terminal = isatty(STDOUT_FILENO) == 1;
         const std::string wrong = conflictIn(logOptions);
         return wrong.empty() ? runLog(logOptions, std::cout, std::cerr) : refuseUsage("log", json, wrong);
     }
     if (fleet->parsed()) {
-        fleetOptions.json = json;
         const std::string wrong = conflictIn(fleetOptions);
         return wrong.empty() ? runFleet(fleetOptions, std::cout, std::cerr) : refuseUsage("fleet", json, wrong);
     }
@@ -276,14 +258,11 @@ int run(std::vector<std::string> arguments)
         return runCheck(checkPath, json, thisUnit(), std::cout, std::cerr);
     }
     if (report->parsed()) {
-        reportOptions.json = json;
         return runReport(reportOptions, thisUnit(), std::cout, std::cerr);
     }
     if (verify->parsed()) {
-        verifyOptions.json = json;
         return runVerify(verifyOptions, thisUnit(), std::cout);
     }
-    unitOptions.json = json;
     return runUnit(unitOptions, thisUnit(), std::cout, std::cerr);
 }
 
@@ -297,15 +276,14 @@ int main(int argc, char** argv)
         std::cout.flush();
         return status;
     } catch (const std::ios_base::failure&) {
-        const char* advice = errno == EPIPE || errno == EBADF ? "Nobody reads it." : "Make room or name another file.";
-        std::fprintf(stderr, "harl-updater-tool: the output cannot be written: %s. %s\n", std::strerror(errno), advice);
+        const int error = errno;
+        std::cerr << "harl-updater-tool: the output cannot be written: " << std::strerror(error) << ". "
+                  << (error == EPIPE || error == EBADF ? "Nobody reads it.\n" : "Make room or name another file.\n");
     } catch (const std::bad_alloc&) {
-        std::fputs("harl-updater-tool: there is not enough memory. End other programs and try again.\n", stderr);
+        std::cerr << "harl-updater-tool: there is not enough memory. End other programs and try again.\n";
     } catch (const std::exception& error) {
-        std::fprintf(stderr,
-                     "harl-updater-tool: internal error: %s. Report this line with the command to the "
-                     "manufacturer.\n",
-                     error.what());
+        std::cerr << "harl-updater-tool: internal error: " << error.what()
+                  << ". Report this line with the command to the manufacturer.\n";
     }
     return Report::STATUS_UNCHECKED;
 }

@@ -4,7 +4,11 @@
 
 const nlohmann::ordered_json& catalogue(const char* section)
 {
-    static const nlohmann::ordered_json all = nlohmann::ordered_json::parse(embeddedCatalogue);
+    static const nlohmann::ordered_json all = [] {
+        auto texts = nlohmann::ordered_json::parse(embeddedCatalogue);
+        texts.update(nlohmann::ordered_json::parse(embeddedCommands));
+        return texts;
+    }();
     return all.at(section);
 }
 

@@ -3,13 +3,24 @@
 #include <functional>
 #include <map>
 #include <string>
+#include <string_view>
 
 #include <nlohmann/json.hpp>
 
-/// What reports are made of, companion/catalogue.json, which is a part of the program: texts that others share, the
-/// failures of runs, what a log leaves open, and the findings of checks.
+inline bool startsWith(std::string_view text, std::string_view start)
+{
+    return text.substr(0, start.size()) == start;
+}
+
+inline bool contains(std::string_view text, std::string_view part)
+{
+    return text.find(part) != std::string_view::npos;
+}
+
+/// What reports are made of, companion/catalogue.json and commands.json, which are a part of the program: texts that
+/// others share, the failures of runs, what a log leaves open, the findings of checks, and the commands' help.
 ///
-/// @param section  "texts", "tools", "failures", "gaps" or "findings"
+/// @param section  "texts", "tools", "failures", "gaps", "findings" or "commands"
 const nlohmann::ordered_json& catalogue(const char* section);
 
 /// What takes the place of the names in braces.

@@ -29,8 +29,7 @@ public:
         expect(record.line > mLastRecord, "records in order");
         mLastRecord = record.line;
         mText << '\n' << record.line << " record";
-        for (const std::string_view text :
-             {record.thread, record.file, record.operation, record.message.value_or("(none)")}) {
+        for (const std::string_view text : {record.thread, record.operation, record.message.value_or("(none)")}) {
             expect(text.find('\n') == std::string_view::npos, "a record's text in one line");
             mText << '\t' << text;
         }
@@ -69,7 +68,6 @@ void feed(LogParser& parser, std::string_view log, std::size_t blockSize)
         parser.feed(log.substr(begin, blockSize));
     }
     parser.finish();
-    expect(parser.bytes() == log.size(), "all bytes taken");
 }
 
 std::string events(std::string_view log, std::size_t blockSize)
@@ -90,7 +88,7 @@ void expectFitReports(std::string_view log, std::size_t blockSize)
     std::ostringstream report;
     std::ostringstream pageText;
     std::ostringstream changes;
-    HtmlPage page(pageText);
+    beginPage(pageText);
     Follower follower(true, false, changes);
     RunBuilder builder([&](Run& run) {
         follower.runComplete(run);
@@ -98,7 +96,7 @@ void expectFitReports(std::string_view log, std::size_t blockSize)
         expect(!run.failure || run.stepOf(*run.failure) != nullptr, "a failure has its step");
         printRun(run, "log", report);
         report << runToJson(run, "log").dump(); // throws when a text is not UTF-8
-        page.writeRun(run, "log");
+        writeRunToPage(run, "log", pageText);
     });
     LogParser parser(builder);
     for (std::size_t begin = 0; begin < log.size(); begin += blockSize) {
@@ -108,7 +106,7 @@ void expectFitReports(std::string_view log, std::size_t blockSize)
     }
     parser.finish();
     builder.finish();
-    page.finish();
+    endPage(pageText);
     expectPrintable(report.str());
     expectPrintable(pageText.str());
     expectPrintable(changes.str());

@@ -36,7 +36,7 @@ void addPlans(const Unit& unit, Report& report)
         plan(report.fact("package_installed"), candidate.empty() ? report.fact("package_candidate") : candidate) +
             (candidate.empty() ? ", as of the last refresh" : ""));
     report.addFact("board_plan", "Board", board);
-    const bool installs = board.find("would be installed") != std::string::npos;
+    const bool installs = contains(board, "would be installed");
     const std::int64_t seconds = outcomeWait + giveBackWait + (installs ? boardWait : 0);
     report.addFact("shortest_s", "Takes at least",
                    std::to_string((seconds + 59) / 60) + " min, and what downloading and copying take", seconds);

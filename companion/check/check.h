@@ -17,8 +17,8 @@ int runCheck(const std::string& path, bool json, const UnitSite& site, std::ostr
 
 struct ReportOptions
 {
-    std::string file;  ///< the archive, which must not be there yet
-    std::string stick; ///< where a stick may be plugged in
+    std::string file;                    ///< the archive, which must not be there yet
+    std::string stick = stickMountPoint; ///< where a stick may be plugged in
     bool json = false;
 };
 

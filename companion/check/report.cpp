@@ -1,6 +1,7 @@
 #include "check/check.h"
 
 #include "descriptor.h"
+#include "embedded.h"
 #include "findings.h"
 #include "log/log_command.h"
 #include "stick/folder.h"
@@ -22,19 +23,6 @@ namespace fs = std::filesystem;
 const auto packLimit = 120s;
 const char folderName[] = "harl-updater-report";
 const char keptLogs[] = "/var/lib/harl-updater"; // where the service keeps the runs that the journal loses
-const char readMe[] = R"(What harl-updater-tool report has gathered on this unit:
-
-journal.txt   the journal of the update's services
-log.txt       what harl-updater-tool log says of it
-kept-logs/    runs that the service has kept, where the journal is lost with the power
-check.txt     what harl-updater-tool check says of the unit and of the stick that was plugged in
-unit.txt      what harl-updater-tool unit says, where check.txt could not hold it
-verify.txt    what harl-updater-tool verify says
-system.txt    versions, clock, services, space and the state of the package database
-
-Left out: keys, passwords, the contents of configuration files, the addresses with logins that package sources may hold,
-the journal of other services, and everything on the stick but its names.
-)";
 
 /// Commands that look something up, for system.txt.
 const std::vector<std::string> lookups[] = {
@@ -72,7 +60,7 @@ void gather(const fs::path& folder, const std::string& stickPath, const Unit& un
         print(text);
         save(name, text.str());
     };
-    save("README.txt", readMe);
+    save("README.txt", embeddedReadMe);
     save("journal.txt", unit.journal());
     saveOf("log.txt", [&](std::ostream& out) {
         LogOptions options;

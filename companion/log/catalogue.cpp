@@ -15,38 +15,35 @@ using Json = nlohmann::ordered_json;
 
 const std::string anyCode = "any";
 
-std::vector<StepKind> stepsNamed(const Json& names)
+StepSet stepsNamed(const Json& names)
 {
-    std::vector<StepKind> steps;
+    StepSet steps;
     for (std::size_t kind = 0; kind < stepKinds; ++kind) {
-        if (std::find(names.begin(), names.end(), factsOf(static_cast<StepKind>(kind)).name) != names.end()) {
-            steps.push_back(static_cast<StepKind>(kind));
-        }
+        steps.set(kind,
+                  std::find(names.begin(), names.end(), factsOf(static_cast<StepKind>(kind)).name) != names.end());
     }
     return steps;
 }
 
-bool contains(const std::vector<StepKind>& steps, StepKind kind)
+Json namesOf(const StepSet& steps)
 {
-    return std::find(steps.begin(), steps.end(), kind) != steps.end();
+    Json names = Json::array();
+    for (std::size_t kind = 0; kind < stepKinds; ++kind) {
+        if (steps.test(kind)) {
+            names.push_back(factsOf(static_cast<StepKind>(kind)).name);
+        }
+    }
+    return names;
 }
 
-/// Takes over a tool's phrases: the tool speaks in its own steps, which must be among the entry's.
-void addPhrases(const std::string& tool, const Json& phrases, Failure& failure)
+bool has(const StepSet& steps, StepKind kind)
 {
-    std::vector<StepKind> steps = stepsNamed(catalogue("tools").at(tool));
-    steps.erase(
-        std::remove_if(steps.begin(), steps.end(), [&](StepKind kind) { return !contains(failure.steps, kind); }),
-        steps.end());
-    for (const Json& words : phrases) {
-        failure.phrases.push_back({tool, words.get<std::string>(), steps});
-    }
+    return steps.test(static_cast<std::size_t>(kind));
 }
 
 std::vector<Failure> readFailures()
 {
     std::vector<Failure> failures;
-    const Json none = Json::object();
     for (const auto& [name, entry] : catalogue("failures").items()) {
         Failure failure;
         failure.name = name;
@@ -58,9 +55,12 @@ std::vector<Failure> readFailures()
         if (const auto code = entry.find("code"); code != entry.end()) {
             failure.code = code->is_string() ? code->get<std::string>() : code->dump();
         }
-        const auto phrases = entry.find("phrases");
-        for (const auto& [tool, words] : (phrases == entry.end() ? none : *phrases).items()) {
-            addPhrases(tool, words, failure);
+        const Json phrases = entry.value("phrases", Json::object());
+        for (const auto& [tool, texts] : phrases.items()) {
+            const StepSet steps = failure.steps & stepsNamed(catalogue("tools").at(tool)); // that the tool runs in
+            for (const Json& words : texts) {
+                failure.phrases.push_back({tool, words.get<std::string>(), steps});
+            }
         }
         failures.push_back(std::move(failure));
     }
@@ -73,41 +73,35 @@ const std::vector<Failure>& failures()
     return all;
 }
 
-/// An entry that is there.
-const Failure* entry(const char* name)
-{
-    return findFailure(name);
-}
-
 /// The entry for a step that failed, as specific as the log allows.
 const Failure* entryFor(const Run& run, const Step& step)
 {
     if (step.kind == S::UPLOAD_BOARD && run.statusesLost) {
-        return entry("statuses-lost");
+        return findFailure("statuses-lost");
     }
     if (step.kind == S::CHECK_BOARD) {
         const bool listed = step.actions.size() > 1 && step.status && step.status->number != 0;
         if (step.event == Event::STICK_NOT_READ || listed) {
-            return entry("stick-not-read");
+            return findFailure("stick-not-read");
         }
         if (!step.status || run.board.unclear) {
-            return entry("board-not-read");
+            return findFailure("board-not-read");
         }
         if (step.status->number == 0 && run.board.candidate.empty() && !run.board.installed.empty()) {
-            return entry("stick-version-missing");
+            return findFailure("stick-version-missing");
         }
     }
     if (step.kind == S::CHECK_PACKAGE && !step.status) {
-        return entry("package-not-read");
+        return findFailure("package-not-read");
     }
     const long code = step.status ? step.status->number : step.word == "NO_INTERNET_ERROR_CODE" ? 100 : 0;
-    const Failure* found = entry("unknown");
+    const Failure* found = findFailure("unknown");
     for (const Failure& failure : failures()) {
-        if (contains(failure.steps, step.kind) && failure.code == std::to_string(code)) {
+        if (has(failure.steps, step.kind) && failure.code == std::to_string(code)) {
             found = &failure;
             break;
         }
-        if (contains(failure.steps, step.kind) && failure.code == anyCode) {
+        if (has(failure.steps, step.kind) && failure.code == anyCode) {
             found = &failure;
         }
     }
@@ -133,7 +127,7 @@ const std::pair<ServiceEvent, const char*> serviceProblems[] = {
 void addFailure(Run& run)
 {
     if (run.service.has(ServiceEvent::NOT_ALLOWED)) {
-        run.failure = {entry("run-not-allowed"), 0};
+        run.failure = {findFailure("run-not-allowed"), 0};
         return;
     }
     if (run.steps.empty()) {
@@ -149,34 +143,34 @@ void addFailure(Run& run)
                 return;
             }
         }
-        run.failure = {entry("unknown"), last};
+        run.failure = {findFailure("unknown"), last};
     } else if (run.ended == RunEnd::EARLY) {
-        run.failure = {entry("ended-early"), last};
+        run.failure = {findFailure("ended-early"), last};
     } else if (run.ended == RunEnd::NOT_SEEN) {
-        run.failure = {entry(shown ? "end-missing" : run.followedByAnother ? "cut-short" : "unfinished"), last};
+        run.failure = {findFailure(shown ? "end-missing" : run.followedByAnother ? "cut-short" : "unfinished"), last};
     } else if (run.outcome == Outcome::NONE) {
-        run.failure = {entry("outcome-missing"), last};
+        run.failure = {findFailure("outcome-missing"), last};
     }
 }
 
 /// What went wrong without deciding the outcome.
 void addBesides(Run& run)
 {
-    const bool named = run.failure && run.failure->failure == entry("statuses-lost");
+    const bool named = run.failure && run.failure->failure == findFailure("statuses-lost");
     for (std::size_t index = 0; index < run.steps.size(); ++index) {
         if (run.steps[index].timeUsedUp) {
-            run.besides.push_back({entry("time-used-up"), index});
+            run.besides.push_back({findFailure("time-used-up"), index});
         }
     }
     for (const auto& [event, name] : serviceProblems) {
         if (run.service.has(event)) {
-            run.besides.push_back({entry(name), run.steps.size()});
+            run.besides.push_back({findFailure(name), run.steps.size()});
         }
     }
     if (run.statusesLost) {
         // Every command seems to have failed then, also those that did their work.
         if (!named) {
-            run.besides.push_back({entry("statuses-lost"), 0});
+            run.besides.push_back({findFailure("statuses-lost"), 0});
         }
         return;
     }
@@ -189,7 +183,7 @@ void addBesides(Run& run)
             const char* const names[] = {"stick-not-released", "application-not-started"};
             for (std::size_t command = 0; command < std::min<std::size_t>(2, step.actions.size()); ++command) {
                 if (const auto& status = step.actions[command].status; status && status->number != 0) {
-                    run.besides.push_back({entry(names[command]), index});
+                    run.besides.push_back({findFailure(names[command]), index});
                 }
             }
             continue;
@@ -197,16 +191,16 @@ void addBesides(Run& run)
         run.besides.push_back({entryFor(run, step), index, step.kind == S::CHECK_BOARD && !run.mainHead});
     }
     if (run.ledFailures > 0) {
-        run.besides.push_back({entry("panel-failed"), 0});
+        run.besides.push_back({findFailure("panel-failed"), 0});
     }
     const auto index = [&](const Step* step) {
         return step == nullptr ? run.steps.size() : static_cast<std::size_t>(step - run.steps.data());
     };
     if (run.soundFailed) {
-        run.besides.push_back({entry("sound-failed"), index(run.find(S::SHOW_OUTCOME))});
+        run.besides.push_back({findFailure("sound-failed"), index(run.find(S::SHOW_OUTCOME))});
     }
     if (!run.applicationStarted && !run.failure && !run.steps.empty()) {
-        run.besides.push_back({entry("start-missing"), index(run.find(S::GIVE_BACK))});
+        run.besides.push_back({findFailure("start-missing"), index(run.find(S::GIVE_BACK))});
     }
 }
 
@@ -234,15 +228,6 @@ void addGaps(Run& run)
     add(run.outcome != Outcome::NONE && !run.mainHead && !run.statusesLost, "feedback");
 }
 
-Json namesOf(const std::vector<StepKind>& steps)
-{
-    Json names = Json::array();
-    for (const StepKind kind : steps) {
-        names.push_back(factsOf(kind).name);
-    }
-    return names;
-}
-
 } // namespace
 
 const Failure* findFailure(std::string_view name)
@@ -256,7 +241,7 @@ const Failure* failureSaid(std::string_view line, StepKind kind)
 {
     for (const Failure& failure : failures()) {
         for (const Phrase& phrase : failure.phrases) {
-            if (contains(phrase.steps, kind) && line.find(phrase.words) != std::string_view::npos) {
+            if (has(phrase.steps, kind) && contains(line, phrase.words)) {
                 return &failure;
             }
         }

@@ -2,6 +2,7 @@
 
 #include "log/vocabulary.h"
 
+#include <bitset>
 #include <iosfwd>
 #include <string>
 #include <string_view>
@@ -9,12 +10,15 @@
 
 struct Run;
 
+/// By StepKind.
+using StepSet = std::bitset<stepKinds>;
+
 /// What a tool says, on standard error most often, in the spelling of Debian 11 to 13, and in which steps it does.
 struct Phrase
 {
     std::string tool;
     std::string words;
-    std::vector<StepKind> steps;
+    StepSet steps;
 };
 
 /// An entry of the catalogue of failures.
@@ -22,7 +26,7 @@ struct Failure
 {
     std::string name;            ///< fixed name in kebab-case, for programs and the documents
     std::string reported;        ///< by the updater; empty when it reports nothing
-    std::vector<StepKind> steps; ///< in which it can occur
+    StepSet steps;               ///< in which it can occur
     std::string code;            ///< explains a step whose command ended with this code, or "any"; empty: neither
     bool general = false;        ///< A tool's phrase makes it more specific.
     std::string cause;           ///< in sentences, with names in braces; see texts.h

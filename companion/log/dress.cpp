@@ -3,7 +3,9 @@
 #include "log/vocabulary.h"
 
 #include <algorithm>
+#include <cstring>
 
+#include <endian.h>
 #include <nlohmann/json.hpp>
 
 namespace
@@ -101,10 +103,10 @@ std::string Dress::findFormat()
 {
     const std::string_view line = std::string_view(mPartial).substr(0, std::min(mPartial.find('\n'), enoughOfALine));
     const bool json = startsWith(line, "{") || startsWith(line, "data: {") || startsWith(line, "\x1e");
-    mFormat = startsWith(line, "__CURSOR=")                ? Format::FIELDS
-              : json                                       ? Format::JSON
-              : line.find("[s=") != std::string_view::npos ? Format::VERBOSE
-                                                           : Format::PLAIN;
+    mFormat = startsWith(line, "__CURSOR=") ? Format::FIELDS
+              : json                        ? Format::JSON
+              : contains(line, "[s=")       ? Format::VERBOSE
+                                            : Format::PLAIN;
     return std::exchange(mPartial, "");
 }
 
@@ -190,10 +192,9 @@ void Dress::takeBinary(std::string_view& block)
     const std::size_t lengthSize = 8;
     std::size_t wanted = lengthSize;
     if (mPartial.size() >= lengthSize) {
-        for (std::size_t byte = 0; byte < 4; ++byte) {
-            wanted += std::size_t{static_cast<unsigned char>(mPartial[byte])} << (8 * byte);
-        }
-        wanted = std::min(wanted, 4 * LogParser::longestLine) + 1;
+        std::uint64_t length = 0;
+        std::memcpy(&length, mPartial.data(), sizeof length);
+        wanted += static_cast<std::size_t>(std::min<std::uint64_t>(le64toh(length), 4 * LogParser::longestLine)) + 1;
     }
     const std::size_t taken = std::min(wanted - mPartial.size(), block.size());
     mPartial.append(block.substr(0, taken));

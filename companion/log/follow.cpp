@@ -14,7 +14,10 @@
 namespace
 {
 
-const std::size_t barLength = 30; // columns
+using Json = nlohmann::ordered_json;
+
+const std::size_t barLength = 30;    // columns
+const char clearLine[] = "\r\x1b[K"; // from its start
 
 bool isOver(const Run& run)
 {
@@ -28,14 +31,6 @@ bool isOverdue(const Run& run, std::int64_t now)
     return now - std::max(run.end, step.start) > factsOf(step.kind).longest;
 }
 
-std::string barText(std::int64_t elapsed, std::int64_t expected)
-{
-    const double share =
-        expected <= 0 ? 1 : std::clamp(static_cast<double>(elapsed) / static_cast<double>(expected), 0.0, 1.0);
-    const auto filled = static_cast<std::size_t>(share * static_cast<double>(barLength));
-    return '[' + std::string(filled, '#') + std::string(barLength - filled, '-') + ']';
-}
-
 std::string attemptText(const Step& step)
 {
     if (step.kind != StepKind::UPLOAD_BOARD || step.failedAttempts == 0) {
@@ -45,13 +40,6 @@ std::string attemptText(const Step& step)
            std::to_string(uploadAttempts);
 }
 
-/// "3 min 2 s of 13 min 0 s", "5 s, no fixed length"
-std::string elapsedText(std::int64_t elapsed, const std::optional<std::int64_t>& expected)
-{
-    const std::string text = durationText(std::max<std::int64_t>(elapsed, 0));
-    return text + (expected ? " of " + durationText(*expected) : ", no fixed length");
-}
-
 /// True when the next step comes only if the check that goes on finds an update.
 bool nextDependsOnCheck(const Run& run)
 {
@@ -59,24 +47,8 @@ bool nextDependsOnCheck(const Run& run)
     return !step.took && !run.mainHead && (step.kind == StepKind::CHECK_PACKAGE || step.kind == StepKind::CHECK_BOARD);
 }
 
-} // namespace
-
-void Follower::runComplete(const Run& run)
-{
-    for (const Step& step : run.steps) {
-        if (step.took) {
-            mLast.at(static_cast<std::size_t>(step.kind)) = *step.took;
-        }
-    }
-}
-
-/// How long a step takes: the updater's own wait, else as long as it took last time in the same log (s).
-std::optional<std::int64_t> Follower::expected(StepKind kind) const
-{
-    const std::int64_t wait = factsOf(kind).wait;
-    return wait > 0 ? wait : mLast.at(static_cast<std::size_t>(kind));
-}
-
+/// The steps that come after the one that goes on. While versions are compared: also the installation that comes if
+/// they differ.
 std::vector<StepKind> stepsToCome(const Run& run)
 {
     const StepKind last = run.steps.empty() ? StepKind::START : run.steps.back().kind;
@@ -113,6 +85,24 @@ std::vector<StepKind> stepsToCome(const Run& run)
         }
     }
     return kinds;
+}
+
+} // namespace
+
+void Follower::runComplete(const Run& run)
+{
+    for (const Step& step : run.steps) {
+        if (step.took) {
+            mLast.at(static_cast<std::size_t>(step.kind)) = *step.took;
+        }
+    }
+}
+
+/// How long a step takes: the updater's own wait, else as long as it took last time in the same log (s).
+std::optional<std::int64_t> Follower::expected(StepKind kind) const
+{
+    const std::int64_t wait = factsOf(kind).wait;
+    return wait > 0 ? wait : mLast.at(static_cast<std::size_t>(kind));
 }
 
 /// How long the run goes on at least, as far as its steps' lengths are known (s).
@@ -160,33 +150,32 @@ void Follower::showChange(const Run* run, std::int64_t now)
     const bool overdue = known && !over && isOverdue(*run, now);
     const char* state = over && mEnded ? "ended" : overdue ? "overdue" : known && !over ? "running" : "waiting";
     if (mJson) {
-        nlohmann::ordered_json object = {{"state", state}, {"time", isoText(now)}};
+        Json object = {{"state", state}, {"time", isoText(now)}};
         if (known) {
             const Step& step = run->steps.back();
             const std::optional<std::int64_t> length = expected(step.kind);
             const std::vector<StepKind> next = stepsToCome(*run);
+            Run explained = *run;
+            explain(explained);
             object["run"] = run->number;
             object["step"] = factsOf(step.kind).name;
             object["title"] = factsOf(step.kind).title;
             object["since"] = isoText(step.start);
             object["elapsed_s"] = step.took.value_or(std::max<std::int64_t>(now - step.start, 0));
-            object["expected_s"] = length ? nlohmann::ordered_json(*length) : nlohmann::ordered_json();
+            object["expected_s"] = length ? Json(*length) : Json();
             object["result"] = step.took ? resultText(*run, step) : "";
             object["failed_attempts"] = step.failedAttempts;
             object["remaining_s"] = over || overdue ? 0 : remaining(*run, now);
-            object["next"] = next.empty() ? nlohmann::ordered_json() : nlohmann::ordered_json(factsOf(next[0]).name);
+            object["next"] = next.empty() ? Json() : Json(factsOf(next[0]).name);
             object["next_if_versions_differ"] = nextDependsOnCheck(*run);
             object["outcome"] = outcomeName(run->outcome);
-            Run explained = *run;
-            explain(explained);
-            object["failure"] =
-                over && explained.failure ? problemToJson(explained, *explained.failure) : nlohmann::ordered_json();
+            object["failure"] = over && explained.failure ? problemToJson(explained, *explained.failure) : Json();
         }
-        mOut << object.dump(-1, ' ', false, nlohmann::ordered_json::error_handler_t::replace) << '\n';
+        mOut << object.dump(-1, ' ', false, Json::error_handler_t::replace) << '\n';
         return;
     }
     if (mBar) {
-        mOut << "\r\x1b[K"; // back to the line's start, and clear it
+        mOut << clearLine;
         mBar = false;
     }
     const std::string text = known ? changeText(*run, over, overdue, now) : "No update is going on. Waiting for one.\n";
@@ -229,16 +218,20 @@ std::string Follower::changeText(const Run& run, bool over, bool overdue, std::i
     return text + '\n';
 }
 
+/// Shows "3 min 2 s of 13 min 0 s" with a bar in front, or "5 s, no fixed length".
 void Follower::showBar(const Run& run, std::int64_t now)
 {
     const Step& step = run.steps.back();
-    const std::int64_t elapsed = now - step.start;
-    const std::optional<std::int64_t> length = expected(step.kind);
-    mOut << "\r\x1b[K  ";
-    if (length) {
-        mOut << barText(elapsed, *length) << ' ';
+    const std::int64_t elapsed = std::max<std::int64_t>(now - step.start, 0);
+    mOut << clearLine << "  ";
+    if (const std::optional<std::int64_t> length = expected(step.kind)) {
+        const auto whole = static_cast<std::size_t>(std::max<std::int64_t>(*length, 1));
+        const std::size_t filled = std::min(barLength * static_cast<std::size_t>(elapsed) / whole, barLength);
+        mOut << '[' << std::string(filled, '#') << std::string(barLength - filled, '-') << "] " << durationText(elapsed)
+             << " of " << durationText(*length);
+    } else {
+        mOut << durationText(elapsed) << ", no fixed length";
     }
-    mOut << elapsedText(elapsed, length);
     mBar = true;
 }
 

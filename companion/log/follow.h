@@ -7,11 +7,6 @@
 #include <iosfwd>
 #include <optional>
 #include <string>
-#include <vector>
-
-/// The steps that come after the one that goes on. While versions are compared: also the installation that comes if
-/// they differ.
-std::vector<StepKind> stepsToCome(const Run& run);
 
 /// Shows the run that goes on while its log grows: a line for each change, on a terminal with a progress bar below it,
 /// or one JSON object for each change.

@@ -94,12 +94,17 @@ void renderPart(const char* page, const char* part, const nlohmann::ordered_json
     (page == embeddedPage ? log : fleet).render(data(part, toData(content)), out);
 }
 
-HtmlPage::HtmlPage(std::ostream& out) : mOut(out)
+void beginPage(std::ostream& out)
 {
-    renderPart(embeddedPage, "begin", true, mOut);
+    renderPart(embeddedPage, "begin", true, out);
 }
 
-void HtmlPage::writeRun(const Run& run, const std::string& source)
+void endPage(std::ostream& out)
+{
+    renderPart(embeddedPage, "end", true, out);
+}
+
+void writeRunToPage(const Run& run, const std::string& source, std::ostream& out)
 {
     Json content = runToJson(run, source);
     content["date"] = dateText(run.begin);
@@ -125,11 +130,5 @@ void HtmlPage::writeRun(const Run& run, const std::string& source)
     }
     content["timeline"] = !run.steps.empty();
     content["open"] = !run.gaps.empty();
-    renderPart(embeddedPage, "run", content, mOut);
-}
-
-void HtmlPage::finish()
-{
-    renderPart(embeddedPage, "end", true, mOut);
-    mOut.flush();
+    renderPart(embeddedPage, "run", content, out);
 }

@@ -12,18 +12,8 @@
 /// @param page  embeddedPage or embeddedFleetPage
 void renderPart(const char* page, const char* part, const nlohmann::ordered_json& content, std::ostream& out);
 
-/// Writes runs, explained before, as one page that needs nothing from outside: for each run what happened, why and what
-/// to do, and its timeline of threads, commands, waits and LED pattern.
-class HtmlPage
-{
-public:
-    explicit HtmlPage(std::ostream& out);
-
-    void writeRun(const Run& run, const std::string& source);
-
-    /// Ends the page. Without it, the page is not whole.
-    void finish();
-
-private:
-    std::ostream& mOut;
-};
+/// Writes a run, explained before: what happened, why and what to do, and its timeline of threads, commands, waits and
+/// LED pattern. A page, which needs nothing from outside, is beginPage(), its runs and endPage().
+void writeRunToPage(const Run& run, const std::string& source, std::ostream& out);
+void beginPage(std::ostream& out);
+void endPage(std::ostream& out);

@@ -37,13 +37,7 @@ const int pollTime = 250;                              // ms between two looks a
 const int settleTime = 2;                              // s, at most, for the earlier runs in a pipe
 
 /// What an input that holds no text begins with, and what to do about it.
-struct Magic
-{
-    std::string_view bytes;
-    const char* advice;
-};
-
-const Magic magics[] = {
+const std::pair<std::string_view, const char*> magics[] = {
     {"LPKSHHRH", "a journal's own file: journalctl --file FILE -u harl-updater | harl-updater-tool log"},
     {"\x1f\x8b", "compressed: zcat FILE | harl-updater-tool log"},
     {"\xfd\x37zXZ", "compressed: xzcat FILE | harl-updater-tool log"},
@@ -53,17 +47,6 @@ const Magic magics[] = {
     {"\xff\xfe", "text in UTF-16: iconv -f UTF-16 -t UTF-8 FILE | harl-updater-tool log"},
     {"\xfe\xff", "text in UTF-16: iconv -f UTF-16 -t UTF-8 FILE | harl-updater-tool log"},
 };
-
-/// What to do about an input that begins like this, or null when it may be a log.
-const char* adviceFor(std::string_view start)
-{
-    for (const Magic& magic : magics) {
-        if (start.substr(0, magic.bytes.size()) == magic.bytes) {
-            return magic.advice;
-        }
-    }
-    return nullptr;
-}
 
 /// Reads one of the sources that the options name, block by block, into a parser.
 class Reader
@@ -86,10 +69,7 @@ public:
     /// Reads one block. False at the source's end for now, and when something is wrong.
     bool readBlock()
     {
-        ssize_t length = -1;
-        do {
-            length = read(mSource.descriptor(), mBlock.data(), mBlock.size());
-        } while (length < 0 && errno == EINTR);
+        const ssize_t length = mSource.read(mBlock);
         if (length < 0) {
             mError = position() + std::strerror(errno);
         }
@@ -97,9 +77,11 @@ public:
             return false;
         }
         const std::string_view text(mBlock.data(), static_cast<std::size_t>(length));
-        if (const char* advice = bytes() == 0 ? adviceFor(text) : nullptr; advice != nullptr) {
-            mError = position() + "no log but " + advice;
-            return false;
+        for (const auto& [magic, advice] : magics) {
+            if (bytes() == 0 && startsWith(text, magic)) {
+                mError = position() + "no log but " + advice;
+                return false;
+            }
         }
         mDress.feed(text);
         if (mDress.tooLarge()) {
@@ -176,66 +158,31 @@ bool openUnnamed(std::fstream& file)
     return file.is_open();
 }
 
-/// Prints explained runs one by one: for people, as one line each, or as one JSON object.
-class Printer
-{
-public:
-    Printer(const LogOptions& options, std::ostream& out) : mOptions(options), mOut(out)
-    {
-        if (mOptions.json) {
-            mOut << "{\"command\": \"log\", \"version\": " << jsonVersion << ", \"runs\": [";
-        }
-    }
-
-    void print(const Run& run, const std::string& source)
-    {
-        const char* between = mPrinted && !mOptions.list ? "\n" : "";
-        mOut << (mOptions.json && mPrinted ? "," : between);
-        mPrinted = true;
-        if (mOptions.json) {
-            mOut << '\n' << dumped(runToJson(run, source));
-        } else if (mOptions.list) {
-            mOut << run.number << "  " << dateText(run.begin) << "  " << operatorView(run).meaning
-                 << (run.failure ? " [" + run.failure->failure->name + ']' : "") << '\n';
-        } else {
-            printRun(run, source, mOut);
-        }
-    }
-
-    void finish(std::uint64_t lines, std::uint64_t bytes, int status, const std::string& error)
-    {
-        if (mOptions.json) {
-            mOut << "\n], \"lines\": " << lines << ", \"bytes\": " << bytes << ", \"status\": " << status
-                 << ", \"error\": " << (error.empty() ? "null" : dumped(error)) << "}\n";
-        }
-        mOut.flush();
-    }
-
-private:
-    static std::string dumped(const Json& value) { return value.dump(1, ' ', false, Json::error_handler_t::replace); }
-
-    const LogOptions& mOptions;
-    std::ostream& mOut;
-    bool mPrinted = false;
-};
-
 /// True when a run leaves nothing to be done.
 bool isClean(const Run& run)
 {
     return wentWell(run) && run.besides.empty() && run.board.found();
 }
 
-/// Reads all sources and explains their runs.
+std::string dumped(const Json& value)
+{
+    return value.dump(1, ' ', false, Json::error_handler_t::replace);
+}
+
+/// Reads all sources and explains their runs one by one: for people, as one line each, or as one JSON object.
 class Explanation
 {
 public:
     Explanation(const LogOptions& options, std::ostream& out, std::ostream& err)
-        : mOptions(options), mErrors(err), mPrinter(options, out), mBuilder([this](Run& run) { take(run); })
+        : mOptions(options), mOut(out), mErrors(err), mBuilder([this](Run& run) { take(run); })
     {
     }
 
     int run()
     {
+        if (mOptions.json) {
+            mOut << "{\"command\": \"log\", \"version\": " << jsonVersion << ", \"runs\": [";
+        }
         std::string error = openPage();
         const std::size_t count = std::max<std::size_t>(mOptions.files.size(), 1);
         for (std::size_t index = 0; index < count && error.empty(); ++index) {
@@ -248,10 +195,15 @@ public:
         if (error.empty() && mOptions.run > mRuns) {
             error = "there is no run " + std::to_string(mOptions.run) + ": the log has " + counted(mRuns, "run");
         }
-        mPrinter.finish(mLines, mBytes, error.empty() ? mStatus : LOG_UNREADABLE, error);
-        if (error.empty() && mPage) {
-            mPage->finish();
-            error = pageError(writeFile(mOptions.htmlFile, mPageText));
+        if (mOptions.json) {
+            mOut << "\n], \"lines\": " << mLines << ", \"bytes\": " << mBytes
+                 << ", \"status\": " << (error.empty() ? mStatus : LOG_UNREADABLE)
+                 << ", \"error\": " << (error.empty() ? "null" : dumped(error)) << "}\n";
+        }
+        mOut.flush();
+        if (error.empty() && mPage.is_open()) {
+            endPage(mPage);
+            error = pageError(writeFile(mOptions.htmlFile, mPage));
         }
         if (!error.empty()) {
             mErrors << "harl-updater-tool: " << error << '\n';
@@ -271,10 +223,10 @@ private:
             return "";
         }
         const std::string objection = objectionTo(mOptions.htmlFile, mOptions.files);
-        if (!objection.empty() || !openUnnamed(mPageText)) {
+        if (!objection.empty() || !openUnnamed(mPage)) {
             return pageError(objection.empty() ? std::strerror(errno) : objection);
         }
-        mPage.emplace(mPageText);
+        beginPage(mPage);
         return "";
     }
 
@@ -307,21 +259,30 @@ private:
 
     void show(const Run& run, const std::string& source)
     {
-        mPrinter.print(run, source);
-        if (mPage) {
-            mPage->writeRun(run, source);
+        if (mOptions.json) {
+            mOut << (mShown ? ",\n" : "\n") << dumped(runToJson(run, source));
+        } else if (mOptions.list) {
+            mOut << run.number << "  " << dateText(run.begin) << "  " << operatorView(run).meaning
+                 << (run.failure ? " [" + run.failure->failure->name + ']' : "") << '\n';
+        } else {
+            mOut << (mShown ? "\n" : "");
+            printRun(run, source, mOut);
+        }
+        mShown = true;
+        if (mPage.is_open()) {
+            writeRunToPage(run, source, mPage);
         }
     }
 
     const LogOptions& mOptions;
+    std::ostream& mOut;
     std::ostream& mErrors;
-    Printer mPrinter;
     RunBuilder mBuilder;
-    std::fstream mPageText;
-    std::optional<HtmlPage> mPage;
+    std::fstream mPage;
     std::string mSource;
     std::optional<Run> mLast;
     std::string mLastSource;
+    bool mShown = false; // a run
     std::uint64_t mRuns = 0;
     std::uint64_t mLines = 0;
     std::uint64_t mBytes = 0;
@@ -406,20 +367,21 @@ int followLast(const LogOptions& options, std::ostream& out, std::ostream& err)
 
 std::string conflictIn(const LogOptions& options)
 {
-    if (options.journal && !options.files.empty()) {
-        return "--journal reads the service's journal: name no FILE with it.";
+    const bool picks = options.list || options.last || options.run > 0;
+    const std::pair<bool, const char*> conflicts[] = {
+        {options.journal && !options.files.empty(), "--journal reads the service's journal: name no FILE with it."},
+        {options.follow && options.files.size() > 1, "--follow shows one log: name one FILE."},
+        {options.follow && (!options.htmlFile.empty() || picks),
+         "--follow shows the run that goes on: neither --html, --list, --last nor --run go with it."},
+        {options.last && options.run > 0, "--last and --run name one run each: leave one of them out."},
+        {options.list && options.json, "--list is for people; --json prints a list anyway: leave one of them out."},
+    };
+    for (const auto& [applies, text] : conflicts) {
+        if (applies) {
+            return text;
+        }
     }
-    if (options.follow && options.files.size() > 1) {
-        return "--follow shows one log: name one FILE.";
-    }
-    if (options.follow && (!options.htmlFile.empty() || options.list || options.last || options.run > 0)) {
-        return "--follow shows the run that goes on: neither --html, --list, --last nor --run go with it.";
-    }
-    if (options.last && options.run > 0) {
-        return "--last and --run name one run each: leave one of them out.";
-    }
-    return options.list && options.json ? "--list is for people; --json prints a list anyway: leave one of them out."
-                                        : "";
+    return "";
 }
 
 int runLog(const LogOptions& options, std::ostream& out, std::ostream& err)

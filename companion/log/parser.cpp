@@ -96,7 +96,7 @@ bool isConsolePrefix(std::string_view text)
 std::string_view plain(std::string_view line, std::string& buffer)
 {
     static const char escape = '\x1b';
-    const bool logged = line.find("#0") != std::string_view::npos;
+    const bool logged = contains(line, "#0");
     if (!logged && line.find(escape) == std::string_view::npos) {
         return line;
     }
@@ -125,14 +125,6 @@ bool isHiddenMessage(std::string_view text)
 {
     static const std::string_view end = "B blob data]";
     return text.size() > end.size() && text.front() == '[' && text.substr(text.size() - end.size()) == end;
-}
-
-std::string_view withoutLineEnd(std::string_view line)
-{
-    while (!line.empty() && line.back() == '\r') {
-        line.remove_suffix(1);
-    }
-    return line;
 }
 
 } // namespace
@@ -167,7 +159,6 @@ std::string_view withoutJournalPrefix(std::string_view line, std::string_view& p
 
 void LogParser::feed(std::string_view block)
 {
-    mBytes += block.size();
     while (!block.empty()) {
         const void* found = std::memchr(block.data(), '\n', block.size());
         const std::size_t length =
@@ -198,7 +189,8 @@ void LogParser::finish()
 void LogParser::takeLine(std::string_view line)
 {
     ++mLines;
-    line = withoutLineEnd(plain(line, mPlain)); // ssh(1) has a carriage return in front of a colour's end
+    line = plain(line, mPlain);
+    line = line.substr(0, line.find_last_not_of('\r') + 1); // ssh(1) has a carriage return in front of a colour's end
 
     std::size_t position = startsWith(line, mark) ? 0 : line.find(mark);
     if (position == std::string_view::npos) {
@@ -212,7 +204,7 @@ void LogParser::takeLine(std::string_view line)
     std::string_view program;
     const std::string_view front = line.substr(0, position);
     const std::string_view before = withoutJournalPrefix(front, program);
-    const bool interrupted = before.find(mark) != std::string_view::npos;
+    const bool interrupted = contains(before, mark);
     if (!interrupted && !withoutBlanks(before).empty() && !isConsolePrefix(before)) {
         takeText(front, indentationOf(front)); // a line that another program, or a message, has not ended
     }
@@ -313,14 +305,10 @@ bool LogParser::parseHead(std::string_view text)
     if (!parseTime(time) || !takeColumn(rest, mHead.thread) || !takeColumn(rest, position)) {
         return false;
     }
-    while (!rest.empty() && isBlank(rest.back())) {
-        rest.remove_suffix(1);
-    }
-    const std::size_t colon = position.rfind(':');
-    if (colon == std::string_view::npos || rest.empty() || rest.back() != ')') {
+    rest = rest.substr(0, rest.find_last_not_of(" \t") + 1);
+    if (!contains(position, ":") || rest.empty() || rest.back() != ')') {
         return false;
     }
-    mHead.file = position.substr(0, colon);
     mHead.operation = bareName(rest);
     return !mHead.operation.empty();
 }

@@ -12,7 +12,6 @@ struct ParsedRecord
     std::uint64_t line = 0;                  ///< of the record's first line, from 1
     std::int64_t time = 0;                   ///< local time in seconds since 1970, as if local time were UTC
     std::string_view thread;                 ///< the thread's id as logged
-    std::string_view file;                   ///< source file, such as "UpdateManager.cpp"
     std::string_view operation;              ///< bare name of the function, such as "updateMirrors"
     std::optional<std::string_view> message; ///< without indentation and line end; none: it is not in the log
     bool cut = false;                        ///< The log ends in the message, which may lack its end.
@@ -59,7 +58,6 @@ public:
     /// The text has ended: hands over the rest.
     void finish();
 
-    std::uint64_t bytes() const { return mBytes; }     ///< taken so far
     std::uint64_t lines() const { return mLines; }     ///< handled so far
     std::uint64_t records() const { return mRecords; } ///< found so far
 
@@ -73,7 +71,6 @@ private:
 
     LogSink& mSink;
     std::string mPartialLine; // bytes of the line that has not ended yet, longestLine at most
-    std::uint64_t mBytes = 0;
     std::uint64_t mLines = 0;
     std::uint64_t mRecords = 0;
 

@@ -18,11 +18,6 @@ const std::int64_t longestGap = 86400;  // s between two records
 const std::string mainPackage = packageOf(true);
 const std::int64_t mostDelay = 60; // s by which a wait may end late
 
-bool contains(std::string_view text, std::string_view part)
-{
-    return text.find(part) != std::string_view::npos;
-}
-
 /// A version check's result, and what stands between the two versions.
 struct VersionEvent
 {

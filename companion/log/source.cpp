@@ -1,6 +1,8 @@
 #include "log/source.h"
 
+#include "command.h"
 #include "findings.h"
+#include "procedure.h"
 
 #include <array>
 #include <cerrno>
@@ -30,15 +32,7 @@ std::string LogSource::openFile(const std::string& path)
 
 std::string LogSource::openJournal(bool follow)
 {
-    // All entries, with their times and programs; --all keeps tabs as they are.
-    std::vector<std::string> arguments = {"journalctl",
-                                          "--unit=harl-updater",
-                                          "--unit=harl-updater-give-back",
-                                          "--unit=harl-updater-verify",
-                                          "--output=short-iso",
-                                          "--all",
-                                          "--quiet",
-                                          "--no-pager"};
+    std::vector<std::string> arguments = journalCommand;
     if (follow) {
         arguments.insert(arguments.end(), {"--follow", "--no-tail"});
     }
@@ -60,13 +54,8 @@ std::string LogSource::openProgram(const std::vector<std::string>& arguments, co
     if (!complains) {
         posix_spawn_file_actions_addopen(&actions, STDERR_FILENO, "/dev/null", O_WRONLY, 0);
     }
-    std::vector<char*> words;
-    words.reserve(arguments.size() + 1);
-    for (const std::string& argument : arguments) {
-        words.push_back(const_cast<char*>(argument.c_str())); // not changed, posix_spawn(3)
-    }
-    words.push_back(nullptr);
-    const int error = posix_spawnp(&mProgram, words.front(), &actions, nullptr, words.data(), environ);
+    const int error =
+        posix_spawnp(&mProgram, arguments.front().c_str(), &actions, nullptr, pointersTo(arguments).data(), environ);
     posix_spawn_file_actions_destroy(&actions);
     if (error == 0) {
         return "";
@@ -83,6 +72,11 @@ bool LogSource::isRegularFile() const
     return fstat(mDescriptor.number(), &status) == 0 && S_ISREG(status.st_mode);
 }
 
+ssize_t LogSource::read(std::vector<char>& block) const
+{
+    return TEMP_FAILURE_RETRY(::read(mDescriptor.number(), block.data(), block.size()));
+}
+
 int LogSource::close(bool allRead)
 {
     mDescriptor = Descriptor();
@@ -93,8 +87,7 @@ int LogSource::close(bool allRead)
     if (!allRead) {
         kill(mProgram, SIGTERM);
     }
-    while (waitpid(mProgram, &status, 0) < 0 && errno == EINTR) {
-    }
+    TEMP_FAILURE_RETRY(waitpid(mProgram, &status, 0));
     mProgram = -1;
     return WIFEXITED(status) ? WEXITSTATUS(status) : 0;
 }

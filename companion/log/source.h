@@ -37,6 +37,9 @@ public:
     int descriptor() const { return mDescriptor.number(); }
     bool isRegularFile() const;
 
+    /// Reads what comes next into `block`. Its length, 0 at the end, -1 with errno on an error.
+    ssize_t read(std::vector<char>& block) const;
+
     /// Waits for the program's end, which it brings about unless all of its output was read.
     ///
     /// @return the program's exit code; 0 for the other sources and when it was ended

@@ -20,21 +20,21 @@ struct OutcomeFacts
 {
     const char* name;
     const char* meaning;
-    bool bothLeds; ///< REMOTE and MAIN; else PASS or FAIL
+    std::vector<std::string> leds; ///< empty: the outcome does not tell
 };
 
 // In the order of Outcome.
 const std::array<OutcomeFacts, 10> outcomeTable = {{
-    {"none", "NOT FINISHED, as far as this log goes", false},
-    {"passed", "PASSED; whether anything was updated is not in this log", false},
-    {"no-update", "PASSED: nothing to update", true},
-    {"updated", "PASSED: updated", false},
-    {"update-offered", "an update is offered", false},
-    {"failed", "FAILED: at what is not in this log", false},
-    {"check-failed", "FAILED: a version could not be read", true},
-    {"mirrors-failed", "FAILED: the package mirrors could not be read", true},
-    {"package-failed", "FAILED: the package could not be installed", false},
-    {"board-failed", "FAILED: the board could not be updated", false},
+    {"none", "NOT FINISHED, as far as this log goes", {}},
+    {"passed", "PASSED; whether anything was updated is not in this log", {}},
+    {"no-update", "PASSED: nothing to update", {"REMOTE", "MAIN"}},
+    {"updated", "PASSED: updated", {"PASS"}},
+    {"update-offered", "an update is offered", {}},
+    {"failed", "FAILED: at what is not in this log", {}},
+    {"check-failed", "FAILED: a version could not be read", {"REMOTE", "MAIN"}},
+    {"mirrors-failed", "FAILED: the package mirrors could not be read", {"REMOTE", "MAIN"}},
+    {"package-failed", "FAILED: the package could not be installed", {"FAIL"}},
+    {"board-failed", "FAILED: the board could not be updated", {"FAIL"}},
 }};
 
 const OutcomeFacts& factsOf(Outcome outcome)
@@ -363,29 +363,26 @@ OperatorView operatorView(const Run& run)
         view.seen = "FAIL lit in fail colour; no sound";
         return view;
     }
-    if (run.outcome == Outcome::NONE && !over) {
-        if (run.ledFailures > 0) {
-            view.seen = "a panel that fails; no sound";
-        } else {
-            view.leds = {{"any", "blue"}};
-            view.seen = "REMOTE and MAIN flashing blue in turn while it went on; no sound";
-        }
-        return view;
-    }
-    if (run.outcome == Outcome::NONE) {
+    if (run.outcome == Outcome::NONE && over) {
         view.seen = "not in this log";
         return view;
     }
-    if (run.outcome == Outcome::FAILED || run.outcome == Outcome::PASSED) {
-        view.seen =
-            "REMOTE and MAIN, or " + std::string(color == "pass" ? "PASS" : "FAIL") + ", in " + color + " colour";
-    } else {
-        view.leds = {{facts.bothLeds ? "REMOTE" : color == "pass" ? "PASS" : "FAIL", color}};
-        view.seen = view.leds.front().first + (facts.bothLeds ? " and MAIN" : "") + " lit in " + color + " colour";
-        if (facts.bothLeds) {
-            view.leds.emplace_back("MAIN", color);
-        }
+    if (run.outcome == Outcome::NONE && run.ledFailures > 0) {
+        view.seen = "a panel that fails; no sound";
+        return view;
     }
+    if (run.outcome == Outcome::NONE) {
+        view.leds = {{"any", "blue"}};
+        view.seen = "REMOTE and MAIN flashing blue in turn while it went on; no sound";
+        return view;
+    }
+    for (const std::string& led : facts.leds) {
+        view.leds.emplace_back(led, color);
+        view.seen += (view.seen.empty() ? "" : " and ") + led;
+    }
+    view.seen = facts.leds.empty() ? "REMOTE and MAIN, or " + std::string(color == "pass" ? "PASS" : "FAIL") + ", in "
+                                   : view.seen + " lit in ";
+    view.seen += color + " colour";
     if (run.outcomeLedFailures > 0 && !run.statusesLost) {
         view.leds.clear();
         view.seen = "a dark or incomplete panel (meant: " + view.seen + ")";

@@ -50,6 +50,8 @@ struct Word
 using S = StepKind;
 using E = Event;
 
+const std::size_t ranLength = sizeof "Running command: " - 1; // what follows is the command
+
 // The first one that fits counts. See common/src/UpdateManager.cpp and remote/.
 const Word words[] = {
     {"main", "TavrenUpdater version: *", E::VERSION, S::START},
@@ -92,21 +94,15 @@ const Word words[] = {
     {"installTVUpdate", "", E::NOTED, S::INSTALL_TEAMVIEWER},
     {"installTVUpdate", "Install script ended with code: #", E::RAW_STATUS, S::INSTALL_TEAMVIEWER},
     {"installTVUpdate", "*", E::ATTEMPT, S::INSTALL_TEAMVIEWER, "/root/RESOURCES/teamviewer_updatescript.sh"},
-    {"runProcess", "Running command: apt update", E::COMMAND, S::REFRESH_MIRRORS, "apt update"},
-    {"runProcess", "Running command: apt-cache policy solvik4-rh", E::COMMAND, S::CHECK_PACKAGE,
-     "apt-cache policy solvik4-rh"},
-    {"runProcess", "Running command: apt-cache policy solvik4-dh", E::COMMAND, S::CHECK_PACKAGE,
-     "apt-cache policy solvik4-dh"},
-    {"runProcess", "Running command: apt --assume-yes install solvik4-rh", E::COMMAND, S::INSTALL_PACKAGE,
-     "apt --assume-yes install solvik4-rh"},
-    {"runProcess", "Running command: apt --assume-yes install solvik4-dh", E::COMMAND, S::INSTALL_PACKAGE,
-     "apt --assume-yes install solvik4-dh"},
+    {"runProcess", "Running command: apt update", E::COMMAND, S::REFRESH_MIRRORS},
+    {"runProcess", "Running command: apt-cache policy solvik4-rh", E::COMMAND, S::CHECK_PACKAGE},
+    {"runProcess", "Running command: apt-cache policy solvik4-dh", E::COMMAND, S::CHECK_PACKAGE},
+    {"runProcess", "Running command: apt --assume-yes install solvik4-rh", E::COMMAND, S::INSTALL_PACKAGE},
+    {"runProcess", "Running command: apt --assume-yes install solvik4-dh", E::COMMAND, S::INSTALL_PACKAGE},
     {"runProcess", "Running command: ssh *", E::COMMAND, S::CHECK_BOARD,
      "ssh  192.168.9.2 \" cat /root/App/AppExe/version.txt | grep 'Brimvale'\""},
-    {"runProcess", "Running command: ls /root/USB_MOUNT/debs/QUORB/armhf/", E::COMMAND, S::CHECK_BOARD,
-     "ls /root/USB_MOUNT/debs/QUORB/armhf/"},
-    {"runProcess", "Running command: ls /root/USB_MOUNT/debs/installTV", E::COMMAND, S::CHECK_TEAMVIEWER,
-     "ls /root/USB_MOUNT/debs/installTV"},
+    {"runProcess", "Running command: ls /root/USB_MOUNT/debs/QUORB/armhf/", E::COMMAND, S::CHECK_BOARD},
+    {"runProcess", "Running command: ls /root/USB_MOUNT/debs/installTV", E::COMMAND, S::CHECK_TEAMVIEWER},
     {"runProcess", "Exit code:#", E::EXIT_CODE},
     {"initMainHead", "", E::MAIN_CHECKS},
     {"initMainHead", "Update mirrors failed:", E::MIRRORS_REPORTED},
@@ -239,7 +235,7 @@ const StepFacts& factsOf(StepKind kind)
 std::optional<ServiceEvent> serviceEventOf(std::string_view line)
 {
     for (const ServiceWord& word : serviceTable) {
-        if (line.rfind(word.part, 0) == 0 && line.find(word.words) != std::string_view::npos) {
+        if (startsWith(line, word.part) && contains(line, word.words)) {
             return word.event;
         }
     }
@@ -262,7 +258,8 @@ Meaning meaningOf(std::string_view operation, std::optional<std::string_view> me
         if (fits(word->message, *message, meaning)) {
             meaning.event = word->event;
             meaning.step = word->step;
-            meaning.command = word->command;
+            meaning.command =
+                word->event == E::COMMAND && *word->command == '\0' ? word->message + ranLength : word->command;
             return meaning;
         }
     }

@@ -1,14 +1,11 @@
 #pragma once
 
+#include "texts.h"
+
 #include <cstddef>
 #include <cstdint>
 #include <optional>
 #include <string_view>
-
-inline bool startsWith(std::string_view text, std::string_view start)
-{
-    return text.substr(0, start.size()) == start;
-}
 
 /// What the updater does in one run, in its order.
 enum class StepKind {

@@ -72,7 +72,7 @@ bool leavesFolder(const std::string& name)
     std::string slashed = '/' + name + '/';
     std::replace(slashed.begin(), slashed.end(), '\\', '/');
     const bool drive = name.size() > 1 && name[1] == ':';
-    return drive || slashed.rfind("//", 0) == 0 || slashed.find("/../") != std::string::npos;
+    return drive || startsWith(slashed, "//") || contains(slashed, "/../");
 }
 
 /// True when `name` is below one of `folders`.

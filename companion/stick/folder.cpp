@@ -1,6 +1,7 @@
 #include "stick/folder.h"
 
 #include "procedure.h"
+#include "texts.h"
 
 #include <algorithm>
 #include <array>
@@ -141,7 +142,7 @@ Descriptor StickFolder::open(const std::string& path, int flags) const
 
         std::string target = targetOf(Descriptor(openat(here, step, O_PATH | O_NOFOLLOW | O_CLOEXEC)));
         if (!target.empty() && (!last || (flags & O_NOFOLLOW) == 0)) {
-            if (target.rfind(onUnit, 0) == 0) { // the stick itself, on the unit
+            if (startsWith(target, onUnit)) { // the stick itself, on the unit
                 folders.resize(1);
                 target.erase(0, onUnit.size());
             } else if (target.front() == '/') {

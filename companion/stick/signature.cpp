@@ -33,17 +33,12 @@ std::vector<std::string> ownEnvironment()
 }
 
 /// Runs a program on this terminal: gpg asks for the passphrase there. True when it exited with 0.
-bool runHere(std::vector<std::string> arguments)
+bool runHere(const std::vector<std::string>& arguments)
 {
-    std::vector<char*> pointers;
-    pointers.reserve(arguments.size() + 1);
-    for (std::string& argument : arguments) {
-        pointers.push_back(argument.data());
-    }
-    pointers.push_back(nullptr);
     pid_t child = -1;
     int status = -1;
-    return posix_spawnp(&child, pointers.front(), nullptr, nullptr, pointers.data(), environ) == 0 &&
+    return posix_spawnp(&child, arguments.front().c_str(), nullptr, nullptr, pointersTo(arguments).data(), environ) ==
+               0 &&
            waitpid(child, &status, 0) == child && status == 0;
 }
 
@@ -61,7 +56,7 @@ std::string fieldOf(const std::string& stick, const std::string& field)
 {
     std::ifstream manifest(fs::path(stick) / manifestName);
     for (std::string line; std::getline(manifest, line);) {
-        if (line.rfind(field + ": ", 0) == 0) {
+        if (startsWith(line, field + ": ")) {
             return line.substr(field.size() + 2);
         }
     }
@@ -132,7 +127,7 @@ void checkSignature(const std::string& stick, const std::string& keyring, Report
     }
     std::istringstream lines(result.output);
     for (std::string line; std::getline(lines, line);) {
-        const bool isFile = line.find(": ") != std::string::npos && line.find("debs/") != std::string::npos;
+        const bool isFile = contains(line, ": ") && contains(line, "debs/");
         report.add(isFile ? "stick-signature.file" : "stick-signature", {{"complaint", escaped(line)}});
     }
     if (result.succeeded() && isSigned) {

@@ -5,6 +5,7 @@
 #include "stick/signature.h"
 
 #include <algorithm>
+#include <cctype>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
@@ -23,9 +24,7 @@ const char markerName[] = "installTV";
 
 std::string lowerCase(std::string text)
 {
-    std::transform(text.begin(), text.end(), text.begin(), [](char letter) {
-        return letter >= 'A' && letter <= 'Z' ? static_cast<char>(letter + 32) : letter;
-    });
+    std::transform(text.begin(), text.end(), text.begin(), [](unsigned char letter) { return std::tolower(letter); });
     return text;
 }
 
@@ -197,7 +196,7 @@ private:
                     names.end());
         if (names.empty()) {
             const bool isUnfinished = std::any_of(all.names.begin(), all.names.end(), [](const std::string& name) {
-                return name.rfind(unfinishedPrefix, 0) == 0;
+                return startsWith(name, unfinishedPrefix);
             });
             mReport.add(all.names.empty() ? "no-version-folder.empty"
                         : isUnfinished    ? "no-version-folder.unfinished"
@@ -405,7 +404,7 @@ std::string checkVersionName(const std::string& name, Report& report)
         report.add("version-missing", {{"name", shown(line)}});
         return version;
     }
-    if (line != name || version.find('\r') != std::string::npos) {
+    if (line != name || contains(version, "\r")) {
         report.add("version-line-break", {{"name", shown(name)}});
         return version;
     }
@@ -433,7 +432,7 @@ void checkScript(std::string_view start, std::uint64_t size, const std::string& 
     const Values values = {
         {"name", name}, {"start", shown(firstLine.substr(0, 60))}, {"interpreter", shown(interpreterOf(firstLine))}};
     const bool names = firstLine.substr(0, 2) == "#!";
-    if (names && firstLine.find('\r') != std::string_view::npos) {
+    if (names && contains(firstLine, "\r")) {
         report.add("script-first-line.windows", values);
         return;
     }

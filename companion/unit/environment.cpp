@@ -49,7 +49,7 @@ CommandResult Unit::run(const std::vector<std::string>& arguments, std::chrono::
 {
     std::vector<std::string> environment = {"RES_OPTIONS=timeout:1 attempts:2"}; // resolv.conf(5)
     for (const auto& [name, value] : mEnvironment) {
-        environment.push_back(name + '=' + value);
+        environment.push_back(std::string(name).append("=").append(value));
     }
     bool told = mSite.waits == nullptr;
     return runCommand(arguments, environment, limit, [&](std::chrono::milliseconds time) {
@@ -67,7 +67,7 @@ std::string Unit::locale() const
     std::string result;
     for (const auto& [name, value] : mEnvironment) {
         if (name != "PATH") {
-            result += (result.empty() ? "" : " ") + name + '=' + value;
+            result.append(result.empty() ? "" : " ").append(name).append("=").append(value);
         }
     }
     return result;
@@ -85,20 +85,15 @@ void Unit::defineTexts(Report& report) const
 
 std::string Unit::property(const std::string& service, const std::string& name) const
 {
-    const auto properties = mServices.find(service + ".service");
-    if (properties == mServices.end()) {
-        return "";
-    }
-    const auto value = properties->second.find(name);
-    return value == properties->second.end() ? "" : value->second;
+    const auto value = mProperties.find({service + ".service", name});
+    return value == mProperties.end() ? "" : value->second;
 }
 
 std::string Unit::journal() const
 {
-    return run({"journalctl", "--unit=harl-updater", "--unit=harl-updater-give-back", "--unit=harl-updater-verify",
-                "--output=short-iso", "--all", "--quiet", "--no-pager", "--lines=1000"},
-               quick)
-        .output;
+    std::vector<std::string> command = journalCommand;
+    command.emplace_back("--lines=1000");
+    return run(command, quick).output;
 }
 
 bool Unit::updaterRuns() const
@@ -125,7 +120,7 @@ void Unit::takeVariables(const std::vector<std::string>& texts)
         const std::size_t equals = text.find('=');
         const std::string name = text.substr(0, equals);
         if (equals != std::string::npos &&
-            (name == "PATH" || name == "LANG" || name == "LANGUAGE" || name.rfind("LC_", 0) == 0)) {
+            (name == "PATH" || name == "LANG" || name == "LANGUAGE" || startsWith(name, "LC_"))) {
             mEnvironment[name] = text.substr(equals + 1);
         }
     }
@@ -140,7 +135,10 @@ void Unit::takeServices(const std::string& output)
         if (equals != std::string::npos) {
             properties[line.substr(0, equals)] = line.substr(equals + 1);
         } else if (!properties.empty()) {
-            mServices[properties["Id"]] = properties;
+            const std::string service = properties["Id"];
+            for (const auto& [name, value] : properties) {
+                mProperties[{service, name}] = value;
+            }
             properties.clear();
         }
     }
@@ -177,11 +175,6 @@ std::vector<std::string> linesOf(const std::string& text)
     return lines;
 }
 
-bool contains(const std::string& text, const std::string& part)
-{
-    return text.find(part) != std::string::npos;
-}
-
 std::string valueAfter(const std::string& text, const std::string& key)
 {
     std::string value;
@@ -212,7 +205,7 @@ std::string complaint(const CommandResult& result)
     for (const std::string& line : linesOf(result.errors)) {
         const std::string text = line.substr(0, line.find('\r')); // ssh(1) ends its lines so
         last = text.empty() ? last : text;
-        error = text.rfind("Error: ", 0) == 0 ? text : error;
+        error = startsWith(text, "Error: ") ? text : error;
     }
     if (!last.empty()) {
         return shown(error.empty() ? last : error);

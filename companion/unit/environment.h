@@ -88,7 +88,7 @@ private:
 
     const UnitSite& mSite;
     std::map<std::string, std::string> mEnvironment;
-    std::map<std::string, std::map<std::string, std::string>> mServices;
+    std::map<std::pair<std::string, std::string>, std::string> mProperties; // of a service, and its name
     bool mServicesKnown = false;
     bool mMainHead = false;
 };
@@ -114,8 +114,6 @@ private:
 
 /// The lines of `text`, without their ends.
 std::vector<std::string> linesOf(const std::string& text);
-
-bool contains(const std::string& text, const std::string& part);
 
 /// What follows `key` in the last line of `text` that holds it, as the updater reads its versions; empty without one.
 std::string valueAfter(const std::string& text, const std::string& key);

@@ -113,7 +113,7 @@ void checkSettings(const Unit& unit, Report& report)
 std::uint64_t numberField(const std::string& record, const std::string& name)
 {
     for (const std::string& line : linesOf(record)) {
-        if (line.rfind(name + ": ", 0) == 0) {
+        if (startsWith(line, name + ": ")) {
             return std::strtoull(line.c_str() + name.size() + 2, nullptr, 10);
         }
     }

@@ -1,24 +1,14 @@
 #pragma once
 
-#include "unit/environment.h"
-
-#include <iosfwd>
-#include <string>
+#include "unit/unit_check.h"
 
 inline constexpr char passSound[] = "/root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav";
 inline constexpr char failSound[] = "/root/RESOURCES/SOUNDS/SND_RESULT_FAIL.wav";
 
-/// How a test of panel or sound ended.
-struct SelfTest
-{
-    int tested = 0; ///< LEDs or sounds
-    int failedCommands = 0;
-    std::string reason; ///< of the last failure, printable
-};
-
-/// Shows every LED of the panel in every colour up to the first that fails, then darkens the panel. `out`, if any, gets
-/// what must be seen.
-SelfTest testPanel(const Unit& unit, const UnitSite& site, std::ostream* out);
-
-/// Plays both sounds to their end. `out`, if any, gets what must be heard.
-SelfTest testSound(const Unit& unit, std::ostream* out);
+/// Does the tests of panel and sound that `options` ask for: shows every LED in every colour up to the first that
+/// fails, then darkens the panel; plays both sounds to their end. `out` gets what must be seen and heard, or the JSON
+/// object.
+///
+/// @return as runUnit()
+int runSelfTests(const UnitOptions& options, const Unit& unit, const UnitSite& site, std::ostream& out,
+                 std::ostream& errors);

@@ -262,6 +262,19 @@ class BadInput(Base):
         self.assertIn(b"page.html: No such file or directory", done.stderr)
 
 
+class Advice(Base):
+    """What is said of a run that was cut."""
+
+    def test_panel_that_does_not_flash_any_more_is_not_asked_for(self) -> None:
+        for name in ("package-and-board", "up-to-date"):
+            lines = (GOLDEN / f"{name}.log").read_bytes().splitlines(keepends=True)
+            shown = next(i for i, line in enumerate(lines) if b"resultCallback" in line)
+            for length in range(2, len(lines)):
+                with self.subTest(name, length=length):
+                    said = b" ".join(run_tool(text=b"".join(lines[:length])).stdout.split())
+                    self.assertEqual(b"still flashes blue" in said, length <= shown, said)
+
+
 class Unit(Base):
     """The journal of the service, through journalctl."""
 
@@ -320,6 +333,21 @@ class Width(Base):
                     for line in lines:
                         longest_word = max(len(word) for word in line.split() or [""])
                         self.assertLessEqual(len(line), max(columns or 100, longest_word + 15), line)
+
+
+class Input(Base):
+    """Standard input."""
+
+    def test_wait_for_a_terminal_is_told(self) -> None:
+        master, slave = pty.openpty()
+        with subprocess.Popen([TOOL, "log"], stdin=slave, stdout=subprocess.PIPE, stderr=subprocess.PIPE) as tool:
+            os.close(slave)
+            assert tool.stderr
+            self.assertEqual(tool.stderr.readline(), b"harl-updater-tool: reading the log from the terminal; end it "
+                                                     b"with Ctrl-D.\n")
+            os.write(master, b"\x04")
+            self.assertEqual(tool.wait(30), 2)
+        os.close(master)
 
 
 class Follow(Base):
@@ -539,6 +567,11 @@ class Output(Base):
                 self.assertEqual(done.returncode, 2)
                 self.assertRegex(done.stderr,
                                  rb"^harl-updater-tool: the output cannot be written: No space left on device\. .*\n$")
+
+    def test_output_that_nobody_reads_needs_no_room(self) -> None:
+        done = subprocess.run(["sh", "-c", '"$0" explain >&-', TOOL], capture_output=True, timeout=60, check=False)
+        self.assertEqual((done.returncode, done.stderr), (2, b"harl-updater-tool: the output cannot be written: Bad "
+                                                             b"file descriptor. Nobody reads it.\n"))
 
 
 if __name__ == "__main__":

@@ -145,7 +145,7 @@ void expectOneReport(const std::string& report, const std::string& message)
     for (const platform::Record& record : records) {
         if (record.function.find("Callback(UpdateManager::") != std::string::npos && record.message.empty()) {
             ++reports;
-            EXPECT_NE(record.function.find(callback), std::string::npos) << record.function;
+            EXPECT_THAT(record.function, testing::HasSubstr(callback));
             EXPECT_TRUE(message.empty() || last == message) << last;
         }
         if (record.function.find("UpdateManager::") != std::string::npos) {

@@ -123,11 +123,15 @@ TEST_F(Runner, OutputAndExitCodeArriveWhole)
     EXPECT_EQ(log.messages().back(), "Exit code:100");
 }
 
-TEST_F(Runner, ExitCodesKeepEightBits)
+class ExitCode : public Runner, public testing::WithParamInterface<int>
 {
-    for (const int code : {1, 2, 100, 127, 128, 200, 255}) {
-        EXPECT_EQ(run("exit " + std::to_string(code)), code);
-    }
+};
+INSTANTIATE_TEST_SUITE_P(Codes, ExitCode, testing::Values(1, 2, 100, 127, 128, 200, 255),
+                         testing::PrintToStringParamName());
+
+TEST_P(ExitCode, KeepsEightBits)
+{
+    EXPECT_EQ(run("exit " + std::to_string(GetParam())), GetParam());
 }
 
 TEST_F(Runner, ToolThatIsMissingIsTheShells127)
@@ -135,13 +139,17 @@ TEST_F(Runner, ToolThatIsMissingIsTheShells127)
     EXPECT_EQ(run("/nonexistent/tool 2>/dev/null"), 127);
 }
 
-TEST_F(Runner, KilledShellGivesZero)
+class KilledShell : public Runner, public testing::WithParamInterface<std::string>
 {
-    for (const char* signal : {"KILL", "SEGV", "PIPE", "TERM"}) {
-        EXPECT_EQ(run(std::string("echo before; kill -") + signal + " $$"), 0);
-        EXPECT_EQ(output, "before\n");
-        EXPECT_EQ(log.messages().back(), "Exit code:0");
-    }
+};
+INSTANTIATE_TEST_SUITE_P(Signals, KilledShell, testing::Values("KILL", "SEGV", "PIPE", "TERM"),
+                         [](const testing::TestParamInfo<std::string>& shell) { return shell.param; });
+
+TEST_P(KilledShell, GivesZero)
+{
+    EXPECT_EQ(run("echo before; kill -" + GetParam() + " $$"), 0);
+    EXPECT_EQ(output, "before\n");
+    EXPECT_EQ(log.messages().back(), "Exit code:0");
 }
 
 TEST_F(Runner, ChildThatTheShellSawKilledIsAnExitCode)

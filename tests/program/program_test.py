@@ -101,6 +101,10 @@ class ProgramTest(unittest.TestCase):
             expected += [("lockApp", ""), ("update", "1"), ("main", "AFTER UPDATE")]
         self.assertEqual(seen, expected)
 
+    def test_update_thread_is_silent_until_the_update_begins(self) -> None:
+        begin = [record.message for record in self.records].index("BEFORE UPDATE")
+        self.assertEqual({record.thread for record in self.records[: begin + 1]}, {self.records[0].thread})
+
     def test_panel_goes_dark_first(self) -> None:
         self.assertEqual([call.text for call in self.calls[:14]], LEDS_OFF)
 

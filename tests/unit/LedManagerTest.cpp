@@ -71,17 +71,16 @@ TEST_F(Leds, FailedCommandIsLoggedAndTheNextOneRuns)
     }
     LedManager::turnOffAll();
     EXPECT_EQ(journal(), failing(allLeds("0x0")));
-    EXPECT_EQ(platform::records().at(0).function, "static void LedManager::turnOn(LedManager::Led, LedManager::Color)");
 }
 
-TEST_F(Leds, AnyStatusButZeroIsAFailure)
+using LedStatus = With<Leds>;
+INSTANTIATE_TEST_SUITE_P(Statuses, LedStatus, testing::ValuesIn(failedStatuses), nameOf<Named<int>>);
+
+TEST_P(LedStatus, IsAFailure)
 {
-    for (const int status : {-1, 1, 9, 256}) {
-        platform::reset();
-        script(ledCommand(ledRemote, blue), {raw(status)});
-        LedManager::turnOn(LedManager::LED_REMOTE, LedManager::COLOR_BLUE);
-        EXPECT_EQ(journal(), failing({ledCommand(ledRemote, blue)}));
-    }
+    script(ledCommand(ledRemote, blue), {raw(value())});
+    LedManager::turnOn(LedManager::LED_REMOTE, LedManager::COLOR_BLUE);
+    EXPECT_EQ(journal(), failing({ledCommand(ledRemote, blue)}));
 }
 
 class Flashing : public Leds
@@ -290,9 +289,6 @@ TEST_F(Sequences, FailedModeIsLogged)
     LedManager::startFlashingSequence(LedManager::LED_PASS);
     LedManager::stopFlashingSequence(LedManager::LED_PASS);
     EXPECT_EQ(journal(), failing({ledCommand("0x13", "0x80"), ledCommand("0x13", "0x40"), ledCommand("0x13", "0x0")}));
-    EXPECT_EQ(platform::records().at(0).function, "static void LedManager::resetFlashingSequence(LedManager::Led)");
-    EXPECT_EQ(platform::records().at(1).function, "static void LedManager::startFlashingSequence(LedManager::Led)");
-    EXPECT_EQ(platform::records().at(2).function, "static void LedManager::stopFlashingSequence(LedManager::Led)");
 }
 
 TEST_F(Sequences, SetAppendsTheColourThenDarkness)
@@ -317,21 +313,22 @@ TEST_F(Sequences, StepTimesOutOfRangeAreLeftToTheToolToRefuse)
     EXPECT_EQ(stepTimeOf(-20), ledCommand("0x1f", "0xffffffff"));
 }
 
-TEST_F(Sequences, SetEndsAtItsFirstFailedCommand)
+using FailedSequence = With<Sequences, std::size_t>;
+INSTANTIATE_TEST_SUITE_P(Commands, FailedSequence,
+                         testing::Values(Named<std::size_t>{"First", 0}, Named<std::size_t>{"Second", 1},
+                                         Named<std::size_t>{"Third", 2}, Named<std::size_t>{"Fourth", 3}),
+                         nameOf<Named<std::size_t>>);
+
+TEST_P(FailedSequence, EndsThere)
 {
-    for (std::size_t failed = 0; failed < passFor500ms.size(); ++failed) {
-        platform::reset();
-        // The second and the fourth command are the same: fail the right one.
-        const bool fourth = failed == 3;
-        script(passFor500ms[failed],
-               fourth ? std::vector<platform::Answer>{exits(0), exits(1)} : std::vector<platform::Answer>{exits(1)});
-        LedManager::setFlashingSequence(LedManager::LED_PASS, LedManager::COLOR_PASS, 500);
-        EXPECT_EQ(entries("system:"),
-                  Lines(passFor500ms.begin(), passFor500ms.begin() + static_cast<std::ptrdiff_t>(failed) + 1));
-        EXPECT_EQ(entries("log:"), Lines{"system returned false: " + passFor500ms[failed]});
-        EXPECT_EQ(platform::records().at(0).function,
-                  "static void LedManager::setFlashingSequence(LedManager::Led, LedManager::Color, int)");
-    }
+    // The second and the fourth command are the same: fail the right one.
+    const bool fourth = value() == 3;
+    script(passFor500ms[value()],
+           fourth ? std::vector<platform::Answer>{exits(0), exits(1)} : std::vector<platform::Answer>{exits(1)});
+    LedManager::setFlashingSequence(LedManager::LED_PASS, LedManager::COLOR_PASS, 500);
+    EXPECT_EQ(entries("system:"),
+              Lines(passFor500ms.begin(), passFor500ms.begin() + static_cast<std::ptrdiff_t>(value()) + 1));
+    EXPECT_EQ(entries("log:"), Lines{"system returned false: " + passFor500ms[value()]});
 }
 
 } // namespace

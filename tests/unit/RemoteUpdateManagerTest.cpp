@@ -50,12 +50,6 @@ const Outcome outcomes[] = {
     {"NegativeError", reportError<static_cast<UpdateManager::Error>(-1)>, failSoundCommand, {}},
 };
 
-template <typename Row>
-std::string nameOf(const testing::TestParamInfo<Row>& info)
-{
-    return info.param.name;
-}
-
 void PrintTo(const Outcome& outcome, std::ostream* stream)
 {
     *stream << outcome.name;
@@ -70,10 +64,6 @@ TEST_P(Feedback, DarkensThePanelPlaysItsSoundAndLightsItsLeds)
 {
     GetParam().report();
     EXPECT_EQ(journal(), joined({{"log:"}, ran(allLeds(dark)), {ran(GetParam().sound)}, ran(GetParam().lit)}));
-    EXPECT_EQ(platform::records().at(0).function,
-              GetParam().sound == passSoundCommand
-                  ? "static void RemoteUpdateManager::resultCallback(UpdateManager::Result)"
-                  : "static void RemoteUpdateManager::errorCallback(UpdateManager::Error)");
 }
 
 TEST_P(Feedback, FlashingSendsNothingOnceTheOutcomeIsBeingShown)
@@ -149,9 +139,6 @@ TEST_F(ApplicationLock, UnlockWakesTheThreadThatIsLocked)
     RemoteUpdateManager::unlockApp();
     waiting.join();
     EXPECT_EQ(journal(), (Lines{"log:", "log:", "log:"}));
-    EXPECT_EQ(platform::records().at(0).function, "static void RemoteUpdateManager::lockApp()");
-    EXPECT_EQ(platform::records().at(1).function, "static void RemoteUpdateManager::unlockApp()");
-    EXPECT_EQ(platform::records().at(2).function, "static void RemoteUpdateManager::lockApp()");
 }
 
 TEST_F(ApplicationLock, IsTakenOnlyAfterItsFirstRecord)
@@ -309,7 +296,6 @@ TEST_F(WholeUpdate, IsLoggedBeforeAnyThreadStarts)
     });
     script(mirrorsCommand, {exits(100)});
     run();
-    EXPECT_EQ(platform::records().at(0).function, "void RemoteUpdateManager::update()");
 }
 
 TEST_F(WholeUpdate, RunsOpeningUpdateAndClosingInOrder)

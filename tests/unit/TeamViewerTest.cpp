@@ -33,7 +33,6 @@ TEST_F(CheckTVUpdate, PlainFileRequestsTheInstallation)
               (Lines{"log:Running command: ls /root/USB_MOUNT/debs/installTV",
                      "popen:ls /root/USB_MOUNT/debs/installTV", "log:Exit code:0",
                      "log:Teamviewer path/root/USB_MOUNT/debs/installTV", "log:Teamviewer install is required"}));
-    EXPECT_EQ(platform::records().back().function, "static bool UpdateManager::checkTVUpdate(bool&)");
 }
 
 TEST_F(CheckTVUpdate, OutputWithoutLineFeedEqualsThePath)
@@ -48,17 +47,20 @@ TEST_F(CheckTVUpdate, OnlyTheFirstLineCounts)
     EXPECT_FALSE(check(exits(0, std::string("more\n") + teamViewerMarker + "\n")));
 }
 
-TEST_F(CheckTVUpdate, DirectoryRequestsNothing)
+using OtherListing = With<CheckTVUpdate, const char*>;
+INSTANTIATE_TEST_SUITE_P(Listings, OtherListing,
+                         testing::Values(Named<const char*>{"EmptyDirectory", ""},
+                                         Named<const char*>{"DirectoryWithAFile", "file\n"},
+                                         Named<const char*>{"OtherCase", "/root/USB_MOUNT/debs/installtv\n"},
+                                         Named<const char*>{"Blank", "/root/USB_MOUNT/debs/installTV \n"}),
+                         nameOf<Named<const char*>>);
+
+TEST_P(OtherListing, RequestsNothing)
 {
-    for (const char* listing :
-         {"", "file\n", "/root/USB_MOUNT/debs/installtv\n", "/root/USB_MOUNT/debs/installTV \n"}) {
-        platform::reset();
-        ok = false;
-        EXPECT_FALSE(check(exits(0, listing)));
-        EXPECT_TRUE(ok);
-        EXPECT_EQ(lastMessages(), "Running command: ls /root/USB_MOUNT/debs/installTV|Exit code:0|"
-                                  "Teamviewer path/root/USB_MOUNT/debs/installTV|No need to install Teamviewer|");
-    }
+    EXPECT_FALSE(check(exits(0, value())));
+    EXPECT_TRUE(ok);
+    EXPECT_EQ(lastMessages(), "Running command: ls /root/USB_MOUNT/debs/installTV|Exit code:0|"
+                              "Teamviewer path/root/USB_MOUNT/debs/installTV|No need to install Teamviewer|");
 }
 
 TEST_F(CheckTVUpdate, MissingMarkerRequestsNothing)
@@ -69,21 +71,23 @@ TEST_F(CheckTVUpdate, MissingMarkerRequestsNothing)
                               "install Teamviewer flag doesnot exist|");
 }
 
-TEST_F(CheckTVUpdate, AnyOtherExitCodeCannotBeTrusted)
+class OtherExit : public CheckTVUpdate, public testing::WithParamInterface<int>
 {
-    for (const int code : {1, 3, 100, 127, 255}) {
-        platform::reset();
-        ok = true;
-        EXPECT_FALSE(check(exits(code, std::string(teamViewerMarker) + "\n")));
-        EXPECT_FALSE(ok);
-        EXPECT_EQ(journal().back(), "log:Failed to check if TV install is needed");
-        EXPECT_EQ(entries("log:").size(), 3U);
-    }
+};
+INSTANTIATE_TEST_SUITE_P(Codes, OtherExit, testing::Values(1, 3, 100, 127, 255), testing::PrintToStringParamName());
+
+TEST_P(OtherExit, CannotBeTrusted)
+{
+    ok = true;
+    EXPECT_FALSE(check(exits(GetParam(), std::string(teamViewerMarker) + "\n")));
+    EXPECT_FALSE(ok);
+    EXPECT_EQ(journal().back(), "log:Failed to check if TV install is needed");
+    EXPECT_EQ(entries("log:").size(), 3U);
 }
 
 TEST_F(CheckTVUpdate, ShellThatDoesNotStartRequestsNothing)
 {
-    EXPECT_FALSE(check({0, "", false, {}}));
+    EXPECT_FALSE(check(doesNotStart()));
     EXPECT_TRUE(ok);
     EXPECT_EQ(lastMessages(), "Running command: ls /root/USB_MOUNT/debs/installTV|"
                               "Teamviewer path/root/USB_MOUNT/debs/installTV|No need to install Teamviewer|");
@@ -93,17 +97,17 @@ class InstallTVUpdate : public UnitTest
 {
 };
 
-TEST_F(InstallTVUpdate, RawStatusIsLoggedAndNeverAFailure)
+using TeamViewerStatus = With<InstallTVUpdate>;
+INSTANTIATE_TEST_SUITE_P(Success, TeamViewerStatus, testing::Values(Named<int>{"Exit0", 0}), nameOf<Named<int>>);
+INSTANTIATE_TEST_SUITE_P(Failures, TeamViewerStatus, testing::ValuesIn(failedStatuses), nameOf<Named<int>>);
+
+TEST_P(TeamViewerStatus, IsLoggedAndNeverAFailure)
 {
-    for (const int status : {0, 5 * 256, 127 * 256, 9, -1}) {
-        platform::reset();
-        script(teamViewerScriptCommand, {raw(status)});
-        EXPECT_TRUE(UpdateManager::installTVUpdate());
-        EXPECT_EQ(journal(), (Lines{"log:", "log:/root/RESOURCES/teamviewer_updatescript.sh",
-                                    "system:/root/RESOURCES/teamviewer_updatescript.sh",
-                                    "log:Install script ended with code: " + std::to_string(status)}));
-        EXPECT_EQ(platform::records().back().function, "static bool UpdateManager::installTVUpdate()");
-    }
+    script(teamViewerScriptCommand, {raw(value())});
+    EXPECT_TRUE(UpdateManager::installTVUpdate());
+    EXPECT_EQ(journal(), (Lines{"log:", "log:/root/RESOURCES/teamviewer_updatescript.sh",
+                                "system:/root/RESOURCES/teamviewer_updatescript.sh",
+                                "log:Install script ended with code: " + std::to_string(value())}));
 }
 
 } // namespace

@@ -4,8 +4,10 @@
 #include "Platform.h"
 #include "UpdateManager.h"
 
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <ostream>
 #include <string>
 
 /// A test with a fresh journal, whose engine reports into it as notes.
@@ -17,6 +19,42 @@ protected:
     /// Registers the callbacks that note the reports, and forgets the record of the registration.
     static void registerCallbacks();
 };
+
+/// A value of a parameterised test, and its name there.
+template <typename Value>
+struct Named
+{
+    const char* name;
+    Value value;
+};
+
+template <typename Value>
+void PrintTo(const Named<Value>& named, std::ostream* stream)
+{
+    *stream << named.name;
+}
+
+/// A fixture whose tests run once for each of some named values.
+template <typename Fixture, typename Value = int>
+class With : public Fixture, public testing::WithParamInterface<Named<Value>>
+{
+protected:
+    static const Value& value() { return testing::WithParamInterface<Named<Value>>::GetParam().value; }
+};
+
+/// The name of a test's parameter, which is a row of a table.
+template <typename Row>
+std::string nameOf(const testing::TestParamInfo<Row>& info)
+{
+    return info.param.name;
+}
+
+/// Raw wait statuses that are not 0.
+const Named<int> failedStatuses[] = {{"NoProcess", -1}, {"Signal1", 1},     {"Signal9", 9},
+                                     {"Exit1", 256},    {"Exit5", 5 * 256}, {"Exit255", 255 * 256}};
+
+/// Exit codes of a command that are neither success nor apt's 100.
+const Named<int> otherCodes[] = {{"1", 1}, {"99", 99}, {"101", 101}, {"255", 255}};
 
 /// For a test whose EXPECT_EXIT must run in a process that has not started anything yet.
 #ifdef EMULATED // QEMU's user emulation cannot start the program once more

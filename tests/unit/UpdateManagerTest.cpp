@@ -6,6 +6,7 @@
 #include <cstddef>
 #include <cstdlib>
 #include <iostream>
+#include <tuple>
 
 namespace
 {
@@ -65,23 +66,6 @@ TEST_F(Manager, ReportsHaveTheirNumbers)
               (Lines{"0", "1", "2"}));
 }
 
-TEST_F(Manager, CallbacksAreValidWhenNoneIsNull)
-{
-    for (const bool result : {false, true}) {
-        for (const bool error : {false, true}) {
-            for (const bool found : {false, true}) {
-                manager->setCallbacks(result ? noteResult : nullptr, error ? noteError : nullptr,
-                                      found ? noteUpdateFound : nullptr);
-                EXPECT_EQ(manager->validateCallbacks(), result && error && found);
-            }
-        }
-    }
-    EXPECT_EQ(platform::records().at(0).message, "");
-    EXPECT_EQ(platform::records().at(0).function,
-              "void UpdateManager::setCallbacks(UpdateManager::ResultCallback, UpdateManager::ErrorCallback, "
-              "UpdateManager::UpdateFoundCallback)");
-}
-
 TEST_F(Manager, RemoteHeadRunsOnTheCallersThread)
 {
     scriptPackage(policyCommand, "1.2.0", "1.2.0");
@@ -109,19 +93,6 @@ TEST_F(Manager, RemoteHeadRunsOnTheCallersThread)
                 {"log:", "log:Giving users 30 Secs to view Pass/Fail LED status before completing update", "sleep:30"},
                 harlStarted()}));
     EXPECT_EQ(journal(std::this_thread::get_id()), journal());
-}
-
-TEST_F(Manager, EntryOperationsAreNamedInTheLog)
-{
-    manager->init(true);
-    EXPECT_EQ(platform::records().at(0).function, "void UpdateManager::init(bool)");
-    platform::reset();
-    manager->update({}, true);
-    EXPECT_EQ(platform::records().at(0).function,
-              "void UpdateManager::update(std::vector<UpdateManager::UpdateComponent>, bool)");
-    platform::reset();
-    manager->deinit(true);
-    EXPECT_EQ(platform::records().at(0).function, "void UpdateManager::deinit(bool)");
 }
 
 std::vector<UpdateManager::UpdateComponent> offered;
@@ -250,16 +221,24 @@ TEST_F(Manager, UpdateOfTheMainHeadWithoutACheckInstallsAtOnce)
         testing::ExitedWithCode(0), "");
 }
 
-/// Calls an entry operation with one of the three callbacks missing.
-class MissingCallback : public testing::TestWithParam<int>
+using Callbacks =
+    std::tuple<UpdateManager::ResultCallback, UpdateManager::ErrorCallback, UpdateManager::UpdateFoundCallback>;
+
+TEST_F(Manager, CallbacksAreValidWhenNoneIsMissing)
+{
+    manager->setCallbacks(noteResult, noteError, noteUpdateFound);
+    EXPECT_TRUE(manager->validateCallbacks());
+    EXPECT_EQ(journal(), entry);
+}
+
+/// Calls an operation with one of the three callbacks missing, or more.
+class MissingCallback : public With<UnitTest, Callbacks>
 {
 protected:
     void SetUp() override
     {
         platform::reset();
-        UpdateManager::instance()->setCallbacks(GetParam() == 0 ? nullptr : noteResult,
-                                                GetParam() == 1 ? nullptr : noteError,
-                                                GetParam() == 2 ? nullptr : noteUpdateFound);
+        std::apply([](auto... callbacks) { UpdateManager::instance()->setCallbacks(callbacks...); }, value());
         platform::afterRecord([] { std::cerr << "entered"; });
     }
 
@@ -274,6 +253,11 @@ protected:
         return text;
     }
 };
+
+TEST_P(MissingCallback, MakesThemInvalid)
+{
+    EXPECT_FALSE(UpdateManager::instance()->validateCallbacks());
+}
 
 TEST_P(MissingCallback, AbortsInit)
 {
@@ -299,6 +283,15 @@ TEST_P(MissingCallback, AbortsDeinit)
     }
 }
 
-INSTANTIATE_TEST_SUITE_P(Each, MissingCallback, testing::Values(0, 1, 2));
+const Named<Callbacks> missing[] = {
+    {"Result", {nullptr, noteError, noteUpdateFound}},
+    {"Error", {noteResult, nullptr, noteUpdateFound}},
+    {"UpdateFound", {noteResult, noteError, nullptr}},
+    {"OnlyResult", {noteResult, nullptr, nullptr}},
+    {"OnlyError", {nullptr, noteError, nullptr}},
+    {"OnlyUpdateFound", {nullptr, nullptr, noteUpdateFound}},
+    {"All", {nullptr, nullptr, nullptr}},
+};
+INSTANTIATE_TEST_SUITE_P(Callbacks, MissingCallback, testing::ValuesIn(missing), nameOf<Named<Callbacks>>);
 
 } // namespace

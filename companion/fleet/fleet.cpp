@@ -4,25 +4,17 @@
 #include "log/text.h"
 
 #include <algorithm>
-#include <array>
 
-namespace
-{
-
-struct StateFacts
-{
-    const char* name;
-    const char* title;
-};
-
-// In the order of UnitState.
-const std::array<StateFacts, unitStates> stateTable = {{
+const std::array<StateName, 5> stateNames = {{
     {"well", "Well"},
     {"not-well", "Passed but not well"},
     {"never-ended", "Began and never ended"},
     {"failed", "Failed"},
     {"not-seen", "Not seen"},
 }};
+
+namespace
+{
 
 UnitState stateOf(const Run& run)
 {
@@ -58,16 +50,6 @@ bool isSameRun(const FleetRun& first, const FleetRun& second)
 }
 
 } // namespace
-
-const char* stateName(UnitState state)
-{
-    return stateTable.at(static_cast<std::size_t>(state)).name;
-}
-
-const char* stateTitle(UnitState state)
-{
-    return stateTable.at(static_cast<std::size_t>(state)).title;
-}
 
 void Fleet::add(const std::string& machine, const std::string& name, const Run& run, std::uint64_t boot)
 {

@@ -2,6 +2,7 @@
 
 #include "log/run.h"
 
+#include <array>
 #include <cstdint>
 #include <map>
 #include <mutex>
@@ -17,13 +18,19 @@ enum class UnitState {
     FAILED,
     NOT_SEEN, ///< The unit has not run since the date that was asked for.
 };
-const std::size_t unitStates = static_cast<std::size_t>(UnitState::NOT_SEEN) + 1;
+/// A state's name for programs, such as "never-ended", and for people: "Began and never ended".
+struct StateName
+{
+    const char* name;
+    const char* title;
+};
 
-/// Name of a state for programs, such as "never-ended".
-const char* stateName(UnitState state);
+extern const std::array<StateName, 5> stateNames; ///< in the order of UnitState
 
-/// "Failed", "Began and never ended".
-const char* stateTitle(UnitState state);
+inline const StateName& nameOf(UnitState state)
+{
+    return stateNames.at(static_cast<std::size_t>(state));
+}
 
 /// What a fleet keeps of a run. The texts are the Fleet's own.
 struct FleetRun

@@ -12,8 +12,9 @@
 
 #include <algorithm>
 #include <ctime>
+#include <iomanip>
+#include <map>
 #include <ostream>
-#include <set>
 #include <sstream>
 
 #include <nlohmann/json.hpp>
@@ -23,6 +24,8 @@ namespace
 
 using Json = nlohmann::ordered_json;
 using Units = std::vector<const FleetUnit*>;
+using Counts = std::map<std::string, std::size_t>;
+using RunCounts = std::map<std::string, Counts>; // "runs", and "units" whose last one they were
 
 const std::int64_t day = 86400;         // s
 const std::int64_t mostPeriods = 31;    // in the page's bars
@@ -86,7 +89,7 @@ Json unitToJson(const FleetUnit& unit)
     }
     return {{"unit", unit.name},
             {"machine", orNull(unit.machine)},
-            {"state", stateName(unit.state)},
+            {"state", nameOf(unit.state).name},
             {"last_run", isoText(run.begin)},
             {"outcome", outcomeName(run.outcome)},
             {"meaning", *run.meaning},
@@ -98,62 +101,50 @@ Json unitToJson(const FleetUnit& unit)
             {"runs", unit.runs.size()}};
 }
 
-void addOne(Json& count)
-{
-    count = count.is_null() ? 1 : count.get<int>() + 1;
-}
-
-/// Counts a run, and its unit if it is the unit's last one.
-void addRun(Json& counts, const std::string& name, bool last)
-{
-    Json& count = counts[name];
-    count = count.is_null() ? Json{{"units", 0}, {"runs", 0}} : count;
-    count["units"] = count["units"].get<int>() + (last ? 1 : 0);
-    addOne(count["runs"]);
-}
-
 /// Failures with their remedies, those of the most units first.
-Json failuresOf(const Json& counts)
+Json failuresOf(RunCounts& counts)
 {
     static const Values values = valuesOf(Run(), nullptr, {});
     Json failures = Json::array();
-    for (const auto& [name, count] : counts.items()) {
+    for (auto& [name, count] : counts) {
         failures.push_back({{"name", name},
                             {"units", count["units"]},
                             {"runs", count["runs"]},
                             {"remedy", filled(findFailure(name)->remedy, values)}});
     }
-    std::sort(failures.begin(), failures.end(), [](const Json& first, const Json& second) {
-        return std::tuple(second["units"], second["runs"], first["name"]) <
-               std::tuple(first["units"], first["runs"], second["name"]);
+    std::stable_sort(failures.begin(), failures.end(), [](const Json& first, const Json& second) {
+        return std::pair(second["units"], second["runs"]) < std::pair(first["units"], first["runs"]);
     });
     return failures;
 }
 
-Json sorted(const Json& counts)
-{
-    return nlohmann::json(counts);
-}
-
-/// Periods of whole days from the first run to the last one, without runs yet.
-Json periodsOf(const Units& units)
+/// The runs in periods of whole days, from the first one to the last.
+Json periodsOf(const std::vector<const FleetRun*>& runs)
 {
     std::int64_t first = INT64_MAX;
     std::int64_t last = 0;
-    for (const FleetUnit* unit : units) {
-        for (const FleetRun& run : unit->runs) {
-            first = run.begin < oldest || unit->state == UnitState::NOT_SEEN ? first : std::min(first, run.begin);
-            last = std::max(last, run.begin);
-        }
+    for (const FleetRun* run : runs) {
+        first = run->begin < oldest ? first : std::min(first, run->begin / day * day);
+        last = std::max(last, run->begin);
     }
     Json periods = Json::array();
-    const std::int64_t length = ((last - first / day * day) / day / mostPeriods + 1) * day;
-    for (std::int64_t from = first / day * day; from <= last; from += length) {
+    const std::int64_t length = ((last - first) / day / mostPeriods + 1) * day;
+    for (std::int64_t from = first; from <= last; from += length) {
+        std::size_t count = 0;
+        Counts outcomes;
+        Counts packages;
+        for (const FleetRun* run : runs) {
+            if (run->begin >= from && run->begin < from + length) {
+                ++count;
+                ++outcomes[outcomeName(run->outcome)];
+                ++packages[run->package->empty() ? unknown : *run->package];
+            }
+        }
         periods.push_back({{"from", isoText(from).substr(0, 10)},
                            {"days", length / day},
-                           {"runs", 0},
-                           {"outcomes", Json::object()},
-                           {"packages", Json::object()}});
+                           {"runs", count},
+                           {"outcomes", outcomes},
+                           {"packages", packages}});
     }
     return periods;
 }
@@ -161,69 +152,106 @@ Json periodsOf(const Units& units)
 /// What the fleet's runs come to, for programs.
 Json factsOf(const Fleet& fleet, const Units& units, const std::vector<Unread>& unread)
 {
-    Json facts = {{"command", "fleet"}, {"version", jsonVersion}, {"status", 0}, {"units", units.size()}, {"runs", 0}};
-    for (std::size_t state = 0; state < unitStates; ++state) {
-        facts["states"][stateName(static_cast<UnitState>(state))] = 0;
+    Json states;
+    for (const StateName& state : stateNames) {
+        states[state.name] = std::count_if(units.begin(), units.end(),
+                                           [&](const FleetUnit* unit) { return &nameOf(unit->state) == &state; });
     }
-    Json outcomes = Json::object();
-    Json packages = Json::object();
-    Json boards = Json::object();
-    Json failures = Json::object();
-    Json besides = Json::object();
-    Json periods = periodsOf(units);
-    const std::int64_t first = periods.empty() ? noTime : timeOf(periods[0]["from"]);
+    Counts packages;
+    Counts boards;
+    RunCounts outcomes;
+    RunCounts failures;
+    RunCounts besides;
+    std::vector<const FleetRun*> runs;
     for (const FleetUnit* unit : units) {
-        const std::string package = packageOf(unit->last().mainHead) + ' ' + *unit->package;
-        addOne(facts["states"][stateName(unit->state)]);
-        addOne(packages[unit->package->empty() ? unknown : package]);
-        addOne(boards[unit->board->empty() ? unknown : *unit->board]);
+        ++packages[unit->package->empty() ? unknown : packageOf(unit->last().mainHead) + ' ' + *unit->package];
+        ++boards[unit->board->empty() ? unknown : *unit->board];
+        if (unit->state == UnitState::NOT_SEEN) {
+            continue;
+        }
         for (const FleetRun& run : unit->runs) {
-            const bool last = &run == &unit->last();
-            if (unit->state == UnitState::NOT_SEEN) {
-                continue;
-            }
-            addOne(facts["runs"]);
-            addRun(outcomes, outcomeName(run.outcome), last);
+            const auto add = [last = &run == &unit->last()](RunCounts& counts, const std::string& name) {
+                counts[name]["units"] += last ? 1 : 0;
+                ++counts[name]["runs"];
+            };
+            runs.push_back(&run);
+            add(outcomes, outcomeName(run.outcome));
             if (run.failure != nullptr) {
-                addRun(failures, run.failure->name, last);
+                add(failures, run.failure->name);
             }
             for (const Failure* failure : run.besides) {
-                addRun(besides, failure->name, last);
-            }
-            if (run.begin >= oldest) {
-                const std::int64_t length = periods[0]["days"].get<std::int64_t>() * day;
-                Json& period = periods[static_cast<std::size_t>((run.begin - first) / length)];
-                addOne(period["runs"]);
-                addOne(period["outcomes"][outcomeName(run.outcome)]);
-                addOne(period["packages"][run.package->empty() ? unknown : *run.package]);
+                add(besides, failure->name);
             }
         }
     }
-    facts.update({{"outcomes", sorted(outcomes)},
-                  {"packages", sorted(packages)},
-                  {"boards", sorted(boards)},
+    const bool well = states["well"] == units.size();
+    Json facts = {{"command", "fleet"},
+                  {"version", jsonVersion},
+                  {"status", !unread.empty() ? Report::STATUS_UNCHECKED
+                             : well          ? Report::STATUS_FIT
+                                             : Report::STATUS_NOT_FIT},
+                  {"units", units.size()},
+                  {"runs", runs.size()},
+                  {"states", states},
+                  {"outcomes", outcomes},
+                  {"packages", packages},
+                  {"boards", boards},
                   {"failures", failuresOf(failures)},
                   {"besides", failuresOf(besides)},
-                  {"periods", periods},
+                  {"periods", periodsOf(runs)},
                   {"repeated_lines", fleet.repeatedLines()},
                   {"repeated_runs", fleet.repeatedRuns()},
-                  {"unread", Json::array()}});
+                  {"unread", Json::array()}};
     for (const Unread& input : unread) {
         facts["unread"].push_back({{"input", input.source}, {"why", input.why}});
     }
-    const bool well = facts["states"]["well"] == units.size();
-    facts["status"] = !unread.empty() ? Report::STATUS_UNCHECKED : well ? Report::STATUS_FIT : Report::STATUS_NOT_FIT;
     return facts;
 }
 
 // For people
 
-/// A line of a table with one or two counts.
-void printRow(const std::string& name, const std::vector<std::string>& counts, std::ostream& out)
+/// The facts as tables: names with their counts, and with what to do.
+Json tablesOf(const Json& facts, const std::string& since)
 {
-    out << name << std::string(60 - std::min<std::size_t>(60, name.size()), ' ');
-    for (const std::string& count : counts) {
-        out << std::string(8 - std::min<std::size_t>(8, count.size()), ' ') << count;
+    Json states = Json::array();
+    for (const auto& [name, title] : stateNames) {
+        states.push_back({{"name", title}, {"style", name}, {"counts", {text(facts["states"][name])}}});
+    }
+    if (since.empty()) {
+        states.erase(states.size() - 1);
+    } else {
+        states.back()["name"] = "Not seen since " + since;
+    }
+    Json tables = {{{"title", "State after the last run"}, {"heads", {"Units"}}, {"rows", states}}};
+    for (const auto& [title, key] : {std::pair("Outcome", "outcomes"),
+                                     {"Package", "packages"},
+                                     {"Board", "boards"},
+                                     {"What failed", "failures"},
+                                     {"Also", "besides"}}) {
+        Json table = {{"title", title}, {"heads", {"Units"}}, {"rows", Json::array()}};
+        for (const auto& [name, count] : facts[key].items()) {
+            Json row = {{"name", name}, {"counts", {text(count)}}};
+            if (count.is_object()) {
+                table["heads"] = {"Units", "Runs"};
+                row = {{"name", count.value("name", name)},
+                       {"counts", {text(count["units"]), text(count["runs"])}},
+                       {"remedy", count.value("remedy", "")}};
+            }
+            table["rows"].push_back(row);
+        }
+        if (!table["rows"].empty()) {
+            tables.push_back(table);
+        }
+    }
+    return tables;
+}
+
+/// A line of a table.
+void printRow(const std::string& name, const Json& counts, std::ostream& out)
+{
+    out << std::left << std::setw(60) << name << std::right;
+    for (const Json& count : counts) {
+        out << std::setw(8) << text(count);
     }
     out << '\n';
 }
@@ -235,32 +263,14 @@ void printFacts(const Json& facts, const std::string& since, std::ostream& out)
         out << "Dropped because they came twice: " << counted(facts["repeated_lines"], "line") << ", "
             << counted(facts["repeated_runs"], "run") << '\n';
     }
-    out << '\n';
-    printRow("State after the last run", {"Units"}, out);
-    for (std::size_t state = 0; state < unitStates; ++state) {
-        const bool notSeen = static_cast<UnitState>(state) == UnitState::NOT_SEEN;
-        if (!notSeen || !since.empty()) {
-            printRow("  " + std::string(stateTitle(static_cast<UnitState>(state))) + (notSeen ? " since " + since : ""),
-                     {text(facts["states"][stateName(static_cast<UnitState>(state))])}, out);
-        }
-    }
-    for (const auto& [title, key] : {std::pair("Outcome", "outcomes"), {"Package", "packages"}, {"Board", "boards"}}) {
+    for (const Json& table : tablesOf(facts, since)) {
         out << '\n';
-        const bool runs = facts[key] == facts["outcomes"];
-        printRow(title, runs ? std::vector<std::string>{"Units", "Runs"} : std::vector<std::string>{"Units"}, out);
-        for (const auto& [name, count] : facts[key].items()) {
-            printRow("  " + name,
-                     runs ? std::vector{text(count["units"]), text(count["runs"])} : std::vector{text(count)}, out);
-        }
-    }
-    for (const auto& [title, key] : {std::pair("What failed", "failures"), {"Also", "besides"}}) {
-        if (!facts[key].empty()) {
-            out << '\n';
-            printRow(title, {"Units", "Runs"}, out);
-        }
-        for (const Json& failure : facts[key]) {
-            printRow("  " + text(failure["name"]), {text(failure["units"]), text(failure["runs"])}, out);
-            printText("    Do now: \t" + text(failure["remedy"]) + '\n', out);
+        printRow(table["title"], table["heads"], out);
+        for (const Json& row : table["rows"]) {
+            printRow("  " + text(row["name"]), row["counts"], out);
+            if (const std::string remedy = row.value("remedy", ""); !remedy.empty()) {
+                printText("    Do now: \t" + remedy + '\n', out);
+            }
         }
     }
 }
@@ -308,74 +318,55 @@ void printCsv(const Units& units, std::ostream& out)
 
 // The page
 
-/// The pieces of a bar, or of its legend.
-///
-/// @param style  of a piece, before its number; empty: its name
-Json piecesOf(const Json& counts, const std::vector<std::string>& names, const std::string& style)
+/// The runs of each period as a bar, with a legend.
+Json chartOf(const char* title, const Json& periods, const char* kind)
 {
-    Json pieces = Json::array();
-    for (std::size_t index = 0; index < names.size(); ++index) {
-        if (const auto count = counts.find(names[index]); count != counts.end()) {
-            const std::string color = style.empty() ? names[index] : style + std::to_string(index % colors);
-            pieces.push_back({{"name", names[index]}, {"style", color}, {"count", *count}});
-        }
-    }
-    return pieces;
-}
-
-/// The runs of each period as a bar.
-Json chartOf(const char* title, const Json& periods, const char* kind, const std::string& style)
-{
+    Counts all;
     int most = 1;
-    Json all = Json::object();
     for (const Json& period : periods) {
         most = std::max(most, period["runs"].get<int>());
-        all.update(period[kind]);
+        all.merge(period[kind].get<Counts>());
     }
-    std::vector<std::string> names; // in their order in a bar
-    for (std::size_t outcome = 0; style.empty() && outcome <= static_cast<std::size_t>(Outcome::BOARD_FAILED);
-         ++outcome) {
-        names.emplace_back(outcomeName(static_cast<Outcome>(outcome)));
+    Json legend = Json::array(); // outcomes in their own order, versions in that of the alphabet
+    for (int outcome = 0; outcome <= static_cast<int>(Outcome::BOARD_FAILED); ++outcome) {
+        const char* name = outcomeName(static_cast<Outcome>(outcome));
+        if (all.erase(name) > 0) {
+            legend.push_back({{"name", name}, {"style", name}});
+        }
     }
-    const Json versions = sorted(style.empty() ? Json::object() : all);
-    for (const auto& [name, count] : versions.items()) {
-        names.push_back(name);
+    for (const auto& [name, count] : all) {
+        legend.push_back({{"name", name}, {"style", "version" + std::to_string(legend.size() % colors)}});
     }
     Json bars = Json::array();
     for (const Json& period : periods) {
+        Json pieces = Json::array();
+        for (Json piece : legend) {
+            piece["count"] = period[kind].value(piece["name"].get<std::string>(), 0);
+            if (piece["count"] > 0) {
+                pieces.push_back(piece);
+            }
+        }
         bars.push_back({{"from", period["from"]},
                         {"runs", period["runs"]},
                         {"width", 100 * period["runs"].get<int>() / most},
-                        {"pieces", piecesOf(period[kind], names, style)}});
+                        {"pieces", pieces}});
     }
-    return {{"title", title}, {"legend", piecesOf(all, names, style)}, {"bars", bars}};
+    return {{"title", title}, {"legend", legend}, {"bars", bars}};
 }
 
-void writePage(const Json& facts, const Units& units, std::ostream& out)
+void writePage(const Json& facts, const Units& units, const std::string& since, std::ostream& out)
 {
-    Json head = {{"title", counted(facts["units"], "unit") + ", " + counted(facts["runs"], "run")},
-                 {"unread", facts["unread"]}};
-    for (std::size_t state = 0; state < unitStates; ++state) {
-        const char* name = stateName(static_cast<UnitState>(state));
-        head["states"].push_back(
-            {{"name", stateTitle(static_cast<UnitState>(state))}, {"style", name}, {"count", facts["states"][name]}});
-    }
-    for (const auto& [title, key] : {std::pair("Package", "packages"), {"Board", "boards"}}) {
-        Json rows = Json::array();
-        for (const auto& [name, count] : facts[key].items()) {
-            rows.push_back({{"name", name}, {"count", count}});
-        }
-        head["versions"].push_back({{"title", title}, {"rows", rows}});
-    }
-    for (const auto& [title, key] : {std::pair("What failed", "failures"), {"Also", "besides"}}) {
-        head["problems"].push_back({{"title", title}, {"rows", facts[key]}});
-    }
-    head["charts"] = {chartOf("Outcomes", facts["periods"], "outcomes", ""),
-                      chartOf("Package after the run", facts["periods"], "packages", "version")};
-    renderPart(embeddedFleetPage, "begin", head, out);
+    renderPart(embeddedFleetPage, "begin",
+               {{"title", counted(facts["units"], "unit") + ", " + counted(facts["runs"], "run")},
+                {"tables", tablesOf(facts, since)},
+                {"charts",
+                 {chartOf("Outcomes", facts["periods"], "outcomes"),
+                  chartOf("Package after the run", facts["periods"], "packages")}},
+                {"unread", facts["unread"]}},
+               out);
     for (const FleetUnit* unit : units) {
         Json row = unitToJson(*unit);
-        row["title"] = stateTitle(unit->state);
+        row["title"] = nameOf(unit->state).title;
         row["also"] = joined(row["besides"]);
         renderPart(embeddedFleetPage, "unit", row, out);
     }
@@ -426,7 +417,7 @@ int runFleet(const FleetOptions& options, std::ostream& out, std::ostream& err)
     std::stringstream page;
     std::string wrong;
     if (!options.htmlFile.empty()) {
-        writePage(facts, units, page);
+        writePage(facts, units, options.since, page);
         wrong = writeFile(options.htmlFile, page);
     }
     if (!wrong.empty()) {

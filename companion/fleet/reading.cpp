@@ -9,7 +9,7 @@
 #include <array>
 #include <atomic>
 #include <cerrno>
-#include <charconv>
+#include <cstdlib>
 #include <cstring>
 #include <filesystem>
 #include <fstream>
@@ -18,6 +18,7 @@
 #include <thread>
 #include <unordered_map>
 
+#include <endian.h>
 #include <unistd.h>
 
 namespace
@@ -26,7 +27,6 @@ namespace
 namespace fs = std::filesystem;
 
 const std::size_t blockSize = std::size_t{256} * 1024; // bytes
-const std::size_t mostBoots = 64;                      // of a machine, whose place in the journal is kept
 
 enum class Kind { TEXT, JOURNAL, ARCHIVE };
 
@@ -64,21 +64,21 @@ std::vector<Input> inputsOf(const std::vector<std::string>& paths, std::vector<U
     std::vector<Input> inputs;
     for (const std::string& path : paths) {
         std::error_code error;
-        if (!fs::is_directory(path, error)) {
-            addFile(path, inputs);
-            continue;
-        }
         std::vector<std::string> files;
-        fs::recursive_directory_iterator file(path, error);
-        for (; !error && file != fs::recursive_directory_iterator(); file.increment(error)) {
-            if (file->is_regular_file(error)) {
-                files.push_back(file->path());
+        if (fs::is_directory(path, error)) {
+            fs::recursive_directory_iterator file(path, error);
+            for (; !error && file != fs::recursive_directory_iterator(); file.increment(error)) {
+                if (file->is_regular_file(error)) {
+                    files.push_back(file->path());
+                }
             }
+            if (error) {
+                unread.push_back({escaped(path), error.message()});
+            }
+            std::sort(files.begin(), files.end());
+        } else {
+            files.push_back(path);
         }
-        if (error) {
-            unread.push_back({escaped(path), error.message()});
-        }
-        std::sort(files.begin(), files.end());
         for (const std::string& found : files) {
             addFile(found, inputs);
         }
@@ -86,18 +86,9 @@ std::vector<Input> inputsOf(const std::vector<std::string>& paths, std::vector<U
     return inputs;
 }
 
-template <typename Number>
-Number numberIn(const std::string& text, int base = 10)
-{
-    Number number = 0;
-    std::from_chars(text.data(), text.data() + text.size(), number, base);
-    return number;
-}
-
-/// How far a machine's journal has been read, by the clock that only goes forward.
+/// How far the journal of a machine's boot has been read, by the clock that only goes forward.
 struct Place
 {
-    std::uint64_t boot = 0;
     std::uint64_t time = 0;  ///< us since the boot, of the latest entry
     std::uint64_t count = 0; ///< entries with this time
     std::uint64_t again = 0; ///< of them, how many came since the entries last went back
@@ -119,9 +110,8 @@ public:
     /// Notes where an entry comes from, before its text is read. False when it came before.
     bool enter(const JournalEntry& entry)
     {
-        const auto boot = numberIn<std::uint64_t>(entry.boot.substr(0, 16), 16) ^
-                          numberIn<std::uint64_t>(entry.boot.substr(std::min<std::size_t>(16, entry.boot.size())), 16);
-        if (!isNew(boot, numberIn<std::uint64_t>(entry.monotonic))) {
+        const std::uint64_t boot = entry.boot.empty() ? 0 : std::hash<std::string>()(entry.boot);
+        if (!isNew(mPlaces[boot], std::strtoull(entry.monotonic.c_str(), nullptr, 10))) {
             mFleet.addRepeats(1);
             return false;
         }
@@ -130,7 +120,7 @@ public:
             mBegan = mTime;
             mBootOfRun = mBoot;
         }
-        mTime = numberIn<std::int64_t>(entry.realtime) / 1000000;
+        mTime = std::strtoll(entry.realtime.c_str(), nullptr, 10) / 1000000;
         mBoot = boot;
         mName = entry.host.empty() ? mName : escaped(entry.host);
         return true;
@@ -143,24 +133,15 @@ public:
     }
 
 private:
-    bool isNew(std::uint64_t boot, std::uint64_t time)
+    static bool isNew(Place& place, std::uint64_t time)
     {
-        auto place = std::find_if(mPlaces.rbegin(), mPlaces.rend(), [&](const Place& one) { return one.boot == boot; });
-        if (place == mPlaces.rend()) {
-            mPlaces.erase(mPlaces.begin(), mPlaces.begin() + (mPlaces.size() < mostBoots ? 0 : 1));
-            mPlaces.push_back({boot, time, 1, 1});
-            return true;
-        }
-        if (time < place->time) {
-            place->again = 0;
+        if (time < place.time) {
+            place.again = 0;
             return false;
         }
-        if (time > place->time) {
-            *place = {boot, time, 1, 1};
-            return true;
-        }
-        const bool known = place->again++ < place->count;
-        place->count += known ? 0 : 1;
+        place = time > place.time ? Place{time, 0, 0} : place;
+        const bool known = place.again++ < place.count;
+        place.count += known ? 0 : 1;
         return !known;
     }
 
@@ -181,8 +162,8 @@ private:
     std::string mName;
     const bool& mWhole;
     Fleet& mFleet;
-    std::vector<Place> mPlaces;
-    std::int64_t mTime = 0; // of the last entry, s
+    std::unordered_map<std::uint64_t, Place> mPlaces; // of each boot
+    std::int64_t mTime = 0;                           // of the last entry, s
     std::uint64_t mBoot = 0;
     std::uint64_t mNumber = 0; // of the run that the two below belong to
     std::int64_t mBegan = 0;
@@ -206,22 +187,18 @@ public:
     std::string read()
     {
         std::string wrong = open();
-        const bool opened = wrong.empty();
-        std::vector<char> block(opened ? blockSize : 0);
-        ssize_t length = opened ? 1 : 0;
-        while (length > 0) {
-            length = ::read(mSource.descriptor(), block.data(), block.size());
-            if (length < 0 && errno == EINTR) {
-                length = 1;
-                continue;
-            }
-            wrong = length < 0 ? std::strerror(errno) : "";
-            mDress.feed({block.data(), static_cast<std::size_t>(std::max<ssize_t>(length, 0))});
+        if (!wrong.empty()) {
+            return wrong;
         }
+        std::vector<char> block(blockSize);
+        ssize_t length = 0;
+        while ((length = TEMP_FAILURE_RETRY(::read(mSource.descriptor(), block.data(), block.size()))) > 0) {
+            mDress.feed({block.data(), static_cast<std::size_t>(length)});
+        }
+        wrong = length < 0 ? std::strerror(errno) : "";
         mDress.finish();
-        if (opened && wrong.empty()) {
-            wrong = whatIsWrong(mSource.close(true));
-        }
+        const int status = mSource.close(true);
+        wrong = wrong.empty() ? whatIsWrong(status) : wrong;
         mWhole = wrong.empty();
         mOwn.finish();
         for (auto& [machine, log] : mLogs) {
@@ -241,6 +218,7 @@ private:
                                         fs::absolute(mInput.files.front()), "harl-updater-report/[jk]*"},
                                        mInput.name, false);
         }
+        mStated = entriesStated(); // before a receiver adds to them
         std::vector<std::string> arguments = {"journalctl", "--output=export", "--quiet"};
         for (const std::string& file : mInput.files) {
             arguments.push_back("--file=" + fs::absolute(file).string());
@@ -272,7 +250,7 @@ private:
         if (mInput.kind == Kind::ARCHIVE && status != 0) {
             return "not a whole archive of harl-updater-tool report";
         }
-        if (mInput.kind == Kind::JOURNAL && (status != 0 || (mEntries < entriesStated() && !isVerified()))) {
+        if (mInput.kind == Kind::JOURNAL && (status != 0 || (mEntries < mStated && !isVerified()))) {
             return "a journal that is damaged or cut off: journalctl --verify --file=" + escaped(mInput.files.front());
         }
         if (!mDress.undamaged()) {
@@ -295,11 +273,10 @@ private:
     {
         std::uint64_t sum = 0;
         for (const std::string& path : mInput.files) {
-            std::array<unsigned char, 160> header{};
-            std::ifstream(path, std::ios::binary).read(reinterpret_cast<char*>(header.data()), header.size());
-            for (std::size_t byte = 0; byte < 8; ++byte) {
-                sum += std::uint64_t{header[152 + byte]} << (8 * byte);
-            }
+            std::uint64_t entries = 0;
+            std::ifstream file(path, std::ios::binary);
+            file.seekg(152).read(reinterpret_cast<char*>(&entries), sizeof entries);
+            sum += le64toh(entries);
         }
         return sum;
     }
@@ -319,6 +296,7 @@ private:
     Fleet& mFleet;
     bool mWhole = true;
     std::uint64_t mEntries = 0;
+    std::uint64_t mStated = 0;
     UnitLog mOwn; // of a log that names no machine
     std::unordered_map<std::string, std::unique_ptr<UnitLog>> mLogs;
     LogSource mSource;

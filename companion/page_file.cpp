@@ -6,24 +6,22 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <filesystem>
 #include <fstream>
-
-#include <sys/stat.h>
-#include <unistd.h>
 
 std::string objectionTo(const std::string& path, const std::vector<std::string>& read)
 {
-    struct stat page = {};
-    if (lstat(path.c_str(), &page) != 0) {
+    namespace fs = std::filesystem;
+    std::error_code error;
+    const fs::file_status page = fs::symlink_status(path, error);
+    if (error || !fs::exists(page)) {
         return "";
     }
-    if (!S_ISREG(page.st_mode)) {
+    if (!fs::is_regular_file(page)) {
         return "not a plain file; name another one for the page";
     }
     const auto isPage = [&](const std::string& file) {
-        struct stat log = {};
-        const int result = file == "-" ? fstat(STDIN_FILENO, &log) : stat(file.c_str(), &log);
-        return result == 0 && page.st_dev == log.st_dev && page.st_ino == log.st_ino;
+        return fs::equivalent(path, file == "-" ? "/proc/self/fd/0" : file, error);
     };
     const bool same = read.empty() ? isPage("-") : std::any_of(read.begin(), read.end(), isPage);
     return same ? "the log itself; name another file for the page" : "";

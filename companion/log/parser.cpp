@@ -31,17 +31,9 @@ int number(std::string_view text, std::size_t position, std::size_t digits)
     return value;
 }
 
-bool isBlank(char character)
-{
-    return character == ' ' || character == '\t';
-}
-
 std::string_view withoutBlanks(std::string_view text)
 {
-    while (!text.empty() && isBlank(text.front())) {
-        text.remove_prefix(1);
-    }
-    return text;
+    return text.substr(std::min(text.find_first_not_of(" \t"), text.size()));
 }
 
 /// Takes the text up to the next blanks, of which a journal or a copy through a terminal may make more or fewer, off

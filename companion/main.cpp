@@ -11,6 +11,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdio>
 #include <cstring>
 #include <exception>
 #include <iostream>
@@ -276,14 +277,15 @@ int main(int argc, char** argv)
         std::cout.flush();
         return status;
     } catch (const std::ios_base::failure&) {
-        const int error = errno;
-        std::cerr << "harl-updater-tool: the output cannot be written: " << std::strerror(error) << ". "
-                  << (error == EPIPE || error == EBADF ? "Nobody reads it.\n" : "Make room or name another file.\n");
-    } catch (const std::bad_alloc&) {
-        std::cerr << "harl-updater-tool: there is not enough memory. End other programs and try again.\n";
+        const char* advice = errno == EPIPE || errno == EBADF ? "Nobody reads it." : "Make room or name another file.";
+        std::fprintf(stderr, "harl-updater-tool: the output cannot be written: %s. %s\n", std::strerror(errno), advice);
+    } catch (const std::bad_alloc&) { // std::cerr would flush std::cout first
+        std::fputs("harl-updater-tool: there is not enough memory. End other programs and try again.\n", stderr);
     } catch (const std::exception& error) {
-        std::cerr << "harl-updater-tool: internal error: " << error.what()
-                  << ". Report this line with the command to the manufacturer.\n";
+        std::fprintf(stderr,
+                     "harl-updater-tool: internal error: %s. Report this line with the command to the "
+                     "manufacturer.\n",
+                     error.what());
     }
     return Report::STATUS_UNCHECKED;
 }

@@ -149,7 +149,7 @@ class Make(Stick):
         for name in (".unfinished-quorb2.2.0", ".replaced-quorb2.1.0"):
             (self.stick / VERSIONS / name).mkdir(parents=True)
         self.assertIn("[no-version-folder]", said := self.check(status=1))
-        self.assertIn("not written to its end", said)
+        self.assertIn("not written completely", said)
         self.make()
         self.assertEqual(os.listdir(self.stick / VERSIONS), ["quorb2.2.0"])
 

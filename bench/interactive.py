@@ -124,7 +124,7 @@ class Play:
 
     def _update(self) -> str:
         if self._view.runs:
-            return "the updater runs already"
+            return "the updater is already running"
         if not self._view.parts["power"]:
             return "there is no power: p switches it on"
         self._plan()
@@ -137,17 +137,17 @@ class Play:
         if self._hung:
             self._signal(self._hung, signal.SIGCONT)
             self._hung = []
-            return "the command goes on"
+            return "the command continues"
         self._hung = self._command()
         if not self._hung:
-            return "no command runs"
+            return "no command is running"
         self._signal(self._hung, signal.SIGSTOP)
-        return f"{self._name(self._hung)} hangs; h lets it go on"
+        return f"{self._name(self._hung)} hangs; h lets it continue"
 
     def _kill_command(self) -> str:
         processes = self._command()
         if not processes:
-            return "no command runs"
+            return "no command is running"
         name = self._name(processes)
         self._signal(processes, signal.SIGKILL)
         self._hung = []
@@ -156,9 +156,9 @@ class Play:
     def _kill_updater(self) -> str:
         updater = self._unit.updater()
         if not updater:
-            return "the updater does not run"
+            return "the updater is not running"
         self._signal([updater], signal.SIGKILL)
-        return "the updater killed; what it started goes on"
+        return "updater killed; what it started continues"
 
     def _set_speed(self, factor: float) -> str:
         self._view.speed = max(1.0, self._view.speed * factor)
@@ -169,7 +169,7 @@ class Play:
         if not self._view.parts["power"]:
             return "there is no power: p switches it on"
         command, environment = self._unit.shell()
-        self._screen.lend(command, environment, "\nA shell on the head. The update goes on. exit leads back.")
+        self._screen.lend(command, environment, "\nA shell on the head. The update continues. exit returns.")
         return "back from the shell"
 
     def _plan(self) -> None:

@@ -51,7 +51,7 @@ def page(summary: Summary, speed: float, build: Path) -> str:
     ends = [call.end or call.start for call in run.calls] + [moment for moment, _ in run.sent]
     end = max([begin + 0.1, *ends])
     speeded = f"The updater's waits are {shortened(speed)}, commands take their real time." if speed > 1 else ""
-    wrong = "".join(f'<p class="bad">Not as the scenario says: {escape(line)}</p>\n' for line in summary.wrong)
+    wrong = "".join(f'<p class="bad">Not as expected: {escape(line)}</p>\n' for line in summary.wrong)
     rows = "".join(f"<tr><th>{escape(name)}</th><td>{escape(value)}</td></tr>\n" for name, value in summary.rows())
     return frame(
         f"{scenario.name}: {summary.outcome}",

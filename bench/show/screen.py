@@ -161,7 +161,7 @@ class Screen:
             "failed": self._colors.get("fail", 0) | curses.A_REVERSE,
             "runs": self._colors.get("blue", 0) | curses.A_BOLD,
             "expected": 0,
-            "left out": curses.A_DIM,
+            "skipped": curses.A_DIM,
         }
         half = WIDTH // 2
         lines: list[list[Segment]] = [[] for _ in range(STEP_ROWS)]

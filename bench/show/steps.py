@@ -41,7 +41,7 @@ class Row:
 
     title: str
     detail: str
-    kind: str  # "done", "failed", "runs", "expected" or "left out"
+    kind: str  # "done", "failed", "runs", "expected" or "skipped"
     wait: float = 0  # s, that remain
 
 
@@ -87,10 +87,10 @@ def rows(planned: list[str | int], run: Run, moment: float, runs: bool) -> list[
         step = step_of(calls[0])
         if step in rest:
             place = rest.index(step)
-            shown += [Row(TITLES[missed], "left out", "left out") for missed in rest[:place]]
+            shown += [Row(TITLES[missed], "skipped", "skipped") for missed in rest[:place]]
             rest = rest[place + 1 :]
         shown.append(_row(step, calls, moment, runs))
-    remaining = "expected" if runs else "left out"
+    remaining = "expected" if runs else "skipped"
     waits = [step if isinstance(step, int) else 0 for step in rest]
     return shown + [Row(TITLES[step], remaining, remaining, wait) for step, wait in zip(rest, waits)]
 
@@ -98,11 +98,11 @@ def rows(planned: list[str | int], run: Run, moment: float, runs: bool) -> list[
 def headline(shown: list[Row], runs: bool) -> str:
     """Whether the updater runs, and how many of the steps remain."""
     if not runs:
-        left_out = sum(row.kind == "left out" for row in shown)
-        return f"The updater does not run: {left_out} of {len(shown)} steps left out"
+        skipped = sum(row.kind == "skipped" for row in shown)
+        return f"The updater is not running: {skipped} of {len(shown)} steps skipped"
     remaining = sum(row.kind == "expected" for row in shown)
     waits = sum(row.wait for row in shown)
-    return f"The updater runs: {remaining} of {len(shown)} steps remain, with {waits:.0f} s of waits"
+    return f"The updater is running: {remaining} of {len(shown)} steps remain, with {waits:.0f} s of waits"
 
 
 def _row(step: str | int, calls: list[Call], moment: float, runs: bool) -> Row:

@@ -126,12 +126,12 @@ class Keys(Interactive):
         terminal = self.bench("up-to-date", 3000)
         first = self.so_far(terminal, "refresh the mirrors")
         terminal.press("h")
-        terminal.wait_for("hangs; h lets it go on")
+        terminal.wait_for("hangs; h lets it continue")
         self.hold("apt-cache policy *")
         while self.so_far(terminal, "refresh the mirrors") < first + 1:
             pass
         terminal.press("h")
-        terminal.wait_for("the command goes on")
+        terminal.wait_for("the command continues")
         self.so_far(terminal, "compare the package")
         terminal.press("k")
         terminal.wait_for("killed")
@@ -148,13 +148,15 @@ class Keys(Interactive):
         terminal = self.bench("up-to-date")
         terminal.wait_until("refresh the mirrors .* so far")
         terminal.press("u")
-        terminal.wait_for("the updater runs already")
+        terminal.wait_for("the updater is already running")
         terminal.press("x")
-        terminal.wait_until("The updater does not run", "left out", "(signal 9|status 137): the panel shows no outcome")
+        terminal.wait_until("The updater is not running", "skipped", "(signal 9|status 137): the panel shows no")
         self.let_go()
-        for key, word in {"x": "the updater does not run", "h": "no command runs", "k": "no command runs"}.items():
+        for key, what in {"x": "the updater", "h": "no command", "k": "no command"}.items():
+            terminal.press("+")
+            terminal.wait_for("waits are")  # instead of the last answer
             terminal.press(key)
-            terminal.wait_for(word)
+            terminal.wait_until(f"(?m)^{what} is (not )?running *$")
         terminal.press("u")
         terminal.wait_for("nothing to update")
 
@@ -186,7 +188,7 @@ class Keys(Interactive):
         terminal.wait_for("42 answers", "Installed: 1.3.0")
         terminal.press("\x03")  # Ctrl-C is the shell's
         terminal.press("exit\r")
-        terminal.wait_for("back from the shell", "The updater does not run")
+        terminal.wait_for("back from the shell", "The updater is not running")
         terminal.press("s")
         terminal.wait_for("stick: out")
 
@@ -282,7 +284,7 @@ class Terminals(Interactive):
             (0, " up-to-date: "),
             (5, "harl active  updater inactive  stick not mounted  package 1.3.0  board "),
             (6, "power on  stick in  board works  link up  mirrors up  sound on  bus up"),
-            (7, "The updater does not run: 0 of 11 steps left out"),
+            (7, "The updater is not running: 0 of 11 steps skipped"),
             (22, "p power"),
             (23, "u update"),
         ):
@@ -369,7 +371,7 @@ class Stories(Interactive):
         terminal.wait_for("link down")
         shown = terminal.wait_for("try 20 of 20", "the package or the board could not be installed", OUTCOME)
         self.assertRegex(shown, r"upload, try 20 of 20 +\d+\.\d s, exit ")
-        self.assertRegex(shown, r"run the board's script +left out")
+        self.assertRegex(shown, r"run the board's script +skipped")
         self.assertIn("play the fail sound", shown)
         self.assertIn("[F]", shown)
         self.assertIn("harl active", shown)

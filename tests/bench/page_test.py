@@ -121,7 +121,7 @@ class Page(unittest.TestCase):
         self.assertEqual(len(commands), 13)  # that of the sound, and those of the table
         self.assertRegex(commands[3], r"^apt --assume-yes install solvik4-rh: \d+\.\d\d s$")
         self.assertIn("BEFORE UPDATE", elements.texts("pre")[-1])
-        self.assertNotIn("Not as the scenario says", page)
+        self.assertNotIn("Not as expected", page)
 
     @unittest.skipUnless((BUILD / page_module.TOOL).exists(), "without the companion program nothing explains the log")
     def test_explained_as_the_companion_program_does(self) -> None:
@@ -151,7 +151,7 @@ class Page(unittest.TestCase):
         text = (ROOT / "bench/scenarios/up-to-date.toml").read_text()
         file.write_text(text.replace('summary = "', 'summary = "<u>', 1).replace("marker = true", "marker = false"))
         page = written(str(file), self.folder)
-        self.assertIn("Not as the scenario says: marker: expected False, not True", page)
+        self.assertIn("Not as expected: marker: expected False, not True", page)
         self.assertIn("&lt;u&gt;", page)
         self.assertNotIn("<u>", page)
 

@@ -41,7 +41,7 @@ PANELS = {
 def fleet(*arguments: str | Path, folder: Path | None = None, text: str = "") -> subprocess.CompletedProcess[str]:
     """What the command prints."""
     command: list[str | Path] = [TOOL, "fleet", *arguments]
-    return subprocess.run(command, cwd=folder, input=text, capture_output=True, text=True, timeout=60, check=False)
+    return subprocess.run(command, cwd=folder, input=text, capture_output=True, text=True, check=False)
 
 
 def facts(*arguments: str | Path, text: str = "") -> tuple[dict[str, Any], list[dict[str, Any]]]:
@@ -53,13 +53,15 @@ def facts(*arguments: str | Path, text: str = "") -> tuple[dict[str, Any], list[
 class FleetTest(unittest.TestCase):
     """A folder with the exports of some units."""
 
+    units = UNITS
+
     def setUp(self) -> None:
         self.maxDiff = None
         holder = tempfile.TemporaryDirectory(prefix="fleet-test-")
         self.addCleanup(holder.cleanup)
         self.folder = Path(holder.name)
         self.exports = self.folder / "exports"
-        write_exports(self.exports, UNITS)
+        write_exports(self.exports, self.units)
 
     def expect_same(self, *inputs: str | Path, text: str = "", repeats: bool = False) -> None:
         """The inputs say of every unit what its export says."""
@@ -252,6 +254,8 @@ class Inputs(FleetTest):
 @unittest.skipUnless(REMOTE.exists(), "systemd-journal-remote is not installed; tests/run installs it")
 class Journals(FleetTest):
     """Real journals."""
+
+    units = 6
 
     def setUp(self) -> None:
         super().setUp()

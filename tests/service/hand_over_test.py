@@ -415,8 +415,8 @@ class Limits(HandOverTest):
     def test_calls_of_one_tool_have_limits_of_their_own(self) -> None:
         for tool in ("apt", "ssh"):
             self.tool(tool, "exec sleep 60")
-        self.assert_expires("apt update", 6)
-        self.assert_expires('ssh -o ConnectTimeout=2 192.168.9.2 " cat /root/App/AppExe/version.txt"', 3)
+        self.assert_expires("apt update", 12)
+        self.assert_expires('ssh -o ConnectTimeout=2 192.168.9.2 " cat /root/App/AppExe/version.txt"', 6)
         spent = [note.split()[:2] for note in self.notes()]
         self.assertEqual(spent, [["spent", "mirrors"], ["spent", "board-version"]])
 

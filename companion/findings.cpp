@@ -4,6 +4,7 @@
 #include <array>
 #include <cstdio>
 #include <iostream>
+#include <sstream>
 #include <utility>
 
 #include <sys/ioctl.h>
@@ -249,11 +250,10 @@ std::size_t widthOf(const std::ostream& out)
 void printText(std::string_view text, std::ostream& out)
 {
     const std::size_t width = widthOf(out);
-    while (!text.empty()) {
-        const std::size_t length = std::min(text.find('\n'), text.size());
-        printLine(text.substr(0, length), width, out);
-        out << (length < text.size() ? "\n" : "");
-        text.remove_prefix(std::min(length + 1, text.size()));
+    std::istringstream lines{std::string(text)};
+    for (std::string line; std::getline(lines, line);) {
+        printLine(line, width, out);
+        out << (lines.eof() ? "" : "\n");
     }
 }
 

@@ -81,27 +81,26 @@ class Keys(Interactive):
         self.update_after(terminal, "s", "stick: in")
         terminal.wait_for("nothing to update")
 
-    def test_link(self) -> None:
+    def check_part(self, key: str, off: str, on: str, step: str, status: int) -> str:
+        """The key takes a part away, which the step shows, and gives it back; the screen without the part."""
         terminal = self.ended()
-        self.assertRegex(self.update_after(terminal, "l", "link: down"), r"read the board .* exit 255")
-        self.assertRegex(self.update_after(terminal, "l", "link: up"), r"read the board +\d\.\d s(?!,)")
+        without = self.update_after(terminal, key, off)
+        self.assertRegex(without, f"{step} .* exit {status}")
+        self.assertRegex(self.update_after(terminal, key, on), rf"{step} +\d\.\d s(?!,)")
+        return without
+
+    def test_link(self) -> None:
+        self.check_part("l", "link: down", "link: up", "read the board", 255)
 
     def test_board(self) -> None:
-        terminal = self.ended()
-        self.assertRegex(self.update_after(terminal, "b", "board: hangs"), r"read the board .* exit 255")
-        self.assertRegex(self.update_after(terminal, "b", "board: works"), r"read the board +\d\.\d s(?!,)")
+        self.check_part("b", "board: hangs", "board: works", "read the board", 255)
 
     def test_mirrors(self) -> None:
-        terminal = self.ended()
-        shown = self.update_after(terminal, "m", "mirrors: down")
-        self.assertRegex(shown, r"refresh the mirrors .* exit 100")
-        self.assertIn("the mirrors or a version could not be read", shown)
-        self.assertRegex(self.update_after(terminal, "m", "mirrors: up"), r"refresh the mirrors +\d\.\d s(?!,)")
+        without = self.check_part("m", "mirrors: down", "mirrors: up", "refresh the mirrors", 100)
+        self.assertIn("the mirrors or a version could not be read", without)
 
     def test_sound(self) -> None:
-        terminal = self.ended()
-        self.assertRegex(self.update_after(terminal, "a", "sound: off"), r"play the pass sound .* exit 1")
-        self.assertRegex(self.update_after(terminal, "a", "sound: on"), r"play the pass sound +\d\.\d s(?!,)")
+        self.check_part("a", "sound: off", "sound: on", "play the pass sound", 1)
 
     def test_bus(self) -> None:
         terminal = self.ended()

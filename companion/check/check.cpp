@@ -176,10 +176,11 @@ int runCheck(const std::string& path, bool json, const UnitSite& site, std::ostr
 
 int runVerify(const VerifyOptions& options, const UnitSite& site, std::ostream& out)
 {
-    const Unit unit(site);
-    if (options.record && unit.updaterRuns()) {
-        return Report::STATUS_UNCHECKED; // the next run has begun; its end is verified
+    const auto nextRunHasBegun = [&] { return options.record && Unit(site).updaterRuns(); }; // its end is verified
+    if (nextRunHasBegun()) {
+        return Report::STATUS_UNCHECKED;
     }
+    const Unit unit(site);
     Report report("verify", "The unit", "well");
     unit.defineTexts(report);
     checkApplication(unit, report);
@@ -187,10 +188,12 @@ int runVerify(const VerifyOptions& options, const UnitSite& site, std::ostream& 
     checkFiles(unit, report);
     checkConfiguration(unit, report);
     checkVersions(unit, report);
-    if (options.record) {
-        out << recordOf(report) << '\n';
-    } else {
+    if (!options.record) {
         report.write(options.json, out);
+    } else if (nextRunHasBegun()) {
+        return Report::STATUS_UNCHECKED;
+    } else {
+        out << recordOf(report) << '\n';
     }
     return report.status();
 }

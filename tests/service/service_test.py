@@ -163,6 +163,8 @@ class ServiceTest(unittest.TestCase):
         self.inside("systemctl", "start", "harl")
 
     def tearDown(self) -> None:
+        # It would look at the next test's unit.
+        self.unit.status("systemctl", "stop", "harl-updater-verify")
         self.unit.status("umount", "-l", "/root/USB_MOUNT")
         self.unit.status("systemctl", "reset-failed")
 

@@ -141,6 +141,12 @@ TEST_F(Verify, WritesNoRecordWhileTheNextRunGoesOn)
     EXPECT_EQ(record(), "");
 }
 
+TEST_F(Verify, WritesNoRecordWhenTheNextRunBeginsMeanwhile)
+{
+    unit.replaceTool("dpkg", "echo UNIT_UPDATER=activating >>\"${0%/*}/../settings\"");
+    EXPECT_EQ(record(), "");
+}
+
 TEST_F(Verify, ReportHoldsWhatSupportNeedsAndNoLogin)
 {
     unit.replaceTool("tar", "PATH=/bin:/usr/bin exec /bin/tar \"$@\"");

@@ -6,7 +6,6 @@ superblock, then the entries, each in a sector of its own and followed by its da
 """
 
 import contextlib
-import ctypes
 import itertools
 import random
 import shutil
@@ -18,6 +17,8 @@ from collections.abc import Callable, Iterator
 from dataclasses import dataclass, replace
 from pathlib import Path
 
+from tests.mounts import separate_mounts
+
 TOOLS = ["qemu-storage-daemon", "mkfs.ext4", "e2fsck", "losetup", "/dev/fuse", "/dev/loop-control"]
 SECTOR = 512  # bytes
 MAGIC, VERSION = 0x6A736677736872, 1
@@ -25,7 +26,6 @@ FLUSH, DISCARD = 1, 4
 SUPERBLOCK_MIDDLE = 3  # sectors from the start of the disk: ext4's superblock begins at 1024 bytes
 LOG_SIZE = 4 << 30  # bytes, sparse
 LONGEST_WAIT = 20  # s, for the storage daemon and for an unmount
-CLONE_NEWNS = 0x20000  # linux/sched.h
 
 
 @dataclass(frozen=True)
@@ -110,9 +110,7 @@ def missing() -> str:
 @contextlib.contextmanager
 def own_mounts() -> Iterator[Path]:
     """A folder in memory. Only this process sees its mounts, which end with it however it ends."""
-    if ctypes.CDLL(None, use_errno=True).unshare(CLONE_NEWNS) != 0:
-        raise OSError(ctypes.get_errno(), "no mounts of its own")
-    run("mount", "--make-rprivate", "/")
+    separate_mounts()
     with tempfile.TemporaryDirectory(prefix="power-cut-") as folder:
         run("mount", "-t", "tmpfs", "tmpfs", folder)
         try:

@@ -19,6 +19,7 @@ from pathlib import Path
 from bench.makers.files import write, write_script
 from bench.makers.i2cset import NEWER, OLDER
 from tests.command_line import take_path
+from tests.mounts import separate_mounts
 
 ROOT = Path(__file__).parents[2]
 SHELLS = ("dash", "bash")
@@ -345,6 +346,7 @@ class Limits(HandOverTest):
         """A mount point whose every access hangs for ever."""
         if os.geteuid() != 0 or not Path("/dev/fuse").exists():
             self.skipTest("no root or no FUSE here")
+        separate_mounts()
         folder = self.folder / "frozen"
         folder.mkdir()
         server = subprocess.Popen(

@@ -1,12 +1,16 @@
-# add_python_test(NAME MODULE [ARGUMENT...]): a test that runs a module of this repository's Python packages. It ends
-# with 77 where the machine cannot provide the unit that it needs, and prints why.
-find_package(Python3 3.11 REQUIRED COMPONENTS Interpreter)
-# A version manager's program on the search path starts a shell before the interpreter; the tests start it directly.
-execute_process(COMMAND ${Python3_EXECUTABLE} -c "import sys; print(sys.executable)"
-  OUTPUT_VARIABLE python OUTPUT_STRIP_TRAILING_WHITESPACE COMMAND_ERROR_IS_FATAL ANY)
+# add_python_test(NAME FILE [ARGUMENT...]): a test that runs a file of Python tests with pytest, as scripts/python would
+# from the command line; the arguments choose among its tests (-k) or set options of tests/conftest.py. It counts as
+# skipped, and prints why, when all of them are.
+function(add_python_test name file)
+  # Debian's own Python, which has pytest and what else the tests import.
+  add_test(NAME ${name} COMMAND /usr/bin/python3 -B -P -m pytest --build ${PROJECT_BINARY_DIR}
+    ${CMAKE_CURRENT_SOURCE_DIR}/${file} ${ARGN} WORKING_DIRECTORY ${PROJECT_SOURCE_DIR})
+  set_tests_properties(${name} PROPERTIES TIMEOUT 180 SKIP_RETURN_CODE 77 # tests/conftest.py
+    ENVIRONMENT "PYTHONPATH=${PROJECT_SOURCE_DIR}")
+endfunction()
 
-function(add_python_test name module)
-  add_test(NAME ${name} COMMAND ${python} -B -m ${module} ${ARGN} WORKING_DIRECTORY ${PROJECT_SOURCE_DIR})
+function(add_module_test name module)
+  add_test(NAME ${name} COMMAND /usr/bin/python3 -B -m ${module} ${ARGN} WORKING_DIRECTORY ${PROJECT_SOURCE_DIR})
   set_tests_properties(${name} PROPERTIES TIMEOUT 180 SKIP_RETURN_CODE 77
     ENVIRONMENT "PYTHONPATH=${PROJECT_SOURCE_DIR}")
 endfunction()

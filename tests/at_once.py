@@ -1,53 +1,26 @@
-"""Usage: at_once.py [--only PREFIX] MODULE [ARGUMENT...]
-
-Runs the tests of a module of unittest, each in a process of its own, all at once: most of them wait. Ends at the first
-that fails, and fails again alone.
+"""A plugin of pytest (-p tests.at_once): runs the chosen tests each in a process of its own, all at once, as most of
+them wait. Ends at the first that fails, and fails again alone.
 """
 
 import os
-import runpy
-import sys
-import unittest
-from collections.abc import Iterator
 
-from tests.command_line import take_word
+import pytest
 
 
-def tests_in(suite: unittest.TestSuite | unittest.TestCase) -> Iterator[unittest.TestCase]:
-    if isinstance(suite, unittest.TestCase):
-        yield suite
-        return
-    for each in suite:
-        yield from tests_in(each)
-
-
-def start(test: unittest.TestCase) -> int:
+def start(test: pytest.Item) -> int:
     process = os.fork()
     if process == 0:
-        result = unittest.TestResult()
-        unittest.TestSuite([test]).run(result)
-        os._exit(0 if result.wasSuccessful() else 1)
+        test.ihook.pytest_runtest_protocol(item=test, nextitem=None)
+        os._exit(1 if test.session.testsfailed else 0)
     return process
 
 
-def run_all(only: str) -> None:
-    suite = unittest.defaultTestLoader.loadTestsFromModule(sys.modules["__main__"])
-    running = {start(test): test for test in tests_in(suite) if type(test).__name__.startswith(only)}
+def pytest_runtestloop(session: pytest.Session) -> bool:
+    session.config._tmp_path_factory.getbasetemp()  # type: ignore[attr-defined] # one for all
+    running = {start(test): test for test in session.items}
     while running:
         process, status = os.wait()
         test = running.pop(process)
         if status != 0 and os.waitpid(start(test), 0)[1] != 0:
-            print(f"{test.id()} fails")
-            os._exit(1)
-    os._exit(0)
-
-
-if __name__ == "__main__":
-    prefix = take_word()
-    if prefix == "--only":
-        prefix, module = take_word(), take_word()
-    else:
-        prefix, module = "", prefix
-    unittest.main = lambda: run_all(prefix)  # type: ignore[misc, assignment]
-    sys.argv[0] = module
-    runpy.run_module(module, run_name="__main__", alter_sys=True)
+            pytest.exit(f"{test.nodeid} fails", pytest.ExitCode.TESTS_FAILED)
+    return True

@@ -75,19 +75,17 @@ def gtest(program: str, only: str = "*", folder: str = ".") -> Check:
     return Check(name, command, name)
 
 
-def python(module: str, arguments: str = "", targets: str = "") -> Check:
-    return Check(module.split(".")[-1], f"python3 -B -m {module} {arguments}", targets)
+def pytest(file: str, only: str = "", targets: str = "", more: str = "") -> Check:
+    """The tests of the file whose names match `only`."""
+    chosen = f"-k '{only}'" if only else ""
+    return Check(Path(file).stem, f"scripts/python -m pytest --exitfirst {more} {file} {chosen}", targets)
 
 
-def at_once(module: str, arguments: str = "", targets: str = "", only: str = "") -> Check:
-    check = python(module, arguments, targets)
-    check.command = f"python3 -B -m tests.at_once --only '{only}' {module} {arguments}"
-    return check
+def at_once(file: str, only: str = "", targets: str = "") -> Check:
+    return pytest(file, only, targets, "-p tests.at_once")
 
 
 SCENARIOS = ["package-and-board", "not-a-service", "up-to-date", "i2cset-missing", "sound-absent"]
-HAND_OVERS = f"{BUILD}/service/hand-over {BUILD}/tests/service/hand-over-short"
-TOOL = f"{BUILD}/companion/harl-updater-tool"
 GOLDEN_LOGS = "tests/companion/golden/log"
 LARGE = "Stick.FourGigabytesOfNothingAreRefusedAtOnce"
 PARTS = [
@@ -102,7 +100,7 @@ PARTS = [
             gtest("unit-tests"),
             gtest("process-tests"),
             *(
-                python("tests.program.program_test", f"{scenario} {BUILD}", "harl-updater call_recorder")
+                pytest("tests/program/program_test.py", f"[{scenario}]", "harl-updater call_recorder")
                 for scenario in SCENARIOS
             ),
             gtest("schedules/schedules", "*/NothingToUpdate:Flashing.*"),  # they represent the others
@@ -111,22 +109,22 @@ PARTS = [
     Part(
         ["service/hand_over.cpp", "service/limits.h"],
         [
-            at_once("tests.service.hand_over_test", HAND_OVERS, "hand-over", only="Panel"),
-            at_once("tests.service.hand_over_test", HAND_OVERS, "hand-over", only="PassedOn"),
-            at_once("tests.service.hand_over_test", HAND_OVERS, "hand-over-short"),
+            at_once("tests/service/hand_over_test.py", "TestPanel", "hand-over"),
+            at_once("tests/service/hand_over_test.py", "TestPassedOn", "hand-over"),
+            at_once("tests/service/hand_over_test.py", targets="hand-over-short"),
         ],
     ),
-    Part(["service/give-back"], [at_once("tests.service.give_back_test")]),
-    Part(["service/prepare"], [at_once("tests.service.prepare_test")]),
+    Part(["service/give-back"], [at_once("tests/service/give_back_test.py")]),
+    Part(["service/prepare"], [at_once("tests/service/prepare_test.py")]),
     Part(
         ["service/verify-stick"],
-        [at_once("tests.companion.stick.make_test", TOOL, "harl-updater-tool", only="Signed")],
+        [at_once("tests/companion/stick/make_test.py", "TestSigned", "harl-updater-tool")],
     ),
     Part(
         ["companion/log/run.cpp", "companion/log/catalogue.cpp"],
         [
             gtest("companion/log-tests", "-Each/Knowledge.*", GOLDEN_LOGS),
-            at_once("tests.companion.log.command_test", TOOL, "harl-updater-tool"),
+            at_once("tests/companion/log/command_test.py", targets="harl-updater-tool"),
             gtest("companion/log-tests", "Each/Knowledge.*", GOLDEN_LOGS),
         ],
     ),
@@ -134,7 +132,7 @@ PARTS = [
         ["companion/stick/stick_check.cpp", "companion/stick/archive.cpp", "companion/stick/signature.cpp"],
         [
             gtest("companion/stick-tests", f"-{LARGE}"),
-            at_once("tests.companion.stick.make_test", TOOL, "harl-updater-tool"),
+            at_once("tests/companion/stick/make_test.py", targets="harl-updater-tool"),
             gtest("companion/stick-tests", LARGE),
         ],
     ),
@@ -146,10 +144,9 @@ PARTS = [
         [
             gtest("companion/unit-check-tests"),
             gtest("companion/tool-tests"),
-            python(
-                "tests.companion.make_golden_checks",
-                f"--compare {BUILD}",
-                "harl-updater-tool unit-on-standin call_recorder harl-updater",
+            pytest(
+                "tests/companion/golden_checks_test.py",
+                targets="harl-updater-tool unit-on-standin call_recorder harl-updater",
             ),
         ],
     ),

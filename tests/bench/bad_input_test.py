@@ -4,212 +4,221 @@ import os
 import re
 import subprocess
 import sys
-import tempfile
-import unittest
 from pathlib import Path
+
+import pytest
 
 from bench.expected import BLOCKS, COMMANDS
 
 ROOT = Path(__file__).parents[2]
-
-
 GOOD = (ROOT / "bench/scenarios/up-to-date.toml").read_text()
+EARLY_END = GOOD[: GOOD.rindex("'''")]
+TOOLS = "'systemctl', 'umount', 'rm', 'ls', 'apt', 'apt-cache', 'ssh', 'scp', 'i2cset', 'aplay'"
 
 
-class BadInput(unittest.TestCase):
-    """Each test names what is wrong and compares the whole message."""
-
-    def setUp(self) -> None:
-        holder = tempfile.TemporaryDirectory()
-        self.addCleanup(holder.cleanup)
-        self.folder = Path(holder.name)
-        self.build = self.folder / "build"
-        self.build.mkdir()
-        (self.build / "harl-updater").touch()
-
-    def bench(self, *arguments: str | Path, **variables: str) -> tuple[int, str, str]:
-        command: list[str | Path] = [sys.executable, "-B", "-m", "bench", *arguments]
-        done = subprocess.run(command, env=os.environ | variables, capture_output=True, text=True, check=False)
-        return done.returncode, done.stdout, done.stderr
-
-    def check_file(self, text: str, line: int, reason: str) -> None:
-        file = self.folder / "scenario.toml"
-        file.write_text(text)
-        self.assertEqual(self.bench(file), (2, "", f"bench: {file}:{line}: {reason}\n"))
-
-    def check_words(self, reason: str, *arguments: str | Path) -> None:
-        """The usage comes before the reason."""
-        status, shown, message = self.bench(*arguments)
-        self.assertEqual((status, shown), (2, ""))
-        self.assertEqual(message[message.rindex("bench/run: "):], f"bench/run: error: {reason}\n")
-
-    def line(self, text: str, key: str) -> int:
-        """The line of `key` under [expect]."""
-        return next(number for number, line in enumerate(text.splitlines(), 1) if line.startswith(f"{key} ="))
-
-    def test_unknown_scenario(self) -> None:
-        message = "bench: no scenario 'nothing': bench/run --list shows all\n"
-        self.assertEqual(self.bench("nothing"), (2, "", message))
-
-    def test_no_such_file(self) -> None:
-        file = self.folder / "none.toml"
-        self.assertEqual(self.bench(file), (2, "", f"bench: {file}: No such file or directory\n"))
-
-    def test_page_that_cannot_be_written(self) -> None:
-        for file in (self.folder / "none/page.html", self.folder, self.build / "harl-updater/page.html"):
-            self.check_words(f"--record: {file} cannot be written", "--record", file, "up-to-date")
-
-    def test_page_of_many_scenarios(self) -> None:
-        (self.folder / "file").touch()
-        file = self.folder / "file"
-        self.check_words(f"--record: {file} cannot be a folder: File exists", "--all", "--record", file)
-
-    def test_scenario_beside_all_or_list(self) -> None:
-        self.check_words("argument scenario: not allowed with argument --all", "--all", "up-to-date")
-        self.check_words("argument scenario: not allowed with argument --list", "--list", "up-to-date")
-
-    def test_speed(self) -> None:
-        for speed in ("nan", "inf", "-inf", "0", "0.99"):
-            self.check_words("--speed: must be a number, 1 or more", f"--speed={speed}")
-
-    def test_build_that_is_none(self) -> None:
-        reason = f"--build: {self.folder} holds no harl-updater: build it there or leave --build out"
-        self.check_words(reason, "--build", self.folder)
-
-    def test_paths_count_from_where_the_user_is(self) -> None:
-        command: list[str | Path] = [ROOT / "bench/run", "scenario.toml"]
-        done = subprocess.run(command, cwd=self.folder, capture_output=True, text=True, check=False)
-        message = "bench: scenario.toml: No such file or directory\n"
-        self.assertEqual((done.returncode, done.stdout, done.stderr), (2, "", message))
-        (self.folder / "scenario.toml").touch()
-        done = subprocess.run(command, cwd=self.folder, capture_output=True, text=True, check=False)
-        self.assertEqual((done.returncode, done.stderr), (2, "bench: scenario.toml:1: summary: is missing\n"))
-
-    def test_no_toml(self) -> None:
-        self.check_file(GOOD.replace("[board]", "[board"), 6, "Expected ']' at the end of a table declaration")
-
-    def test_file_ends_early(self) -> None:
-        text = GOOD[: GOOD.rindex("'''")]
-        self.check_file(text, len(text.splitlines()), "Expected \"'''\"")
-
-    def test_unknown_section(self) -> None:
-        sections = "package, mirrors, board, stick, head, tools, updater"
-        reason = f"bord: not known; the sections are {sections} and expect"
-        self.check_file(GOOD.replace("[board]", "[bord]"), 6, reason)
-
-    def test_unknown_key(self) -> None:
-        text = GOOD.replace('[board]\n', '[board]\ncolour = "red"\n')
-        keys = "installed, version_file, link, login, disk, uploads_lost, script"
-        self.check_file(text, 7, f"board.colour: not known; the keys are {keys}")
-
-    def test_unknown_value(self) -> None:
-        text = GOOD.replace('[board]\n', '[board]\ndisk = "none"\n')
-        self.check_file(text, 7, "board.disk: must be one of 'free', 'full', not 'none'")
-
-    def test_value_of_another_type(self) -> None:
-        text = GOOD.replace('[board]\n', '[board]\nuploads_lost = "3"\n')
-        self.check_file(text, 7, "board.uploads_lost: must be of type int, not '3'")
-
-    def test_entries_of_another_type(self) -> None:
-        text = GOOD.replace("[board]\n", "[stick]\ndirectories = [3]\n\n[board]\n")
-        self.check_file(text, 7, "stick.directories: must be of type str, not 3")
-        text = re.sub(r"status = .*", 'status = ["0"]', GOOD)
-        self.check_file(text, self.line(text, "status"), "expect.status: must be of type int, not '0'")
-
-    def test_folder_outside_the_unit(self) -> None:
-        text = GOOD.replace("[board]\n", '[stick]\ndirectories = ["../../quorb2.2.0"]\n\n[board]\n')
-        self.check_file(text, 7, "stick.directories: must be fit for the name of a file, not '../../quorb2.2.0'")
-
-    def test_unknown_tools(self) -> None:
-        tools = "'systemctl', 'umount', 'rm', 'ls', 'apt', 'apt-cache', 'ssh', 'scp', 'i2cset', 'aplay'"
-        for key in ("missing", "killed"):
-            text = GOOD.replace("[board]\n", f'[tools]\n{key} = ["nope"]\n\n[board]\n')
-            self.check_file(text, 7, f"tools.{key}: must be one of {tools}, not 'nope'")
-
-    def test_null_character(self) -> None:
-        text = GOOD.replace("[board]\n", '[board]\nversion_file = "a\\u0000b"\n')
-        self.check_file(text, 7, "board.version_file: must be without null characters")
-
-    def test_commands(self) -> None:
-        for entry, reason in (
-            ("stop-harl xtwo", "'stop-harl xtwo': no number after the x"),
-            ("stop", f"no command 'stop'; there are {', '.join(COMMANDS)}"),
-        ):
-            text = GOOD.replace('"stop-harl"', f'"{entry}"')
-            self.check_file(text, self.line(text, "commands"), f"expect.commands: {reason}")
-        text = re.sub(r"commands = \[[^]]*\]", "commands = [3]", GOOD)
-        self.check_file(text, self.line(text, "commands"), "expect.commands: must be of type str, not 3")
-
-    def test_log(self) -> None:
-        for line, reason in (
-            ("(nothing 0)", f"no block 'nothing'; there are {', '.join(BLOCKS)}"),
-            ("(opening)", "block 'opening': values after the name: must be 1, not 0"),
-            ("runProcess: {stop}", f"no command 'stop'; there are {', '.join(COMMANDS)}"),
-        ):
-            text = GOOD.replace("(opening 0)", line)
-            self.check_file(text, self.line(text, "log"), f"expect.log: {reason}")
-
-    def test_missing_expectation(self) -> None:
-        self.check_file(GOOD.replace("marker = true\n", ""), 9, "expect.marker: is missing")
-
-    def test_temporary_folder_that_cannot_be_written(self) -> None:
-        if os.geteuid() == 0:
-            self.skipTest("root may write everywhere")
-        self.folder.chmod(0o500)
-        status, _, message = self.bench("up-to-date", TMPDIR=str(self.folder))
-        self.assertEqual((status, message.count("\n")), (1, 1))
-
-    def test_too_little_space(self) -> None:
-        bench = f"{sys.executable} -B -m bench --build {self.build} --unit stand-in up-to-date"
-        small = self.folder / "small"
-        small.mkdir()
-        script = f"mount -t tmpfs -o size=3m small {small} || exit 77; TMPDIR={small} exec {bench}"
-        unshare = ["unshare", "--map-root-user", "--mount", "sh", "-c", script]
-        done = subprocess.run(unshare, capture_output=True, text=True, check=False)
-        if done.returncode == 77 or "unshare" in done.stderr:
-            self.skipTest("this machine forbids namespaces")
-        message = f"bench: 3 MB are free in {small}, a unit needs 20: make room there or name another TMPDIR\n"
-        self.assertEqual((done.returncode, done.stdout, done.stderr), (1, "", message))
-
-    def test_missing_package(self) -> None:
-        tools = self.folder / "bin"
-        tools.mkdir()
-        for tool in ("env", "sh", "dirname", "id"):
-            (tools / tool).symlink_to(f"/usr/bin/{tool}")
-        query = tools / "dpkg-query"
-        query.write_text('#!/bin/sh\nfor package; do :; done\n[ "$package" = alsa-utils ] || echo "ii "\n')
-        query.chmod(0o755)
-        # No apt-get on this search path, so that nothing is installed.
-        status, shown, message = self.bench("up-to-date", PATH=str(tools))
-        self.assertNotEqual(status, 0)
-        self.assertIn("alsa-utils", message)
-        self.assertNotIn("Unit:", shown)
+def before_board(lines: str) -> str:
+    """The good file with lines before the board's section, and in it."""
+    return GOOD.replace("[board]\n", lines)
 
 
-class OtherCommands(unittest.TestCase):
-    """Commands that would find nothing to run, or never end."""
-
-    def test_wrong_words(self) -> None:
-        numbers = [["x"], ["0"], ["-1"], [""], ["1", "2"], ["9999999999"]]
-        names = [["nonsense"]]
-        for command, wrong in (
-            ("tests/reliability/threads", numbers),
-            ("fuzz/run", numbers),
-            ("tests/companion/log/throughput", numbers),
-            ("performance/processes", numbers[:-1]),
-            ("tests/reliability/interruption_real", names),
-            ("tests/companion/log/make-golden", names),
-            ("tests/companion/make-golden-checks", names),
-            ("tests/run-armhf", names),
-        ):
-            for words in wrong:
-                with self.subTest(command, words=words):
-                    done = subprocess.run(
-                        [ROOT / command, *words], capture_output=True, text=True, timeout=30, check=False
-                    )
-                    self.assertEqual((done.returncode, done.stdout), (2, ""), done.stderr)
-                    self.assertEqual(done.stderr.count("\n"), 1, done.stderr)
+def line_of(text: str, key: str) -> int:
+    """The line of `key` under [expect]."""
+    return next(number for number, line in enumerate(text.splitlines(), 1) if line.startswith(f"{key} ="))
 
 
-if __name__ == "__main__":
-    unittest.main()
+# The whole message: the file's text, the line and the reason.
+WRONG_FILES = {
+    "no-toml": (GOOD.replace("[board]", "[board"), 6, "Expected ']' at the end of a table declaration"),
+    "early-end": (EARLY_END, len(EARLY_END.splitlines()), "Expected \"'''\""),
+    "section": (
+        GOOD.replace("[board]", "[bord]"),
+        6,
+        "bord: not known; the sections are package, mirrors, board, stick, head, tools, updater and expect",
+    ),
+    "key": (
+        before_board('[board]\ncolour = "red"\n'),
+        7,
+        "board.colour: not known; the keys are installed, version_file, link, login, disk, uploads_lost, script",
+    ),
+    "value": (before_board('[board]\ndisk = "none"\n'), 7, "board.disk: must be one of 'free', 'full', not 'none'"),
+    "type": (before_board('[board]\nuploads_lost = "3"\n'), 7, "board.uploads_lost: must be of type int, not '3'"),
+    "type-of-entry": (
+        before_board("[stick]\ndirectories = [3]\n\n[board]\n"),
+        7,
+        "stick.directories: must be of type str, not 3",
+    ),
+    "outside-the-unit": (
+        before_board('[stick]\ndirectories = ["../../quorb2.2.0"]\n\n[board]\n'),
+        7,
+        "stick.directories: must be fit for the name of a file, not '../../quorb2.2.0'",
+    ),
+    "missing-tool": (
+        before_board('[tools]\nmissing = ["nope"]\n\n[board]\n'),
+        7,
+        f"tools.missing: must be one of {TOOLS}, not 'nope'",
+    ),
+    "killed-tool": (
+        before_board('[tools]\nkilled = ["nope"]\n\n[board]\n'),
+        7,
+        f"tools.killed: must be one of {TOOLS}, not 'nope'",
+    ),
+    "null-character": (
+        before_board('[board]\nversion_file = "a\\u0000b"\n'),
+        7,
+        "board.version_file: must be without null characters",
+    ),
+    "missing-expectation": (GOOD.replace("marker = true\n", ""), 9, "expect.marker: is missing"),
+}
+# Under [expect]: what is replaced, by what, and the reason, which begins with the key.
+WRONG_EXPECTATIONS = {
+    "status": (r"status = .*", 'status = ["0"]', "status: must be of type int, not '0'"),
+    "number": ('"stop-harl"', '"stop-harl xtwo"', "commands: 'stop-harl xtwo': no number after the x"),
+    "command": ('"stop-harl"', '"stop"', f"commands: no command 'stop'; there are {', '.join(COMMANDS)}"),
+    "type": (r"commands = \[[^]]*\]", "commands = [3]", "commands: must be of type str, not 3"),
+    "block": (r"\(opening 0\)", "(nothing 0)", f"log: no block 'nothing'; there are {', '.join(BLOCKS)}"),
+    "values": (r"\(opening 0\)", "(opening)", "log: block 'opening': values after the name: must be 1, not 0"),
+    "log": (
+        r"\(opening 0\)",
+        "runProcess: {stop}",
+        f"log: no command 'stop'; there are {', '.join(COMMANDS)}",
+    ),
+}
+
+
+def bench(*arguments: str | Path, **variables: str) -> tuple[int, str, str]:
+    """Status, output and errors of bench/run."""
+    command: list[str | Path] = [sys.executable, "-B", "-m", "bench", *arguments]
+    done = subprocess.run(command, env=os.environ | variables, capture_output=True, text=True, check=False)
+    return done.returncode, done.stdout, done.stderr
+
+
+def check_file(file: Path, text: str, line: int, reason: str) -> None:
+    file.write_text(text)
+    assert bench(file) == (2, "", f"bench: {file}:{line}: {reason}\n")
+
+
+def check_words(reason: str, *arguments: str | Path) -> None:
+    """The usage comes before the reason."""
+    status, shown, message = bench(*arguments)
+    assert (status, shown) == (2, "")
+    assert message[message.rindex("bench/run: ") :] == f"bench/run: error: {reason}\n"
+
+
+@pytest.fixture
+def build(tmp_path: Path) -> Path:
+    """A build folder whose updater cannot run."""
+    build = tmp_path / "build"
+    build.mkdir()
+    (build / "harl-updater").touch()
+    return build
+
+
+@pytest.mark.parametrize("text, line, reason", WRONG_FILES.values(), ids=WRONG_FILES)
+def test_file(tmp_path: Path, text: str, line: int, reason: str) -> None:
+    check_file(tmp_path / "scenario.toml", text, line, reason)
+
+
+@pytest.mark.parametrize("old, new, reason", WRONG_EXPECTATIONS.values(), ids=WRONG_EXPECTATIONS)
+def test_expectation(tmp_path: Path, old: str, new: str, reason: str) -> None:
+    text = re.sub(old, new, GOOD)
+    check_file(tmp_path / "scenario.toml", text, line_of(text, reason.split(":")[0]), f"expect.{reason}")
+
+
+def test_unknown_scenario() -> None:
+    assert bench("nothing") == (2, "", "bench: no scenario 'nothing': bench/run --list shows all\n")
+
+
+def test_no_such_file(tmp_path: Path) -> None:
+    file = tmp_path / "none.toml"
+    assert bench(file) == (2, "", f"bench: {file}: No such file or directory\n")
+
+
+@pytest.mark.parametrize("name", ["none/page.html", "", "build/harl-updater/page.html"])
+def test_page_that_cannot_be_written(tmp_path: Path, build: Path, name: str) -> None:
+    check_words(f"--record: {tmp_path / name} cannot be written", "--record", tmp_path / name, "up-to-date")
+
+
+def test_page_of_many_scenarios(tmp_path: Path) -> None:
+    file = tmp_path / "file"
+    file.touch()
+    check_words(f"--record: {file} cannot be a folder: File exists", "--all", "--record", file)
+
+
+@pytest.mark.parametrize("option", ["--all", "--list"])
+def test_scenario_beside(option: str) -> None:
+    check_words(f"argument scenario: not allowed with argument {option}", option, "up-to-date")
+
+
+@pytest.mark.parametrize("speed", ["nan", "inf", "-inf", "0", "0.99"])
+def test_speed(speed: str) -> None:
+    check_words("--speed: must be a number, 1 or more", f"--speed={speed}")
+
+
+def test_build_that_is_none(tmp_path: Path) -> None:
+    reason = f"--build: {tmp_path} holds no harl-updater: build it there or leave --build out"
+    check_words(reason, "--build", tmp_path)
+
+
+def test_paths_count_from_where_the_user_is(tmp_path: Path) -> None:
+    command: list[str | Path] = [ROOT / "bench/run", "scenario.toml"]
+    done = subprocess.run(command, cwd=tmp_path, capture_output=True, text=True, check=False)
+    message = "bench: scenario.toml: No such file or directory\n"
+    assert (done.returncode, done.stdout, done.stderr) == (2, "", message)
+    (tmp_path / "scenario.toml").touch()
+    done = subprocess.run(command, cwd=tmp_path, capture_output=True, text=True, check=False)
+    assert (done.returncode, done.stderr) == (2, "bench: scenario.toml:1: summary: is missing\n")
+
+
+@pytest.mark.skipif(os.geteuid() == 0, reason="root may write everywhere")
+def test_temporary_folder_that_cannot_be_written(tmp_path: Path) -> None:
+    tmp_path.chmod(0o500)
+    status, _, message = bench("up-to-date", TMPDIR=str(tmp_path))
+    assert (status, message.count("\n")) == (1, 1)
+
+
+def test_too_little_space(tmp_path: Path, build: Path) -> None:
+    command = f"{sys.executable} -B -m bench --build {build} --unit stand-in up-to-date"
+    small = tmp_path / "small"
+    small.mkdir()
+    script = f"mount -t tmpfs -o size=3m small {small} || exit 77; TMPDIR={small} exec {command}"
+    unshare = ["unshare", "--map-root-user", "--mount", "sh", "-c", script]
+    done = subprocess.run(unshare, capture_output=True, text=True, check=False)
+    if done.returncode == 77 or "unshare" in done.stderr:
+        pytest.skip("this machine forbids namespaces")
+    message = f"bench: 3 MB are free in {small}, a unit needs 20: make room there or name another TMPDIR\n"
+    assert (done.returncode, done.stdout, done.stderr) == (1, "", message)
+
+
+def test_missing_package(tmp_path: Path) -> None:
+    for tool in ("env", "sh", "dirname", "id"):
+        (tmp_path / tool).symlink_to(f"/usr/bin/{tool}")
+    query = tmp_path / "dpkg-query"
+    query.write_text('#!/bin/sh\nfor package; do :; done\n[ "$package" = alsa-utils ] || echo "ii "\n')
+    query.chmod(0o755)
+    # No apt-get on this search path, so that nothing is installed.
+    status, shown, message = bench("up-to-date", PATH=str(tmp_path))
+    assert status != 0
+    assert "alsa-utils" in message
+    assert "Unit:" not in shown
+
+
+NUMBERS = ["x", "0", "-1", "", "1 2", "9999999999"]
+# Commands that would find nothing to run, or never end, and what is no argument of theirs.
+WRONG_WORDS = {
+    "tests/reliability/threads": NUMBERS,
+    "fuzz/run": NUMBERS,
+    "tests/companion/log/throughput": NUMBERS,
+    "performance/processes": NUMBERS[:-1],
+    "tests/reliability/interruption_real": ["nonsense"],
+    "tests/companion/log/make-golden": ["nonsense"],
+    "tests/companion/make-golden-checks": ["nonsense"],
+    "tests/run-armhf": ["nonsense"],
+}
+
+
+@pytest.mark.parametrize("command, words", [(name, words) for name in WRONG_WORDS for words in WRONG_WORDS[name]])
+def test_other_command(command: str, words: str) -> None:
+    arguments = words.split(" ")
+    done = subprocess.run([ROOT / command, *arguments], capture_output=True, text=True, timeout=30, check=False)
+    assert (done.returncode, done.stdout) == (2, ""), done.stderr
+    assert done.stderr.count("\n") == 1, done.stderr

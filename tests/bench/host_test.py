@@ -1,27 +1,20 @@
-"""Usage: host_test.py BUILD_FOLDER
-
-The machine is the same before and after a run of the bench, however the run ends."""
+"""The machine is the same before and after a run of the bench, however the run ends."""
 
 import os
 import signal
 import subprocess
 import sys
-import tempfile
 import time
-import unittest
 from collections.abc import Callable
 from pathlib import Path
 
+import pytest
+
 from bench.real.unit import forbidden
 from bench.runner import CLEANUP
-from tests.command_line import take_path
 
 ROOT = Path(__file__).parents[2]
-
-
-KINDS = ["stand-in"] if forbidden() else ["real", "stand-in"]
-BUILD = ROOT / "build/default"
-COMMAND = [sys.executable, "-B", "-m", "bench"]
+NO_UNIT = forbidden()
 INSTRUMENT = ["/root/USB_MOUNT", "/root/RESOURCES", "/unzipUpgrade.sh", "/opt/bench", "/run/harl"]
 LONGEST_CLEARING = 60  # s
 
@@ -58,103 +51,108 @@ def users_of(folder: str) -> list[str]:
     return found
 
 
-class HostTest(unittest.TestCase):
-    """Each test runs the bench with its own temporary folder, which must be empty and unused at the end."""
+class Host:
+    """This machine. The bench runs with the temporary folder `folder`, which must be empty and unused at the end."""
 
-    def setUp(self) -> None:
-        holder = tempfile.TemporaryDirectory(prefix="bench-host-test-")
-        self.addCleanup(holder.cleanup)
-        self.folder = holder.name
-        self.before = machine(self.folder)
+    def __init__(self, folder: Path, build: Path) -> None:
+        self.folder = folder
+        self._build = build
+        self._before = machine(str(folder))
 
-    def start(self, *arguments: str) -> subprocess.Popen[str]:
+    def start(self, *arguments: str | Path) -> subprocess.Popen[str]:
         return subprocess.Popen(
-            [*COMMAND, "--build", BUILD, *arguments],
-            env=os.environ | {"TMPDIR": self.folder},
+            [sys.executable, "-B", "-m", "bench", "--build", self._build, *arguments],
+            env=os.environ | {"TMPDIR": str(self.folder)},
             stdout=subprocess.PIPE,
             stderr=subprocess.STDOUT,
             text=True,
             start_new_session=True,
         )
 
+    def users(self) -> list[str]:
+        return users_of(str(self.folder))
+
     def wait_until(self, what: str, holds: Callable[[], object]) -> None:
         end = time.monotonic() + LONGEST_CLEARING
         while not holds():
-            self.assertLess(time.monotonic(), end, f"{what}: {os.listdir(self.folder)} {users_of(self.folder)}")
+            assert time.monotonic() < end, f"{what}: {os.listdir(self.folder)} {self.users()}"
             time.sleep(0.02)
 
     def check_untouched(self) -> None:
-        self.wait_until("not cleared away", lambda: not os.listdir(self.folder) and not users_of(self.folder))
-        self.assertEqual(machine(self.folder), self.before)
-
-    def test_after_a_run(self) -> None:
-        for kind in KINDS:
-            with self.subTest(kind):
-                with self.start("--unit", kind, "up-to-date") as bench:
-                    text = bench.communicate()[0]
-                self.assertEqual(bench.returncode, 0, text)
-                self.check_untouched()
-
-    def test_after_a_run_that_fails(self) -> None:
-        wrong = Path(self.folder).with_suffix(".toml")
-        self.addCleanup(wrong.unlink)
-        text = (ROOT / "bench/scenarios/up-to-date.toml").read_text()
-        wrong.write_text(text.replace("marker = true", "marker = false"))
-        for kind in KINDS:
-            with self.subTest(kind):
-                with self.start("--unit", kind, str(wrong)) as bench:
-                    text = bench.communicate()[0]
-                self.assertEqual(bench.returncode, 1, text)
-                self.assertIn("DIFFERENCE: marker: expected False, not True", text)
-                self.check_untouched()
-
-    def test_after_a_signal_while_the_updater_runs(self) -> None:
-        for kind in KINDS:
-            for number, status in ((signal.SIGINT, 130), (signal.SIGTERM, 143), (signal.SIGKILL, -9)):
-                arguments = ["--unit", kind, "package-and-board", "--speed", "1"]
-                with self.subTest(kind, number=number), self.start(*arguments) as bench:
-                    assert bench.stdout
-                    while "Running command: apt-cache" not in (line := bench.stdout.readline()):
-                        self.assertNotEqual(line, "", "the bench ended early")
-                    self.assertTrue(users_of(self.folder))
-                    bench.send_signal(number)
-                    bench.communicate()
-                    self.assertEqual(bench.returncode, status)
-                    self.check_untouched()
-
-    def test_guard_needs_no_process(self) -> None:
-        folder = Path(self.folder) / "bench"
-        folder.mkdir()
-        with subprocess.Popen(["sleep", "60"], start_new_session=True) as left:
-            (folder / "unit.pid").write_text(f"{left.pid}\n")
-            guard: list[str | Path] = [sys.executable, "-I", "-S", CLEANUP, folder]
-            # No program on its search path.
-            subprocess.run(guard, env={"PATH": self.folder}, stdin=subprocess.DEVNULL, check=True)
-            self.assertEqual(left.wait(), -signal.SIGKILL)
-        self.assertFalse(folder.exists())
-
-    def test_after_a_signal_while_the_unit_is_made(self) -> None:
-        for kind in KINDS:
-            for number in (signal.SIGINT, signal.SIGTERM, signal.SIGKILL):
-                with self.subTest(kind, number=number), self.start("--unit", kind, "package-and-board") as bench:
-                    self.wait_until("no folder", lambda: users_of(self.folder))
-                    bench.send_signal(number)
-                    bench.communicate()
-                    self.assertNotEqual(bench.returncode, 0)
-                    self.check_untouched()
-
-    def test_after_a_signal_while_many_scenarios_run(self) -> None:
-        for kind in KINDS:
-            for number in (signal.SIGINT, signal.SIGKILL):
-                with self.subTest(kind, number=number), self.start("--unit", kind, "--all", "--jobs", "3") as bench:
-                    self.wait_until("no folders", lambda: len(os.listdir(self.folder)) == 3)
-                    time.sleep(0.5)
-                    bench.send_signal(number)
-                    bench.communicate()
-                    self.assertNotEqual(bench.returncode, 0)
-                    self.check_untouched()
+        self.wait_until("not cleared away", lambda: not os.listdir(self.folder) and not self.users())
+        assert machine(str(self.folder)) == self._before
 
 
-if __name__ == "__main__":
-    BUILD = take_path()
-    unittest.main()
+@pytest.fixture
+def host(tmp_path_factory: pytest.TempPathFactory, build: Path) -> Host:
+    return Host(tmp_path_factory.mktemp("bench-host-test-"), build)
+
+
+@pytest.fixture(params=[pytest.param("real", marks=pytest.mark.skipif(bool(NO_UNIT), reason=NO_UNIT)), "stand-in"])
+def kind(request: pytest.FixtureRequest) -> str:
+    """The kind of unit."""
+    return str(request.param)
+
+
+def test_after_a_run(host: Host, kind: str) -> None:
+    with host.start("--unit", kind, "up-to-date") as bench:
+        text = bench.communicate()[0]
+    assert bench.returncode == 0, text
+    host.check_untouched()
+
+
+def test_after_a_run_that_fails(host: Host, kind: str, tmp_path: Path) -> None:
+    wrong = tmp_path / "wrong.toml"
+    text = (ROOT / "bench/scenarios/up-to-date.toml").read_text()
+    wrong.write_text(text.replace("marker = true", "marker = false"))
+    with host.start("--unit", kind, wrong) as bench:
+        text = bench.communicate()[0]
+    assert bench.returncode == 1, text
+    assert "DIFFERENCE: marker: expected False, not True" in text
+    host.check_untouched()
+
+
+@pytest.mark.parametrize("name, status", [("SIGINT", 130), ("SIGTERM", 143), ("SIGKILL", -9)])
+def test_after_a_signal_while_the_updater_runs(host: Host, kind: str, name: str, status: int) -> None:
+    with host.start("--unit", kind, "package-and-board", "--speed", "1") as bench:
+        assert bench.stdout
+        while "Running command: apt-cache" not in (line := bench.stdout.readline()):
+            assert line != "", "the bench ended early"
+        assert host.users()
+        bench.send_signal(signal.Signals[name])
+        bench.communicate()
+        assert bench.returncode == status
+        host.check_untouched()
+
+
+def test_guard_needs_no_process(host: Host) -> None:
+    folder = host.folder / "bench"
+    folder.mkdir()
+    with subprocess.Popen(["sleep", "60"], start_new_session=True) as left:
+        (folder / "unit.pid").write_text(f"{left.pid}\n")
+        guard: list[str | Path] = [sys.executable, "-I", "-S", CLEANUP, folder]
+        # No program on its search path.
+        subprocess.run(guard, env={"PATH": str(host.folder)}, stdin=subprocess.DEVNULL, check=True)
+        assert left.wait() == -signal.SIGKILL
+    assert not folder.exists()
+
+
+@pytest.mark.parametrize("name", ["SIGINT", "SIGTERM", "SIGKILL"])
+def test_after_a_signal_while_the_unit_is_made(host: Host, kind: str, name: str) -> None:
+    with host.start("--unit", kind, "package-and-board") as bench:
+        host.wait_until("no folder", host.users)
+        bench.send_signal(signal.Signals[name])
+        bench.communicate()
+        assert bench.returncode != 0
+        host.check_untouched()
+
+
+@pytest.mark.parametrize("name", ["SIGINT", "SIGKILL"])
+def test_after_a_signal_while_many_scenarios_run(host: Host, kind: str, name: str) -> None:
+    with host.start("--unit", kind, "--all", "--jobs", "3") as bench:
+        host.wait_until("no folders", lambda: len(os.listdir(host.folder)) == 3)
+        time.sleep(0.5)
+        bench.send_signal(signal.Signals[name])
+        bench.communicate()
+        assert bench.returncode != 0
+        host.check_untouched()

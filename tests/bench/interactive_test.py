@@ -1,46 +1,42 @@
-"""Usage: interactive_test.py UNIT BUILD_FOLDER [TEST...]
+"""bench/run --interactive in a terminal, on a unit of the kind --unit: each key, whole stories, and that the terminal
+is given back however it ends."""
 
-bench/run --interactive in a terminal, on a unit of the kind UNIT: each key, whole stories, and that the terminal is
-given back however it ends.
-"""
-
+import contextlib
 import re
 import signal
 import sys
-import tempfile
 import time
-import unittest
+from collections.abc import Iterator
 from pathlib import Path
 
-from bench.makers.files import replace_text
-from tests.bench.terminal import ROOT, Terminal
-from tests.command_line import take_path, take_word
+import pytest
 
-KIND, BUILD = "stand-in", ROOT / "build/default"
+from bench.makers.files import replace_text
+from tests.bench.terminal import Terminal
+
 # Shows the cursor and leaves the terminal's second screen: terminfo's cnorm and rmcup of xterm.
 GIVEN_BACK = (b"\x1b[?12l\x1b[?25h", b"\x1b[?1049l")
 OUTCOME = "updates again"  # shown at the end of each update
 
 
-class Interactive(unittest.TestCase):
-    """A terminal with the bench unit in it."""
+class Bench:
+    """Terminals with a bench unit in them, in `folder`."""
 
-    def setUp(self) -> None:
-        holder = tempfile.TemporaryDirectory()
-        self.addCleanup(holder.cleanup)
-        self.folder = Path(holder.name) / "bench"
+    def __init__(self, folder: Path, arguments: list[str], terminals: contextlib.ExitStack) -> None:
+        self.folder = folder / "bench"
         self.folder.mkdir()
-        self._held = Path(holder.name) / "held"
+        self._held = folder / "held"
+        self._arguments = arguments
+        self._terminals = terminals
 
-    def bench(self, scenario: str, speed: int = 600, columns: int = 80, lines: int = 24, **variables: str) -> Terminal:
+    def start(self, scenario: str, speed: int = 600, columns: int = 80, lines: int = 24, **variables: str) -> Terminal:
         """Starts the bench; the stand-in unit's commands take a minute each, `speed` times shorter."""
-        words = ["--build", str(BUILD), "--unit", KIND, "--speed", str(speed), "--interactive", scenario]
+        words = [*self._arguments, "--speed", str(speed), "--interactive", scenario]
         command = [sys.executable, "-B", "-m", "bench", *words]
         variables |= {"TMPDIR": str(self.folder), "BENCH_HOLD": str(self._held)}
         terminal = Terminal(command, variables, columns, lines)
-        self.addCleanup(self.assert_cleared)
-        self.enterContext(terminal)
-        return terminal
+        self._terminals.callback(self.check_cleared)
+        return self._terminals.enter_context(terminal)
 
     def hold(self, calls: str) -> None:
         """Lets the stand-in tools' calls that match this pattern of the shell wait, and those held before go on."""
@@ -50,20 +46,16 @@ class Interactive(unittest.TestCase):
         """Lets the held calls go on."""
         self._held.unlink()
 
-    def assert_cleared(self) -> None:
+    def check_cleared(self) -> None:
         """The unit is gone."""
         end = time.monotonic() + 10
         while list(self.folder.iterdir()) and time.monotonic() < end:
             time.sleep(0.05)
-        self.assertEqual(list(self.folder.iterdir()), [])
-
-
-class Keys(Interactive):
-    """Each key, on a unit whose update has ended unless the key is for a running one."""
+        assert list(self.folder.iterdir()) == []
 
     def ended(self, speed: int = 3000) -> Terminal:
         """A terminal whose first update has ended."""
-        terminal = self.bench("up-to-date", speed)
+        terminal = self.start("up-to-date", speed)
         terminal.wait_for("nothing to update", OUTCOME)
         return terminal
 
@@ -74,83 +66,117 @@ class Keys(Interactive):
         terminal.press("u")
         return terminal.wait_for(OUTCOME)
 
-    def test_stick(self) -> None:
-        terminal = self.ended()
-        shown = self.update_after(terminal, "s", "stick: out")
-        self.assertRegex(shown, r"read the stick .* exit 2")
-        self.update_after(terminal, "s", "stick: in")
-        terminal.wait_for("nothing to update")
-
     def check_part(self, key: str, off: str, on: str, step: str, status: int) -> str:
         """The key takes a part away, which the step shows, and gives it back; the screen without the part."""
         terminal = self.ended()
         without = self.update_after(terminal, key, off)
-        self.assertRegex(without, f"{step} .* exit {status}")
-        self.assertRegex(self.update_after(terminal, key, on), rf"{step} +\d\.\d s(?!,)")
+        assert re.search(f"{step} .* exit {status}", without)
+        assert re.search(rf"{step} +\d\.\d s(?!,)", self.update_after(terminal, key, on))
         return without
 
-    def test_link(self) -> None:
-        self.check_part("l", "link: down", "link: up", "read the board", 255)
+    def running(self) -> Terminal:
+        """A terminal, xterm, in which an update runs."""
+        terminal = self.start("up-to-date", TERM="xterm")
+        terminal.wait_for("so far")
+        assert terminal.modes()[3] != terminal.before[3]
+        return terminal
 
-    def test_board(self) -> None:
-        self.check_part("b", "board: hangs", "board: works", "read the board", 255)
 
-    def test_mirrors(self) -> None:
-        without = self.check_part("m", "mirrors: down", "mirrors: up", "refresh the mirrors", 100)
-        self.assertIn("the mirrors or a version could not be read", without)
+@pytest.fixture
+def bench(tmp_path: Path, build: Path, pytestconfig: pytest.Config) -> Iterator[Bench]:
+    """Ends what still runs after the test, and looks whether the units are gone."""
+    with contextlib.ExitStack() as terminals:
+        yield Bench(tmp_path, ["--build", str(build), "--unit", pytestconfig.getoption("unit")], terminals)
 
-    def test_sound(self) -> None:
-        self.check_part("a", "sound: off", "sound: on", "play the pass sound", 1)
 
-    def test_bus(self) -> None:
-        terminal = self.ended()
-        self.assertEqual(terminal.text().count("[P]"), 2)
+def so_far(terminal: Terminal, step: str) -> float:
+    """How long the step has been running (s), as soon as that changes."""
+    number = rf"{step} +(\d+\.\d) s so far"
+    now = re.findall(number, terminal.wait_until(number))[0]
+    return float(re.findall(number, terminal.wait_until(rf"{step} +(?!{re.escape(now)} )\d+\.\d s so far"))[0])
+
+
+def next_left(terminal: Terminal) -> int:
+    """How many seconds of the wait are left, once it is another number than now."""
+    number = r"wait for the board +(\d+) s left"
+    now = re.findall(number, terminal.wait_until(number))[0]
+    return int(re.findall(number, terminal.wait_until(rf"wait for the board +(?!{now} )\d+ s left"))[0])
+
+
+def check_given_back(terminal: Terminal, status: int) -> None:
+    assert terminal.wait_for_end() == status
+    for sequence in GIVEN_BACK:
+        assert sequence in terminal.written
+    # The modes of a pseudo-terminal stay when its program has ended.
+    assert terminal.modes() == terminal.before
+
+
+class TestKeys:
+    """Each key, on a unit whose update has ended unless the key is for a running one."""
+
+    def test_stick(self, bench: Bench) -> None:
+        terminal = bench.ended()
+        shown = bench.update_after(terminal, "s", "stick: out")
+        assert re.search(r"read the stick .* exit 2", shown)
+        bench.update_after(terminal, "s", "stick: in")
+        terminal.wait_for("nothing to update")
+
+    def test_link(self, bench: Bench) -> None:
+        bench.check_part("l", "link: down", "link: up", "read the board", 255)
+
+    def test_board(self, bench: Bench) -> None:
+        bench.check_part("b", "board: hangs", "board: works", "read the board", 255)
+
+    def test_mirrors(self, bench: Bench) -> None:
+        without = bench.check_part("m", "mirrors: down", "mirrors: up", "refresh the mirrors", 100)
+        assert "the mirrors or a version could not be read" in without
+
+    def test_sound(self, bench: Bench) -> None:
+        bench.check_part("a", "sound: off", "sound: on", "play the pass sound", 1)
+
+    def test_bus(self, bench: Bench) -> None:
+        terminal = bench.ended()
+        assert terminal.text().count("[P]") == 2
         terminal.press("p", "p")  # the panel has been without power
         terminal.wait_for("power: on")
-        self.assertNotIn("[P]", self.update_after(terminal, "i", "bus: down"))
-        self.assertEqual(self.update_after(terminal, "i", "bus: up").count("[P]"), 2)
+        assert "[P]" not in bench.update_after(terminal, "i", "bus: down")
+        assert bench.update_after(terminal, "i", "bus: up").count("[P]") == 2
 
-    def test_power(self) -> None:
-        terminal = self.ended()
+    def test_power(self, bench: Bench) -> None:
+        terminal = bench.ended()
         terminal.press("p")
         shown = terminal.wait_for("everything on the head is dead", "harl inactive", "stick not mounted")
-        self.assertNotIn("[P]", shown)
+        assert "[P]" not in shown
         terminal.press("u")
         terminal.wait_for("there is no power")
         terminal.press("p")
         terminal.wait_for("power on", "harl active", "stick mounted")
 
-    def test_hang_and_kill_the_command(self) -> None:
-        self.hold("apt update")
-        terminal = self.bench("up-to-date", 3000)
-        first = self.so_far(terminal, "refresh the mirrors")
+    def test_hang_and_kill_the_command(self, bench: Bench) -> None:
+        bench.hold("apt update")
+        terminal = bench.start("up-to-date", 3000)
+        first = so_far(terminal, "refresh the mirrors")
         terminal.press("h")
         terminal.wait_for("hangs; h lets it continue")
-        self.hold("apt-cache policy *")
-        while self.so_far(terminal, "refresh the mirrors") < first + 1:
+        bench.hold("apt-cache policy *")
+        while so_far(terminal, "refresh the mirrors") < first + 1:
             pass
         terminal.press("h")
         terminal.wait_for("the command continues")
-        self.so_far(terminal, "compare the package")
+        so_far(terminal, "compare the package")
         terminal.press("k")
         terminal.wait_for("killed")
         terminal.wait_until(r"compare the package +\d+\.\d s, (signal 9|exit 137)")
 
-    def so_far(self, terminal: Terminal, step: str) -> float:
-        """How long the step has been running (s), as soon as that changes."""
-        number = rf"{step} +(\d+\.\d) s so far"
-        now = re.findall(number, terminal.wait_until(number))[0]
-        return float(re.findall(number, terminal.wait_until(rf"{step} +(?!{re.escape(now)} )\d+\.\d s so far"))[0])
-
-    def test_kill_the_updater(self) -> None:
-        self.hold("apt update")
-        terminal = self.bench("up-to-date")
+    def test_kill_the_updater(self, bench: Bench) -> None:
+        bench.hold("apt update")
+        terminal = bench.start("up-to-date")
         terminal.wait_until("refresh the mirrors .* so far")
         terminal.press("u")
         terminal.wait_for("the updater is already running")
         terminal.press("x")
         terminal.wait_until("The updater is not running", "skipped", "(signal 9|status 137): the panel shows no")
-        self.let_go()
+        bench.let_go()
         for key, what in {"x": "the updater", "h": "no command", "k": "no command"}.items():
             terminal.press("+")
             terminal.wait_for("waits are")  # instead of the last answer
@@ -159,28 +185,22 @@ class Keys(Interactive):
         terminal.press("u")
         terminal.wait_for("nothing to update")
 
-    def test_speed(self) -> None:
-        self.hold("ssh * /unzipUpgrade.sh")
-        terminal = self.bench("board-only", 1000)
+    def test_speed(self, bench: Bench) -> None:
+        bench.hold("ssh * /unzipUpgrade.sh")
+        terminal = bench.start("board-only", 1000)
         terminal.wait_until("run the board's script .* so far")
         terminal.press(*"-------")  # seven times three times slower: 780 s take their time
         terminal.wait_for("waits are at full length")
-        self.let_go()
-        first, since = self.next_left(terminal), time.monotonic()
-        passed = first - self.next_left(terminal)
-        self.assertLessEqual(passed, 2 + 2 * (time.monotonic() - since))
+        bench.let_go()
+        first, since = next_left(terminal), time.monotonic()
+        passed = first - next_left(terminal)
+        assert passed <= 2 + 2 * (time.monotonic() - since)
         terminal.press(*"++++++++")
         terminal.wait_for("waits are 6561 times shorter")
         terminal.wait_for("updated", OUTCOME)
 
-    def next_left(self, terminal: Terminal) -> int:
-        """How many seconds of the wait are left, once it is another number than now."""
-        number = r"wait for the board +(\d+) s left"
-        now = re.findall(number, terminal.wait_until(number))[0]
-        return int(re.findall(number, terminal.wait_until(rf"wait for the board +(?!{now} )\d+ s left"))[0])
-
-    def test_shell(self) -> None:
-        terminal = self.ended()
+    def test_shell(self, bench: Bench) -> None:
+        terminal = bench.ended()
         terminal.press("!")
         terminal.wait_for("A shell on the head", "# ")
         terminal.press("echo $((6 * 7)) answers; apt-cache policy solvik4-rh\r")
@@ -191,93 +211,77 @@ class Keys(Interactive):
         terminal.press("s")
         terminal.wait_for("stick: out")
 
-    def test_end(self) -> None:
-        terminal = self.ended()
+    def test_end(self, bench: Bench) -> None:
+        terminal = bench.ended()
         terminal.press("q")
-        self.assertEqual(terminal.wait_for_end(), 0)
-        self.assertRegex(terminal.text(), r"Update 1: (signal 15|status 143), panel REMOTE pass, MAIN pass")
+        assert terminal.wait_for_end() == 0
+        assert re.search(r"Update 1: (signal 15|status 143), panel REMOTE pass, MAIN pass", terminal.text())
 
-    def test_other_keys_do_nothing(self) -> None:
-        terminal = self.ended()
+    def test_other_keys_do_nothing(self, bench: Bench) -> None:
+        terminal = bench.ended()
         terminal.press("z", "\x1b[A", "\x1b[15~", "ä", "\t", "s")
         terminal.wait_for("stick: out")
 
 
-class GivenBack(Interactive):
+class TestGivenBack:
     """The terminal is as before however the program ends, and the unit is gone."""
 
-    def check(self, terminal: Terminal, status: int) -> None:
-        self.assertEqual(terminal.wait_for_end(), status)
-        for sequence in GIVEN_BACK:
-            self.assertIn(sequence, terminal.written)
-        # The modes of a pseudo-terminal stay when its program has ended.
-        self.assertEqual(terminal.modes(), terminal.before)
+    @pytest.mark.parametrize("name, status", [("SIGTERM", 143), ("SIGHUP", 129), ("SIGINT", 130)])
+    def test_after_signal(self, bench: Bench, name: str, status: int) -> None:
+        terminal = bench.running()
+        terminal.process.kill(signal.Signals[name])
+        check_given_back(terminal, status)
 
-    def running(self) -> Terminal:
-        """A terminal, xterm, in which an update runs."""
-        terminal = self.bench("up-to-date", TERM="xterm")
-        terminal.wait_for("so far")
-        self.assertNotEqual(terminal.modes()[3], terminal.before[3])
-        return terminal
-
-    def test_after_signals(self) -> None:
-        for number, status in ((signal.SIGTERM, 143), (signal.SIGHUP, 129), (signal.SIGINT, 130)):
-            with self.subTest(number):
-                terminal = self.running()
-                terminal.process.kill(number)
-                self.check(terminal, status)
-
-    def test_after_control_c(self) -> None:
-        terminal = self.running()
+    def test_after_control_c(self, bench: Bench) -> None:
+        terminal = bench.running()
         terminal.press("\x03")
-        self.check(terminal, 130)
+        check_given_back(terminal, 130)
 
-    def test_after_an_exception(self) -> None:
-        terminal = self.running()
-        [calls] = self.folder.glob("bench-*/calls")
+    def test_after_an_exception(self, bench: Bench) -> None:
+        terminal = bench.running()
+        [calls] = bench.folder.glob("bench-*/calls")
         with calls.open("a") as file:
             file.write("no call\n")
-        self.check(terminal, 1)
-        self.assertIn("ValueError", terminal.text())
+        check_given_back(terminal, 1)
+        assert "ValueError" in terminal.text()
 
-    def test_with_a_closed_terminal(self) -> None:
-        terminal = self.running()
+    def test_with_a_closed_terminal(self, bench: Bench) -> None:
+        terminal = bench.running()
         terminal.process.ptyproc.fileobj.close()
         terminal.process.wait()
-        self.assertEqual(terminal.process.exitstatus, 129)
+        assert terminal.process.exitstatus == 129
 
-    def test_from_the_shell(self) -> None:
-        terminal = self.running()
+    def test_from_the_shell(self, bench: Bench) -> None:
+        terminal = bench.running()
         terminal.press("!")
         terminal.wait_for("A shell on the head", "# ")
         terminal.process.kill(signal.SIGTERM)
-        self.assertEqual(terminal.wait_for_end(), 143)
-        self.assertEqual(terminal.modes()[3], terminal.before[3])
+        assert terminal.wait_for_end() == 143
+        assert terminal.modes()[3] == terminal.before[3]
 
 
-class Terminals(Interactive):
+class TestTerminals:
     """Different terminals."""
 
-    def test_colors(self) -> None:
-        self.hold("apt update")
-        terminal = self.bench("up-to-date", 3000)
+    def test_colors(self, bench: Bench) -> None:
+        bench.hold("apt update")
+        terminal = bench.start("up-to-date", 3000)
         terminal.wait_for("[B]")
-        self.let_go()
+        bench.let_go()
         terminal.wait_for("[P]", OUTCOME)
-        self.assertLessEqual({"default", "green"}, terminal.colors())
+        assert {"default", "green"} <= terminal.colors()
 
-    def test_without_colors(self) -> None:
-        for name, value in (("NO_COLOR", "1"), ("TERM", "vt100")):
-            with self.subTest(name):
-                terminal = self.bench("up-to-date", 3000, 80, 24, **{name: value})
-                terminal.wait_for("[P]", OUTCOME)
-                self.assertEqual(terminal.colors(), {"default"})
-                self.assertNotRegex(terminal.written, rb"\x1b\[[0-9;]*3[0-7][;m]")
-                terminal.press("q")
-                self.assertEqual(terminal.wait_for_end(), 0)
+    @pytest.mark.parametrize("name, value", [("NO_COLOR", "1"), ("TERM", "vt100")])
+    def test_without_colors(self, bench: Bench, name: str, value: str) -> None:
+        terminal = bench.start("up-to-date", 3000, 80, 24, **{name: value})
+        terminal.wait_for("[P]", OUTCOME)
+        assert terminal.colors() == {"default"}
+        assert not re.search(rb"\x1b\[[0-9;]*3[0-7][;m]", terminal.written)
+        terminal.press("q")
+        assert terminal.wait_for_end() == 0
 
-    def test_everything_fits(self) -> None:
-        text = self.bench("up-to-date", 3000).wait_for(OUTCOME, "updater inactive")
+    def test_everything_fits(self, bench: Bench) -> None:
+        text = bench.start("up-to-date", 3000).wait_for(OUTCOME, "updater inactive")
         rows = text.splitlines()
         for row, begin in (
             (0, " up-to-date: "),
@@ -287,95 +291,90 @@ class Terminals(Interactive):
             (22, "p power"),
             (23, "u update"),
         ):
-            self.assertTrue(rows[row].startswith(begin), text)
-        self.assertIn("q end", rows[23])
-        self.assertIn("stopUpdater:", text)
+            assert rows[row].startswith(begin), text
+        assert "q end" in rows[23]
+        assert "stopUpdater:" in text
 
-    def test_small_and_large_terminals(self) -> None:
-        for columns, lines in ((40, 10), (200, 60)):
-            with self.subTest(columns):
-                terminal = self.bench("up-to-date", 3000, columns, lines)
-                terminal.wait_for("[P]")
-                terminal.press("q")
-                self.assertEqual(terminal.wait_for_end(), 0)
+    @pytest.mark.parametrize("columns, lines", [(40, 10), (200, 60)])
+    def test_small_or_large_terminal(self, bench: Bench, columns: int, lines: int) -> None:
+        terminal = bench.start("up-to-date", 3000, columns, lines)
+        terminal.wait_for("[P]")
+        terminal.press("q")
+        assert terminal.wait_for_end() == 0
 
-    def test_refused(self) -> None:
-        for name in ("dumb", "unknown-to-all"):
-            terminal = self.bench("up-to-date", TERM=name)
-            self.assertEqual(terminal.wait_for_end(), 1)
-            self.assertIn(f"a terminal of the type '{name}' is not known, or cannot move its cursor",
-                          " ".join(terminal.text().split()))
+    @pytest.mark.parametrize("name", ["dumb", "unknown-to-all"])
+    def test_refused(self, bench: Bench, name: str) -> None:
+        terminal = bench.start("up-to-date", TERM=name)
+        assert terminal.wait_for_end() == 1
+        assert f"a terminal of the type '{name}' is not known, or cannot move its cursor" in " ".join(
+            terminal.text().split()
+        )
 
 
-class Stories(Interactive):
+class TestStories:
     """What a technician may try, from the beginning to the end."""
 
-    def test_stick_pulled_in_the_upload_and_plugged_in_again(self) -> None:
-        self.hold("scp *")
-        terminal = self.bench("board-slow", 300)
+    def test_stick_pulled_in_the_upload_and_plugged_in_again(self, bench: Bench) -> None:
+        bench.hold("scp *")
+        terminal = bench.start("board-slow", 300)
         terminal.wait_until("upload to the board .* so far", "run the board's script")
         terminal.press("s")
         terminal.wait_for("stick: out")
-        self.let_go()
+        bench.let_go()
         terminal.wait_until(r"try ([3-9]|1\d) of 20")
-        self.hold("scp *")
+        bench.hold("scp *")
         terminal.press("s")
         terminal.wait_for("stick: in")
-        self.let_go()
+        bench.let_go()
         shown = terminal.wait_for("updated", OUTCOME)
-        self.assertRegex(shown, r"upload, try ([3-9]|1\d) of 20 +\d+\.\d s ")
-        self.assertIn("board 2.2.0", shown)
-        self.assertIn("[P]", shown)
+        assert re.search(r"upload, try ([3-9]|1\d) of 20 +\d+\.\d s ", shown)
+        assert "board 2.2.0" in shown
+        assert "[P]" in shown
 
-    def test_power_cut_in_the_installation_then_the_next_run(self) -> None:
-        self.hold("apt --assume-yes install *")
-        terminal = self.bench("package-database-locked", 300)
+    def test_power_cut_in_the_installation_then_the_next_run(self, bench: Bench) -> None:
+        bench.hold("apt --assume-yes install *")
+        terminal = bench.start("package-database-locked", 300)
         terminal.wait_until("install the package .* so far")
         terminal.press("p")
         shown = terminal.wait_for("is dead", "harl inactive", "updater inactive", "stick not mounted")
-        self.assertRegex(shown, r"install the package +cut short")
-        self.assertNotIn("[B]", shown)
+        assert re.search(r"install the package +cut short", shown)
+        assert "[B]" not in shown
         [found] = re.findall(r"package (1\.[23]\.0)", shown)  # a package that is unpacked counts as installed
         terminal.press("p")
         terminal.wait_for("power on", "harl active", "stick mounted", "updater inactive")
-        self.let_go()
+        bench.let_go()
         terminal.press("u")
         shown = terminal.wait_for(OUTCOME)
         if "could not be installed" in shown:  # the real dpkg knows that it was interrupted
-            self.assertRegex(shown, r"install the package .* exit 100")
+            assert re.search(r"install the package .* exit 100", shown)
             terminal.press("!")
             terminal.wait_for("A shell on the head", "# ")
             terminal.press("dpkg --configure -a; exit\r")
             terminal.wait_for("back from the shell")
             terminal.press("s", "s", "u")  # the failed update has released the stick
             shown = terminal.wait_for(OUTCOME)
-        self.assertIn("package 1.3.0", shown)
-        self.assertIn("updated" if found == "1.2.0" else "nothing to update", shown)
-        self.assertEqual("install the package" in shown, found == "1.2.0")
-        self.assertIn("[P]", shown)
+        assert "package 1.3.0" in shown
+        assert ("updated" if found == "1.2.0" else "nothing to update") in shown
+        assert ("install the package" in shown) == (found == "1.2.0")
+        assert "[P]" in shown
         terminal.press("q")
         terminal.wait_for_end()
-        self.assertRegex(terminal.text(), "Update 1: power cut, panel (dark|REMOTE blue|MAIN blue)")
-        self.assertRegex(terminal.text(), "Update [23]: (signal 15|status 143), panel (PASS|REMOTE pass, MAIN) pass")
+        assert re.search("Update 1: power cut, panel (dark|REMOTE blue|MAIN blue)", terminal.text())
+        assert re.search("Update [23]: (signal 15|status 143), panel (PASS|REMOTE pass, MAIN) pass", terminal.text())
 
-    def test_board_that_hangs_then_its_link_is_cut(self) -> None:
-        self.hold("scp *")
-        terminal = self.bench("board-slow", 60)
+    def test_board_that_hangs_then_its_link_is_cut(self, bench: Bench) -> None:
+        bench.hold("scp *")
+        terminal = bench.start("board-slow", 60)
         terminal.wait_until(r"upload to the board +([1-9]|\d\d)\.\d s so far")  # in a real unit's first copy
         terminal.press("b")
         terminal.wait_for("board: hangs")
-        self.let_go()
+        bench.let_go()
         terminal.wait_until(r"upload to the board +([6-9]|\d\d)\.\d s so far")  # takes less without that
         terminal.press("l", "+", "+", "+")
         terminal.wait_for("link down")
         shown = terminal.wait_for("try 20 of 20", "the package or the board could not be installed", OUTCOME)
-        self.assertRegex(shown, r"upload, try 20 of 20 +\d+\.\d s, exit ")
-        self.assertRegex(shown, r"run the board's script +skipped")
-        self.assertIn("play the fail sound", shown)
-        self.assertIn("[F]", shown)
-        self.assertIn("harl active", shown)
-
-
-if __name__ == "__main__":
-    KIND, BUILD = take_word(), take_path()
-    unittest.main()
+        assert re.search(r"upload, try 20 of 20 +\d+\.\d s, exit ", shown)
+        assert re.search(r"run the board's script +skipped", shown)
+        assert "play the fail sound" in shown
+        assert "[F]" in shown
+        assert "harl active" in shown

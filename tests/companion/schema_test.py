@@ -1,73 +1,65 @@
-"""Usage: schema_test.py TOOL
-
-Holds what each command prints with --json against docs/harl-updater-tool.schema.json.
-"""
+"""Holds what each command prints with --json against docs/harl-updater-tool.schema.json."""
 
 import json
 import subprocess
-import sys
-import tempfile
-import unittest
+from collections.abc import Callable
 from pathlib import Path
 
 import jsonschema  # of Debian's python3-jsonschema
+import pytest
 
-ROOT = Path(__file__).resolve().parents[2]
+ROOT = Path(__file__).parents[2]
 GOLDEN = ROOT / "tests/companion/golden/log"
 SCHEMA = json.loads((ROOT / "docs/harl-updater-tool.schema.json").read_text())
-TOOL = ""
+VALIDATOR = jsonschema.Draft202012Validator(SCHEMA)
+COMMANDS = [
+    *(f"log --json {log.name}" for log in sorted(GOLDEN.glob("*.log"))),
+    "log --json /dev/null",
+    "log --json /nonexistent",
+    "log --json --follow /dev/null",
+    "fleet --json .",
+    "fleet --json --since 2026-11-21 /dev/null /nonexistent",
+    "stick --json EMPTY",
+    "report --json EMPTY/none/report.tar.gz",
+    "stick --json /nonexistent",
+    "check --json /nonexistent",
+    "explain --json",
+    "explain --json mirrors-expired",
+    "explain --json nonsense",
+    # Wrong usage.
+    "log --json --nonsense",
+    "--json",
+]
+Printed = Callable[[str], str]
 
 
-def printed(*arguments: str) -> str:
-    """What the tool prints."""
-    done = subprocess.run([TOOL, *arguments], stdin=subprocess.DEVNULL, capture_output=True, timeout=60, check=False)
-    return done.stdout.decode()
+@pytest.fixture
+def printed(tool: Path) -> Printed:
+    """What the tool prints for the words after its name."""
+
+    def run(words: str) -> str:
+        command = [str(tool), *words.split()]
+        done = subprocess.run(
+            command, cwd=GOLDEN, stdin=subprocess.DEVNULL, capture_output=True, timeout=60, check=False
+        )
+        return done.stdout.decode()
+
+    return run
 
 
-class Schema(unittest.TestCase):
-    """The objects are as described."""
-
-    def setUp(self) -> None:
-        jsonschema.Draft202012Validator.check_schema(SCHEMA)
-        self.validator = jsonschema.Draft202012Validator(SCHEMA)
-
-    def expect_valid(self, *arguments: str) -> None:
-        lines = "--follow" in arguments or arguments[0] == "fleet"
-        for text in printed(*arguments).splitlines() if lines else [printed(*arguments)]:
-            with self.subTest(arguments):
-                self.validator.validate(json.loads(text))
-
-    def test_logs(self) -> None:
-        for log in sorted(GOLDEN.glob("*.log")):
-            self.expect_valid("log", "--json", str(log))
-        self.expect_valid("log", "--json", "/dev/null")
-        self.expect_valid("log", "--json", "/nonexistent")
-        self.expect_valid("log", "--json", "--follow", "/dev/null")
-
-    def test_fleets(self) -> None:
-        self.expect_valid("fleet", "--json", str(GOLDEN))
-        self.expect_valid("fleet", "--json", "--since", "2026-11-21", "/dev/null", "/nonexistent")
-
-    def test_sticks_and_catalogue(self) -> None:
-        with tempfile.TemporaryDirectory() as folder:
-            self.expect_valid("stick", "--json", folder)
-            self.expect_valid("report", "--json", f"{folder}/none/report.tar.gz")
-        self.expect_valid("stick", "--json", "/nonexistent")
-        self.expect_valid("check", "--json", "/nonexistent")
-        self.expect_valid("explain", "--json")
-        self.expect_valid("explain", "--json", "mirrors-expired")
-        self.expect_valid("explain", "--json", "nonsense")
-
-    def test_wrong_usage(self) -> None:
-        self.expect_valid("log", "--json", "--nonsense")
-        self.expect_valid("--json")
-
-    def test_another_object_is_not_valid(self) -> None:
-        run = json.loads(printed("log", "--json", str(GOLDEN / "up-to-date.log")))
-        del run["runs"][0]["outcome"]
-        self.assertFalse(self.validator.is_valid(run))
+def test_schema_is_one() -> None:
+    jsonschema.Draft202012Validator.check_schema(SCHEMA)
 
 
-if __name__ == "__main__":
-    TOOL = sys.argv.pop()
-    unittest.main()
+@pytest.mark.parametrize("command", COMMANDS)
+def test_objects_are_as_described(printed: Printed, tmp_path: Path, command: str) -> None:
+    text = printed(command.replace("EMPTY", str(tmp_path)))
+    has_lines = "--follow" in command or command.startswith("fleet")
+    for part in text.splitlines() if has_lines else [text]:
+        VALIDATOR.validate(json.loads(part))
+
+
+def test_another_object_is_not_valid(printed: Printed) -> None:
+    run = json.loads(printed("log --json up-to-date.log"))
+    del run["runs"][0]["outcome"]
+    assert not VALIDATOR.is_valid(run)

@@ -1,7 +1,6 @@
 """Versions: banner, build, changelog, package and manual page agree."""
 
 import re
-import unittest
 from pathlib import Path
 
 ROOT = Path(__file__).parents[2]
@@ -26,27 +25,20 @@ def read_changelog(path: str, head: str, bullet: str) -> dict[str, list[str]]:
     return versions
 
 
-class Version(unittest.TestCase):
-    """The banner is the reference for the others."""
-
-    def test_changelogs_agree(self) -> None:
-        whole = read_changelog("CHANGELOG.md", r"## (\S+)", r"- (.*)")
-        packages = read_changelog("debian/changelog", r"harl-updater \(([\d.]+)", r"  \* (.*)")
-        self.assertEqual(list(packages), list(whole))
-        for version, items in packages.items():
-            self.assertTrue(items)
-            self.assertEqual([item for item in items if item not in whole[version]], [])
-
-    def test_all_follow_the_banner(self) -> None:
-        banner = find("remote/main.cpp", r"TavrenUpdater version: ([\d.]+)")
-        self.assertRegex(banner, r"^\d+\.\d+\.\d+$")
-        self.assertEqual(find("CMakeLists.txt", r"project\(harl-updater VERSION ([\d.]+)"), banner)
-        self.assertEqual(find("CHANGELOG.md", r"^## (\S+)"), banner)
-        self.assertEqual(find("debian/changelog", r"^harl-updater \((\S+)\)"), banner)
-        self.assertEqual(find("docs/man/harl-updater.8", r'^\.TH HARL-UPDATER 8 \S+ "harl-updater (\S+)"'), banner)
-        self.assertEqual(find("docs/man/harl-updater-tool.1", r'^\.TH HARL-UPDATER-TOOL 1 \S+ "harl-updater (\S+)"'),
-                         banner)
+def test_changelogs_agree() -> None:
+    whole = read_changelog("CHANGELOG.md", r"## (\S+)", r"- (.*)")
+    packages = read_changelog("debian/changelog", r"harl-updater \(([\d.]+)", r"  \* (.*)")
+    assert list(packages) == list(whole)
+    for version, items in packages.items():
+        assert items
+        assert [item for item in items if item not in whole[version]] == []
 
 
-if __name__ == "__main__":
-    unittest.main()
+def test_all_follow_the_banner() -> None:
+    banner = find("remote/main.cpp", r"TavrenUpdater version: ([\d.]+)")
+    assert re.search(r"^\d+\.\d+\.\d+$", banner)
+    assert find("CMakeLists.txt", r"project\(harl-updater VERSION ([\d.]+)") == banner
+    assert find("CHANGELOG.md", r"^## (\S+)") == banner
+    assert find("debian/changelog", r"^harl-updater \((\S+)\)") == banner
+    assert find("docs/man/harl-updater.8", r'^\.TH HARL-UPDATER 8 \S+ "harl-updater (\S+)"') == banner
+    assert find("docs/man/harl-updater-tool.1", r'^\.TH HARL-UPDATER-TOOL 1 \S+ "harl-updater (\S+)"') == banner

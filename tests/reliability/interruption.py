@@ -5,7 +5,7 @@ That run must end as a first run on a unit with that package, board, marker and 
 
 import copy
 import shlex
-from collections.abc import Callable
+from collections.abc import Callable, Iterable
 from concurrent.futures import ThreadPoolExecutor
 from dataclasses import dataclass
 from functools import cache, partial
@@ -91,9 +91,13 @@ class InterruptedUnit(Unit, Protocol):
 Maker = Callable[[Scenario, Path, Interruption | None], InterruptedUnit]
 
 
-def interrupt_all(make: Maker, killed: list[str], points: list[str], at_once: int) -> list[Aftermath]:
-    """Every one of `killed` at all `points`, `at_once` at a time."""
-    cases = [Interruption(who, point, moment) for who in killed for point in points for moment in MOMENTS]
+def interruptions(killed: Iterable[str], points: Iterable[str]) -> list[Interruption]:
+    """Every one of `killed` at all `points`."""
+    return [Interruption(who, point, moment) for who in killed for point in points for moment in MOMENTS]
+
+
+def interrupt_all(make: Maker, cases: list[Interruption], at_once: int) -> list[Aftermath]:
+    """The result of each case, `at_once` at a time."""
     with ThreadPoolExecutor(at_once) as pool:
         return list(pool.map(partial(_interrupt, make), cases))
 

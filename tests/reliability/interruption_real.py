@@ -21,7 +21,7 @@ from bench.scenario import Scenario
 from bench.unit import UnitError
 from tests.reliability import interruption
 from tests.reliability.disturbed import SPEED
-from tests.reliability.interruption import HEADER, Aftermath, Interruption, interrupt_all
+from tests.reliability.interruption import HEADER, Aftermath, Interruption, interrupt_all, interruptions
 
 AT_ONCE = 3
 
@@ -131,9 +131,10 @@ def main() -> int:
     build()
     if reason := forbidden():
         sys.exit(f"interruption_real: this machine forbids namespaces: {reason}")
+    cases = interruptions(KILLS, points)
     print(HEADER)
     try:
-        as_due = [report(aftermath) for aftermath in interrupt_all(InterruptedReal, list(KILLS), points, AT_ONCE)]
+        as_due = [report(aftermath) for aftermath in interrupt_all(InterruptedReal, cases, AT_ONCE)]
     except UnitError as error:
         sys.exit(f"interruption_real: {error}")
     print(f"{len(as_due)} interruptions, {as_due.count(False)} with a difference")

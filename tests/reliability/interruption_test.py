@@ -1,20 +1,15 @@
-"""Usage: interruption_test.py BUILD_FOLDER
-       interruption_test.py BUILD_FOLDER --table
+"""Ends the updater, or the whole unit, at each command of an update in turn, on stand-in units: right before the
+command takes effect and right after."""
 
-Ends the updater, or the whole unit, at each command of an update in turn, on stand-in units: right before the command
-takes effect and right after. --table prints the result of each.
-"""
-
-import sys
-import unittest
+from functools import partial
 from pathlib import Path
 
-from bench.scenario import Scenario
-from tests.command_line import take_path
-from tests.reliability.disturbed import DisturbedUnit
-from tests.reliability.interruption import HEADER, POINTS, Aftermath, Interruption, interrupt_all
+import pytest
 
-BUILD = Path()
+from bench.scenario import Scenario
+from tests.reliability.disturbed import DisturbedUnit
+from tests.reliability.interruption import POINTS, Aftermath, Interruption, interrupt_all, interruptions
+
 AT_ONCE = 4
 
 # The updater alone: its command runs to its end. The unit: everything ends, the updater first, which must not continue
@@ -35,8 +30,8 @@ MARKER_STAYS = {
 class InterruptedStandIn(DisturbedUnit):
     """A stand-in unit that is interrupted in its first run."""
 
-    def __init__(self, what: Scenario, folder: Path, interruption: Interruption | None) -> None:
-        super().__init__(what, folder, BUILD)
+    def __init__(self, build: Path, what: Scenario, folder: Path, interruption: Interruption | None) -> None:
+        super().__init__(what, folder, build)
         if interruption is None:
             return
         tool, arguments = POINTS[interruption.point]
@@ -63,54 +58,39 @@ class InterruptedStandIn(DisturbedUnit):
         self.close()
 
 
-class InterruptionTest(unittest.TestCase):
-    """One table of aftermaths, checked in several ways."""
-
-    aftermaths: list[Aftermath]
-
-    @classmethod
-    def setUpClass(cls) -> None:
-        cls.aftermaths = interrupt_all(InterruptedStandIn, list(KILLS), list(POINTS), AT_ONCE)
-
-    def test_every_command_is_interrupted(self) -> None:
-        self.assertEqual(len(self.aftermaths), len(KILLS) * len(POINTS) * 2)
-        self.assertEqual(len(POINTS), 12)
-
-    def test_next_run_ends_as_a_first_run_on_that_state(self) -> None:
-        self.maxDiff = None
-        for aftermath in self.aftermaths:
-            with self.subTest(aftermath.interruption):
-                self.assertEqual(aftermath.differences(), [])
-
-    def test_next_run_gives_the_instrument_back(self) -> None:
-        for aftermath in self.aftermaths:
-            with self.subTest(aftermath.interruption):
-                self.assertEqual(aftermath.second["harl"], "active")
-                self.assertFalse(aftermath.second["stick"])
-
-    def test_package_and_board_are_up_to_date_after_the_next_run(self) -> None:
-        for aftermath in self.aftermaths:
-            with self.subTest(aftermath.interruption):
-                self.assertEqual(aftermath.second["package"], "1.3.0")
-                self.assertEqual(aftermath.second["board"], "2.2.0")
-
-    def test_marker_stays_only_where_both_were_installed_before_the_interruption(self) -> None:
-        for aftermath in self.aftermaths:
-            what = aftermath.interruption
-            with self.subTest(what):
-                self.assertEqual(aftermath.second["marker"], (what.killed, what.point, what.moment) in MARKER_STAYS)
+CASES = interruptions(KILLS, POINTS)
 
 
-def print_table() -> None:
-    """A row for each interruption."""
-    print(HEADER)
-    for aftermath in interrupt_all(InterruptedStandIn, list(KILLS), list(POINTS), AT_ONCE):
-        print(aftermath.row())
+@pytest.fixture(scope="module")
+def aftermaths(build: Path) -> dict[Interruption, Aftermath]:
+    all_of_them = interrupt_all(partial(InterruptedStandIn, build), CASES, AT_ONCE)
+    return {aftermath.interruption: aftermath for aftermath in all_of_them}
 
 
-if __name__ == "__main__":
-    BUILD = take_path()
-    if sys.argv[1:] == ["--table"]:
-        print_table()
-    else:
-        unittest.main()
+@pytest.fixture(params=CASES, ids=lambda case: f"{case.killed}-{case.moment}-{case.point}")
+def aftermath(aftermaths: dict[Interruption, Aftermath], request: pytest.FixtureRequest) -> Aftermath:
+    return aftermaths[request.param]
+
+
+def test_every_command_is_interrupted() -> None:
+    assert len(CASES) == len(KILLS) * len(POINTS) * 2
+    assert len(POINTS) == 12
+
+
+def test_next_run_ends_as_a_first_run_on_that_state(aftermath: Aftermath) -> None:
+    assert aftermath.differences() == []
+
+
+def test_next_run_gives_the_instrument_back(aftermath: Aftermath) -> None:
+    assert aftermath.second["harl"] == "active"
+    assert not aftermath.second["stick"]
+
+
+def test_package_and_board_are_up_to_date_after_the_next_run(aftermath: Aftermath) -> None:
+    assert aftermath.second["package"] == "1.3.0"
+    assert aftermath.second["board"] == "2.2.0"
+
+
+def test_marker_stays_only_where_both_were_installed_before_the_interruption(aftermath: Aftermath) -> None:
+    what = aftermath.interruption
+    assert aftermath.second["marker"] == ((what.killed, what.point, what.moment) in MARKER_STAYS)

@@ -2,9 +2,11 @@
 
 import re
 import subprocess
-import unittest
+from pathlib import Path
 
-from tests.service.stand_in import StandInTest
+import pytest
+
+from tests.service.stand_in import StandIn
 
 CALL = 'call="${0##*/} $*"; echo "$call" >>"$UNIT/calls"\n'
 # The call that MENDED names leaves these packages.
@@ -35,23 +37,19 @@ REINSTALL = "apt-get --assume-yes --reinstall install"
 BROKEN = "iF solvik4-rh\n"
 
 
-class Prepare(StandInTest):
+class Unit(StandIn):
     """A unit on which nothing is broken, with a stick that nobody has to verify."""
 
-    program = "prepare"
-    tools = TOOLS
-    changes = CHANGES
-
-    def setUp(self) -> None:
-        super().setUp()
+    def __init__(self, folder: Path) -> None:
+        super().__init__(folder, "prepare", TOOLS, CHANGES)
         self.environment |= {"MENDED": "nothing", "LEFT": "ii solvik4-rh"}
-        (self.unit / "updates").mkdir()
+        (folder / "updates").mkdir()
         self.write(packages="ii solvik4-rh\nrc solvik4-old\nun other\nhi held\n", jobs="", wrong="")
         self.offer("1.3.0")
 
     def write(self, **texts: str) -> None:
         for name, text in texts.items():
-            (self.unit / name).write_text(text)
+            (self.folder / name).write_text(text)
 
     def offer(self, candidate: str) -> None:
         self.write(policy=f"solvik4-rh:\n  Installed: 1.2.0\n  Candidate: {candidate}\n  Version table:\n")
@@ -59,7 +57,7 @@ class Prepare(StandInTest):
     def prepare(self, status: int = 0) -> str:
         """Runs it; returns its output."""
         done = subprocess.run(
-            [self.unit / "prepare"],
+            [self.folder / "prepare"],
             env=self.environment,
             stdin=subprocess.DEVNULL,
             capture_output=True,
@@ -67,123 +65,138 @@ class Prepare(StandInTest):
             check=False,
             timeout=60,
         )
-        self.assertEqual((done.stderr, done.returncode), ("", status))
+        assert (done.stderr, done.returncode) == ("", status)
         return done.stdout
 
     def repairs(self) -> list[str]:
         """The calls that change something, or find out what would."""
         return [call for call in self.calls("dpkg", "apt-get", "apt-cache", "systemctl") if call != JOBS]
 
-    def test_notes_of_the_run_begin(self) -> None:
-        (self.unit / "run/select").touch()
-        (self.unit / "run/give-back").mkdir()
-        self.assertEqual(self.prepare(), "")
-        files = {path.name: path.read_text() for path in (self.unit / "run").iterdir()}
-        self.assertRegex(files.pop("notes"), r"^\d+\.\d\d prepared\n$")
-        last = '#include "/usr/lib/harl-updater/apt-last.conf";\n'
-        self.assertEqual(files, {"cursor": "s=1;i=2\n", "apt.conf": last})
-        self.assertEqual(self.calls(), ["journalctl --identifier=harl-updater --show-cursor --lines=0", JOBS])
-        self.write(**{"apt.conf": ""})
-        self.prepare()
-        self.assertEqual((self.unit / "run/apt.conf").read_text(), f'#include "/etc/apt/apt.conf";\n{last}')
 
-    def test_stick_is_verified_where_a_keyring_is_installed(self) -> None:
-        for target in ("/dev/null", "/nowhere"):
-            (self.unit / "keyring").symlink_to(target)
-            self.assertEqual(self.prepare(), "")
-            self.assertEqual(self.calls("verify-stick"), [f"verify-stick /root/USB_MOUNT {self.unit}/keyring"])
-            path = self.environment["PATH"]
-            self.assertEqual((self.unit / "path").read_text(), f"{path}:/usr/lib/harl-updater\n")
-            self.setUp()
-
-    def test_stick_that_is_not_the_makers_keeps_the_updater_from_running(self) -> None:
-        for wrong, said in (("changed: x\nadded: y\n", ("changed: x", "added: y")), ("", ("it cannot be read",))):
-            self.write(keyring="", wrong=wrong, packages=BROKEN, jobs="ActiveState=active\n")
-            with (self.unit / "bin/verify-stick").open("a") as tool:
-                tool.write("exit 1\n")
-            lines = [f"prepare: the stick is not as the maker signed it: {what}\n" for what in said]
-            self.assertEqual(self.prepare(status=1), "".join(lines) + "prepare: the updater is not run\n")
-            self.assertEqual(self.calls("systemctl", "dpkg", "apt-get"), [])
-            self.assertTrue((self.unit / "run/notes").exists())
-            self.setUp()
-
-    def test_jobs_of_apts_own_timers_are_waited_for(self) -> None:
-        self.write(jobs="".join(f"ActiveState={state}\n" for state in ("activating", "active", "deactivating")))
-        self.assertEqual(self.prepare(), "prepare: a job of apt's own timers is at work, waiting for it\n")
-        self.assertEqual(self.calls("systemctl", "sleep"), [JOBS, "sleep 1"] * 3 + [JOBS])
-        self.write(jobs="ActiveState=active\n")
-        self.assertEqual(self.prepare(), "prepare: a job of apt's own timers is at work, waiting for it\n")
-        for state in ("inactive", "failed"):
-            self.write(jobs=f"ActiveState={state}\n")
-            self.assertEqual(self.prepare(), "")
-
-    def test_job_that_hangs_does_not_keep_the_updater(self) -> None:
-        self.assertIn("apt_jobs_wait=600 #", (self.unit / "prepare").read_text())
-        self.change({"apt_jobs_wait=600 ": "apt_jobs_wait=3 "})
-        self.write(jobs="ActiveState=active\n" * 9)
-        self.assertIn("prepare: it is at work after 3 s, going on beside it\n", self.prepare())
-        self.assertEqual(len(self.calls("sleep")), 3)
-
-    def test_each_unfinished_state_is_repaired(self) -> None:
-        self.environment["MENDED"] = "dpkg --configure"
-        for state in ("iH ", "iU ", "iF ", "iW ", "it ", "iiR"):
-            with self.subTest(state=state):
-                self.write(packages=f"ii other\n{state}solvik4-rh\n")
-                said = "prepare: an installation was broken off: solvik4-rh \nprepare: the installation is finished\n"
-                self.assertEqual(self.prepare(), said)
-                self.assertEqual(self.repairs(), [STOP, CONFIGURE])
-            self.setUp()
-            self.environment["MENDED"] = "dpkg --configure"
-
-    def test_steps_that_dpkg_has_noted_are_finished(self) -> None:
-        self.environment["MENDED"] = "dpkg --configure"
-        (self.unit / "updates/0001").touch()
-        self.assertIn("prepare: the installation is finished\n", self.prepare())
-        self.assertEqual(self.repairs(), [STOP, CONFIGURE])
-
-    def test_steps_are_tried_until_one_helps(self) -> None:
-        for mended, tried in (
-            (MEND, [STOP, CONFIGURE, TAKE_OVER, REFRESH, POLICY, MEND]),
-            (REINSTALL, [STOP, CONFIGURE, TAKE_OVER, REFRESH, POLICY, MEND, POLICY, f"{REINSTALL} solvik4-rh"]),
-        ):
-            self.environment["MENDED"] = mended
-            self.write(packages=BROKEN)
-            self.offer("1.2.0")
-            self.assertIn("prepare: the installation is finished\n", self.prepare())
-            self.assertEqual(self.repairs(), tried)
-            self.assertEqual((self.unit / "selections").read_text(), "")
-            self.setUp()
-
-    def test_package_of_which_another_version_is_offered_is_left_to_the_updater(self) -> None:
-        self.write(packages=BROKEN)
-        self.assertIn("prepare: still unfinished, left to the updater: solvik4-rh \n", self.prepare())
-        self.assertEqual(self.repairs(), [STOP, CONFIGURE, TAKE_OVER, REFRESH, POLICY, POLICY])
-
-    def test_broken_package_that_looks_up_to_date_keeps_the_updater_from_running(self) -> None:
-        self.write(packages=BROKEN)
-        self.offer("1.2.0")
-        wrong = "solvik4-rh cannot be finished and no other version of it is offered: the updater is not run"
-        self.assertEqual(self.prepare(status=1).splitlines()[1:], [f"prepare: {wrong}"])
-
-    def test_other_packages_are_repaired_beside_it(self) -> None:
-        self.write(packages=f"{BROKEN}iU solvik4-rh-data\niU other\n")
-        said = self.prepare()
-        self.assertIn("prepare: an installation was broken off: solvik4-rh solvik4-rh-data other \n", said)
-        self.assertIn("left to the updater: solvik4-rh solvik4-rh-data other \n", said)
-        self.assertEqual(self.repairs()[4:7], [MEND, POLICY, f"{REINSTALL} solvik4-rh-data other"])
-        self.offer("1.2.0")
-        self.prepare(status=1)
-        self.assertEqual(self.calls("apt-get")[-1], f"{REINSTALL} solvik4-rh solvik4-rh-data other")
-        self.environment |= {"MENDED": MEND, "LEFT": BROKEN}
-        self.prepare(status=1)
-        self.assertEqual(self.calls("apt-get")[-1], f"{REINSTALL} solvik4-rh")
-
-    def test_other_package_that_stays_broken_does_not_keep_the_updater(self) -> None:
-        self.write(packages="ii solvik4-rh\niU other\n")
-        self.offer("1.2.0")
-        self.assertTrue(re.search("left to the updater: other \n$", self.prepare()))
-        self.assertEqual(self.repairs(), [STOP, CONFIGURE, TAKE_OVER, REFRESH, MEND, f"{REINSTALL} other"])
+@pytest.fixture
+def unit(tmp_path: Path) -> Unit:
+    return Unit(tmp_path)
 
 
-if __name__ == "__main__":
-    unittest.main()
+def test_notes_of_the_run_begin(unit: Unit) -> None:
+    (unit.folder / "run/select").touch()
+    (unit.folder / "run/give-back").mkdir()
+    assert unit.prepare() == ""
+    files = {path.name: path.read_text() for path in (unit.folder / "run").iterdir()}
+    assert re.search(r"^\d+\.\d\d prepared\n$", files.pop("notes"))
+    last = '#include "/usr/lib/harl-updater/apt-last.conf";\n'
+    assert files == {"cursor": "s=1;i=2\n", "apt.conf": last}
+    assert unit.calls() == ["journalctl --identifier=harl-updater --show-cursor --lines=0", JOBS]
+    unit.write(**{"apt.conf": ""})
+    unit.prepare()
+    assert (unit.folder / "run/apt.conf").read_text() == f'#include "/etc/apt/apt.conf";\n{last}'
+
+
+@pytest.mark.parametrize("target", ["/dev/null", "/nowhere"])
+def test_stick_is_verified_where_a_keyring_is_installed(unit: Unit, target: str) -> None:
+    (unit.folder / "keyring").symlink_to(target)
+    assert unit.prepare() == ""
+    assert unit.calls("verify-stick") == [f"verify-stick /root/USB_MOUNT {unit.folder}/keyring"]
+    path = unit.environment["PATH"]
+    assert (unit.folder / "path").read_text() == f"{path}:/usr/lib/harl-updater\n"
+
+
+@pytest.mark.parametrize(
+    "wrong, said",
+    [("changed: x\nadded: y\n", ["changed: x", "added: y"]), ("", ["it cannot be read"])],
+    ids=["changed", "unreadable"],
+)
+def test_stick_that_is_not_the_makers_keeps_the_updater_from_running(unit: Unit, wrong: str, said: list[str]) -> None:
+    unit.write(keyring="", wrong=wrong, packages=BROKEN, jobs="ActiveState=active\n")
+    with (unit.folder / "bin/verify-stick").open("a") as tool:
+        tool.write("exit 1\n")
+    lines = [f"prepare: the stick is not as the maker signed it: {what}\n" for what in said]
+    assert unit.prepare(status=1) == "".join(lines) + "prepare: the updater is not run\n"
+    assert unit.calls("systemctl", "dpkg", "apt-get") == []
+    assert (unit.folder / "run/notes").exists()
+
+
+def test_jobs_of_apts_own_timers_are_waited_for(unit: Unit) -> None:
+    unit.write(jobs="".join(f"ActiveState={state}\n" for state in ("activating", "active", "deactivating")))
+    assert unit.prepare() == "prepare: a job of apt's own timers is at work, waiting for it\n"
+    assert unit.calls("systemctl", "sleep") == [JOBS, "sleep 1"] * 3 + [JOBS]
+    unit.write(jobs="ActiveState=active\n")
+    assert unit.prepare() == "prepare: a job of apt's own timers is at work, waiting for it\n"
+    for state in ("inactive", "failed"):
+        unit.write(jobs=f"ActiveState={state}\n")
+        assert unit.prepare() == ""
+
+
+def test_job_that_hangs_does_not_keep_the_updater(unit: Unit) -> None:
+    assert "apt_jobs_wait=600 #" in (unit.folder / "prepare").read_text()
+    unit.change({"apt_jobs_wait=600 ": "apt_jobs_wait=3 "})
+    unit.write(jobs="ActiveState=active\n" * 9)
+    assert "prepare: it is at work after 3 s, going on beside it\n" in unit.prepare()
+    assert len(unit.calls("sleep")) == 3
+
+
+@pytest.mark.parametrize("state", ["iH ", "iU ", "iF ", "iW ", "it ", "iiR"])
+def test_unfinished_state_is_repaired(unit: Unit, state: str) -> None:
+    unit.environment["MENDED"] = "dpkg --configure"
+    unit.write(packages=f"ii other\n{state}solvik4-rh\n")
+    said = "prepare: an installation was broken off: solvik4-rh \nprepare: the installation is finished\n"
+    assert unit.prepare() == said
+    assert unit.repairs() == [STOP, CONFIGURE]
+
+
+def test_steps_that_dpkg_has_noted_are_finished(unit: Unit) -> None:
+    unit.environment["MENDED"] = "dpkg --configure"
+    (unit.folder / "updates/0001").touch()
+    assert "prepare: the installation is finished\n" in unit.prepare()
+    assert unit.repairs() == [STOP, CONFIGURE]
+
+
+@pytest.mark.parametrize(
+    "mended, tried",
+    [
+        (MEND, [STOP, CONFIGURE, TAKE_OVER, REFRESH, POLICY, MEND]),
+        (REINSTALL, [STOP, CONFIGURE, TAKE_OVER, REFRESH, POLICY, MEND, POLICY, f"{REINSTALL} solvik4-rh"]),
+    ],
+    ids=["mend", "reinstall"],
+)
+def test_steps_are_tried_until_one_helps(unit: Unit, mended: str, tried: list[str]) -> None:
+    unit.environment["MENDED"] = mended
+    unit.write(packages=BROKEN)
+    unit.offer("1.2.0")
+    assert "prepare: the installation is finished\n" in unit.prepare()
+    assert unit.repairs() == tried
+    assert (unit.folder / "selections").read_text() == ""
+
+
+def test_package_of_which_another_version_is_offered_is_left_to_the_updater(unit: Unit) -> None:
+    unit.write(packages=BROKEN)
+    assert "prepare: still unfinished, left to the updater: solvik4-rh \n" in unit.prepare()
+    assert unit.repairs() == [STOP, CONFIGURE, TAKE_OVER, REFRESH, POLICY, POLICY]
+
+
+def test_broken_package_that_looks_up_to_date_keeps_the_updater_from_running(unit: Unit) -> None:
+    unit.write(packages=BROKEN)
+    unit.offer("1.2.0")
+    wrong = "solvik4-rh cannot be finished and no other version of it is offered: the updater is not run"
+    assert unit.prepare(status=1).splitlines()[1:] == [f"prepare: {wrong}"]
+
+
+def test_other_packages_are_repaired_beside_it(unit: Unit) -> None:
+    unit.write(packages=f"{BROKEN}iU solvik4-rh-data\niU other\n")
+    said = unit.prepare()
+    assert "prepare: an installation was broken off: solvik4-rh solvik4-rh-data other \n" in said
+    assert "left to the updater: solvik4-rh solvik4-rh-data other \n" in said
+    assert unit.repairs()[4:7] == [MEND, POLICY, f"{REINSTALL} solvik4-rh-data other"]
+    unit.offer("1.2.0")
+    unit.prepare(status=1)
+    assert unit.calls("apt-get")[-1] == f"{REINSTALL} solvik4-rh solvik4-rh-data other"
+    unit.environment |= {"MENDED": MEND, "LEFT": BROKEN}
+    unit.prepare(status=1)
+    assert unit.calls("apt-get")[-1] == f"{REINSTALL} solvik4-rh"
+
+
+def test_other_package_that_stays_broken_does_not_keep_the_updater(unit: Unit) -> None:
+    unit.write(packages="ii solvik4-rh\niU other\n")
+    unit.offer("1.2.0")
+    assert re.search("left to the updater: other \n$", unit.prepare())
+    assert unit.repairs() == [STOP, CONFIGURE, TAKE_OVER, REFRESH, MEND, f"{REINSTALL} other"]

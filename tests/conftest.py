@@ -1,0 +1,47 @@
+"""What the Python tests share: options, folders, and when a run of them counts as skipped."""
+
+import shlex
+import shutil
+from collections.abc import Iterator
+from pathlib import Path
+
+import pytest
+
+SKIPPED = 77  # cmake/python_test.cmake
+ROOT = Path(__file__).parents[1]
+
+pytest.register_assert_rewrite("tests.commands", "tests.service.stand_in")
+
+
+def pytest_addoption(parser: pytest.Parser) -> None:
+    options = parser.getgroup("updater")
+    options.addoption("--build", type=Path, default=ROOT / "build/default", help="the build folder under test")
+    options.addoption("--emulator", type=shlex.split, default=[], help="what runs the tool of another machine")
+    options.addoption("--unit", default="stand-in", help="the kind of unit in the terminals of the bench")
+
+
+def pytest_sessionfinish(session: pytest.Session) -> None:
+    """Gives a run in which every test was skipped a status of its own."""
+    reporter = session.config.pluginmanager.get_plugin("terminalreporter")
+    if session.exitstatus == pytest.ExitCode.OK and reporter.stats.get("skipped") and not reporter.stats.get("passed"):
+        session.exitstatus = SKIPPED
+
+
+@pytest.fixture(scope="session")
+def build(pytestconfig: pytest.Config) -> Path:
+    """The build folder."""
+    folder: Path = pytestconfig.getoption("build")
+    return folder.resolve()
+
+
+@pytest.fixture(scope="session")
+def tool(build: Path) -> Path:
+    """The companion program."""
+    return build / "companion/harl-updater-tool"
+
+
+@pytest.fixture
+def tmp_path(tmp_path: Path) -> Iterator[Path]:
+    """pytest's folder, removed after the test: some fill theirs with 100 MB."""
+    yield tmp_path
+    shutil.rmtree(tmp_path, ignore_errors=True)

@@ -2,32 +2,20 @@
 
 #include "log/catalogue.h"
 #include "log/text.h"
+#include "procedure.h"
 
 #include <algorithm>
-
-const std::array<StateName, 5> stateNames = {{
-    {"well", "Well"},
-    {"not-well", "Passed but not well"},
-    {"never-ended", "Began and never ended"},
-    {"failed", "Failed"},
-    {"not-seen", "Not seen"},
-}};
+#include <utility>
 
 namespace
 {
 
-UnitState stateOf(const Run& run)
+const char* stateOf(const Run& run)
 {
-    if (wentWell(run)) {
-        return UnitState::WELL;
-    }
-    if (isFailure(run.outcome) || run.ended == RunEnd::EARLY || run.service.has(ServiceEvent::FAILURE_SHOWN)) {
-        return UnitState::FAILED;
-    }
-    if (run.ended == RunEnd::NOT_SEEN) {
-        return UnitState::NEVER_ENDED;
-    }
-    return run.outcome == Outcome::NONE ? UnitState::FAILED : UnitState::NOT_WELL;
+    const bool unfinished = run.ended == RunEnd::NOT_SEEN;
+    const bool failed = isFailure(run.outcome) || run.ended == RunEnd::EARLY ||
+                        run.service.has(ServiceEvent::FAILURE_SHOWN) || (!unfinished && run.outcome == Outcome::NONE);
+    return wentWell(run) ? "well" : failed ? "failed" : unfinished ? "never-ended" : "not-well";
 }
 
 /// The version that a run leaves; empty when its log does not tell.
@@ -43,79 +31,83 @@ std::string versionAfter(const Run& run, const Versions& versions, StepKind inst
 /// True for two readings of one run: a unit has one at a time.
 bool isSameRun(const FleetRun& first, const FleetRun& second)
 {
-    if (first.boot != 0 && second.boot != 0 && first.boot != second.boot) {
+    if (!first.boot.empty() && !second.boot.empty() && first.boot != second.boot) {
         return false;
     }
     return second.begin < first.end || (second.begin == first.begin && second.end == first.end);
 }
 
-} // namespace
-
-void Fleet::add(const std::string& machine, const std::string& name, const Run& run, std::uint64_t boot)
-{
-    FleetRun one;
-    one.begin = run.begin;
-    one.end = run.end;
-    one.boot = boot;
-    one.lines = run.lastLine - run.firstLine;
-    one.mainHead = run.mainHead;
-    one.outcome = run.outcome;
-    one.state = stateOf(run);
-    one.failure = run.failure ? run.failure->failure : nullptr;
-    for (const Problem& problem : run.besides) {
-        one.besides.push_back(problem.failure);
-    }
-    const std::string meaning = operatorView(run).meaning;
-    const std::string package = versionAfter(run, run.package, StepKind::INSTALL_PACKAGE);
-    const std::string board = versionAfter(run, run.board, StepKind::RUN_BOARD_SCRIPT);
-
-    const std::lock_guard lock(mMutex);
-    one.meaning = kept(meaning);
-    one.package = kept(package);
-    one.board = kept(board);
-    FleetUnit& unit = mUnits[machine];
-    unit.name = name;
-    unit.machine = machine == name ? "" : machine;
-    unit.runs.push_back(std::move(one));
-}
-
-void Fleet::addRepeats(std::uint64_t lines)
-{
-    const std::lock_guard lock(mMutex);
-    mRepeatedLines += lines;
-}
-
-void Fleet::finish(std::int64_t since)
-{
-    for (auto& [machine, unit] : mUnits) {
-        dropRepeats(unit.runs);
-        unit.package = unit.board = kept("");
-        for (const FleetRun& run : unit.runs) { // a run that read no version left the one before
-            unit.package = run.package->empty() ? unit.package : run.package;
-            unit.board = run.board->empty() ? unit.board : run.board;
-        }
-        unit.state = unit.last().begin < since ? UnitState::NOT_SEEN : unit.last().state;
-        const auto old = std::find_if(unit.runs.begin(), unit.runs.end() - 1,
-                                      [&](const FleetRun& run) { return run.begin >= since; });
-        unit.runs.erase(unit.runs.begin(), old);
-    }
-}
-
-void Fleet::dropRepeats(std::vector<FleetRun>& runs)
+/// Brings a unit's runs into order and leaves the longer one of two readings. Returns how many lines were dropped.
+std::uint64_t dropRepeats(std::vector<FleetRun>& runs)
 {
     std::stable_sort(runs.begin(), runs.end(), [](const FleetRun& first, const FleetRun& second) {
         return std::pair(first.begin, first.end) < std::pair(second.begin, second.end);
     });
+    std::uint64_t dropped = 0;
     std::vector<FleetRun> single;
     for (FleetRun& run : runs) {
         if (single.empty() || !isSameRun(single.back(), run)) {
             single.push_back(std::move(run));
             continue;
         }
-        ++mRepeatedRuns;
         if (run.lines > single.back().lines) {
-            single.back() = std::move(run);
+            std::swap(run, single.back());
         }
+        dropped += run.lines;
     }
     runs = std::move(single);
+    return dropped;
+}
+
+bool hasMet(const FleetRun& run, const std::string& failure)
+{
+    return run.failure == failure || std::count(run.besides.begin(), run.besides.end(), failure) > 0;
+}
+
+} // namespace
+
+void Fleet::add(const std::string& machine, const std::string& name, const std::string& boot, const Run& run)
+{
+    FleetRun one;
+    one.begin = run.begin;
+    one.end = run.end;
+    one.boot = boot;
+    one.lines = run.lastLine - run.firstLine + 1;
+    one.state = stateOf(run);
+    one.outcome = outcomeName(run.outcome);
+    one.meaning = operatorView(run).meaning;
+    one.failure = run.failure ? run.failure->failure->name : "";
+    for (const Problem& problem : run.besides) {
+        one.besides.push_back(problem.failure->name);
+    }
+    const std::string package = versionAfter(run, run.package, StepKind::INSTALL_PACKAGE);
+    one.package = package.empty() ? "" : packageOf(run.mainHead) + ' ' + package;
+    one.board = versionAfter(run, run.board, StepKind::RUN_BOARD_SCRIPT);
+
+    const std::lock_guard lock(mMutex);
+    FleetUnit& unit = mUnits[machine.empty() ? name : machine];
+    unit.name = name;
+    unit.machine = machine;
+    unit.runs.push_back(std::move(one));
+}
+
+void Fleet::finish(const std::string& since, const std::string& failed)
+{
+    for (auto next = mUnits.begin(); next != mUnits.end();) {
+        const auto unit = next++;
+        std::vector<FleetRun>& runs = unit->second.runs;
+        mRepeats += dropRepeats(runs);
+        std::string package = "not known";
+        std::string board = "not known";
+        for (FleetRun& run : runs) { // one that read no version left the one before
+            run.package = package = run.package.empty() ? package : run.package;
+            run.board = board = run.board.empty() ? board : run.board;
+        }
+        const auto isOld = [&](const FleetRun& run) { return isoText(run.begin) < since; };
+        runs.back().state = isOld(runs.back()) ? "not-seen" : runs.back().state;
+        runs.erase(std::remove_if(runs.begin(), runs.end() - 1, isOld), runs.end() - 1);
+        if (!failed.empty() && !hasMet(runs.back(), failed)) {
+            mUnits.erase(unit);
+        }
+    }
 }

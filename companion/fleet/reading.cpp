@@ -7,19 +7,18 @@
 
 #include <algorithm>
 #include <array>
-#include <atomic>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <future>
-#include <memory>
+#include <map>
+#include <mutex>
+#include <set>
 #include <thread>
-#include <unordered_map>
 
 #include <endian.h>
-#include <unistd.h>
 
 namespace
 {
@@ -30,78 +29,89 @@ const std::size_t blockSize = std::size_t{256} * 1024; // bytes
 
 enum class Kind { TEXT, JOURNAL, ARCHIVE };
 
-/// What is read at a time: a file, or the files that a journal is made of.
-struct Input
-{
-    Kind kind;
-    std::string name;
-    std::vector<std::string> files;
-};
+/// What is read one after the other: a file, or those of a journal. Behind the name, one that is full has "@" and a
+/// number, and the one that still grows, which comes last, has nothing.
+using Files = std::set<std::pair<bool, std::string>>;
+using Inputs = std::map<std::string, Files>; ///< by name
 
 Kind kindOf(const std::string& path)
 {
     std::array<char, 8> start{};
     std::ifstream(path, std::ios::binary).read(start.data(), start.size());
     const std::string_view bytes(start.data(), start.size());
-    return bytes == "LPKSHHRH" ? Kind::JOURNAL : startsWith(bytes, "\x1f\x8b") ? Kind::ARCHIVE : Kind::TEXT;
+    return path == "-"                     ? Kind::TEXT
+           : bytes == "LPKSHHRH"           ? Kind::JOURNAL
+           : startsWith(bytes, "\x1f\x8b") ? Kind::ARCHIVE
+                                           : Kind::TEXT;
 }
 
-/// Adds a file. A journal that has grown goes on in a file of the same name, which ends in "@" and a number before
-/// that.
-void addFile(const std::string& path, std::vector<Input>& inputs)
+/// Opens a file. What is wrong, in words; empty for nothing.
+std::string open(const std::string& path, Kind kind, LogSource& source)
 {
-    const Kind kind = path == "-" ? Kind::TEXT : kindOf(path);
-    const std::string name = kind == Kind::JOURNAL ? path.substr(0, std::min(path.rfind('@'), path.rfind('.'))) : path;
-    if (kind == Kind::JOURNAL && !inputs.empty() && inputs.back().kind == kind && inputs.back().name == name) {
-        inputs.back().files.push_back(path);
-        return;
+    const std::string file = "--file=" + fs::absolute(path).string();
+    switch (kind) {
+    case Kind::JOURNAL:
+        return source.openProgram({"journalctl", "--output=export", "--quiet", file}, path, false);
+    case Kind::ARCHIVE: // its journal.txt and kept-logs/
+        return source.openProgram(
+            {"tar", "--extract", "--gzip", "--to-stdout", "--wildcards", file, "harl-updater-report/[jk]*"}, path,
+            false);
+    default:
+        return source.openFile(path);
     }
-    inputs.push_back({kind, name, {path}});
 }
 
-std::vector<Input> inputsOf(const std::vector<std::string>& paths, std::vector<Unread>& unread)
+/// How many entries a journal's file states. systemd, journal-def.h: n_entries, 64 bits, is at byte 152.
+std::uint64_t entriesStated(const std::string& path)
 {
-    std::vector<Input> inputs;
-    for (const std::string& path : paths) {
-        std::error_code error;
-        std::vector<std::string> files;
-        if (fs::is_directory(path, error)) {
-            fs::recursive_directory_iterator file(path, error);
-            for (; !error && file != fs::recursive_directory_iterator(); file.increment(error)) {
-                if (file->is_regular_file(error)) {
-                    files.push_back(file->path());
-                }
-            }
-            if (error) {
-                unread.push_back({escaped(path), error.message()});
-            }
-            std::sort(files.begin(), files.end());
-        } else {
-            files.push_back(path);
-        }
-        for (const std::string& found : files) {
-            addFile(found, inputs);
-        }
+    std::uint64_t entries = 0;
+    std::ifstream file(path, std::ios::binary);
+    file.seekg(152).read(reinterpret_cast<char*>(&entries), sizeof entries);
+    return le64toh(entries);
+}
+
+/// True when journalctl finds a journal's file whole.
+bool isVerified(const std::string& path)
+{
+    LogSource source;
+    const std::string file = "--file=" + fs::absolute(path).string();
+    const std::string wrong = source.openProgram({"journalctl", "--verify", "--quiet", file}, path, false);
+    return wrong.empty() && source.close(true) == 0;
+}
+
+/// When an entry was made.
+struct Moment
+{
+    std::int64_t time = 0; ///< as ParsedRecord::time
+    std::string boot;
+};
+
+/// How far the journal of a machine's boot has been read, by the clock that only goes forward: us since the boot, and
+/// which of the entries with this time.
+struct Progress
+{
+    std::pair<std::uint64_t, std::uint64_t> entry; ///< the last one
+    std::pair<std::uint64_t, std::uint64_t> newest;
+
+    /// Takes an entry of this time. False when it came before.
+    bool advance(std::uint64_t time)
+    {
+        entry = {time, time == entry.first ? entry.second + 1 : 1};
+        const bool isNew = entry > newest;
+        newest = std::max(newest, entry);
+        return isNew;
     }
-    return inputs;
-}
-
-/// How far the journal of a machine's boot has been read, by the clock that only goes forward.
-struct Place
-{
-    std::uint64_t time = 0;  ///< us since the boot, of the latest entry
-    std::uint64_t count = 0; ///< entries with this time
-    std::uint64_t again = 0; ///< of them, how many came since the entries last went back
 };
 
 /// The runs of one unit in an input.
 class UnitLog
 {
 public:
-    /// @param whole  false once the input is known not to be
-    UnitLog(std::string machine, std::string name, const bool& whole, Fleet& fleet)
-        : mMachine(std::move(machine)), mName(std::move(name)), mWhole(whole), mFleet(fleet),
-          mBuilder([this](Run& run) { take(run); }), mParser(mBuilder)
+    /// @param machine  its ID; empty where the log does not tell
+    /// @param whole    false once the input is known not to be
+    UnitLog(const std::string& machine, const std::string& name, const bool& whole, Fleet& fleet)
+        : mMachine(machine), mName(name), mWhole(whole), mFleet(fleet), mBuilder([this](Run& run) { take(run); }),
+          mParser(mBuilder)
     {
     }
 
@@ -110,19 +120,16 @@ public:
     /// Notes where an entry comes from, before its text is read. False when it came before.
     bool enter(const JournalEntry& entry)
     {
-        const std::uint64_t boot = entry.boot.empty() ? 0 : std::hash<std::string>()(entry.boot);
-        if (!isNew(mPlaces[boot], std::strtoull(entry.monotonic.c_str(), nullptr, 10))) {
-            mFleet.addRepeats(1);
+        if (!mProgress[entry.boot].advance(std::strtoull(entry.monotonic.c_str(), nullptr, 10))) {
+            mFleet.addRepeat();
             return false;
         }
         if (const Run* run = mBuilder.current(); run != nullptr && run->number != mNumber) {
             mNumber = run->number;
-            mBegan = mTime;
-            mBootOfRun = mBoot;
+            mBegan = mLast;
         }
-        mTime = std::strtoll(entry.realtime.c_str(), nullptr, 10) / 1000000;
-        mBoot = boot;
-        mName = entry.host.empty() ? mName : escaped(entry.host);
+        mLast = {std::strtoll(entry.realtime.c_str(), nullptr, 10) / 1000000, entry.boot};
+        mName = entry.host.empty() ? mName : entry.host;
         return true;
     }
 
@@ -133,41 +140,27 @@ public:
     }
 
 private:
-    static bool isNew(Place& place, std::uint64_t time)
-    {
-        if (time < place.time) {
-            place.again = 0;
-            return false;
-        }
-        place = time > place.time ? Place{time, 0, 0} : place;
-        const bool known = place.again++ < place.count;
-        place.count += known ? 0 : 1;
-        return !known;
-    }
-
     void take(Run& run)
     {
         if (!mWhole && run.ended == RunEnd::NOT_SEEN) {
             return;
         }
-        const bool noted = run.number == mNumber;
+        const Moment& began = run.number == mNumber ? mBegan : mLast;
         if (run.steps.empty() && run.service.has(ServiceEvent::NOT_ALLOWED)) { // it has no record of its own
-            run.begin = run.end = noted ? mBegan : mTime;
+            run.begin = run.end = began.time;
         }
         explain(run);
-        mFleet.add(mMachine, mName, run, noted ? mBootOfRun : mBoot);
+        mFleet.add(escaped(mMachine), escaped(mName), began.boot, run);
     }
 
     std::string mMachine;
     std::string mName;
     const bool& mWhole;
     Fleet& mFleet;
-    std::unordered_map<std::uint64_t, Place> mPlaces; // of each boot
-    std::int64_t mTime = 0;                           // of the last entry, s
-    std::uint64_t mBoot = 0;
-    std::uint64_t mNumber = 0; // of the run that the two below belong to
-    std::int64_t mBegan = 0;
-    std::uint64_t mBootOfRun = 0;
+    std::map<std::string, Progress> mProgress; // by boot
+    Moment mLast;
+    std::uint64_t mNumber = 0; // of the run that began at the place below
+    Moment mBegan;
     RunBuilder mBuilder;
     LogParser mParser;
 };
@@ -176,159 +169,142 @@ private:
 class InputReader
 {
 public:
-    InputReader(const Input& input, Fleet& fleet)
-        : mInput(input), mFleet(fleet), mOwn(escaped(input.name), escaped(input.name), mWhole, fleet),
-          mDress(mOwn.parser())
-    {
-        mDress.divide([this](const JournalEntry& entry) { return parserFor(entry); });
-    }
+    InputReader(const std::string& name, Fleet& fleet) : mName(name), mFleet(fleet) {}
 
     /// What is wrong, in words; empty for nothing.
-    std::string read()
+    std::string read(const Files& files)
     {
-        std::string wrong = open();
-        if (!wrong.empty()) {
-            return wrong;
+        std::string wrong;
+        for (const auto& [grows, file] : files) {
+            const std::string found = readFile(file);
+            wrong = wrong.empty() ? found : wrong;
         }
-        std::vector<char> block(blockSize);
-        ssize_t length = 0;
-        while ((length = TEMP_FAILURE_RETRY(::read(mSource.descriptor(), block.data(), block.size()))) > 0) {
-            mDress.feed({block.data(), static_cast<std::size_t>(length)});
-        }
-        wrong = length < 0 ? std::strerror(errno) : "";
-        mDress.finish();
-        const int status = mSource.close(true);
-        wrong = wrong.empty() ? whatIsWrong(status) : wrong;
         mWhole = wrong.empty();
-        mOwn.finish();
         for (auto& [machine, log] : mLogs) {
-            log->finish();
+            log.finish();
         }
         return wrong;
     }
 
 private:
-    std::string open()
+    std::string readFile(const std::string& path)
     {
-        if (mInput.kind == Kind::TEXT) {
-            return mSource.openFile(mInput.files.front());
+        const Kind kind = kindOf(path);
+        const std::uint64_t stated = kind == Kind::JOURNAL ? entriesStated(path) : 0; // before a receiver adds to them
+        LogSource source;
+        std::string wrong = open(path, kind, source);
+        if (!wrong.empty()) {
+            return wrong;
         }
-        if (mInput.kind == Kind::ARCHIVE) { // its journal.txt and kept-logs/
-            return mSource.openProgram({"tar", "--extract", "--gzip", "--to-stdout", "--wildcards", "--file",
-                                        fs::absolute(mInput.files.front()), "harl-updater-report/[jk]*"},
-                                       mInput.name, false);
+        std::uint64_t entries = 0;
+        Dress dress(logOf("").parser());
+        dress.divide([&](const JournalEntry& entry) {
+            ++entries;
+            mWhole = mWhole && dress.undamaged();
+            return parserFor(entry);
+        });
+        std::vector<char> block(blockSize);
+        ssize_t length = 0;
+        while ((length = source.read(block)) > 0) {
+            dress.feed({block.data(), static_cast<std::size_t>(length)});
         }
-        mStated = entriesStated(); // before a receiver adds to them
-        std::vector<std::string> arguments = {"journalctl", "--output=export", "--quiet"};
-        for (const std::string& file : mInput.files) {
-            arguments.push_back("--file=" + fs::absolute(file).string());
-        }
-        return mSource.openProgram(arguments, mInput.name, false);
+        wrong = length < 0 ? std::strerror(errno) : "";
+        dress.finish();
+        const int status = source.close(true);
+        const bool hasRecord =
+            std::any_of(mLogs.begin(), mLogs.end(), [](auto& log) { return log.second.parser().records() > 0; });
+        const std::pair<bool, std::string> faults[] = {
+            {!wrong.empty(), wrong},
+            {kind == Kind::ARCHIVE && status != 0, "not a whole archive of harl-updater-tool report"},
+            {kind == Kind::JOURNAL && (status != 0 || (entries < stated && !isVerified(path))),
+             "a journal that is damaged or cut off: journalctl --verify --file=" + escaped(path)},
+            {!dress.undamaged(), "damaged: not everything in it is a journal's entry"},
+            {dress.tooLarge(), "the newest lines come first and are too many to be turned round: turn them with tac"},
+            {kind == Kind::TEXT && dress.cut(), "cut off: it ends in the middle of a line or of an entry"},
+            {kind != Kind::JOURNAL && !hasRecord, "no record of the updater in it"},
+        };
+        const auto* fault = std::find_if(std::begin(faults), std::end(faults), [](auto& one) { return one.first; });
+        return fault == std::end(faults) ? "" : fault->second;
     }
 
     LogParser* parserFor(const JournalEntry& entry)
     {
-        ++mEntries;
-        mWhole = mDress.undamaged();
-        const bool manager = entry.program == "systemd" && entry.message.find("harl-updater") != std::string::npos;
+        const bool manager = entry.program == "systemd" && contains(entry.message, "harl-updater");
         if (entry.program != "harl-updater" && !manager) {
             return nullptr;
         }
-        if (entry.machine.empty()) {
-            return &mOwn.parser();
-        }
-        std::unique_ptr<UnitLog>& log = mLogs[entry.machine];
-        if (!log) {
-            log = std::make_unique<UnitLog>(escaped(entry.machine), escaped(entry.machine), mWhole, mFleet);
-        }
-        return log->enter(entry) ? &log->parser() : nullptr;
+        UnitLog& log = logOf(entry.machine);
+        return entry.machine.empty() || log.enter(entry) ? &log.parser() : nullptr;
     }
 
-    /// @param status  of journalctl or tar
-    std::string whatIsWrong(int status)
+    UnitLog& logOf(const std::string& machine)
     {
-        if (mInput.kind == Kind::ARCHIVE && status != 0) {
-            return "not a whole archive of harl-updater-tool report";
-        }
-        if (mInput.kind == Kind::JOURNAL && (status != 0 || (mEntries < mStated && !isVerified()))) {
-            return "a journal that is damaged or cut off: journalctl --verify --file=" + escaped(mInput.files.front());
-        }
-        if (!mDress.undamaged()) {
-            return "damaged: not everything in it is a journal's entry";
-        }
-        if (mDress.tooLarge()) {
-            return "the newest lines come first and are too many to be turned round: turn them with tac";
-        }
-        if (mDress.cut() && mInput.kind == Kind::TEXT) {
-            return "cut off: it ends in the middle of a line or of an entry";
-        }
-        const bool hasRecord = mOwn.parser().records() > 0 || std::any_of(mLogs.begin(), mLogs.end(), [](auto& log) {
-                                   return log.second->parser().records() > 0;
-                               });
-        return hasRecord || mInput.kind == Kind::JOURNAL ? "" : "no record of the updater in it";
+        return mLogs.try_emplace(machine, machine, machine.empty() ? mName : machine, mWhole, mFleet).first->second;
     }
 
-    /// How many entries the journal's files state. systemd, journal-def.h: n_entries, 64 bits, is at byte 152.
-    std::uint64_t entriesStated() const
-    {
-        std::uint64_t sum = 0;
-        for (const std::string& path : mInput.files) {
-            std::uint64_t entries = 0;
-            std::ifstream file(path, std::ios::binary);
-            file.seekg(152).read(reinterpret_cast<char*>(&entries), sizeof entries);
-            sum += le64toh(entries);
-        }
-        return sum;
-    }
-
-    /// True when journalctl finds the journal's files whole: fewer entries may be other files' again.
-    bool isVerified() const
-    {
-        return std::all_of(mInput.files.begin(), mInput.files.end(), [](const std::string& file) {
-            LogSource verification;
-            const std::string wrong = verification.openProgram(
-                {"journalctl", "--verify", "--quiet", "--file=" + fs::absolute(file).string()}, file, false);
-            return wrong.empty() && verification.close(true) == 0;
-        });
-    }
-
-    const Input& mInput;
+    const std::string& mName;
     Fleet& mFleet;
     bool mWhole = true;
-    std::uint64_t mEntries = 0;
-    std::uint64_t mStated = 0;
-    UnitLog mOwn; // of a log that names no machine
-    std::unordered_map<std::string, std::unique_ptr<UnitLog>> mLogs;
-    LogSource mSource;
-    Dress mDress;
+    std::map<std::string, UnitLog> mLogs; // by machine; that of no machine has the log's name
 };
+
+/// The inputs of these paths; `unread` gets the folders that cannot be read.
+Inputs inputsOf(const std::vector<std::string>& paths, nlohmann::ordered_json& unread)
+{
+    Inputs inputs;
+    const auto add = [&](const std::string& path) {
+        std::size_t end = path.size();
+        if (kindOf(path) == Kind::JOURNAL) {
+            end = std::min({end, path.find('@', path.rfind('/') + 1), path.rfind('.')});
+        }
+        inputs[path.substr(0, end)].insert({path[end] != '@', path});
+    };
+    for (const std::string& path : paths) {
+        std::error_code error;
+        if (!fs::is_directory(path, error)) {
+            add(path);
+            continue;
+        }
+        for (fs::recursive_directory_iterator file(path, error), end; !error && file != end; file.increment(error)) {
+            if (file->is_regular_file(error)) {
+                add(file->path());
+            }
+        }
+        if (error) {
+            unread.push_back({{"input", escaped(path)}, {"why", error.message()}});
+        }
+    }
+    return inputs;
+}
 
 } // namespace
 
-std::vector<Unread> readFleet(const std::vector<std::string>& paths, Fleet& fleet)
+nlohmann::ordered_json readFleet(const std::vector<std::string>& paths, Fleet& fleet)
 {
-    std::vector<Unread> unread;
-    const std::vector<Input> inputs = inputsOf(paths, unread);
-    std::vector<std::string> wrong(inputs.size());
-    std::atomic<std::size_t> next = 0;
+    auto unread = nlohmann::ordered_json::array();
+    Inputs inputs = inputsOf(paths, unread);
+    std::mutex mutex; // of what follows
+    auto next = inputs.begin();
     const auto work = [&] {
-        for (std::size_t index = next++; index < inputs.size(); index = next++) {
-            wrong[index] = InputReader(inputs[index], fleet).read();
+        for (std::unique_lock lock(mutex); next != inputs.end();) {
+            const auto& [name, files] = *next++;
+            lock.unlock();
+            const std::string wrong = InputReader(name, fleet).read(files);
+            lock.lock();
+            if (!wrong.empty()) {
+                unread.push_back({{"input", escaped(name)}, {"why", wrong}});
+            }
         }
     };
+    const std::size_t count = std::min<std::size_t>(std::thread::hardware_concurrency(), inputs.size());
     std::vector<std::future<void>> workers;
-    for (unsigned worker = 1; worker < std::min<std::size_t>(std::thread::hardware_concurrency(), inputs.size());
-         ++worker) {
+    while (workers.size() + 1 < count) {
         workers.push_back(std::async(std::launch::async, work));
     }
     work();
     for (std::future<void>& worker : workers) {
         worker.get();
     }
-    for (std::size_t index = 0; index < inputs.size(); ++index) {
-        if (!wrong[index].empty()) {
-            unread.push_back({escaped(inputs[index].name), wrong[index]});
-        }
-    }
+    std::sort(unread.begin(), unread.end());
     return unread;
 }

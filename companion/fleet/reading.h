@@ -5,6 +5,8 @@
 #include <string>
 #include <vector>
 
+#include <nlohmann/json.hpp>
+
 /// Reads logs of many units into `fleet`, two or more inputs at once where the machine has the cores: journals through
 /// journalctl(1), exports and other formats of journals, saved logs, and archives of `harl-updater-tool report` through
 /// tar(1).
@@ -14,5 +16,5 @@
 /// are left out.
 ///
 /// @param paths  files, folders with files, or "-" for standard input
-/// @return what could not be read, in the order of the inputs
-std::vector<Unread> readFleet(const std::vector<std::string>& paths, Fleet& fleet);
+/// @return what could not be read, and why: "input" and "why" of each
+nlohmann::ordered_json readFleet(const std::vector<std::string>& paths, Fleet& fleet);

@@ -33,11 +33,12 @@ SPEED = 300  # times shorter waits of the updater
 PROGRAMS = Path()
 RECEIVER = Path("/lib/systemd/systemd-journal-remote")
 # What the unit's service says when it could not send.
-CANNOT_COPY, CANNOT_SEND = "the disk is full", "upload failed"
+CANNOT_COPY, CANNOT_SEND = "No space left on device", "upload failed"
 # Where the maker's server can be, or not, when an update runs.
-PLACES = ("none", "away", "silent", "there, the unit's disk full", "there, its disk full", "there")
+PLACES = ("none", "away", "silent", "there, the unit's disk full", "there, the unit's /run full",
+          "there, its disk full", "there")
 LAST = "fleet /var/log"  # in the page's command that answers
-CHANGING = (r"\b[0-9a-f]{32}\b", r"\d\d-\d\d-\d{4} \d\d:\d\d:\d\d")
+CHANGING = (r"\b[0-9a-f]{32}\b", r"\d{4}-\d\d-\d\dT\d\d:\d\d:\d\d")
 # What the maker's tool must say of each unit.
 OUTCOMES = {
     "updated": ("updated", "well", None),
@@ -168,7 +169,8 @@ class FleetTest(unittest.TestCase):
         found = {name: (unit["outcome"], unit["state"], unit["failure"]) for name, unit in units.items()}
         self.assertEqual(found, {f"unit-{number:04}": told for number, told in enumerate(OUTCOMES.values(), 1)})
         self.assertEqual(facts["runs"], len(OUTCOMES))
-        self.assertEqual(facts["packages"]["solvik4-rh 1.3.0"], 5)
+        packages = {row["name"]: row["units"] for row in facts["packages"]}
+        self.assertEqual(packages["solvik4-rh 1.3.0"], 5)
         self.assertEqual(facts["unread"], [])
 
     @contextlib.contextmanager
@@ -187,6 +189,8 @@ class FleetTest(unittest.TestCase):
                 after.callback(self.server.run, "systemctl", "stop", "silent")
             elif place.endswith("the unit's disk full"):
                 after.enter_context(full_disk(unit.unit, f"/var/lib/{SERVICE}"))
+            elif place.endswith("the unit's /run full"):
+                after.enter_context(full_run(unit.unit))
             elif place.endswith("its disk full"):
                 self.server.run("systemctl", "stop", "systemd-journal-remote")
                 after.callback(self.server.run, "systemctl", "stop", "systemd-journal-remote")  # its files are there
@@ -225,6 +229,17 @@ class FleetTest(unittest.TestCase):
         [unit] = self.units[:1]
         self.server.run("systemctl", "stop", "systemd-journal-remote")
         self.expect_nothing_lost_on(unit, self.server, f"/{RECEIVED}", CANNOT_SEND)
+
+    def test_full_run_of_the_unit(self) -> None:
+        [unit] = self.units[:1]
+        unit.prepare("updated")
+        with full_run(unit.unit):
+            unit.run_to("updated")
+            wait_for("the instrument", unit.given_back)
+            self.assertEqual(unit.panel(), {"PASS": "pass"})
+            wait_for("the records", unit.sent)
+        self.expect_all_records([unit])
+        self.assertEqual(self.answer()[1]["unit-0001"]["state"], "well")
 
     def expect_nothing_lost_on(self, unit: Unit, full: Machine, folder: str, says: str) -> None:
         """An update ends well and its records arrive later, when this folder is on a full disk meanwhile."""
@@ -307,6 +322,18 @@ def full_disk(where: Machine, folder: str) -> Iterator[None]:
         yield
     finally:
         where.run("umount", "-l", folder)
+
+
+@contextlib.contextmanager
+def full_run(where: Machine) -> Iterator[None]:
+    """A /run on which no file can grow, until the end of the block."""
+    size, used = where.run("df", "-k", "--output=size,used", "/run").splitlines()[1].split()
+    where.run("mount", "-o", f"remount,size={used}k", "/run")
+    assert where.status("sh", "-c", "echo word >/run/file") != 0
+    try:
+        yield
+    finally:
+        where.run("mount", "-o", f"remount,size={size}k", "/run")
 
 
 def records(where: Machine, *options: str) -> set[tuple[str, str, str]]:

@@ -31,10 +31,8 @@ std::string versionAfter(const Run& run, const Versions& versions, StepKind inst
 /// True for two readings of one run: a unit has one at a time.
 bool isSameRun(const FleetRun& first, const FleetRun& second)
 {
-    if (!first.boot.empty() && !second.boot.empty() && first.boot != second.boot) {
-        return false;
-    }
-    return second.begin < first.end || (second.begin == first.begin && second.end == first.end);
+    const bool sameBoot = first.boot.empty() || second.boot.empty() || first.boot == second.boot;
+    return sameBoot && (second.begin < first.end || (second.begin == first.begin && second.end == first.end));
 }
 
 /// Brings a unit's runs into order and leaves the longer one of two readings. Returns how many lines were dropped.
@@ -57,11 +55,6 @@ std::uint64_t dropRepeats(std::vector<FleetRun>& runs)
     }
     runs = std::move(single);
     return dropped;
-}
-
-bool hasMet(const FleetRun& run, const std::string& failure)
-{
-    return run.failure == failure || std::count(run.besides.begin(), run.besides.end(), failure) > 0;
 }
 
 } // namespace
@@ -106,7 +99,9 @@ void Fleet::finish(const std::string& since, const std::string& failed)
         const auto isOld = [&](const FleetRun& run) { return isoText(run.begin) < since; };
         runs.back().state = isOld(runs.back()) ? "not-seen" : runs.back().state;
         runs.erase(std::remove_if(runs.begin(), runs.end() - 1, isOld), runs.end() - 1);
-        if (!failed.empty() && !hasMet(runs.back(), failed)) {
+        const std::vector<std::string>& besides = runs.back().besides;
+        if (!failed.empty() && runs.back().failure != failed &&
+            std::count(besides.begin(), besides.end(), failed) == 0) {
             mUnits.erase(unit);
         }
     }

@@ -36,14 +36,17 @@ using Counts = std::map<std::string, Count>;
 
 const std::size_t lengthOfDay = 10; // of "2026-11-21"
 
-/// The facts that are tables, for people and for programs.
-const std::pair<const char*, const char*> tables[] = {
-    {"State after the last run", "states"},
-    {"Outcome", "outcomes"},
-    {"Package", "packages"},
-    {"Board", "boards"},
-    {"What failed", "failures"},
-    {"Also", "besides"},
+/// A fact that is a table, for people and for programs.
+struct Table
+{
+    const char* title;
+    const char* key;
+    bool remedies = false; ///< Its names are those of failures.
+};
+
+const Table tables[] = {
+    {"State after the last run", "states"}, {"Outcome", "outcomes"},   {"Package", "packages"}, {"Board", "boards"},
+    {"What failed", "failures", true},      {"Also", "besides", true},
 };
 
 bool isDate(const std::string& text)
@@ -89,21 +92,20 @@ Json unitsOf(const Fleet& fleet)
     return units;
 }
 
-/// A table for programs, those of the most units first. Failures have their remedies.
-Json tableOf(const Counts& counts)
+/// The rows of a table, those of the most units first.
+Json rowsOf(const Counts& counts, bool remedies)
 {
-    static const Values values = valuesOf(Run(), nullptr, {});
-    Json table = Json::array();
+    Json rows = Json::array();
     for (const auto& [name, count] : counts) {
-        table.push_back({{"name", name}, {"units", count.units}, {"runs", count.runs}});
-        if (const Failure* failure = findFailure(name); failure != nullptr) {
-            table.back()["remedy"] = filled(failure->remedy, values);
+        rows.push_back({{"name", name}, {"units", count.units}, {"runs", count.runs}});
+        if (remedies) {
+            rows.back()["remedy"] = filled(findFailure(name)->remedy, valuesOf(Run(), nullptr, {}));
         }
     }
-    std::stable_sort(table.begin(), table.end(), [](const Json& first, const Json& second) {
+    std::stable_sort(rows.begin(), rows.end(), [](const Json& first, const Json& second) {
         return std::pair(first["units"], first["runs"]) > std::pair(second["units"], second["runs"]);
     });
-    return table;
+    return rows;
 }
 
 /// The fleet for programs.
@@ -153,8 +155,8 @@ Json factsOf(const Fleet& fleet, const Json& unread)
                   {"repeated_lines", fleet.repeats()},
                   {"unread", unread},
                   {"days", days}};
-    for (const auto& [title, key] : tables) {
-        facts[key] = tableOf(counts[key]);
+    for (const auto& [title, key, remedies] : tables) {
+        facts[key] = rowsOf(counts[key], remedies);
     }
     return facts;
 }
@@ -165,11 +167,10 @@ void print(const Json& facts, const Json& units, std::ostream& out)
         out << std::left << std::setw(60) << name << std::right << std::setw(8) << number << std::setw(8) << runs
             << '\n';
     };
-    out << counted(facts["units"], "unit") << ", " << counted(facts["runs"], "run") << '\n';
-    if (facts["repeated_lines"] > 0) {
-        out << "Dropped because they came twice: " << counted(facts["repeated_lines"], "line") << '\n';
-    }
-    for (const auto& [title, key] : tables) {
+    const std::size_t repeats = facts["repeated_lines"];
+    out << counted(facts["units"], "unit") << ", " << counted(facts["runs"], "run")
+        << (repeats > 0 ? "; dropped " + counted(repeats, "line") + " that came again\n" : "\n");
+    for (const auto& [title, key, remedies] : tables) {
         out << '\n';
         printRow(title, "Units", "Runs");
         for (const Json& row : facts[key]) {
@@ -235,12 +236,11 @@ void writePage(const Json& facts, const Json& units, std::ostream& out)
 {
     Json page = facts;
     page["charts"] = {chartOf("Outcomes", "outcomes", facts), chartOf("Package after the run", "packages", facts)};
-    for (const auto& [title, key] : tables) {
+    for (const auto& [title, key, remedies] : tables) {
         page["tables"].push_back({{"title", title}, {"rows", facts[key]}});
     }
     renderPart(embeddedFleetPage, "begin", page, out);
-    for (Json unit : units) {
-        unit["besides"] = textOf(unit["besides"]);
+    for (const Json& unit : units) {
         renderPart(embeddedFleetPage, "unit", unit, out);
     }
     renderPart(embeddedFleetPage, "end", true, out);

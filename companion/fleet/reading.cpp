@@ -6,7 +6,6 @@
 #include "log/source.h"
 
 #include <algorithm>
-#include <array>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
@@ -36,26 +35,29 @@ using Inputs = std::map<std::string, Files>; ///< by name
 
 Kind kindOf(const std::string& path)
 {
-    std::array<char, 8> start{};
-    std::ifstream(path, std::ios::binary).read(start.data(), start.size());
-    const std::string_view bytes(start.data(), start.size());
+    std::string bytes(8, '\0');
+    std::ifstream(path, std::ios::binary).read(bytes.data(), 8);
     return path == "-"                     ? Kind::TEXT
            : bytes == "LPKSHHRH"           ? Kind::JOURNAL
            : startsWith(bytes, "\x1f\x8b") ? Kind::ARCHIVE
                                            : Kind::TEXT;
 }
 
-/// Opens a file. What is wrong, in words; empty for nothing.
-std::string open(const std::string& path, Kind kind, LogSource& source)
+/// Starts a program that reads a file. What is wrong, in words; empty for nothing.
+std::string start(LogSource& source, std::vector<std::string> program, const std::string& path)
 {
-    const std::string file = "--file=" + fs::absolute(path).string();
+    program.push_back("--file=" + fs::absolute(path).string());
+    return source.openProgram(program, path, false);
+}
+
+std::string open(LogSource& source, Kind kind, const std::string& path)
+{
     switch (kind) {
     case Kind::JOURNAL:
-        return source.openProgram({"journalctl", "--output=export", "--quiet", file}, path, false);
+        return start(source, {"journalctl", "--output=export", "--quiet"}, path);
     case Kind::ARCHIVE: // its journal.txt and kept-logs/
-        return source.openProgram(
-            {"tar", "--extract", "--gzip", "--to-stdout", "--wildcards", file, "harl-updater-report/[jk]*"}, path,
-            false);
+        return start(source, {"tar", "--extract", "--gzip", "--to-stdout", "--wildcards", "harl-updater-report/[jk]*"},
+                     path);
     default:
         return source.openFile(path);
     }
@@ -74,9 +76,7 @@ std::uint64_t entriesStated(const std::string& path)
 bool isVerified(const std::string& path)
 {
     LogSource source;
-    const std::string file = "--file=" + fs::absolute(path).string();
-    const std::string wrong = source.openProgram({"journalctl", "--verify", "--quiet", file}, path, false);
-    return wrong.empty() && source.close(true) == 0;
+    return start(source, {"journalctl", "--verify", "--quiet"}, path).empty() && source.close(true) == 0;
 }
 
 /// When an entry was made.
@@ -192,7 +192,7 @@ private:
         const Kind kind = kindOf(path);
         const std::uint64_t stated = kind == Kind::JOURNAL ? entriesStated(path) : 0; // before a receiver adds to them
         LogSource source;
-        std::string wrong = open(path, kind, source);
+        std::string wrong = open(source, kind, path);
         if (!wrong.empty()) {
             return wrong;
         }

@@ -11,7 +11,7 @@ from tests.power_cut.cuts import Group, PowerCuts
 from tests.power_cut.disk import missing, own_mounts
 from tests.service.service_test import built_package
 
-EVERY = 150  # images
+EVERY = 300  # images
 JOBS = 2
 
 

@@ -2,11 +2,9 @@
 
 #include "texts.h"
 
-#include <cstddef>
-#include <cstdint>
 #include <iosfwd>
 #include <string>
-#include <string_view>
+#include <utility>
 #include <vector>
 
 #include <nlohmann/json.hpp>
@@ -19,8 +17,10 @@ enum class Severity {
     UNCHECKED, ///< Could not be found out here; the answer is open.
 };
 
-/// The word for `severity` in reports: "note", "warning", "error" or "unchecked".
-const char* severityWord(Severity severity);
+NLOHMANN_JSON_SERIALIZE_ENUM(Severity, {{Severity::NOTE, "note"},
+                                        {Severity::WARNING, "warning"},
+                                        {Severity::ERROR, "error"},
+                                        {Severity::UNCHECKED, "unchecked"}})
 
 /// One thing that a check noticed.
 struct Finding
@@ -48,18 +48,27 @@ public:
     /// @param command  name of the check for programs
     /// @param subject  what was checked, printable
     /// @param good     what it is without an error
-    Report(std::string command, std::string subject, std::string good = "fit for an update");
+    Report(std::string command, std::string subject, std::string good = "fit for an update")
+        : mCommand(std::move(command)), mSubject(std::move(subject)), mGood(std::move(good))
+    {
+    }
 
-    /// Adds a fact: `name` in snake_case for programs, `label` and `text` for people, `value` for programs.
-    void addFact(std::string name, std::string label, std::string text, nlohmann::ordered_json value);
-
-    /// Adds a fact whose value for programs is its text.
-    void addFact(const std::string& name, const std::string& label, const std::string& text);
+    /// Adds a fact: `name` in snake_case for programs, `label` and `text` for people, `value`, or else `text`, for programs.
+    void addFact(const std::string& name, const std::string& label, const std::string& text,
+                 const nlohmann::ordered_json& value)
+    {
+        mLines.emplace_back(label, text);
+        mFacts[name] = value;
+    }
+    void addFact(const std::string& name, const std::string& label, const std::string& text)
+    {
+        addFact(name, label, text, text);
+    }
 
     /// Gives the catalogue's texts values for all findings that are added from now on.
-    void define(Values values);
+    void define(Values values) { mValues.merge(values); }
 
-    void add(Finding finding);
+    void add(Finding finding) { mFindings.push_back(std::move(finding)); }
 
     /// Adds a finding of the catalogue.
     ///
@@ -67,7 +76,7 @@ public:
     void add(const std::string& name, Values values = {});
 
     /// The text of a fact for programs; empty when there is none of this name.
-    std::string fact(const std::string& name) const;
+    std::string fact(const std::string& name) const { return mFacts.value(name, ""); }
 
     const std::vector<Finding>& findings() const { return mFindings; }
     Status status() const;
@@ -79,21 +88,13 @@ public:
     nlohmann::ordered_json toJson() const;
 
 private:
-    void print(std::ostream& out) const;
     std::size_t count(Severity severity) const;
-
-    struct Fact
-    {
-        std::string name;
-        std::string label;
-        std::string text;
-        nlohmann::ordered_json value;
-    };
 
     std::string mCommand;
     std::string mSubject;
     std::string mGood;
-    std::vector<Fact> mFacts;
+    nlohmann::ordered_json mFacts = nlohmann::ordered_json::object();
+    std::vector<std::pair<std::string, std::string>> mLines; // the facts for people
     std::vector<Finding> mFindings;
     Values mValues;
 };
@@ -108,31 +109,3 @@ inline constexpr int jsonVersion = 1;
 /// @return STATUS_UNCHECKED
 Report::Status refuse(const std::string& command, bool json, const std::string& text, std::ostream& out,
                       std::ostream& errors);
-
-/// The columns of the terminal that `out` is, or 100 where it is none.
-std::size_t widthOf(const std::ostream& out);
-
-/// Prints lines, each no longer than the terminal is wide, or 100 columns where `out` is none. They break at blanks
-/// only, so that a path stays whole. What goes on in a further line begins below the place of the line's tab, which
-/// itself is not printed.
-///
-/// @param text  printable but for tabs and line ends
-void printText(std::string_view text, std::ostream& out);
-
-/// `text` made fit for a terminal and for JSON whatever bytes it holds.
-///
-/// Control characters, invalid UTF-8 and characters that are invisible or change the direction of writing become \n,
-/// \t, \r, \xHH (a byte) or \u{HHHH} (a character); a double quote and a backslash get a backslash.
-std::string escaped(std::string_view text);
-
-/// escaped() `text` in double quotes. One of more than 300 bytes is cut, which three dots behind the quotes show.
-std::string shown(std::string_view text);
-
-/// `bytes` with an SI unit and in full: "3.1 MB (3,145,728 bytes)"; below 1,000 only "17 bytes".
-std::string byteCount(std::uint64_t bytes);
-
-/// `count` and the noun that fits it: "1 entry", "2 entries". Without `plural` it is the noun and an s.
-std::string counted(std::uint64_t count, const std::string& noun, const std::string& plural = "");
-
-/// shown() texts with commas between; of more than five only the first five and how many more there are.
-std::string listed(const std::vector<std::string>& texts);

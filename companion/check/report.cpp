@@ -8,6 +8,7 @@
 #include "unit/unit_check.h"
 
 #include <cerrno>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <ostream>
@@ -97,7 +98,7 @@ int runReport(const ReportOptions& options, const UnitSite& site, std::ostream& 
     const Descriptor made(open(options.file.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
     if (!made) {
         return refused(errno == EEXIST ? "exists already; name another file"
-                                       : "cannot be written: " + errorText(errno));
+                                       : std::string("cannot be written: ") + std::strerror(errno));
     }
     const Unit unit(site);
     const TemporaryFolder temporary(unit);

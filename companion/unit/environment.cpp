@@ -13,13 +13,9 @@
 
 #include <unistd.h>
 
-namespace
-{
-
-const char defaultSearchPath[] = "/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin"; // systemd.exec(5)
-const auto patience = 2s; // before a word on what is waited for
-
-} // namespace
+static const char defaultSearchPath[] =
+    "/usr/local/sbin:/usr/local/bin:/usr/sbin:/usr/bin:/sbin:/bin"; // systemd.exec(5)
+static const auto patience = 2s;                                    // before a word on what is waited for
 
 UnitSite thisUnit()
 {
@@ -49,7 +45,7 @@ CommandResult Unit::run(const std::vector<std::string>& arguments, std::chrono::
 {
     std::vector<std::string> environment = {"RES_OPTIONS=timeout:1 attempts:2"}; // resolv.conf(5)
     for (const auto& [name, value] : mEnvironment) {
-        environment.push_back(std::string(name).append("=").append(value));
+        environment.push_back(name + '=' + value);
     }
     bool told = mSite.waits == nullptr;
     return runCommand(arguments, environment, limit, [&](std::chrono::milliseconds time) {
@@ -67,7 +63,7 @@ std::string Unit::locale() const
     std::string result;
     for (const auto& [name, value] : mEnvironment) {
         if (name != "PATH") {
-            result.append(result.empty() ? "" : " ").append(name).append("=").append(value);
+            result += (result.empty() ? "" : " ") + name + '=' + value;
         }
     }
     return result;
@@ -75,11 +71,11 @@ std::string Unit::locale() const
 
 void Unit::defineTexts(Report& report) const
 {
-    const auto& notRead = catalogue("texts").at(mMainHead ? "board-not-read-main" : "board-not-read-remote");
+    const char* const notRead = mMainHead ? "board-not-read-main" : "board-not-read-remote";
     report.define({{"failure", failure()},
                    {"package", shown(package())},
                    {"package-name", package()},
-                   {"board-not-read", filled(notRead, {{"failure", failure()}})},
+                   {"board-not-read", sharedText(notRead, {{"failure", failure()}})},
                    {"without-version", mMainHead ? "installs nothing" : "leaves the board as it is"}});
 }
 
@@ -168,8 +164,7 @@ std::vector<std::string> linesOf(const std::string& text)
 {
     std::vector<std::string> lines;
     std::istringstream stream(text);
-    std::string line;
-    while (std::getline(stream, line)) {
+    for (std::string line; std::getline(stream, line);) {
         lines.push_back(line);
     }
     return lines;
@@ -179,17 +174,11 @@ std::string valueAfter(const std::string& text, const std::string& key)
 {
     std::string value;
     for (const std::string& line : linesOf(text)) {
-        const std::size_t position = line.find(key);
-        if (position != std::string::npos) {
+        if (const std::size_t position = line.find(key); position != std::string::npos) {
             value = line.substr(position + key.size());
         }
     }
     return value;
-}
-
-std::string errorText(int error)
-{
-    return std::generic_category().message(error);
 }
 
 std::string complaint(const CommandResult& result)

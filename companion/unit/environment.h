@@ -41,7 +41,6 @@ public:
 
     /// The program that the service's search path leads to; empty when there is none.
     std::string program(const std::string& name) const { return findProgram(name, searchPath()); }
-
     std::string searchPath() const { return mEnvironment.at("PATH"); }
 
     /// The service's variables for the locale, for a message.
@@ -49,19 +48,15 @@ public:
 
     /// Where the unit's file `absolute` is to be read.
     std::string path(const std::string& absolute) const { return mSite.root + absolute; }
-
-    bool isRoot() const { return mSite.isRoot; }
-    std::chrono::milliseconds silence() const { return mSite.silence; }
+    const UnitSite& site() const { return mSite; }
 
     /// True for a main head: its package is installed and the remote head's is not. Its own program shows the outcome;
     /// the panel and the sounds are the remote head's.
     bool isMainHead() const { return mMainHead; }
-
-    /// The head's own package.
     std::string package() const { return packageOf(mMainHead); }
 
     /// What the updater does when it cannot go on, for a message.
-    std::string failure() const
+    const char* failure() const
     {
         return mMainHead ? "reports a failure to the main head's program" : "shows the fail pattern";
     }
@@ -110,16 +105,11 @@ private:
     std::string mPath;
 };
 
-// What the checks need to judge commands and files
-
 /// The lines of `text`, without their ends.
 std::vector<std::string> linesOf(const std::string& text);
 
 /// What follows `key` in the last line of `text` that holds it, as the updater reads its versions; empty without one.
 std::string valueAfter(const std::string& text, const std::string& key);
-
-/// The text for an errno.
-std::string errorText(int error);
 
 /// What a command said of its failure, for a message.
 std::string complaint(const CommandResult& result);

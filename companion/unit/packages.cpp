@@ -31,21 +31,17 @@ void checkLocks(const Unit& unit, Report& report)
         {"/var/cache/apt/archives/lock", "archives-locked"},
     };
     for (const auto& [path, name] : locks) {
-        const std::string effect = filled(catalogue("texts").at(name), {{"failure", unit.failure()}});
         const Descriptor file(open(unit.path(path).c_str(), O_RDONLY | O_CLOEXEC));
-        if (!file) {
-            if (errno != ENOENT) {
-                report.add("package-lock.unknown",
-                           {{"path", shown(path)}, {"error", errorText(errno)}, {"effect", effect}});
-            }
-            continue;
-        }
+        const int error = file ? 0 : errno;
         struct flock lock = {};
         lock.l_type = F_WRLCK;
-        lock.l_whence = SEEK_SET;
-        if (fcntl(file.number(), F_GETLK, &lock) == 0 && lock.l_type != F_UNLCK) {
-            report.add("package-lock",
-                       {{"path", shown(path)}, {"process", std::to_string(lock.l_pid)}, {"effect", effect}});
+        const bool held = file && fcntl(file.number(), F_GETLK, &lock) == 0 && lock.l_type != F_UNLCK;
+        if (held || (!file && error != ENOENT)) {
+            report.add(held ? "package-lock" : "package-lock.unknown",
+                       {{"path", shown(path)},
+                        {"process", std::to_string(lock.l_pid)},
+                        {"error", std::strerror(error)},
+                        {"effect", sharedText(name, {{"failure", unit.failure()}})}});
         }
     }
 }
@@ -67,13 +63,12 @@ void checkPolicy(const Unit& unit, Report& report)
     if (!policy.started) {
         return; // reported with the tools
     }
-    const std::string locale = unit.locale();
-    if (!locale.empty()) {
-        report.addFact("locale", "Locale", escaped(locale));
+    if (!unit.locale().empty()) {
+        report.addFact("locale", "Locale", escaped(unit.locale()));
     }
     const std::string& text = policy.output;
     if (!text.empty() && !(contains(text, "Installed: ") && contains(text, "Candidate: "))) {
-        report.add("policy-words", {{"locale", shown(locale)}});
+        report.add("policy-words", {{"locale", shown(unit.locale())}});
         return;
     }
     const std::size_t own = text.find(unit.package() + ":\n");
@@ -98,36 +93,28 @@ void checkSettings(const Unit& unit, Report& report)
     static const std::array<const char*, 4> contradicting = {
         R"(DPkg::Options:: "--force-confnew";)", R"(DPkg::Options:: "--force-confask";)",
         R"(APT::Update::Error-Mode "any";)", R"(Binary::apt::APT::Update::Error-Mode "any";)"};
-    std::vector<std::string> found;
-    for (const std::string& line : linesOf(unit.run({"apt-config", "dump"}, quick).output)) {
-        if (std::find(contradicting.begin(), contradicting.end(), line) != contradicting.end()) {
-            found.push_back(line);
-        }
-    }
+    std::vector<std::string> found = linesOf(unit.run({"apt-config", "dump"}, quick).output);
+    const auto others = std::remove_if(found.begin(), found.end(), [](const std::string& line) {
+        return std::find(contradicting.begin(), contradicting.end(), line) == contradicting.end();
+    });
+    found.erase(others, found.end());
     if (!found.empty()) {
         report.add("apt-settings", {{"settings", listed(found)}});
     }
 }
 
-/// A number field of the package's record, 0 when it has none.
-std::uint64_t numberField(const std::string& record, const std::string& name)
-{
-    for (const std::string& line : linesOf(record)) {
-        if (startsWith(line, name + ": ")) {
-            return std::strtoull(line.c_str() + name.size() + 2, nullptr, 10);
-        }
-    }
-    return 0;
-}
-
 void checkSpace(const Unit& unit, Report& report)
 {
-    const CommandResult record = unit.run({"apt-cache", "show", "--no-all-versions", unit.package()}, quick);
-    const std::uint64_t needed = numberField(record.output, "Size") + // bytes
-                                 numberField(record.output, "Installed-Size") * 1024;
+    const std::string record =
+        '\n' + unit.run({"apt-cache", "show", "--no-all-versions", unit.package()}, quick).output;
+    const auto number = [&](const std::string& field) -> std::uint64_t { // 0 without the field
+        const std::size_t begin = record.find('\n' + field);
+        return begin == std::string::npos ? 0 : std::strtoull(&record[begin + 1 + field.size()], nullptr, 10);
+    };
+    const std::uint64_t needed = number("Size: ") + number("Installed-Size: ") * 1024; // bytes
     struct statvfs system = {};
     if (statvfs(unit.path("/").c_str(), &system) != 0) {
-        report.add("space-unknown", {{"error", errorText(errno)}});
+        report.add("space-unknown", {{"error", std::strerror(errno)}});
         return;
     }
     checkFreeSpace(system, needed, report);
@@ -165,7 +152,7 @@ bool makeLists(const Unit& unit, const std::string& folder)
 /// there is nothing of that.
 bool reportUnfetched(const std::string& errors, Report& report)
 {
-    const std::string words = "Failed to fetch ";
+    static const std::string words = "Failed to fetch ";
     std::set<std::string> told;
     for (const std::string& line : linesOf(errors)) {
         const std::size_t begin = line.find(words);
@@ -203,7 +190,7 @@ void refreshPrivately(const Unit& unit, const std::vector<std::string>& hosts, R
 {
     const TemporaryFolder folder(unit);
     if (folder.path().empty() || !makeLists(unit, folder.path())) {
-        report.add("mirrors-unknown.folder", {{"error", errorText(errno)}});
+        report.add("mirrors-unknown.folder", {{"error", std::strerror(errno)}});
         return;
     }
     const std::string settings = folder.path() + "/apt.conf";
@@ -213,7 +200,7 @@ void refreshPrivately(const Unit& unit, const std::vector<std::string>& hosts, R
     const CommandResult refresh = unit.run({"apt-get", "-c", settings, "update"}, refreshLimit, [&](auto time) {
         const std::uint64_t now = bytesFetched(folder.path());
         since = std::exchange(bytes, now) == now ? since : time;
-        silent = time - since >= unit.silence();
+        silent = time - since >= unit.site().silence;
         return !silent;
     });
     const bool fetched = !reportUnfetched(refresh.errors, report);
@@ -222,14 +209,11 @@ void refreshPrivately(const Unit& unit, const std::vector<std::string>& hosts, R
                    : refresh.timedOut ? "mirrors-unknown.slow"
                                       : "refresh-fails",
                    {{"complaint", complaint(refresh)}, {"hosts", listed(hosts)}});
-    }
-    if (!refresh.succeeded() || !fetched) {
-        return;
-    }
-    const std::string policy = unit.run({"apt-cache", "-c", settings, "policy", unit.package()}, quick).output;
-    const std::string candidate = valueAfter(policy, "Candidate: ");
-    if (!candidate.empty()) {
-        report.addFact("package_now", "Package offered now", shown(candidate), escaped(candidate));
+    } else if (fetched) {
+        const std::string policy = unit.run({"apt-cache", "-c", settings, "policy", unit.package()}, quick).output;
+        if (const std::string candidate = valueAfter(policy, "Candidate: "); !candidate.empty()) {
+            report.addFact("package_now", "Package offered now", shown(candidate), escaped(candidate));
+        }
     }
 }
 
@@ -243,7 +227,7 @@ void checkMirrors(const Unit& unit, Report& report)
     }
     std::set<std::string> hosts;
     for (const std::string& line : linesOf(list.output)) {
-        if (!line.empty() && line.front() == '\'') {
+        if (startsWith(line, "'")) {
             hosts.insert(hostOf(line.substr(1, line.find('\'', 1) - 1)));
         }
     }
@@ -300,10 +284,9 @@ void checkUnfinishedWork(const Unit& unit, Report& report)
             pending.push_back(line.substr(line.find('\t') + 1));
         }
     }
-    const char* const interrupted = dpkgWasInterrupted(unit) ? "an interrupted run" : "";
-    const char* const between = !pending.empty() && *interrupted != '\0' ? " and " : "";
-    const std::string work = listed(pending) + between + interrupted;
-    if (!work.empty()) {
-        report.add("package-half-configured", {{"work", work}});
+    const bool interrupted = dpkgWasInterrupted(unit);
+    if (interrupted || !pending.empty()) {
+        const char* const run = !interrupted ? "" : pending.empty() ? "an interrupted run" : " and an interrupted run";
+        report.add("package-half-configured", {{"work", listed(pending) + run}});
     }
 }

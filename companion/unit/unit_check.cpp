@@ -48,24 +48,6 @@ void checkService(const Unit& unit, const std::string& service, const std::strin
     report.addFact(fact, "Service " + service, escaped(unit.property(service, "ActiveState")));
 }
 
-void checkServices(const Unit& unit, Report& report)
-{
-    if (!unit.servicesKnown()) {
-        report.add("services-unknown");
-        return;
-    }
-    checkService(unit, "harl", "service_harl", report);
-    checkService(unit, "harl-updater", "service_harl_updater", report);
-}
-
-/// Without its folder the journal is kept in memory, journald.conf(5).
-void checkJournal(const Unit& unit, Report& report)
-{
-    if (!std::filesystem::exists(unit.path("/var/log/journal"))) {
-        report.add("journal-volatile");
-    }
-}
-
 /// The package tools keep the time at which the updater was built.
 void checkClock(const Unit& unit, Report& report)
 {
@@ -83,14 +65,6 @@ bool findTool(const Unit& unit, const std::string& name, Report& report)
         report.add("tool-missing." + name, {{"tool", shown(name)}, {"search-path", shown(unit.searchPath())}});
     }
     return found;
-}
-
-void checkTools(const Unit& unit, Report& report)
-{
-    report.addFact("search_path", "Search path", escaped(unit.searchPath()));
-    for (const char* tool : {"systemctl", "umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp"}) {
-        findTool(unit, tool, report);
-    }
 }
 
 void checkPanelAddress(const Unit& unit, Report& report)
@@ -151,7 +125,7 @@ void checkSoundFile(const Unit& unit, const char* sound, Report& report)
 {
     std::ifstream file(unit.path(sound), std::ios::binary);
     if (!file && errno != ENOENT) {
-        report.add("sound-file.unknown", {{"path", shown(sound)}, {"error", errorText(errno)}});
+        report.add("sound-file.unknown", {{"path", shown(sound)}, {"error", std::strerror(errno)}});
         return;
     }
     const std::string fault = file ? soundFault(file) : "it is not there";
@@ -187,19 +161,16 @@ void checkBoard(const Unit& unit, Report& report)
         return; // reported with the tools
     }
     const bool refused = answer.exitCode == 255; // ssh(1): an error of its own
-    const bool forKeys =
-        contains(answer.errors, "Host key verification failed") || contains(answer.errors, "Permission denied");
-    const Values values = {{"complaint", complaint(answer)}};
-    if (refused && forKeys && !unit.isRoot()) {
-        report.add("board-login.user", values);
-    } else if (refused && contains(answer.errors, "HOST IDENTIFICATION HAS CHANGED")) {
-        report.add("board-host-key.changed");
-    } else if (refused && contains(answer.errors, "Host key verification failed")) {
-        report.add("board-host-key.unknown");
-    } else if (refused && contains(answer.errors, "Permission denied")) {
-        report.add("board-login");
-    } else if (refused || answer.exitCode < 0) {
-        report.add("board-unreachable", values);
+    const bool unknown = contains(answer.errors, "Host key verification failed");
+    const bool denied = contains(answer.errors, "Permission denied");
+    const bool changed = contains(answer.errors, "HOST IDENTIFICATION HAS CHANGED");
+    if (refused || answer.exitCode < 0) {
+        report.add(refused && (unknown || denied) && !unit.site().isRoot ? "board-login.user"
+                   : refused && changed                                  ? "board-host-key.changed"
+                   : refused && unknown                                  ? "board-host-key.unknown"
+                   : refused && denied                                   ? "board-login"
+                                                                         : "board-unreachable",
+                   {{"complaint", complaint(answer)}});
     } else {
         checkBoardVersion(answer, report);
     }
@@ -211,16 +182,26 @@ void checkUnit(const Unit& unit, Report& report)
     if (unit.updaterRuns()) {
         report.add("updater-runs");
     }
-    if (!unit.isRoot()) {
+    if (!unit.site().isRoot) {
         report.add("not-root");
     }
     const bool main = unit.isMainHead();
     report.addFact("head", "Head", (main ? "main head, package " : "remote head, package ") + shown(unit.package()),
                    main ? "main" : "remote");
-    checkServices(unit, report);
-    checkJournal(unit, report);
+    if (unit.servicesKnown()) {
+        checkService(unit, "harl", "service_harl", report);
+        checkService(unit, "harl-updater", "service_harl_updater", report);
+    } else {
+        report.add("services-unknown");
+    }
+    if (!std::filesystem::exists(unit.path("/var/log/journal"))) { // kept in memory then, journald.conf(5)
+        report.add("journal-volatile");
+    }
     checkClock(unit, report);
-    checkTools(unit, report);
+    report.addFact("search_path", "Search path", escaped(unit.searchPath()));
+    for (const char* tool : {"systemctl", "umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp"}) {
+        findTool(unit, tool, report);
+    }
     if (!main) {
         checkPanel(unit, report);
         checkSound(unit, report);

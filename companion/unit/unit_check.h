@@ -1,11 +1,9 @@
 #pragma once
 
-#include "findings.h"
 #include "unit/environment.h"
 
 #include <iosfwd>
 
-/// What runUnit() is to do.
 struct UnitOptions
 {
     bool json = false;  ///< Print one JSON object instead of text.
@@ -22,9 +20,8 @@ void checkBoard(const Unit& unit, Report& report);
 /// Checks whether the unit is fit for an update, and prints the report to `out`.
 ///
 /// Starts no service and lights no LED; writes only a temporary folder, which it removes, and what the package tool
-/// caches of its own accord. A mirror that gives nothing costs 25 s, a slow one up to
-/// two minutes. With `panel` or `sound` it does what
-/// these ask for instead, unless the updater is running.
+/// caches of its own accord. A mirror that gives nothing costs 25 s, a slow one up to two minutes. With `panel` or
+/// `sound` it does what these ask for instead, unless the updater is running.
 ///
 /// @return a Report::Status; STATUS_UNCHECKED, with a message on `errors`, when a test is refused
 int runUnit(const UnitOptions& options, const UnitSite& site, std::ostream& out, std::ostream& errors);

@@ -6,7 +6,7 @@ Lines findingsOf(const Report& report)
 {
     Lines lines;
     for (const Finding& finding : report.findings()) {
-        lines.push_back(severityWord(finding.severity) + (' ' + finding.check));
+        lines.push_back(nlohmann::json(finding.severity).get<std::string>() + ' ' + finding.check);
     }
     return lines;
 }

@@ -86,11 +86,6 @@ bool liesBelow(const std::set<std::string>& folders, const std::string& name)
     return false;
 }
 
-void addUp(std::uint64_t& sum, std::uint64_t value)
-{
-    sum = value > UINT64_MAX - sum ? UINT64_MAX : sum + value;
-}
-
 /// The archive check: each operation adds to the report what it finds.
 class ArchiveCheck
 {
@@ -122,13 +117,8 @@ private:
     std::string readAt(std::uint64_t offset, std::size_t length) const
     {
         std::string bytes(length, '\0');
-        std::size_t done = 0;
-        ssize_t count = 0;
-        while (done < length && (count = pread(mDescriptor, bytes.data() + done, length - done,
-                                               static_cast<off_t>(offset + done))) > 0) {
-            done += static_cast<std::size_t>(count);
-        }
-        bytes.resize(done);
+        const ssize_t count = pread(mDescriptor, bytes.data(), length, static_cast<off_t>(offset));
+        bytes.resize(static_cast<std::size_t>(std::max<ssize_t>(count, 0)));
         return bytes;
     }
 
@@ -136,10 +126,9 @@ private:
     bool readWhole()
     {
         for (std::uint64_t offset = 0; offset < mSize; offset += blockSize) {
-            const auto wanted = static_cast<std::size_t>(std::min<std::uint64_t>(blockSize, mSize - offset));
-            const std::size_t count = readAt(offset, wanted).size();
-            if (count < wanted) {
-                mReport.add("archive-unreadable", {{"offset", std::to_string(offset + count)}});
+            const std::uint64_t end = offset + readAt(offset, blockSize).size();
+            if (end < std::min<std::uint64_t>(mSize, offset + blockSize)) {
+                mReport.add("archive-unreadable", {{"offset", std::to_string(end)}});
                 return false;
             }
         }
@@ -167,8 +156,8 @@ private:
         Faults leaving;
         std::set<std::string> links;
         const bool intact = forEachEntry(mArchive.get(), [&](const Entry& entry) {
-            addUp(mPackedBytes, entry.info.compressed_size);
-            addUp(mDeclaredBytes, entry.info.uncompressed_size);
+            mPackedBytes += std::min<std::uint64_t>(entry.info.compressed_size, UINT64_MAX - mPackedBytes);
+            mDeclaredBytes += std::min<std::uint64_t>(entry.info.uncompressed_size, UINT64_MAX - mDeclaredBytes);
             if (leavesFolder(entry.name)) {
                 leaving.add(entry.name, unzGetOffset64(mArchive.get()), "lies outside the folder it is unpacked into");
             } else if (liesBelow(links, entry.name)) {

@@ -6,13 +6,14 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
-#include <memory>
+#include <filesystem>
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <linux/magic.h>
 #include <sys/stat.h>
 #include <sys/vfs.h>
+
+namespace fs = std::filesystem;
 
 namespace
 {
@@ -42,21 +43,17 @@ Node StickFolder::node(const std::string& path) const
     Node result;
     struct stat status = {};
     const Descriptor itself = open(path, O_PATH | O_NOFOLLOW);
-    if (!itself || fstat(itself.number(), &status) != 0) {
-        result.error = errno;
-        const bool missing = errno == ENOENT || errno == ENOTDIR;
-        result.kind = missing ? Node::MISSING : errno == EXDEV ? Node::LEADS_OUT : Node::UNREADABLE;
-        return result;
-    }
-    result.present = true;
-    if (S_ISLNK(status.st_mode)) {
+    result.present = itself && fstat(itself.number(), &status) == 0;
+    if (result.present && S_ISLNK(status.st_mode)) {
         result.target = targetOf(itself);
     }
     const Descriptor followed = open(path, O_PATH);
     if (!followed || fstat(followed.number(), &status) != 0) {
         result.error = errno;
-        const bool nowhere = errno == ENOENT || errno == ENOTDIR || errno == ELOOP;
-        result.kind = nowhere ? Node::LEADS_NOWHERE : errno == EXDEV ? Node::LEADS_OUT : Node::UNREADABLE;
+        const bool nowhere = errno == ENOENT || errno == ENOTDIR || (result.present && errno == ELOOP);
+        result.kind = errno == EXDEV ? Node::LEADS_OUT
+                      : !nowhere     ? Node::UNREADABLE
+                                     : (result.present ? Node::LEADS_NOWHERE : Node::MISSING);
         return result;
     }
     result.kind = S_ISDIR(status.st_mode) ? Node::FOLDER : S_ISREG(status.st_mode) ? Node::FILE : Node::SPECIAL;
@@ -68,26 +65,21 @@ Node StickFolder::node(const std::string& path) const
 Names StickFolder::names(const std::string& path) const
 {
     Names result;
-    Descriptor folder = open(path, O_RDONLY | O_DIRECTORY);
-    const std::unique_ptr<DIR, int (*)(DIR*)> stream(folder ? fdopendir(folder.number()) : nullptr, closedir);
-    if (!stream) {
+    const Descriptor folder = open(path, O_RDONLY | O_DIRECTORY);
+    if (!folder) {
         result.error = errno;
         return result;
     }
-    folder.release(); // closedir() closes it
-    errno = 0;
-    while (const dirent* entry = readdir(stream.get())) {
-        const std::string name = entry->d_name;
-        if (name == "." || name == "..") {
-            continue;
-        }
+    std::error_code error;
+    fs::directory_iterator entry("/proc/self/fd/" + std::to_string(folder.number()), error);
+    for (; !error && entry != fs::directory_iterator(); entry.increment(error)) {
         if (result.names.size() == Names::most) {
             result.tooMany = true;
             break;
         }
-        result.names.push_back(name);
+        result.names.push_back(entry->path().filename());
     }
-    result.error = result.tooMany ? 0 : errno;
+    result.error = error.value();
     std::sort(result.names.begin(), result.names.end());
     return result;
 }
@@ -129,12 +121,12 @@ Descriptor StickFolder::open(const std::string& path, int flags) const
         const bool last = slash == std::string::npos;
         const std::string name = rest.substr(0, slash);
         rest.erase(0, last ? slash : slash + 1);
-        if (name == ".." && folders.size() == 1) {
-            errno = EXDEV;
-            return Descriptor();
-        }
         if (name == "..") {
             folders.pop_back();
+        }
+        if (folders.empty()) {
+            errno = EXDEV;
+            return Descriptor();
         }
         const bool stays = name.empty() || name == "." || name == "..";
         const char* const step = stays ? "." : name.c_str();

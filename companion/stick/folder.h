@@ -43,9 +43,8 @@ struct Names
 class StickFolder
 {
 public:
-    /// Opens the folder at `path`. When that fails, error() tells why, and nothing else is to be called.
+    /// Opens the folder at `path`. When that fails, error() is its errno, and nothing else is to be called.
     explicit StickFolder(const std::string& path);
-
     int error() const { return mError; }
 
     /// What the relative `path` is.

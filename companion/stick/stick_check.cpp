@@ -7,13 +7,13 @@
 #include <algorithm>
 #include <cctype>
 #include <cerrno>
-#include <cstdlib>
 #include <cstring>
-#include <memory>
+#include <filesystem>
 #include <ostream>
 #include <utility>
 #include <vector>
 
+#include <elf.h>
 #include <sys/stat.h>
 
 namespace
@@ -33,14 +33,9 @@ std::string inFolder(const std::string& folder, const std::string& name)
     return folder + '/' + name;
 }
 
-bool isDigit(char letter)
-{
-    return letter >= '0' && letter <= '9';
-}
-
 bool isLetterOrDigit(char letter)
 {
-    return isDigit(letter) || (letter >= 'a' && letter <= 'z');
+    return std::isalnum(static_cast<unsigned char>(letter)) != 0;
 }
 
 /// True when ls(1) lists `name` behind `other` in every locale: they differ in how they order upper and lower case,
@@ -213,8 +208,8 @@ private:
                             shown(version) + ": the board is updated unless it reports exactly this", escaped(version));
         }
         if (hasFolder) {
-            checkArchiveFile(names);
-            checkScriptFile(names);
+            checkFile(names, archiveName);
+            checkFile(names, scriptName);
         }
     }
 
@@ -255,31 +250,32 @@ private:
         return true;
     }
 
-    void checkArchiveFile(const std::vector<std::string>& names)
+    /// Checks the file that the upload takes when it is a plain and not an empty one, and reports anything else.
+    void checkFile(const std::vector<std::string>& names, const std::string& name)
     {
-        const std::string path = uploadedPath(names, archiveName);
+        const std::string path = uploadedPath(names, name);
         const Node node = mStick.node(path);
-        const Descriptor file = openFile(path, node);
-        if (file) {
-            checkArchive(file.number(), node.size, shown(path), mReport);
-        }
-    }
-
-    void checkScriptFile(const std::vector<std::string>& names)
-    {
-        const std::string path = uploadedPath(names, scriptName);
-        const Node node = mStick.node(path);
-        const Descriptor file = openFile(path, node);
-        if (!file) {
+        if (path.empty() || reportUnusable(path, node, "upload-fails")) {
             return;
         }
+        if (node.kind != Node::FILE || node.size == 0) {
+            mReport.add(node.kind == Node::FILE ? "file-empty" : "no-plain-file",
+                        {{"path", shown(path)},
+                         {"state", node.kind == Node::FOLDER ? "is a folder, no file" : "is no plain file"}});
+            return;
+        }
+        const Descriptor file = mStick.openFile(path);
         std::string start(static_cast<std::size_t>(std::min<std::uint64_t>(node.size, scriptBytesChecked)), '\0');
-        if (read(file.number(), start.data(), start.size()) != static_cast<ssize_t>(start.size())) {
+        if (!file) {
+            addUnreadable(path, errno, "upload-fails");
+        } else if (name == archiveName) {
+            checkArchive(file.number(), node.size, shown(path), mReport);
+        } else if (read(file.number(), start.data(), start.size()) != static_cast<ssize_t>(start.size())) {
             addUnreadable(path, EIO, "upload-fails");
-            return;
+        } else {
+            checkScript(start, node.size, shown(path), mReport);
+            checkRunBit(node.mode, mStick.keepsPermissions(), mOnUnit, shown(path), mReport);
         }
-        checkScript(start, node.size, shown(path), mReport);
-        checkRunBit(node.mode, mStick.keepsPermissions(), mOnUnit, shown(path), mReport);
     }
 
     /// What the `*` of the upload's command line finds of `file`: of several paths the one that arrives last and so
@@ -306,26 +302,6 @@ private:
                         {{"file", shown(file)}, {"names", listed(similar)}});
         }
         return last;
-    }
-
-    /// Opens the file at `path` when it is a plain and not an empty one, and reports anything else. An empty path has
-    /// been reported before.
-    Descriptor openFile(const std::string& path, const Node& node)
-    {
-        if (path.empty() || reportUnusable(path, node, "upload-fails")) {
-            return Descriptor();
-        }
-        if (node.kind != Node::FILE || node.size == 0) {
-            mReport.add(node.kind == Node::FILE ? "file-empty" : "no-plain-file",
-                        {{"path", shown(path)},
-                         {"state", node.kind == Node::FOLDER ? "is a folder, no file" : "is no plain file"}});
-            return Descriptor();
-        }
-        Descriptor file = mStick.openFile(path);
-        if (!file) {
-            addUnreadable(path, errno, "upload-fails");
-        }
-        return file;
     }
 
     /// ls(1) prints the path of anything but a folder, and only its path requests TeamViewer. It prints nothing of a
@@ -360,12 +336,6 @@ private:
     Report& mReport;
 };
 
-bool isUnitMountPoint(const std::string& path)
-{
-    const std::unique_ptr<char, void (*)(void*)> real(realpath(path.c_str(), nullptr), std::free);
-    return real && std::strcmp(real.get(), stickMountPoint) == 0;
-}
-
 } // namespace
 
 int runStick(const std::string& path, bool json, std::ostream& out, std::ostream& errors, const std::string& keyring)
@@ -375,7 +345,8 @@ int runStick(const std::string& path, bool json, std::ostream& out, std::ostream
         return refuseStick("stick", path, stick.error(), json, out, errors);
     }
     Report report("stick", "The stick at " + shown(path));
-    checkStick(stick, isUnitMountPoint(path), report);
+    std::error_code error;
+    checkStick(stick, std::filesystem::canonical(path, error) == stickMountPoint, report);
     checkSignature(path, keyring, report);
     report.write(json, out);
     return report.status();
@@ -413,8 +384,8 @@ std::string checkVersionName(const std::string& name, Report& report)
     if (!usual) {
         report.add("version-unusual", {{"version", shown(version)}});
     }
-    const char lastOfPrefix = line[versionPrefixLength - 1];
-    if (!isDigit(version.front()) || isDigit(lastOfPrefix) || lastOfPrefix == '.') {
+    const std::string lastOfPrefix = line.substr(versionPrefixLength - 1, 1);
+    if (!contains("0123456789", version.substr(0, 1)) || contains("0123456789.", lastOfPrefix)) {
         report.add("version-start",
                    {{"prefix", shown(line.substr(0, versionPrefixLength))}, {"version", shown(version)}});
     }
@@ -423,48 +394,43 @@ std::string checkVersionName(const std::string& name, Report& report)
 
 void checkScript(std::string_view start, std::uint64_t size, const std::string& name, Report& report)
 {
-    if (start.substr(0, 4) == std::string_view("\x7f"
-                                               "ELF")) {
+    if (startsWith(start, ELFMAG)) {
         report.addFact("script_interpreter", "Script", byteCount(size) + ", a compiled program", nullptr);
         return;
     }
     const std::string_view firstLine = start.substr(0, start.find('\n'));
+    const std::string_view interpreter = interpreterOf(firstLine);
     const Values values = {
-        {"name", name}, {"start", shown(firstLine.substr(0, 60))}, {"interpreter", shown(interpreterOf(firstLine))}};
-    const bool names = firstLine.substr(0, 2) == "#!";
-    if (names && contains(firstLine, "\r")) {
-        report.add("script-first-line.windows", values);
-        return;
-    }
-    if (names && (interpreterOf(firstLine).substr(0, 1) != "/" || firstLine.size() > firstLineBytes ||
+        {"name", name}, {"start", shown(firstLine.substr(0, 60))}, {"interpreter", shown(interpreter)}};
+    const bool names = startsWith(firstLine, "#!");
+    const bool windows = contains(firstLine, "\r");
+    if (names && (windows || !startsWith(interpreter, "/") || firstLine.size() > firstLineBytes ||
                   firstLine.find('\0') != std::string_view::npos)) {
-        report.add("script-first-line.interpreter", values);
+        report.add(windows ? "script-first-line.windows" : "script-first-line.interpreter", values);
         return;
     }
     if (names) {
-        report.addFact("script_interpreter", "Script", byteCount(size) + ", run by " + shown(interpreterOf(firstLine)),
-                       escaped(interpreterOf(firstLine)));
+        report.addFact("script_interpreter", "Script", byteCount(size) + ", run by " + shown(interpreter),
+                       escaped(interpreter));
     } else {
         report.add("script-first-line", values);
     }
 
     // Behind a zero byte a script carries data, not lines.
     const std::string_view text = start.substr(0, start.find('\0'));
-    const std::size_t carriageReturn = text.find("\r\n");
-    if (carriageReturn == std::string_view::npos) {
-        return;
+    const std::string_view before = text.substr(0, text.find("\r\n"));
+    if (before.size() < text.size()) {
+        const auto line = 1 + std::count(before.begin(), before.end(), '\n');
+        report.add("script-line-ends", {{"name", name}, {"line", std::to_string(line)}});
     }
-    const auto line = 1 + std::count(text.begin(), text.begin() + static_cast<std::ptrdiff_t>(carriageReturn), '\n');
-    report.add("script-line-ends", {{"name", name}, {"line", std::to_string(line)}});
 }
 
 void checkRunBit(mode_t mode, bool keepsPermissions, bool onUnit, const std::string& name, Report& report)
 {
-    if ((mode & (S_IXUSR | S_IXGRP | S_IXOTH)) != 0) {
-        return;
+    if ((mode & (S_IXUSR | S_IXGRP | S_IXOTH)) == 0) {
+        report.add(keepsPermissions ? "script-run-bit"
+                   : onUnit         ? "script-run-bit.mount"
+                                    : "script-run-bit.elsewhere",
+                   {{"name", name}});
     }
-    report.add(keepsPermissions ? "script-run-bit"
-               : onUnit         ? "script-run-bit.mount"
-                                : "script-run-bit.elsewhere",
-               {{"name", name}});
 }

@@ -13,8 +13,6 @@ namespace
 using S = StepKind;
 using Json = nlohmann::ordered_json;
 
-const std::string anyCode = "any";
-
 StepSet stepsNamed(const Json& names)
 {
     StepSet steps;
@@ -45,16 +43,16 @@ std::vector<Failure> readFailures()
 {
     std::vector<Failure> failures;
     for (const auto& [name, entry] : catalogue("failures").items()) {
-        Failure failure;
-        failure.name = name;
-        failure.reported = entry.value("reported", "");
-        failure.steps = stepsNamed(entry.value("steps", Json::array()));
-        failure.general = entry.value("general", false);
-        failure.cause = unfilled(entry.at("cause"));
-        failure.remedy = unfilled(entry.at("remedy"));
-        if (const auto code = entry.find("code"); code != entry.end()) {
-            failure.code = code->is_string() ? code->get<std::string>() : code->dump();
-        }
+        const Json code = entry.value("code", Json(""));
+        failures.push_back({name,
+                            entry.value("reported", ""),
+                            stepsNamed(entry.value("steps", Json::array())),
+                            code.is_string() ? code.get<std::string>() : code.dump(),
+                            entry.value("general", false),
+                            unfilled(entry.at("cause")),
+                            unfilled(entry.at("remedy")),
+                            {}});
+        Failure& failure = failures.back();
         const Json phrases = entry.value("phrases", Json::object());
         for (const auto& [tool, texts] : phrases.items()) {
             const StepSet steps = failure.steps & stepsNamed(catalogue("tools").at(tool)); // that the tool runs in
@@ -62,7 +60,6 @@ std::vector<Failure> readFailures()
                 failure.phrases.push_back({tool, words.get<std::string>(), steps});
             }
         }
-        failures.push_back(std::move(failure));
     }
     return failures;
 }
@@ -97,12 +94,12 @@ const Failure* entryFor(const Run& run, const Step& step)
     const long code = step.status ? step.status->number : step.word == "NO_INTERNET_ERROR_CODE" ? 100 : 0;
     const Failure* found = findFailure("unknown");
     for (const Failure& failure : failures()) {
-        if (has(failure.steps, step.kind) && failure.code == std::to_string(code)) {
+        const bool exact = failure.code == std::to_string(code);
+        if (has(failure.steps, step.kind) && (exact || failure.code == "any")) {
             found = &failure;
-            break;
-        }
-        if (has(failure.steps, step.kind) && failure.code == anyCode) {
-            found = &failure;
+            if (exact) {
+                break;
+            }
         }
     }
     return found->general && step.pointsTo != nullptr ? step.pointsTo : found;
@@ -181,10 +178,8 @@ void addBesides(Run& run)
         }
         if (step.kind == S::GIVE_BACK) {
             const char* const names[] = {"stick-not-released", "application-not-started"};
-            for (std::size_t command = 0; command < std::min<std::size_t>(2, step.actions.size()); ++command) {
-                if (const auto& status = step.actions[command].status; status && status->number != 0) {
-                    run.besides.push_back({findFailure(names[command]), index});
-                }
+            for (const std::size_t command : failedCommands(step)) {
+                run.besides.push_back({findFailure(names[command]), index});
             }
             continue;
         }
@@ -266,45 +261,42 @@ bool wentWell(const Run& run)
 
 bool printCatalogue(const std::string& name, bool json, std::ostream& out)
 {
-    Json entries = Json::array();
     const Values values = valuesOf(Run(), nullptr, {});
-    for (const Failure& failure : failures()) {
-        if (!name.empty() && name != failure.name) {
-            continue;
-        }
-        Json phrases = Json::array();
-        for (const Phrase& phrase : failure.phrases) {
-            phrases.push_back({{"tool", phrase.tool}, {"words", phrase.words}, {"steps", namesOf(phrase.steps)}});
-        }
-        entries.push_back({{"name", failure.name},
-                           {"reported", failure.reported},
-                           {"steps", namesOf(failure.steps)},
-                           {"cause", filled(failure.cause, values)},
-                           {"remedy", filled(failure.remedy, values)},
-                           {"phrases", phrases}});
-    }
-    if (json && !entries.empty()) {
-        out << Json{{"command", "explain"}, {"version", jsonVersion}, {"failures", entries}}.dump(2) << '\n';
-        return true;
-    }
+    Json entries = Json::array();
     std::string text;
     const auto add = [&](const char* label, const std::string& words) {
         text += words.empty() ? "" : label + words + '\n';
     };
-    for (const Json& one : entries) {
-        text += (text.empty() ? "" : "\n") + one["name"].get<std::string>() + '\n';
+    for (const Failure& failure : failures()) {
+        if (!name.empty() && name != failure.name) {
+            continue;
+        }
+        Json entry = {{"name", failure.name},
+                      {"reported", failure.reported},
+                      {"steps", namesOf(failure.steps)},
+                      {"cause", filled(failure.cause, values)},
+                      {"remedy", filled(failure.remedy, values)},
+                      {"phrases", Json::array()}};
         std::string steps;
-        for (const Json& step : one["steps"]) {
+        for (const Json& step : entry["steps"]) {
             steps += (steps.empty() ? "" : ", ") + step.get<std::string>();
         }
-        add("  Reported: \t", one["reported"]);
+        text += (text.empty() ? "" : "\n") + failure.name + '\n';
+        add("  Reported: \t", failure.reported);
         add("  In step:  \t", steps);
-        add("  Cause:    \t", one["cause"]);
-        add("  Do now:   \t", one["remedy"]);
-        for (const Json& phrase : one["phrases"]) {
-            add("  Says so:  \t", phrase["tool"].get<std::string>() + ": " + phrase["words"].get<std::string>());
+        add("  Cause:    \t", entry["cause"]);
+        add("  Do now:   \t", entry["remedy"]);
+        for (const Phrase& phrase : failure.phrases) {
+            entry["phrases"].push_back(
+                {{"tool", phrase.tool}, {"words", phrase.words}, {"steps", namesOf(phrase.steps)}});
+            add("  Says so:  \t", phrase.tool + ": " + phrase.words);
         }
+        entries.push_back(std::move(entry));
     }
-    printText(text, out);
+    if (json && !entries.empty()) {
+        out << Json{{"command", "explain"}, {"version", jsonVersion}, {"failures", entries}}.dump(2) << '\n';
+    } else {
+        printText(text, out);
+    }
     return !entries.empty();
 }

@@ -7,7 +7,8 @@
 
 #include <algorithm>
 #include <ctime>
-#include <ostream>
+#include <sstream>
+#include <utility>
 
 #include <nlohmann/json.hpp>
 
@@ -119,25 +120,26 @@ std::int64_t Follower::remaining(const Run& run, std::int64_t now) const
 
 void Follower::show(const Run* run, std::int64_t now)
 {
-    const bool running = run != nullptr && !isOver(*run) && !run->steps.empty();
+    const bool over = run != nullptr && isOver(*run);
+    const bool known = run != nullptr && !run->steps.empty();
+    const bool running = known && !over;
+    const bool overdue = running && isOverdue(*run, now);
     const std::uint64_t number = run == nullptr ? 0 : run->number;
-    const std::uint64_t firstNumber = mFirstNumber.value_or(number);
-    mFirstNumber = firstNumber;
-    mEnded = mEnded || ((mRunning || number > firstNumber) && run != nullptr && isOver(*run));
+    mFirstNumber = mFirstNumber.value_or(number);
+    mEnded = mEnded || ((mRunning || number > *mFirstNumber) && over);
     mRunning = mRunning || running;
 
-    std::string state = "none";
-    if (run != nullptr && !run->steps.empty()) {
+    std::ostringstream state; // "" is that of the first call
+    state << "shown ";
+    if (known) {
         const Step& step = run->steps.back();
-        state = std::to_string(run->number) + ' ' + std::to_string(run->steps.size()) + ' ' +
-                std::to_string(step.failedAttempts) + ' ' + std::to_string(static_cast<int>(step.result)) + ' ' +
-                std::to_string(static_cast<int>(run->ended)) + (running && isOverdue(*run, now) ? " overdue" : "");
+        state << number << ' ' << run->steps.size() << ' ' << step.failedAttempts << ' '
+              << static_cast<int>(step.result) << ' ' << static_cast<int>(run->ended) << ' ' << overdue;
     }
-    if (state != mShown) {
-        mShown = state;
+    if (std::exchange(mShown, state.str()) != state.str()) {
         showChange(run, now);
     }
-    if (running && mTerminal && !mJson && !isOverdue(*run, now)) {
+    if (running && mTerminal && !mJson && !overdue) {
         showBar(*run, now);
     }
     mOut.flush();

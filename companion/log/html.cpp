@@ -74,15 +74,13 @@ Json rowOf(const Run& run, const Step& step)
 Json problemData(const Run& run, const Problem& problem, const char* style)
 {
     const Step* step = run.stepOf(problem);
-    Json said;
-    for (const std::string& line : step == nullptr ? std::vector<std::string>() : shownLines(step->said)) {
-        said["lines"].push_back(line);
+    Json shown = problemToJson(run, problem);
+    shown["style"] = style;
+    shown["heading"] = headingOf(run, problem);
+    if (step != nullptr && step->said.count > 0) {
+        shown["said"]["lines"] = shownLines(step->said);
     }
-    return {{"style", style},
-            {"heading", headingOf(run, problem)},
-            {"cause", causeOf(run, problem)},
-            {"remedy", remedyOf(run, problem)},
-            {"said", said}};
+    return shown;
 }
 
 } // namespace

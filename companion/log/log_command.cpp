@@ -12,6 +12,7 @@
 #include "log/source.h"
 #include "log/text.h"
 #include "page_file.h"
+#include "procedure.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -58,7 +59,11 @@ public:
     bool open(const LogOptions& options, std::size_t index, std::ostream& err)
     {
         mJournal = options.journal;
-        mError = mJournal ? mSource.openJournal(options.follow)
+        std::vector<std::string> command = journalCommand;
+        if (options.follow) {
+            command.insert(command.end(), {"--follow", "--no-tail"});
+        }
+        mError = mJournal ? mSource.openProgram(command, "the journal of harl-updater", true)
                           : mSource.openFile(options.files.empty() ? "-" : options.files[index]);
         if (mError.empty() && isatty(mSource.descriptor()) == 1) {
             err << "harl-updater-tool: reading the log from the terminal; end it with Ctrl-D.\n";
@@ -158,12 +163,6 @@ bool openUnnamed(std::fstream& file)
     return file.is_open();
 }
 
-/// True when a run leaves nothing to be done.
-bool isClean(const Run& run)
-{
-    return wentWell(run) && run.besides.empty() && run.board.found();
-}
-
 std::string dumped(const Json& value)
 {
     return value.dump(1, ' ', false, Json::error_handler_t::replace);
@@ -190,7 +189,7 @@ public:
         }
         mBuilder.finish();
         if (mLast) {
-            show(*mLast, mLastSource);
+            show(mLast->first, mLast->second);
         }
         if (error.empty() && mOptions.run > mRuns) {
             error = "there is no run " + std::to_string(mOptions.run) + ": the log has " + counted(mRuns, "run");
@@ -248,10 +247,10 @@ private:
     {
         explain(run);
         mRuns = run.number;
-        mStatus = (mOptions.strict ? isClean(run) : wentWell(run)) ? LOG_WENT_WELL : LOG_WENT_WRONG;
+        const bool clean = run.besides.empty() && run.board.found();
+        mStatus = wentWell(run) && (clean || !mOptions.strict) ? LOG_WENT_WELL : LOG_WENT_WRONG;
         if (mOptions.last) {
-            mLast = run;
-            mLastSource = mSource;
+            mLast = {run, mSource};
         } else if (mOptions.run == 0 || mOptions.run == run.number) {
             show(run, mSource);
         }
@@ -280,9 +279,8 @@ private:
     RunBuilder mBuilder;
     std::fstream mPage;
     std::string mSource;
-    std::optional<Run> mLast;
-    std::string mLastSource;
-    bool mShown = false; // a run
+    std::optional<std::pair<Run, std::string>> mLast; // with its source
+    bool mShown = false;                              // a run
     std::uint64_t mRuns = 0;
     std::uint64_t mLines = 0;
     std::uint64_t mBytes = 0;
@@ -302,14 +300,10 @@ bool awaitMore(const LogSource& source, int time)
 /// @return false when nothing more can come
 bool readWhatIsThere(Reader& reader)
 {
-    if (reader.source().isRegularFile()) {
-        while (reader.readBlock()) {
-        }
-        return true;
-    }
-    while (awaitMore(reader.source(), 0)) {
+    const bool file = reader.source().isRegularFile();
+    while (file || awaitMore(reader.source(), 0)) {
         if (!reader.readBlock()) {
-            return false;
+            return file;
         }
     }
     return true;

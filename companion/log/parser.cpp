@@ -3,32 +3,26 @@
 #include "log/vocabulary.h"
 
 #include <algorithm>
-#include <cstring>
 #include <ctime>
+#include <numeric>
 
 namespace
 {
 
 const std::string_view mark = "Updater | ";
-const std::size_t longestPrefix = 200; // bytes of a journal's prefix
-const std::size_t timeLength = 19;
+const std::size_t longestPrefix = 200;                   // bytes of a journal's prefix
+const std::string_view timeForm = "00-00-0000 00-00-00"; // DD-MM-YYYY HH-MM-SS
 
 bool isDigit(char character)
 {
     return character >= '0' && character <= '9';
 }
 
-/// The number that `digits` decimal digits of `text` at `position` stand for, -1 if they are no digits.
-int number(std::string_view text, std::size_t position, std::size_t digits)
+/// The number that the decimal digits of `text` from `begin` to `end` stand for.
+int number(std::string_view text, std::size_t begin, std::size_t end)
 {
-    int value = 0;
-    for (std::size_t index = position; index < position + digits; ++index) {
-        if (!isDigit(text[index])) {
-            return -1;
-        }
-        value = value * 10 + (text[index] - '0');
-    }
-    return value;
+    const auto append = [](int value, char digit) { return value * 10 + (digit - '0'); };
+    return std::accumulate(text.begin() + begin, text.begin() + end, 0, append);
 }
 
 std::string_view withoutBlanks(std::string_view text)
@@ -122,8 +116,9 @@ bool isHiddenMessage(std::string_view text)
     return text.size() > end.size() && text.front() == '[' && text.substr(text.size() - end.size()) == end;
 }
 
-} // namespace
-
+/// Removes what a journal puts in front of a line, "Nov 21 07:15:33 unit ssh[123]: " or with another form of the time.
+///
+/// @param program  out: "ssh" in the example; empty when there is no such prefix
 std::string_view withoutJournalPrefix(std::string_view line, std::string_view& program)
 {
     program = {};
@@ -152,22 +147,24 @@ std::string_view withoutJournalPrefix(std::string_view line, std::string_view& p
     return line.substr(std::min(end + 3, line.size()));
 }
 
+} // namespace
+
 void LogParser::feed(std::string_view block)
 {
     while (!block.empty()) {
-        const void* found = std::memchr(block.data(), '\n', block.size());
-        const std::size_t length =
-            found == nullptr ? block.size() : static_cast<std::size_t>(static_cast<const char*>(found) - block.data());
-        if (found != nullptr && mPartialLine.empty()) {
-            takeLine(block.substr(0, std::min(length, longestLine)));
+        const std::size_t end = block.find('\n');
+        const bool ends = end != std::string_view::npos;
+        const std::string_view line = block.substr(0, end);
+        if (ends && mPartialLine.empty()) {
+            takeLine(line.substr(0, longestLine));
         } else {
-            mPartialLine.append(block.substr(0, std::min(length, longestLine - mPartialLine.size())));
-            if (found != nullptr) {
+            mPartialLine.append(line.substr(0, longestLine - mPartialLine.size()));
+            if (ends) {
                 takeLine(mPartialLine);
                 mPartialLine.clear();
             }
         }
-        block.remove_prefix(std::min(length + 1, block.size()));
+        block.remove_prefix(line.size() + (ends ? 1 : 0));
     }
 }
 
@@ -243,16 +240,14 @@ void LogParser::takeText(std::string_view line, std::size_t indentation)
         takeMessage(text.substr(indentation));
     } else if (mHeadOpen && words.empty() && !mCut) {
         mEmptySeen = true; // the message without its blanks, or a line that a copy has put in
-    } else if (mHeadOpen && ((!mIndented && logsOutput(mHead.operation)) || isMessageOf(mHead.operation, words))) {
+    } else if (mHeadOpen && isMessageOf(mHead.operation, words, !mIndented)) {
         takeMessage(words); // its blanks are gone
     } else if (mHeadOpen && isHiddenMessage(text)) {
         closeHead(true);
-    } else { // between a head and its message, a tool's line may come
-        if (indentation != 0 && !words.empty() && (indentation == 3 || mRecords == 0)) {
-            mSink.torn(mLines); // a message whose head is not there
-        } else if (!words.empty()) {
-            mSink.otherLine(mLines, program, text);
-        }
+    } else if (indentation != 0 && !words.empty() && (indentation == 3 || mRecords == 0)) {
+        mSink.torn(mLines);      // a message whose head is not there
+    } else if (!words.empty()) { // also between a head and its message
+        mSink.otherLine(mLines, program, text);
     }
 }
 
@@ -264,21 +259,14 @@ void LogParser::closeHead(bool leftOut)
     if (!mHeadOpen) {
         return;
     }
-    if (mEmptySeen) {
-        takeMessage({});
-        return;
-    }
-    if (!leftOut) {
+    if (!mEmptySeen && !leftOut) {
         mSink.torn(mHead.line);
     }
-    mHeadOpen = false;
-    ++mRecords;
-    mHead.message.reset();
-    mSink.record(mHead);
+    takeMessage(mEmptySeen ? std::optional(std::string_view()) : std::nullopt);
 }
 
-/// The message of mHead has come: the record is complete.
-void LogParser::takeMessage(std::string_view message)
+/// The message of mHead has come, or does not come any more: the record is complete.
+void LogParser::takeMessage(std::optional<std::string_view> message)
 {
     mHeadOpen = false;
     ++mRecords;
@@ -290,13 +278,10 @@ void LogParser::takeMessage(std::string_view message)
 /// Reads a record's first line, from its mark on, into mHead. False, and mHead is of no use, when it is not whole.
 bool LogParser::parseHead(std::string_view text)
 {
-    mHeadText.assign(text);
-    std::string_view rest = mHeadText;
-    std::string_view time;
+    mHeadText = text.substr(mark.size());
+    const std::string_view time = std::string_view(mHeadText).substr(0, timeForm.size());
+    std::string_view rest = withoutBlanks(std::string_view(mHeadText).substr(time.size()));
     std::string_view position;
-    rest.remove_prefix(std::min(mark.size(), rest.size()));
-    time = rest.substr(0, timeLength);
-    rest = withoutBlanks(rest.substr(time.size()));
     if (!parseTime(time) || !takeColumn(rest, mHead.thread) || !takeColumn(rest, position)) {
         return false;
     }
@@ -311,27 +296,26 @@ bool LogParser::parseHead(std::string_view text)
 /// Reads "DD-MM-YYYY HH-MM-SS" into mHead.
 bool LogParser::parseTime(std::string_view text)
 {
-    if (text.size() != timeLength || text[10] != ' ' || text[13] != '-' || text[16] != '-') {
+    const bool formed = std::equal(text.begin(), text.end(), timeForm.begin(), timeForm.end(),
+                                   [](char it, char wanted) { return wanted == '0' ? isDigit(it) : it == wanted; });
+    if (!formed) {
         return false;
     }
-    const int hour = number(text, 11, 2);
-    const int minute = number(text, 14, 2);
-    const int second = number(text, 17, 2);
-    if (hour < 0 || hour > 23 || minute < 0 || minute > 59 || second < 0 || second > 60) {
+    const int hour = number(text, 11, 13);
+    const int minute = number(text, 14, 16);
+    const int second = number(text, 17, 19);
+    if (hour > 23 || minute > 59 || second > 60) {
         return false;
     }
     if (text.substr(0, 10) != mDate) {
-        const int day = number(text, 0, 2);
-        const int month = number(text, 3, 2);
-        const int year = number(text, 6, 4);
-        if (text[2] != '-' || text[5] != '-' || day < 1 || day > 31 || month < 1 || month > 12 || year < 0) {
+        std::tm date = {};
+        date.tm_mday = number(text, 0, 2);
+        date.tm_mon = number(text, 3, 5) - 1;
+        date.tm_year = number(text, 6, 10) - 1900;
+        if (date.tm_mday < 1 || date.tm_mday > 31 || date.tm_mon < 0 || date.tm_mon > 11) {
             return false;
         }
         mDate = text.substr(0, 10);
-        std::tm date = {};
-        date.tm_mday = day;
-        date.tm_mon = month - 1;
-        date.tm_year = year - 1900;
         mMidnight = timegm(&date);
     }
     mHead.time = mMidnight + hour * std::int64_t{3600} + minute * std::int64_t{60} + second;

@@ -23,7 +23,6 @@ class LogSink
 {
 public:
     virtual ~LogSink() = default;
-
     virtual void record(const ParsedRecord& record) = 0;
 
     /// A line that is no record: of a tool that the updater ran, of the service manager, or the rest of a message of
@@ -65,7 +64,7 @@ private:
     void takeLine(std::string_view line);
     void takeText(std::string_view line, std::size_t indentation);
     void closeHead(bool leftOut);
-    void takeMessage(std::string_view message);
+    void takeMessage(std::optional<std::string_view> message);
     bool parseHead(std::string_view text);
     bool parseTime(std::string_view text);
 
@@ -86,8 +85,3 @@ private:
     std::string mDate; // of the last head, and the time its day began
     std::int64_t mMidnight = 0;
 };
-
-/// Removes what a journal puts in front of a line, "Nov 21 07:15:33 unit ssh[123]: " or with another form of the time.
-///
-/// @param program  out: "ssh" in the example; empty when there is no such prefix
-std::string_view withoutJournalPrefix(std::string_view line, std::string_view& program);

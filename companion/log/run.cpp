@@ -23,17 +23,14 @@ struct VersionEvent
 {
     Event event;
     Versions::State state;
-    Versions Run::*versions;
     const char* between;
 };
 
 const VersionEvent versionEvents[] = {
-    {Event::PACKAGE_DIFFERS, Versions::State::DIFFER, &Run::package, " -> "},
-    {Event::PACKAGE_SAME, Versions::State::SAME, &Run::package, " == "},
-    {Event::BOARD_DIFFERS, Versions::State::DIFFER, &Run::board, " -> "},
-    {Event::BOARD_SAME, Versions::State::SAME, &Run::board, " == "},
-    {Event::BOARD_NOT_READ, Versions::State::NOT_READ, &Run::board, " -> "},
-    {Event::STICK_NOT_READ, Versions::State::NOT_READ, &Run::board, " -> "},
+    {Event::VERSIONS_DIFFER, Versions::State::DIFFER, " -> "},
+    {Event::VERSIONS_SAME, Versions::State::SAME, " == "},
+    {Event::BOARD_NOT_READ, Versions::State::NOT_READ, " -> "},
+    {Event::STICK_NOT_READ, Versions::State::NOT_READ, " -> "},
 };
 const std::pair<Event, bool Run::*> factEvents[] = {
     {Event::MAIN_INSTALLS, &Run::partsInstalled}, {Event::MARKER_REMOVED, &Run::markerRemoved},
@@ -100,6 +97,29 @@ bool installs(StepKind kind)
     return kind == StepKind::INSTALL_PACKAGE || (kind >= StepKind::UPLOAD_BOARD && kind <= StepKind::WAIT_FOR_BOARD);
 }
 
+/// How a step came out of whose end there is no record, the next one having begun.
+StepResult resultWithoutRecord(Step& step, StepKind next)
+{
+    if (step.kind == StepKind::UPLOAD_BOARD) {
+        return next == StepKind::RUN_BOARD_SCRIPT || next == StepKind::WAIT_FOR_BOARD ? StepResult::DONE
+               : step.failedAttempts >= uploadAttempts                                ? StepResult::FAILED
+                                                                                      : StepResult::UNTOLD;
+    }
+    if (step.kind == StepKind::GIVE_BACK) {
+        if (step.actions.size() > 1 && step.actions[1].status) {
+            const bool mounted = resultOf(step.actions[0].status) == StepResult::FAILED;
+            return mounted ? StepResult::FAILED : resultOf(step.actions[1].status);
+        }
+        if (!step.actions.empty()) {
+            step.actions[0].status.reset(); // one of two numbers, and no telling which
+        }
+        return StepResult::UNTOLD;
+    }
+    const bool waited = !step.actions.empty() && *step.actions.back().command == '\0';
+    const bool silent = step.kind == StepKind::START || step.kind == StepKind::SHOW_OUTCOME;
+    return waited || silent ? StepResult::DONE : isOneCommand(step.kind) ? resultOf(step.status) : StepResult::UNTOLD;
+}
+
 Outcome mainHeadOutcome(const Run& run)
 {
     if (run.partsInstalled) {
@@ -148,12 +168,12 @@ Outcome remoteHeadOutcome(const Run& run)
         return Outcome::NO_UPDATE;
     }
     const Step* install = run.find(StepKind::INSTALL_PACKAGE);
-    if (install != nullptr && install->result == StepResult::DONE) {
-        return boardDone                                      ? Outcome::UPDATED
-               : run.board.state == Versions::State::NOT_READ ? Outcome::CHECK_FAILED
-                                                              : Outcome::NONE;
+    if (install == nullptr || install->result != StepResult::DONE) {
+        return Outcome::NONE;
     }
-    return Outcome::NONE;
+    return boardDone                                      ? Outcome::UPDATED
+           : run.board.state == Versions::State::NOT_READ ? Outcome::CHECK_FAILED
+                                                          : Outcome::NONE;
 }
 
 Outcome outcomeOf(const Run& run)
@@ -179,6 +199,17 @@ Outcome failureOf(const Step& step)
     const auto* const found = std::find_if(std::begin(stepFailures), std::end(stepFailures),
                                            [&](const auto& failure) { return failure.first == step.kind; });
     return found == std::end(stepFailures) ? Outcome::NONE : found->second;
+}
+
+std::vector<std::size_t> failedCommands(const Step& step)
+{
+    std::vector<std::size_t> failed;
+    for (std::size_t command = 0; command < step.actions.size(); ++command) {
+        if (const auto& status = step.actions[command].status; status && status->number != 0) {
+            failed.push_back(command);
+        }
+    }
+    return failed;
 }
 
 void OtherLines::add(std::string_view text)
@@ -323,7 +354,7 @@ void RunBuilder::takeServiceLine(ServiceEvent event, std::string_view text)
     ServiceFacts& service = mRun->service;
     service.events.set(static_cast<std::size_t>(event));
     if (event == ServiceEvent::UNIT_NOT_WELL || event == ServiceEvent::UNIT_OPEN) {
-        service.unit = kept(serviceWords(text));
+        service.unit = kept(text.substr(text.find(": ") + 2));
     }
     if (event == ServiceEvent::TIME_USED_UP && !mRun->steps.empty()) {
         mRun->steps.back().timeUsedUp = true;
@@ -343,11 +374,6 @@ void RunBuilder::torn(std::uint64_t line)
     if (mRun->tornRecords++ == 0) {
         mRun->firstTornLine = line;
     }
-}
-
-void RunBuilder::finish()
-{
-    endRun(false);
 }
 
 void RunBuilder::beginRun(const ParsedRecord& record)
@@ -401,10 +427,11 @@ void RunBuilder::noteTime(const ParsedRecord& record, const Meaning& meaning)
 void RunBuilder::takeRunEvent(const ParsedRecord& record, const Meaning& meaning)
 {
     Run& run = *mRun;
-    for (const auto& [event, state, versions, between] : versionEvents) {
+    Versions& versions = meaning.step == StepKind::CHECK_PACKAGE ? run.package : run.board;
+    for (const auto& [event, state, between] : versionEvents) {
         if (event == meaning.event) {
-            (run.*versions).state = state;
-            splitVersions(meaning.rest, between, run.*versions);
+            versions.state = state;
+            splitVersions(meaning.rest, between, versions);
         }
     }
     for (const auto& [event, fact] : factEvents) {
@@ -441,9 +468,7 @@ void RunBuilder::takeRunEvent(const ParsedRecord& record, const Meaning& meaning
         break;
     }
     const bool package = meaning.step == StepKind::CHECK_PACKAGE || meaning.step == StepKind::INSTALL_PACKAGE;
-    if (package && !run.mainHead && contains(record.message.value_or(""), mainPackage)) {
-        run.mainHead = true;
-    }
+    run.mainHead = run.mainHead || (package && contains(record.message.value_or(""), mainPackage));
 }
 
 /// What an event says about its step, or about the last one.
@@ -451,16 +476,17 @@ void RunBuilder::takeStepEvent(Step& step, const ParsedRecord& record, const Mea
 {
     switch (meaning.event) {
     case Event::NOTED:
-    case Event::STOPS_UPDATER:
-        if (step.actions.empty() && *meaning.command != '\0') {
-            beginAction(step, meaning.command, 0);
-        } else if (step.actions.empty() && factsOf(step.kind).wait > 0 && step.kind != StepKind::GIVE_BACK) {
-            beginAction(step, "", factsOf(step.kind).wait);
+    case Event::STOPS_UPDATER: {
+        const bool waits = *meaning.command == '\0';
+        const std::int64_t wait = waits && step.kind != StepKind::GIVE_BACK ? factsOf(step.kind).wait : 0;
+        if (step.actions.empty() && (!waits || wait > 0)) {
+            beginAction(step, meaning.command, wait);
         }
         break;
+    }
     case Event::COMMAND:
     case Event::ATTEMPT:
-        beginAction(step, meaning.command, 0);
+        beginAction(step, meaning.command);
         break;
     case Event::EXIT_CODE:
         if (!step.took && !step.actions.empty() && !step.actions.back().took) {
@@ -472,31 +498,26 @@ void RunBuilder::takeStepEvent(Step& step, const ParsedRecord& record, const Mea
         }
         break;
     case Event::ATTEMPT_FAILED:
-        if (++step.failedAttempts > uploadAttempts) {
+        if (++step.failedAttempts > uploadAttempts || step.actions.empty()) {
             break;
         }
-        if (!step.actions.empty()) {
-            step.actions.back().attemptFailed = true;
-            endAction(step, std::nullopt);
-        }
-        if (step.failedAttempts < uploadAttempts && !step.actions.empty()) {
-            beginAction(step, step.actions.back().command, 0);
+        step.actions.back().attemptFailed = true;
+        endAction(step, std::nullopt);
+        if (step.failedAttempts < uploadAttempts) {
+            beginAction(step, step.actions.back().command);
         }
         break;
     case Event::RAW_STATUS:
         takeStatus(step, *meaning.number);
         break;
+    case Event::MARKER_REMOVED:
+        beginAction(step, meaning.command);
+        [[fallthrough]];
     case Event::SUCCEEDED:
-    case Event::PACKAGE_DIFFERS:
-    case Event::PACKAGE_SAME:
-    case Event::BOARD_DIFFERS:
-    case Event::BOARD_SAME:
+    case Event::VERSIONS_DIFFER:
+    case Event::VERSIONS_SAME:
     case Event::TEAMVIEWER_REQUESTED:
     case Event::TEAMVIEWER_NOT_REQUESTED:
-    case Event::MARKER_REMOVED:
-        if (meaning.event == Event::MARKER_REMOVED) {
-            beginAction(step, meaning.command, 0);
-        }
         endAction(step, std::nullopt);
         endStep(step, StepResult::DONE, meaning.event);
         break;
@@ -512,9 +533,8 @@ void RunBuilder::takeStepEvent(Step& step, const ParsedRecord& record, const Mea
         if (step.kind == StepKind::INSTALL_PACKAGE && !step.took && meaning.number && !meaning.rest.empty()) {
             // The code and the command's output, with nothing between: only the record before tells where it ends.
             const std::string code = step.status ? std::to_string(step.status->number) : "";
-            const std::string_view message = *record.message;
-            if (startsWith(message, code)) {
-                step.said.add(message.substr(code.size()));
+            if (startsWith(*record.message, code)) {
+                step.said.add(record.message->substr(code.size()));
             }
         }
         endStep(step, StepResult::FAILED, meaning.event);
@@ -536,21 +556,17 @@ void RunBuilder::takeStatus(Step& step, long number)
     mRun->statusesLost = mRun->statusesLost || status.lost();
     if (step.kind == StepKind::GIVE_BACK) {
         if (step.actions.empty()) {
-            beginAction(step, "umount /root/USB_MOUNT/", 0);
+            beginAction(step, "umount /root/USB_MOUNT/");
         }
-        const bool first = step.actions.size() == 1;
-        if (step.actions.size() > 2) {
+        const std::size_t command = step.actions.size();
+        if (command > 2) {
             return;
         }
         endAction(step, status);
-        if (first) {
-            beginAction(step, "systemctl start harl", 0);
-            return;
-        }
-        if (!status.lost()) {
+        if (command == 2 && !status.lost()) {
             mRun->applicationStarted = number == 0;
         }
-        beginAction(step, "", giveBackWait);
+        beginAction(step, command == 1 ? "systemctl start harl" : "", command == 1 ? 0 : giveBackWait);
         return;
     }
     if (step.took) {
@@ -570,68 +586,35 @@ void RunBuilder::takeStatus(Step& step, long number)
 Step& RunBuilder::stepFor(StepKind kind, const ParsedRecord& record)
 {
     std::vector<Step>& steps = mRun->steps;
-    if (!steps.empty()) {
-        if (steps.back().kind == kind) {
-            return steps.back();
-        }
-        endStepWithoutRecord(steps.back(), kind);
+    if (!steps.empty() && steps.back().kind == kind) {
+        return steps.back();
+    }
+    if (!steps.empty() && !steps.back().took) {
+        Step& last = steps.back();
+        const StepResult result = resultWithoutRecord(last, kind);
+        const bool uploaded = last.kind == StepKind::UPLOAD_BOARD && result == StepResult::DONE;
+        endAction(last, uploaded ? std::optional(CommandStatus()) : std::nullopt);
+        endStep(last, result, Event::NONE);
     }
     if (steps.size() == mostSteps) {
         ++mRun->stepsLeftOut;
         steps.pop_back();
     }
-    Step step;
+    Step& step = steps.emplace_back();
     step.kind = kind;
     step.line = record.line;
     step.start = record.time;
     step.began = mRun->elapsed;
-    steps.push_back(std::move(step));
-    return steps.back();
-}
-
-/// Ends the step that goes on because the next one begins.
-void RunBuilder::endStepWithoutRecord(Step& step, StepKind next)
-{
-    if (step.took) {
-        return;
-    }
-    if (step.kind == StepKind::UPLOAD_BOARD) {
-        const bool done = next == StepKind::RUN_BOARD_SCRIPT || next == StepKind::WAIT_FOR_BOARD;
-        const bool failed = step.failedAttempts >= uploadAttempts;
-        endAction(step, done ? std::optional(CommandStatus{0, false}) : std::nullopt);
-        endStep(step, done ? StepResult::DONE : failed ? StepResult::FAILED : StepResult::UNTOLD, Event::NONE);
-        return;
-    }
-    if (step.kind == StepKind::GIVE_BACK) {
-        const auto status = [&](std::size_t index) {
-            return index < step.actions.size() ? step.actions[index].status : std::nullopt;
-        };
-        if (!status(1) && status(0)) {
-            step.actions[0].status.reset(); // one of two numbers, and no telling which
-        }
-        const bool failed = resultOf(status(0)) == StepResult::FAILED || resultOf(status(1)) == StepResult::FAILED;
-        endAction(step, std::nullopt);
-        endStep(step, failed ? StepResult::FAILED : resultOf(status(1)), Event::NONE);
-        return;
-    }
-    const bool waited = !step.actions.empty() && *step.actions.back().command == '\0';
-    const bool silent = step.kind == StepKind::START || step.kind == StepKind::SHOW_OUTCOME;
-    endAction(step, std::nullopt);
-    endStep(step,
-            waited || silent          ? StepResult::DONE
-            : isOneCommand(step.kind) ? resultOf(step.status)
-                                      : StepResult::UNTOLD,
-            Event::NONE);
+    return step;
 }
 
 void RunBuilder::endStep(Step& step, StepResult result, Event event)
 {
-    if (step.took) {
-        return;
+    if (!step.took) {
+        step.took = mRun->elapsed - step.began;
+        step.result = result;
+        step.event = event;
     }
-    step.took = mRun->elapsed - step.began;
-    step.result = result;
-    step.event = event;
 }
 
 /// @param command  empty: a wait
@@ -639,21 +622,15 @@ void RunBuilder::endStep(Step& step, StepResult result, Event event)
 void RunBuilder::beginAction(Step& step, const char* command, std::int64_t wait)
 {
     if (step.actions.size() < mostActions) {
-        Action action;
-        action.command = command;
-        action.wait = wait;
-        action.start = mRun->end;
-        action.began = mRun->elapsed;
-        step.actions.push_back(action);
+        step.actions.push_back({command, wait, mRun->end, mRun->elapsed});
     }
 }
 
 void RunBuilder::endAction(Step& step, std::optional<CommandStatus> status)
 {
-    if (step.actions.empty() || step.actions.back().took) {
-        return;
+    if (!step.actions.empty() && !step.actions.back().took) {
+        Action& action = step.actions.back();
+        action.took = mRun->elapsed - action.began;
+        action.status = status;
     }
-    Action& action = step.actions.back();
-    action.took = mRun->elapsed - action.began;
-    action.status = status;
 }

@@ -29,12 +29,12 @@ struct CommandStatus
 /// One command, one attempt of it, or one wait.
 struct Action
 {
-    const char* command = "";         ///< empty: a wait
-    std::int64_t wait = 0;            ///< s
-    std::int64_t start = 0;           ///< as ParsedRecord::time
-    std::int64_t began = 0;           ///< as Run::elapsed
-    std::optional<std::int64_t> took; ///< s
-    std::optional<CommandStatus> status;
+    const char* command = "";                        ///< empty: a wait
+    std::int64_t wait = 0;                           ///< s
+    std::int64_t start = 0;                          ///< as ParsedRecord::time
+    std::int64_t began = 0;                          ///< as Run::elapsed
+    std::optional<std::int64_t> took = std::nullopt; ///< s
+    std::optional<CommandStatus> status = std::nullopt;
     bool attemptFailed = false; ///< one of several; its status is not logged
 };
 
@@ -182,6 +182,9 @@ bool isFailure(Outcome outcome);
 /// The failure that a step's own end decides; NONE for none.
 Outcome failureOf(const Step& step);
 
+/// The places of a step's commands whose status tells that they failed.
+std::vector<std::size_t> failedCommands(const Step& step);
+
 /// Gathers records into runs and steps. Memory stays bounded for a log of any size: each run is handed over when it is
 /// complete, and of a run only so many steps, actions and lines are kept.
 class RunBuilder : public LogSink
@@ -198,7 +201,7 @@ public:
     void sourceEnds() { mSourceEnded = true; }
 
     /// The log has ended: hands over the last run.
-    void finish();
+    void finish() { endRun(false); }
 
     /// The run that goes on, or null.
     const Run* current() const { return mRun ? &*mRun : nullptr; }
@@ -214,9 +217,8 @@ private:
     void takeStatus(Step& step, long number);
 
     Step& stepFor(StepKind kind, const ParsedRecord& record);
-    void endStepWithoutRecord(Step& step, StepKind next);
     void endStep(Step& step, StepResult result, Event event);
-    void beginAction(Step& step, const char* command, std::int64_t wait);
+    void beginAction(Step& step, const char* command, std::int64_t wait = 0);
     void endAction(Step& step, std::optional<CommandStatus> status);
 
     std::function<void(Run&)> mRunComplete;

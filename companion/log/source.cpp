@@ -1,8 +1,7 @@
 #include "log/source.h"
 
 #include "command.h"
-#include "findings.h"
-#include "procedure.h"
+#include "texts.h"
 
 #include <array>
 #include <cerrno>
@@ -28,15 +27,6 @@ std::string LogSource::openFile(const std::string& path)
         return "a folder; name a file in it";
     }
     return "";
-}
-
-std::string LogSource::openJournal(bool follow)
-{
-    std::vector<std::string> arguments = journalCommand;
-    if (follow) {
-        arguments.insert(arguments.end(), {"--follow", "--no-tail"});
-    }
-    return openProgram(arguments, "the journal of harl-updater", true);
 }
 
 std::string LogSource::openProgram(const std::vector<std::string>& arguments, const std::string& name, bool complains)

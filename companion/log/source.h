@@ -7,7 +7,7 @@
 
 #include <sys/types.h>
 
-/// Where a log comes from: a file, standard input, the journal of the updater's service, or what a program prints.
+/// Where a log comes from: a file, standard input, or what a program prints, such as journalctl(1).
 class LogSource
 {
 public:
@@ -18,11 +18,6 @@ public:
 
     /// Opens `path`, or standard input for "-". Returns what is wrong, in words; empty when it is open.
     std::string openFile(const std::string& path);
-
-    /// Reads the journal of the service harl-updater through journalctl(1), and with `follow` what comes.
-    ///
-    /// @return what is wrong, in words; empty when it is open
-    std::string openJournal(bool follow);
 
     /// Reads what a program prints.
     ///

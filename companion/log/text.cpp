@@ -61,17 +61,12 @@ std::string signalText(int signal)
 
 std::string exitCodeText(long code)
 {
-    std::string text = "exit " + std::to_string(code);
-    if (code == 126) {
-        return text + " (command cannot be run)";
-    }
-    if (code == 127) {
-        return text + " (command not found)";
-    }
-    if (code > 128 && code <= 128 + SIGRTMAX) {
-        return text + " (killed by " + signalText(static_cast<int>(code) - 128) + ')';
-    }
-    return text;
+    const std::string meaning = code == 126   ? "command cannot be run"
+                                : code == 127 ? "command not found"
+                                : code > 128 && code <= 128 + SIGRTMAX
+                                    ? "killed by " + signalText(static_cast<int>(code) - 128)
+                                    : "";
+    return "exit " + std::to_string(code) + (meaning.empty() ? "" : " (" + meaning + ')');
 }
 
 /// A line for each of `lines`, as a quotation.
@@ -89,11 +84,9 @@ std::string doneText(const Run& run, const Step& step)
 {
     const Versions& versions = step.kind == StepKind::CHECK_PACKAGE ? run.package : run.board;
     switch (step.event) {
-    case Event::PACKAGE_DIFFERS:
-    case Event::BOARD_DIFFERS:
+    case Event::VERSIONS_DIFFER:
         return "an update: " + versions.installed + " -> " + versions.candidate;
-    case Event::PACKAGE_SAME:
-    case Event::BOARD_SAME:
+    case Event::VERSIONS_SAME:
         return "up to date" + (versions.installed.empty() ? "" : ": " + versions.installed);
     case Event::TEAMVIEWER_REQUESTED:
         return "an installation is requested";
@@ -113,11 +106,9 @@ std::string failedText(const Step& step)
 {
     if (step.kind == StepKind::GIVE_BACK) {
         std::string text;
-        for (std::size_t index = 0; index < std::min<std::size_t>(2, step.actions.size()); ++index) {
-            if (const auto& status = step.actions[index].status; status && status->number != 0) {
-                text +=
-                    (text.empty() ? "" : ", ") + std::string(index == 0 ? "stick: " : "harl: ") + statusText(*status);
-            }
+        for (const std::size_t command : failedCommands(step)) {
+            text += text.empty() ? "" : ", ";
+            text += (command == 0 ? "stick: " : "harl: ") + statusText(*step.actions[command].status);
         }
         return text;
     }
@@ -134,6 +125,33 @@ std::string failedText(const Step& step)
         return "the versions could not be read";
     }
     return step.status ? statusText(*step.status) : "";
+}
+
+bool isOver(const Run& run)
+{
+    return run.isDecided() || run.ended == RunEnd::BY_SERVICE_MANAGER;
+}
+
+std::string meaningOf(const Run& run)
+{
+    const bool failed = isFailure(run.outcome);
+    const bool notRun = run.service.has(ServiceEvent::NOT_ALLOWED);
+    const Step* marker = run.find(StepKind::CHECK_TEAMVIEWER);
+    if (run.mainHead && run.outcome == Outcome::PASSED) {
+        return "checked; whether an update is offered is not in this log";
+    }
+    if (!run.mainHead && run.service.has(ServiceEvent::FAILURE_SHOWN) && !failed && !notRun) {
+        return "FAILED: the updater ended before its outcome was known";
+    }
+    if (run.outcome == Outcome::NONE && isOver(run)) {
+        return "not in this log: the records of its outcome are missing";
+    }
+    if (run.outcome == Outcome::CHECK_FAILED && marker != nullptr && marker->result == StepResult::FAILED) {
+        return "FAILED: the TeamViewer marker could not be looked for";
+    }
+    const std::string meaning =
+        notRun ? "NOT RUN: the service did not let the updater begin" : factsOf(run.outcome).meaning;
+    return run.service.has(ServiceEvent::UNIT_NOT_WELL) && !failed ? meaning + ", but " + run.service.unit : meaning;
 }
 
 /// How far the installation of a part came.
@@ -252,14 +270,13 @@ std::string boardText(const Run& run)
 {
     const Step* upload = run.find(StepKind::UPLOAD_BOARD);
     const Step* script = run.find(StepKind::RUN_BOARD_SCRIPT);
-    const auto result = [](const Step* step) { return step == nullptr ? StepResult::UNFINISHED : step->result; };
     std::string text = "not installed";
     if (script != nullptr) {
-        text = result(script) == StepResult::DONE     ? "uploaded and its install script run"
-               : result(script) == StepResult::FAILED ? "uploaded, but its install script FAILED"
+        text = script->result == StepResult::DONE     ? "uploaded and its install script run"
+               : script->result == StepResult::FAILED ? "uploaded, but its install script FAILED"
                                                       : "uploaded; its install script's end is not in this log";
     } else if (upload != nullptr) {
-        text = result(upload) == StepResult::FAILED ? "upload FAILED" : "its upload's end is not in this log";
+        text = upload->result == StepResult::FAILED ? "upload FAILED" : "its upload's end is not in this log";
     }
     return versionsText(run, run.board, StepKind::CHECK_BOARD, text);
 }
@@ -331,51 +348,25 @@ std::vector<std::string> gapTexts(const Run& run)
 
 OperatorView operatorView(const Run& run)
 {
-    OperatorView view;
     const OutcomeFacts& facts = factsOf(run.outcome);
-    view.meaning = facts.meaning;
-    if (run.service.has(ServiceEvent::NOT_ALLOWED)) {
-        view.meaning = "NOT RUN: the service did not let the updater begin";
-    }
-    if (run.service.has(ServiceEvent::UNIT_NOT_WELL) && !isFailure(run.outcome)) {
-        view.meaning += ", but " + run.service.unit;
-    }
-    if (const Step* marker = run.find(StepKind::CHECK_TEAMVIEWER);
-        marker != nullptr && marker->result == StepResult::FAILED && run.outcome == Outcome::CHECK_FAILED) {
-        view.meaning = "FAILED: the TeamViewer marker could not be looked for";
-    }
-    const bool over = run.isDecided() || run.ended == RunEnd::BY_SERVICE_MANAGER;
-    if (run.outcome == Outcome::NONE && over) {
-        view.meaning = "not in this log: the records of its outcome are missing";
-    }
+    const std::string meaning = meaningOf(run);
     if (run.mainHead) {
-        view.meaning =
-            run.outcome == Outcome::PASSED ? "checked; whether an update is offered is not in this log" : view.meaning;
-        view.seen = "shown by the main head's own program";
-        return view;
+        return {{}, "", "shown by the main head's own program", meaning};
     }
-    const std::string color = isFailure(run.outcome) ? "fail" : "pass";
     if (run.service.has(ServiceEvent::FAILURE_SHOWN)) {
-        if (!isFailure(run.outcome) && !run.service.has(ServiceEvent::NOT_ALLOWED)) {
-            view.meaning = "FAILED: the updater ended before its outcome was known";
-        }
-        view.leds = {{"FAIL", "fail"}};
-        view.seen = "FAIL lit in fail colour; no sound";
-        return view;
+        return {{{"FAIL", "fail"}}, "", "FAIL lit in fail colour; no sound", meaning};
     }
-    if (run.outcome == Outcome::NONE && over) {
-        view.seen = "not in this log";
-        return view;
+    if (run.outcome == Outcome::NONE && isOver(run)) {
+        return {{}, "", "not in this log", meaning};
     }
     if (run.outcome == Outcome::NONE && run.ledFailures > 0) {
-        view.seen = "a panel that fails; no sound";
-        return view;
+        return {{}, "", "a panel that fails; no sound", meaning};
     }
     if (run.outcome == Outcome::NONE) {
-        view.leds = {{"any", "blue"}};
-        view.seen = "REMOTE and MAIN flashing blue in turn while it went on; no sound";
-        return view;
+        return {{{"any", "blue"}}, "", "REMOTE and MAIN flashing blue in turn while it went on; no sound", meaning};
     }
+    const std::string color = isFailure(run.outcome) ? "fail" : "pass";
+    OperatorView view = {{}, "", "", meaning};
     for (const std::string& led : facts.leds) {
         view.leds.emplace_back(led, color);
         view.seen += (view.seen.empty() ? "" : " and ") + led;

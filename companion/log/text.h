@@ -26,19 +26,13 @@ OperatorView operatorView(const Run& run);
 /// @param source  where the log came from
 void printRun(const Run& run, const std::string& source, std::ostream& out);
 
-/// Name of an outcome for programs, such as "no-update"; "none" when a log does not reach it.
+/// Names for programs, such as "no-update" and "failed"; "none" for a log that does not reach an outcome.
 const char* outcomeName(Outcome outcome);
-
-/// Name of a result for programs, such as "failed".
 const char* resultName(StepResult result);
 
-/// "07:15:33" of a ParsedRecord::time.
+/// A ParsedRecord::time as "07:15:33", "21-11-2026 07:15:33" and "2026-11-21T07:15:33".
 std::string clockText(std::int64_t time);
-
-/// "21-11-2026 07:15:33" of a ParsedRecord::time.
 std::string dateText(std::int64_t time);
-
-/// "2026-11-21T07:15:33" of a ParsedRecord::time.
 std::string isoText(std::int64_t time);
 
 /// "12 s", "13 min 0 s", "1 h 2 min".
@@ -54,29 +48,23 @@ std::string resultText(const Run& run, const Step& step);
 /// error of its own.
 std::string statusText(const CommandStatus& status);
 
-/// "apt update", "wait 780 s".
+/// "apt update" or "wait 780 s", and how it ended: "exit 0", "failed", or nothing when the log does not tell.
 std::string actionText(const Action& action);
-
-/// "exit 0", "failed"; empty when the log does not tell.
 std::string actionStatusText(const Action& action);
 
 /// What other programs said, a line each: "scp: Connection closed (20 times)".
 std::vector<std::string> shownLines(const OtherLines& lines);
 
-/// "1.2.0 -> 1.3.0, installed": what became of the package in a run.
+/// What became of the package and of the board in a run: "1.2.0 -> 1.3.0, installed".
 std::string packageText(const Run& run);
-
-/// Likewise of the board.
 std::string boardText(const Run& run);
 
-/// "Failed: Refresh the package mirrors (line 23) [mirrors-unreachable]".
+/// "Failed: Refresh the package mirrors (line 23) [mirrors-unreachable]", why, what to do, and all three for
+/// printText().
 std::string headingOf(const Run& run, const Problem& problem);
-
-/// A problem's heading, cause and remedy for printText().
-std::string problemText(const Run& run, const Problem& problem);
-
 std::string causeOf(const Run& run, const Problem& problem);
 std::string remedyOf(const Run& run, const Problem& problem);
+std::string problemText(const Run& run, const Problem& problem);
 
 /// What the catalogue's texts get of a run.
 ///

@@ -67,14 +67,14 @@ const Word words[] = {
     {"updateMirrors", "NOT OK #", E::FAILED, S::REFRESH_MIRRORS},
     {"updateMirrors", "NOT OK*", E::FAILED, S::REFRESH_MIRRORS},
     {"checkUpdate", "apt-cache policy *", E::NOTED, S::CHECK_PACKAGE},
-    {"checkUpdate", "NWM_UM_UPDATE_FOUND: *", E::PACKAGE_DIFFERS, S::CHECK_PACKAGE},
-    {"checkUpdate", "NWM_UM_NO_UPDATES *", E::PACKAGE_SAME, S::CHECK_PACKAGE},
+    {"checkUpdate", "NWM_UM_UPDATE_FOUND: *", E::VERSIONS_DIFFER, S::CHECK_PACKAGE},
+    {"checkUpdate", "NWM_UM_NO_UPDATES *", E::VERSIONS_SAME, S::CHECK_PACKAGE},
     {"checkUpdate", "NWM_UM_CHECK_UPDATE_FAILED", E::FAILED, S::CHECK_PACKAGE},
     {"checkUpdate", "NO_INTERNET_ERROR_CODE", E::FAILED, S::CHECK_PACKAGE},
     {"installUpdate", "", E::NOTED, S::INSTALL_PACKAGE},
     {"installUpdate", "#*", E::FAILED, S::INSTALL_PACKAGE},
-    {"checkQuorbUpdate", "Update found: *", E::BOARD_DIFFERS, S::CHECK_BOARD},
-    {"checkQuorbUpdate", "QUORB up to date", E::BOARD_SAME, S::CHECK_BOARD},
+    {"checkQuorbUpdate", "Update found: *", E::VERSIONS_DIFFER, S::CHECK_BOARD},
+    {"checkQuorbUpdate", "QUORB up to date", E::VERSIONS_SAME, S::CHECK_BOARD},
     {"checkQuorbUpdate", "Failed to checkUpdate", E::BOARD_NOT_READ, S::CHECK_BOARD},
     {"checkQuorbUpdate", "Failed to check candidate QUORB version", E::STICK_NOT_READ, S::CHECK_BOARD},
     {"checkQuorbUpdate", "*", E::BOARD_VERSIONS},
@@ -215,13 +215,12 @@ Meaning meaningOfAny(const WordRange& range)
     const auto& [begin, end] = range;
     const bool oneStep =
         std::all_of(begin, end, [front = begin](const Word& word) { return word.step == front->step; });
-    if (begin == end || !oneStep) {
-        return meaning;
+    if (begin != end && oneStep) {
+        const bool first = end - begin == 1 || (*begin->message == '\0' && begin->step);
+        meaning.event = first ? begin->event : begin->step ? E::NOTED : E::NONE;
+        meaning.step = begin->step;
+        meaning.command = first ? begin->command : "";
     }
-    const bool first = end - begin == 1 || (*begin->message == '\0' && begin->step);
-    meaning.event = first ? begin->event : begin->step ? E::NOTED : E::NONE;
-    meaning.step = begin->step;
-    meaning.command = first ? begin->command : "";
     return meaning;
 }
 
@@ -240,11 +239,6 @@ std::optional<ServiceEvent> serviceEventOf(std::string_view line)
         }
     }
     return std::nullopt;
-}
-
-std::string_view serviceWords(std::string_view line)
-{
-    return line.substr(std::min(line.find(": ") + 2, line.size()));
 }
 
 Meaning meaningOf(std::string_view operation, std::optional<std::string_view> message)
@@ -268,13 +262,11 @@ Meaning meaningOf(std::string_view operation, std::optional<std::string_view> me
     return meaning;
 }
 
-bool logsOutput(std::string_view operation)
+bool isMessageOf(std::string_view operation, std::string_view message, bool output)
 {
-    return operation == "checkUpdate" || operation == "checkQuorbUpdate";
-}
-
-bool isMessageOf(std::string_view operation, std::string_view message)
-{
+    if (output && (operation == "checkUpdate" || operation == "checkQuorbUpdate")) {
+        return true;
+    }
     const Event event = meaningOf(operation, message).event;
     if (event == Event::BOARD_VERSIONS) { // "2.1.0  2.2.0"
         const std::size_t blank = message.find(' ');

@@ -57,10 +57,8 @@ enum class Event {
     RAW_STATUS, ///< of the command that the step runs
     SUCCEEDED,
     FAILED,
-    PACKAGE_DIFFERS,
-    PACKAGE_SAME,
-    BOARD_DIFFERS,
-    BOARD_SAME,
+    VERSIONS_DIFFER, ///< of the package or of the board, as the step tells
+    VERSIONS_SAME,
     BOARD_VERSIONS,
     BOARD_NOT_READ,
     STICK_NOT_READ,
@@ -117,11 +115,7 @@ const std::size_t serviceEvents = static_cast<std::size_t>(ServiceEvent::UNIT_OP
 /// Empty when the line is not one of the service's.
 std::optional<ServiceEvent> serviceEventOf(std::string_view line);
 
-/// What follows the name of the part that speaks: "verify: ".
-std::string_view serviceWords(std::string_view line);
-
 /// True when `message` is one that `operation` writes and that says something.
-bool isMessageOf(std::string_view operation, std::string_view message);
-
-/// True for an operation that also logs the lines of a command's output.
-bool logsOutput(std::string_view operation);
+///
+/// @param output  also when it can be a line of a command's output, which some operations log
+bool isMessageOf(std::string_view operation, std::string_view message, bool output);

@@ -5,7 +5,6 @@
 #include "procedure.h"
 #include "stick/signature.h"
 #include "stick/stick_check.h"
-#include "unit/packages.h"
 #include "unit/unit_check.h"
 
 #include <filesystem>
@@ -95,15 +94,6 @@ Run lastRun(const Unit& unit)
     return last;
 }
 
-/// Compares a version with the one that the last run was to leave.
-void checkVersion(const char* check, const std::string& found, const Versions& versions, Report& report)
-{
-    const std::string& wanted = versions.differ() ? versions.candidate : versions.installed;
-    if (!found.empty() && versions.found() && !wanted.empty() && found != wanted) {
-        report.add(check, {{"found", shown(found)}, {"wanted", shown(wanted)}});
-    }
-}
-
 void checkVersions(const Unit& unit, Report& report)
 {
     const Run run = lastRun(unit);
@@ -117,16 +107,14 @@ void checkVersions(const Unit& unit, Report& report)
         report.add("last-run");
         return;
     }
-    checkVersion("package-version", installed, run.package, report);
-    checkVersion("board-version-old", report.fact("board_version"), run.board, report);
-}
-
-void checkApplication(const Unit& unit, Report& report)
-{
-    const std::string state = unit.property("harl", "ActiveState");
-    if (state != "active") {
-        report.add(state.empty() ? "application.unknown" : "application", {{"state", shown(state)}});
-    }
+    const auto compare = [&](const char* check, const std::string& found, const Versions& versions) {
+        const std::string& wanted = versions.differ() ? versions.candidate : versions.installed;
+        if (!found.empty() && versions.found() && !wanted.empty() && found != wanted) {
+            report.add(check, {{"found", shown(found)}, {"wanted", shown(wanted)}});
+        }
+    };
+    compare("package-version", installed, run.package);
+    compare("board-version-old", report.fact("board_version"), run.board);
 }
 
 /// The line for the journal.
@@ -183,7 +171,10 @@ int runVerify(const VerifyOptions& options, const UnitSite& site, std::ostream& 
     const Unit unit(site);
     Report report("verify", "The unit", "well");
     unit.defineTexts(report);
-    checkApplication(unit, report);
+    const std::string state = unit.property("harl", "ActiveState");
+    if (state != "active") {
+        report.add(state.empty() ? "application.unknown" : "application", {{"state", shown(state)}});
+    }
     checkUnfinishedWork(unit, report);
     checkFiles(unit, report);
     checkConfiguration(unit, report);

@@ -51,40 +51,37 @@ std::string withoutLogins(std::string text)
 }
 
 /// Gathers the files in `folder`.
-void gather(const fs::path& folder, const std::string& stickPath, const Unit& unit, const UnitSite& site)
+void gather(const fs::path& folder, const std::string& stickPath, const Unit& unit)
 {
-    const auto save = [&](const char* name, const std::string& text) {
-        std::ofstream(folder / name) << withoutLogins(text);
-    };
-    const auto saveOf = [&](const char* name, auto print) {
+    const UnitSite& site = unit.site();
+    const auto save = [&](const std::string& name, auto print) {
         std::ostringstream text;
         print(text);
-        save(name, text.str());
+        std::ofstream(folder / name) << withoutLogins(text.str());
     };
-    save("README.txt", embeddedReadMe);
-    save("journal.txt", unit.journal());
-    saveOf("log.txt", [&](std::ostream& out) {
+    save("README.txt", [](std::ostream& out) { out << embeddedReadMe; });
+    save("journal.txt", [&](std::ostream& out) { out << unit.journal(); });
+    save("log.txt", [&](std::ostream& out) {
         LogOptions options;
         options.files = {(folder / "journal.txt").string()};
         runLog(options, out, out);
     });
     if (!isUnit(unit) || StickFolder(stickPath).error() != 0) {
-        saveOf("unit.txt", [&](std::ostream& out) { runUnit({}, site, out, out); });
+        save("unit.txt", [&](std::ostream& out) { runUnit({}, site, out, out); });
     }
-    saveOf("check.txt", [&](std::ostream& out) { runCheck(stickPath, false, site, out, out); });
-    saveOf("verify.txt", [&](std::ostream& out) { runVerify({}, site, out); });
-    saveOf("system.txt", [&](std::ostream& out) {
+    save("check.txt", [&](std::ostream& out) { runCheck(stickPath, false, site, out, out); });
+    save("verify.txt", [&](std::ostream& out) { runVerify({}, site, out); });
+    save("system.txt", [&](std::ostream& out) {
         out << "harl-updater-tool " << TOOL_VERSION << '\n';
         for (const std::vector<std::string>& lookup : lookups) {
             const CommandResult result = unit.run(lookup, quick);
-            out << "\n# " << lookup.front() << ' ' << lookup[1] << '\n' << result.output << result.errors;
+            out << "\n# " << lookup[0] << ' ' << lookup[1] << '\n' << result.output << result.errors;
         }
     });
     std::error_code error;
     for (const auto& log : fs::directory_iterator(unit.path(keptLogs), error)) {
         fs::create_directory(folder / "kept-logs");
-        saveOf(("kept-logs" / log.path().filename()).c_str(),
-               [&](std::ostream& out) { out << std::ifstream(log.path()).rdbuf(); });
+        save("kept-logs" / log.path().filename(), [&](std::ostream& out) { out << std::ifstream(log.path()).rdbuf(); });
     }
 }
 
@@ -108,7 +105,7 @@ int runReport(const ReportOptions& options, const UnitSite& site, std::ostream& 
         fs::remove(options.file, error);
         return refused("no temporary folder can be made; check the space in /tmp: df /tmp");
     }
-    gather(folder, options.stick, unit, site);
+    gather(folder, options.stick, unit);
     const CommandResult packed = unit.run({"tar", "--create", "--gzip", "--file", fs::absolute(options.file).string(),
                                            "--directory", temporary.path(), folderName},
                                           packLimit);

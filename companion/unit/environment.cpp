@@ -45,7 +45,7 @@ CommandResult Unit::run(const std::vector<std::string>& arguments, std::chrono::
 {
     std::vector<std::string> environment = {"RES_OPTIONS=timeout:1 attempts:2"}; // resolv.conf(5)
     for (const auto& [name, value] : mEnvironment) {
-        environment.push_back(name + '=' + value);
+        environment.push_back(std::string(name).append("=").append(value));
     }
     bool told = mSite.waits == nullptr;
     return runCommand(arguments, environment, limit, [&](std::chrono::milliseconds time) {
@@ -63,7 +63,7 @@ std::string Unit::locale() const
     std::string result;
     for (const auto& [name, value] : mEnvironment) {
         if (name != "PATH") {
-            result += (result.empty() ? "" : " ") + name + '=' + value;
+            result.append(result.empty() ? "" : " ").append(name).append("=").append(value);
         }
     }
     return result;

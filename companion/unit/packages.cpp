@@ -1,6 +1,5 @@
-#include "unit/packages.h"
-
 #include "descriptor.h"
+#include "unit/unit_check.h"
 
 #include <algorithm>
 #include <array>
@@ -15,6 +14,7 @@
 #include <utility>
 
 #include <fcntl.h>
+#include <sys/statvfs.h>
 
 namespace
 {

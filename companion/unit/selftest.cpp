@@ -1,6 +1,5 @@
-#include "unit/selftest.h"
-
 #include "LedManager.h"
+#include "unit/unit_check.h"
 
 #include <array>
 #include <ostream>
@@ -40,7 +39,7 @@ void lightAll(SelfTest& test, const Unit& unit, LedManager::Color color)
     }
 }
 
-SelfTest testPanel(const Unit& unit, const UnitSite& site, std::ostream& out)
+SelfTest testPanel(const Unit& unit, std::ostream& out)
 {
     const std::array<std::pair<LedManager::Color, const char*>, 3> colors = {{
         {LedManager::COLOR_BLUE, "blue"},
@@ -55,7 +54,7 @@ SelfTest testPanel(const Unit& unit, const UnitSite& site, std::ostream& out)
             break;
         }
         out << "All " << test.tested << " LEDs must be " << name << " now." << std::endl;
-        site.pause(2);
+        unit.site().pause(2);
     }
     lightAll(test, unit, LedManager::COLOR_OFF);
     if (test.failedCommands == 0) {
@@ -77,8 +76,7 @@ SelfTest testSound(const Unit& unit, std::ostream& out)
 
 } // namespace
 
-int runSelfTests(const UnitOptions& options, const Unit& unit, const UnitSite& site, std::ostream& out,
-                 std::ostream& errors)
+int runSelfTests(const UnitOptions& options, const Unit& unit, std::ostream& out, std::ostream& errors)
 {
     if (unit.updaterRuns()) {
         return refuse("unit", options.json,
@@ -98,7 +96,7 @@ int runSelfTests(const UnitOptions& options, const Unit& unit, const UnitSite& s
     };
     std::ostream text(options.json ? nullptr : out.rdbuf());
     if (options.panel) {
-        take("panel", "leds", testPanel(unit, site, text));
+        take("panel", "leds", testPanel(unit, text));
     }
     if (options.sound) {
         take("sound", "sounds", testSound(unit, text));

@@ -1,10 +1,5 @@
 #include "unit/unit_check.h"
 
-#include "findings.h"
-#include "unit/environment.h"
-#include "unit/packages.h"
-#include "unit/selftest.h"
-
 #include <array>
 #include <cerrno>
 #include <cstring>
@@ -24,17 +19,6 @@ namespace
 
 const auto boardLimit = 45s; // 2 s to connect, then ten unanswered keep-alives of 4 s
 
-void checkBoardVersion(const CommandResult& answer, Report& report)
-{
-    const std::string value = valueAfter(answer.output, boardVersionKey);
-    const std::string version = value.substr(0, value.find('\r'));
-    if (!answer.succeeded() || version.empty()) {
-        report.add("board-version", {{"answer", answer.output.empty() ? complaint(answer) : shown(answer.output)}});
-        return;
-    }
-    report.addFact("board_version", "Board's version", shown(version), escaped(version));
-}
-
 /// systemctl(1) exits with 5 for a unit that is not loaded.
 void checkService(const Unit& unit, const std::string& service, const std::string& fact, Report& report)
 {
@@ -46,15 +30,6 @@ void checkService(const Unit& unit, const std::string& service, const std::strin
         report.add("service-not-reloaded", {{"service", shown(service)}});
     }
     report.addFact(fact, "Service " + service, escaped(unit.property(service, "ActiveState")));
-}
-
-/// The package tools keep the time at which the updater was built.
-void checkClock(const Unit& unit, Report& report)
-{
-    struct stat updater = {};
-    if (stat(unit.path("/usr/sbin/harl-updater").c_str(), &updater) == 0 && std::time(nullptr) < updater.st_mtime) {
-        report.add("clock-behind");
-    }
 }
 
 /// False, and reported, when the service's search path does not lead to the tool.
@@ -171,8 +146,14 @@ void checkBoard(const Unit& unit, Report& report)
                    : refused && denied                                   ? "board-login"
                                                                          : "board-unreachable",
                    {{"complaint", complaint(answer)}});
+        return;
+    }
+    const std::string value = valueAfter(answer.output, boardVersionKey);
+    const std::string version = value.substr(0, value.find('\r'));
+    if (answer.succeeded() && !version.empty()) {
+        report.addFact("board_version", "Board's version", shown(version), escaped(version));
     } else {
-        checkBoardVersion(answer, report);
+        report.add("board-version", {{"answer", answer.output.empty() ? complaint(answer) : shown(answer.output)}});
     }
 }
 
@@ -197,7 +178,10 @@ void checkUnit(const Unit& unit, Report& report)
     if (!std::filesystem::exists(unit.path("/var/log/journal"))) { // kept in memory then, journald.conf(5)
         report.add("journal-volatile");
     }
-    checkClock(unit, report);
+    struct stat updater = {}; // the package tools keep the time at which it was built
+    if (stat(unit.path("/usr/sbin/harl-updater").c_str(), &updater) == 0 && std::time(nullptr) < updater.st_mtime) {
+        report.add("clock-behind");
+    }
     report.addFact("search_path", "Search path", escaped(unit.searchPath()));
     for (const char* tool : {"systemctl", "umount", "rm", "ls", "apt", "apt-cache", "ssh", "scp"}) {
         findTool(unit, tool, report);
@@ -214,7 +198,7 @@ int runUnit(const UnitOptions& options, const UnitSite& site, std::ostream& out,
 {
     const Unit unit(site);
     if (options.panel || options.sound) {
-        return runSelfTests(options, unit, site, out, errors);
+        return runSelfTests(options, unit, out, errors);
     }
     Report report("unit", "The unit");
     checkUnit(unit, report);

@@ -1,7 +1,6 @@
 #include "unit/unit_check.h"
 
 #include "finding_lines.h"
-#include "unit/packages.h"
 #include "unit/standin.h"
 
 #include <gmock/gmock.h>
@@ -13,6 +12,7 @@
 #include <sstream>
 
 #include <sys/stat.h>
+#include <sys/statvfs.h>
 
 namespace fs = std::filesystem;
 using testing::Contains;

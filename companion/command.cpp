@@ -149,9 +149,7 @@ CommandResult runCommand(const std::vector<std::string>& arguments, const std::v
     }
     result.output = contentOf(output);
     result.errors = contentOf(errors);
-    if (!result.timedOut && WIFEXITED(status)) {
-        result.exitCode = WEXITSTATUS(status);
-    }
+    result.exitCode = !result.timedOut && WIFEXITED(status) ? WEXITSTATUS(status) : -1;
     return result;
 }
 
@@ -176,8 +174,7 @@ std::string findProgram(const std::string& name, const std::string& searchPath)
         return canRun(name) ? name : "";
     }
     std::istringstream folders(searchPath);
-    std::string path;
-    while (std::getline(folders, path, ':')) {
+    for (std::string path; std::getline(folders, path, ':');) {
         path.append("/").append(name);
         if (canRun(path)) {
             return path;

@@ -23,7 +23,6 @@ public:
     }
 
     int number() const { return mNumber; }
-    int release() { return std::exchange(mNumber, -1); }
     explicit operator bool() const { return mNumber >= 0; }
 
 private:

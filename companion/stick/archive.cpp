@@ -103,7 +103,7 @@ public:
             mReport.add("archive-too-large", {{"most", byteCount(largestArchive)}});
             return;
         }
-        if (readWhole() && open() && checkDirectory() && checkClaims()) {
+        if (readWhole() && open() && checkDirectory()) {
             forEachEntry(mArchive.get(), [&](const Entry& entry) {
                 testEntry(entry);
                 return true;
@@ -150,7 +150,7 @@ private:
         return info.number_entry > 0;
     }
 
-    /// Adds up what the directory of the archive declares. False when it is damaged.
+    /// Adds up what the directory of the archive declares. False when it is damaged, or too much to unpack.
     bool checkDirectory()
     {
         Faults leaving;
@@ -178,23 +178,15 @@ private:
             mReport.add("archive-damaged", {{"entries", "its directory is damaged at offset " +
                                                             std::to_string(unzGetOffset64(mArchive.get())) +
                                                             ", behind " + counted(mEntries, "entry", "entries")}});
-        }
-        return intact;
-    }
-
-    /// Judges what the directory declares. False when it is too much to unpack.
-    bool checkClaims()
-    {
-        if (mEntries > mostEntries) {
+        } else if (mEntries > mostEntries) {
             mReport.add("archive-bomb.entries", {{"most", counted(mostEntries, "entry", "entries")}});
-            return false;
-        }
-        if (mDeclaredBytes > mostUnpacked || mPackedBytes > mSize) {
+        } else if (mDeclaredBytes > mostUnpacked || mPackedBytes > mSize) {
             mReport.add("archive-bomb.declared",
                         {{"declared", byteCount(mDeclaredBytes)}, {"packed", byteCount(mPackedBytes)}});
-            return false;
+        } else {
+            return true;
         }
-        return true;
+        return false;
     }
 
     void testEntry(const Entry& entry)

@@ -109,12 +109,9 @@ private:
                     const char* effect)
     {
         const std::vector<std::string> names = mStick.names(folder).names;
-        if (std::find(names.begin(), names.end(), wanted) != names.end()) {
-            return false;
-        }
         const auto other = std::find_if(names.begin(), names.end(),
                                         [&](const std::string& name) { return lowerCase(name) == lowerCase(wanted); });
-        if (other == names.end()) {
+        if (other == names.end() || std::find(names.begin(), names.end(), wanted) != names.end()) {
             return false;
         }
         mReport.add(found ? "name-case.found" : finding, {{"name", shown(*other)},
@@ -128,13 +125,11 @@ private:
     std::vector<std::string> lookalikes(const std::string& folder, const std::string& wanted) const
     {
         const std::string stem = lowerCase(wanted.substr(0, wanted.find('.')));
-        std::vector<std::string> result;
-        for (const std::string& name : mStick.names(folder).names) {
-            if (lowerCase(name).find(stem) != std::string::npos) {
-                result.push_back(name);
-            }
-        }
-        return result;
+        std::vector<std::string> names = mStick.names(folder).names;
+        const auto others = std::remove_if(names.begin(), names.end(),
+                                           [&](const auto& name) { return !contains(lowerCase(name), stem); });
+        names.erase(others, names.end());
+        return names;
     }
 
     /// Walks down to the board's folder. True when it is there.
@@ -143,14 +138,15 @@ private:
         std::string parent = ".";
         for (const std::string path : {"debs", "debs/QUORB", "debs/QUORB/armhf"}) {
             const Node node = mStick.node(path);
-            const bool misspelled = reportCase(parent, path.substr(path.rfind('/') + 1), node.kind != Node::MISSING,
-                                               "name-case", "no-version");
+            const bool missing = node.kind == Node::MISSING;
+            const bool misspelled =
+                reportCase(parent, path.substr(path.rfind('/') + 1), !missing, "name-case", "no-version");
             if (node.kind != Node::FOLDER) {
                 if (!reportUnusable(path, node, "no-version") && !misspelled) {
-                    const std::string deeper = node.kind == Node::MISSING ? oneLevelDeeper(path) : "";
+                    const std::string deeper = missing ? oneLevelDeeper(path) : "";
                     mReport.add(deeper.empty() ? "no-board-folder" : "no-board-folder.deeper",
                                 {{"path", shown(path)},
-                                 {"state", node.kind == Node::MISSING ? "is missing" : "is no folder"},
+                                 {"state", missing ? "is missing" : "is no folder"},
                                  {"found", shown(deeper)},
                                  {"board-folder", shown(boardFolder)}});
                 }

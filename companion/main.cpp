@@ -64,10 +64,10 @@ std::string usageText(const CLI::App& app, const CLI::ParseError& error)
     if (parsed.empty() && rest.empty()) {
         return "Name a command: stick, unit, check, verify, log, fleet, explain or report.";
     }
+    if (parsed.empty() && startsWith(rest.front(), "-")) {
+        return "Name a command before " + rest.front() + '.';
+    }
     if (parsed.empty()) {
-        if (startsWith(rest.front(), "-")) {
-            return "Name a command before " + rest.front() + '.';
-        }
         std::string text = rest.front() + " is not a command.";
         for (const CLI::App* command : app.get_subcommands([](const CLI::App*) { return true; })) {
             const std::string name = command->get_name();
@@ -241,30 +241,22 @@ int run(std::vector<std::string> arguments)
         return runStick(stickPath, json, std::cout, std::cerr, keyring);
     }
     unitOptions.json = verifyOptions.json = logOptions.json = fleetOptions.json = reportOptions.json = json;
-    if (log->parsed()) {
-        logOptions.terminal = isatty(STDOUT_FILENO) == 1;
-        const std::string wrong = conflictIn(logOptions);
-        return wrong.empty() ? runLog(logOptions, std::cout, std::cerr) : refuseUsage("log", json, wrong);
-    }
-    if (fleet->parsed()) {
-        const std::string wrong = conflictIn(fleetOptions);
-        return wrong.empty() ? runFleet(fleetOptions, std::cout, std::cerr) : refuseUsage("fleet", json, wrong);
+    logOptions.terminal = isatty(STDOUT_FILENO) == 1;
+    const std::string wrong = log->parsed() ? conflictIn(logOptions) : fleet->parsed() ? conflictIn(fleetOptions) : "";
+    if (!wrong.empty()) {
+        return refuseUsage(commandIn(app), json, wrong);
     }
     if (explain->parsed()) {
         return printCatalogue(failure, json, std::cout)
                    ? 0
                    : refuseUsage("explain", json, escaped(failure) + " is not a name of the catalogue.");
     }
-    if (check->parsed()) {
-        return runCheck(checkPath, json, thisUnit(), std::cout, std::cerr);
-    }
-    if (report->parsed()) {
-        return runReport(reportOptions, thisUnit(), std::cout, std::cerr);
-    }
-    if (verify->parsed()) {
-        return runVerify(verifyOptions, thisUnit(), std::cout);
-    }
-    return runUnit(unitOptions, thisUnit(), std::cout, std::cerr);
+    return log->parsed()      ? runLog(logOptions, std::cout, std::cerr)
+           : fleet->parsed()  ? runFleet(fleetOptions, std::cout, std::cerr)
+           : check->parsed()  ? runCheck(checkPath, json, thisUnit(), std::cout, std::cerr)
+           : report->parsed() ? runReport(reportOptions, thisUnit(), std::cout, std::cerr)
+           : verify->parsed() ? runVerify(verifyOptions, thisUnit(), std::cout)
+                              : runUnit(unitOptions, thisUnit(), std::cout, std::cerr);
 }
 
 } // namespace

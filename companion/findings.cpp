@@ -8,8 +8,9 @@ void Report::add(const std::string& name, Values values)
 {
     values.insert(mValues.begin(), mValues.end());
     const nlohmann::ordered_json& entry = catalogue("findings").at(name);
-    add({entry.at("severity").get<Severity>(), name.substr(0, name.find('.')), filled(entry.at("what"), values),
-         filled(entry.at("effect"), values), filled(entry.at("remedy"), values)});
+    const auto text = [&](const char* part) { return filled(unfilled(entry.at(part)), values); };
+    add({entry.at("severity").get<Severity>(), name.substr(0, name.find('.')), text("what"), text("effect"),
+         text("remedy")});
 }
 
 std::size_t Report::count(Severity severity) const
@@ -35,12 +36,13 @@ void Report::write(bool json, std::ostream& out) const
     }
     std::string text;
     for (const auto& [label, fact] : mLines) {
-        text += label + ':' + std::string(width - label.size() + 2, ' ') + '\t' + fact + '\n';
+        text.append(label).append(":").append(width - label.size() + 2, ' ').append("\t").append(fact).append("\n");
     }
     for (Severity severity : {Severity::ERROR, Severity::UNCHECKED, Severity::WARNING, Severity::NOTE}) {
         for (const Finding& finding : mFindings) {
             if (finding.severity == severity) {
-                text += '\n' + nlohmann::json(severity).get<std::string>() + ": \t" + finding.what + " [" + finding.check + "]\n";
+                text += '\n' + nlohmann::json(severity).get<std::string>() + ": \t" + finding.what + " [" +
+                        finding.check + "]\n";
                 text += finding.effect.empty() ? "" : "  The updater: \t" + finding.effect + '\n';
                 text += finding.remedy.empty() ? "" : "  Fix:         \t" + finding.remedy + '\n';
             }

@@ -53,7 +53,8 @@ public:
     {
     }
 
-    /// Adds a fact: `name` in snake_case for programs, `label` and `text` for people, `value`, or else `text`, for programs.
+    /// Adds a fact: `name` in snake_case for programs, `label` and `text` for people, `value`, or else `text`, for
+    /// programs.
     void addFact(const std::string& name, const std::string& label, const std::string& text,
                  const nlohmann::ordered_json& value)
     {

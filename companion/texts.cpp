@@ -18,23 +18,30 @@ namespace
 
 const std::size_t longestShown = 300; // bytes; a file name has at most 255
 
-/// True for characters beyond ASCII that do not show, or that change how their neighbours show.
-bool isInvisible(char32_t character)
+using Ranges = std::vector<std::pair<char32_t, char32_t>>;
+
+/// Characters beyond ASCII that do not show, or that change how their neighbours show.
+const Ranges invisible = {
+    {0x80, 0xA0},       // C1 controls, no-break space
+    {0xAD, 0xAD},       // soft hyphen
+    {0x34F, 0x34F},     // combining grapheme joiner
+    {0x61C, 0x61C},     // Arabic letter mark
+    {0x115F, 0x1160},   // Hangul fillers
+    {0x180B, 0x180E},   // Mongolian separators
+    {0x2000, 0x200F},   // blanks, zero width, direction marks
+    {0x2028, 0x202F},   // line separators, direction embeddings
+    {0x205F, 0x206F},   // blanks, direction isolates
+    {0x3000, 0x3000},   // ideographic space
+    {0xFE00, 0xFEFF},   // variation selectors, Arabic presentation forms, byte order mark
+    {0xE0000, 0x10FFFF} // tags, private use
+};
+/// Those that take two columns of a terminal, Unicode's annex 11, and those that combine with the one before.
+const Ranges wide = {{0x1100, 0x115F}, {0x2E80, 0xA4CF}, {0xAC00, 0xD7A3},
+                     {0xF900, 0xFAFF}, {0xFF01, 0xFF60}, {0x1F300, 0x3FFFD}};
+const Ranges combining = {{0x300, 0x36F}};
+
+bool isIn(const Ranges& ranges, char32_t character)
 {
-    static const std::array<std::pair<char32_t, char32_t>, 12> ranges = {{
-        {0x80, 0xA0},       // C1 controls, no-break space
-        {0xAD, 0xAD},       // soft hyphen
-        {0x34F, 0x34F},     // combining grapheme joiner
-        {0x61C, 0x61C},     // Arabic letter mark
-        {0x115F, 0x1160},   // Hangul fillers
-        {0x180B, 0x180E},   // Mongolian separators
-        {0x2000, 0x200F},   // blanks, zero width, direction marks
-        {0x2028, 0x202F},   // line separators, direction embeddings
-        {0x205F, 0x206F},   // blanks, direction isolates
-        {0x3000, 0x3000},   // ideographic space
-        {0xFE00, 0xFEFF},   // variation selectors, Arabic presentation forms, byte order mark
-        {0xE0000, 0x10FFFF} // tags, private use
-    }};
     return std::any_of(ranges.begin(), ranges.end(),
                        [&](const auto& range) { return character >= range.first && character <= range.second; });
 }
@@ -55,26 +62,20 @@ void appendEscaped(std::string& text, char32_t character, std::string_view bytes
         text.append("\\").append(1, named[place + 1]);
     } else if (character < 0x20 || character == 0x7F) {
         text += formatted("\\x%02x", character);
-    } else if (isInvisible(character)) {
+    } else if (isIn(invisible, character)) {
         text += formatted("\\u{%x}", character);
     } else {
         text += bytes;
     }
 }
 
-/// The columns that a terminal needs for `text`: two for each wide character, Unicode's annex 11, none for one that
-/// combines with the one before.
+/// The columns that a terminal needs for `text`.
 std::size_t columnsOf(std::string_view text)
 {
     std::size_t columns = 0;
     for (const auto* next = text.begin(); next != text.end();) {
         const char32_t character = utf8::unchecked::next(next);
-        const bool wide =
-            (character >= 0x1100 && character <= 0x115F) || (character >= 0x2E80 && character <= 0xA4CF) ||
-            (character >= 0xAC00 && character <= 0xD7A3) || (character >= 0xF900 && character <= 0xFAFF) ||
-            (character >= 0xFF01 && character <= 0xFF60) || (character >= 0x1F300 && character <= 0x3FFFD);
-        const bool combines = character >= 0x300 && character <= 0x36F;
-        columns += combines ? 0 : wide ? 2 : 1;
+        columns += isIn(combining, character) ? 0 : isIn(wide, character) ? 2 : 1;
     }
     return columns;
 }
@@ -136,25 +137,24 @@ std::string unfilled(const nlohmann::ordered_json& text)
     return result;
 }
 
-std::string filled(const nlohmann::ordered_json& text, const Values& values)
+std::string filled(const std::string& text, const Values& values)
 {
-    const std::string pattern = unfilled(text);
     std::string result;
     std::size_t position = 0;
-    for (std::size_t open = 0; (open = pattern.find('{', position)) != std::string::npos;) {
-        const std::size_t close = pattern.find('}', open);
-        const std::string name = pattern.substr(open + 1, close - open - 1);
+    for (std::size_t open = 0; (open = text.find('{', position)) != std::string::npos;) {
+        const std::size_t close = text.find('}', open);
+        const std::string name = text.substr(open + 1, close - open - 1);
         const auto value = values.find(name);
-        result += pattern.substr(position, open - position);
-        result += value != values.end() ? value->second : sharedText(name.c_str(), values);
+        result += text.substr(position, open - position);
+        result += value != values.end() ? value->second : sharedText(name, values);
         position = close + 1;
     }
-    return result + pattern.substr(position);
+    return result + text.substr(position);
 }
 
-std::string sharedText(const char* name, const Values& values)
+std::string sharedText(const std::string& name, const Values& values, const char* section)
 {
-    return filled(catalogue("texts").at(name), values);
+    return filled(unfilled(catalogue(section).at(name)), values);
 }
 
 std::size_t widthOf(const std::ostream& out)

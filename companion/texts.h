@@ -31,13 +31,15 @@ const nlohmann::ordered_json& catalogue(const char* section);
 /// What takes the place of the names in braces.
 using Values = std::map<std::string, std::string, std::less<>>;
 
-/// A text of the catalogue, which is a string or an array of its lines, as it is there; filled() with each {name}
-/// replaced by the value of that name or else by the shared text of it. Values stay as they are.
+/// A text of the catalogue as it is there: a string or an array of its lines.
 std::string unfilled(const nlohmann::ordered_json& text);
-std::string filled(const nlohmann::ordered_json& text, const Values& values);
 
-/// The shared text of this name, filled().
-std::string sharedText(const char* name, const Values& values = {});
+/// `text` with each {name} replaced by the value of that name or else by the shared text of it. Values stay as they
+/// are.
+std::string filled(const std::string& text, const Values& values);
+
+/// The text of this name in a section that holds texts alone, filled().
+std::string sharedText(const std::string& name, const Values& values = {}, const char* section = "texts");
 
 // What is shown
 

@@ -7,6 +7,8 @@
 #include <algorithm>
 #include <ostream>
 
+#include <nlohmann/json.hpp>
+
 namespace
 {
 
@@ -130,23 +132,23 @@ void addFailure(Run& run)
     if (run.steps.empty()) {
         return;
     }
-    const std::size_t last = run.steps.size() - 1;
+    const bool failed = isFailure(run.outcome);
+    const auto decisive = std::find_if(run.steps.rbegin(), run.steps.rend(),
+                                       [&](const Step& step) { return failed && decides(step, run.outcome); });
+    if (decisive != run.steps.rend()) {
+        run.failure = {entryFor(run, *decisive), static_cast<std::size_t>(run.steps.rend() - decisive) - 1};
+        return;
+    }
     const bool shown = run.steps.back().kind >= S::SHOW_OUTCOME ||
                        (run.mainHead && run.outcome != Outcome::NONE && run.outcome != Outcome::UPDATE_OFFERED);
-    if (isFailure(run.outcome)) {
-        for (std::size_t index = run.steps.size(); index-- > 0;) {
-            if (decides(run.steps[index], run.outcome)) {
-                run.failure = {entryFor(run, run.steps[index]), index};
-                return;
-            }
-        }
-        run.failure = {findFailure("unknown"), last};
-    } else if (run.ended == RunEnd::EARLY) {
-        run.failure = {findFailure("ended-early"), last};
-    } else if (run.ended == RunEnd::NOT_SEEN) {
-        run.failure = {findFailure(shown ? "end-missing" : run.followedByAnother ? "cut-short" : "unfinished"), last};
-    } else if (run.outcome == Outcome::NONE) {
-        run.failure = {findFailure("outcome-missing"), last};
+    const char* const name = failed                          ? "unknown"
+                             : run.ended == RunEnd::EARLY    ? "ended-early"
+                             : run.ended != RunEnd::NOT_SEEN ? "outcome-missing"
+                             : shown                         ? "end-missing"
+                             : run.followedByAnother         ? "cut-short"
+                                                             : "unfinished";
+    if (failed || run.outcome == Outcome::NONE || run.ended == RunEnd::EARLY || run.ended == RunEnd::NOT_SEEN) {
+        run.failure = {findFailure(name), run.steps.size() - 1};
     }
 }
 

@@ -1,12 +1,12 @@
 #include "log/follow.h"
 
-#include "findings.h"
 #include "log/json.h"
 #include "log/text.h"
 #include "procedure.h"
 
 #include <algorithm>
 #include <ctime>
+#include <map>
 #include <sstream>
 #include <utility>
 
@@ -61,28 +61,22 @@ std::vector<StepKind> stepsToCome(const Run& run)
     };
     const bool package = mayDiffer(run.package, StepKind::CHECK_PACKAGE);
     const bool board = mayDiffer(run.board, StepKind::CHECK_BOARD);
-    const auto comes = [&](StepKind kind) {
-        switch (kind) {
-        case StepKind::INSTALL_PACKAGE:
-            return package;
-        case StepKind::UPLOAD_BOARD:
-        case StepKind::RUN_BOARD_SCRIPT:
-        case StepKind::WAIT_FOR_BOARD:
-            return board;
-        case StepKind::CHECK_TEAMVIEWER:
-            return run.mainHead && (!ends || last == StepKind::CHECK_BOARD);
-        case StepKind::INSTALL_TEAMVIEWER: // its user decides
-            return false;
-        case StepKind::REMOVE_MARKER:
-            return run.mainHead ? !ends && last != StepKind::INSTALL_TEAMVIEWER : package || board;
-        default:
-            return kind >= StepKind::SHOW_OUTCOME || !ends;
-        }
+    // All others come in any case, or unless the run ends before its outcome.
+    const std::map<StepKind, bool> comes = {
+        {StepKind::INSTALL_PACKAGE, package},
+        {StepKind::UPLOAD_BOARD, board},
+        {StepKind::RUN_BOARD_SCRIPT, board},
+        {StepKind::WAIT_FOR_BOARD, board},
+        {StepKind::CHECK_TEAMVIEWER, run.mainHead && (!ends || last == StepKind::CHECK_BOARD)},
+        {StepKind::INSTALL_TEAMVIEWER, false}, // its user decides
+        {StepKind::REMOVE_MARKER, run.mainHead ? !ends && last != StepKind::INSTALL_TEAMVIEWER : package || board},
     };
     std::vector<StepKind> kinds;
     for (std::size_t index = static_cast<std::size_t>(last) + 1; index < stepKinds; ++index) {
-        if (comes(static_cast<StepKind>(index))) {
-            kinds.push_back(static_cast<StepKind>(index));
+        const auto kind = static_cast<StepKind>(index);
+        const auto known = comes.find(kind);
+        if (known != comes.end() ? known->second : kind >= StepKind::SHOW_OUTCOME || !ends) {
+            kinds.push_back(kind);
         }
     }
     return kinds;
@@ -241,6 +235,5 @@ std::int64_t localNow()
 {
     const std::time_t now = std::time(nullptr);
     std::tm local = {};
-    localtime_r(&now, &local);
-    return timegm(&local);
+    return now + localtime_r(&now, &local)->tm_gmtoff;
 }

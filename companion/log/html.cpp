@@ -8,6 +8,7 @@
 #include <ostream>
 
 #include <kainjow/mustache.hpp>
+#include <nlohmann/json.hpp>
 
 namespace
 {

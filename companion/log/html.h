@@ -5,7 +5,7 @@
 #include <iosfwd>
 #include <string>
 
-#include <nlohmann/json.hpp>
+#include <nlohmann/json_fwd.hpp>
 
 /// Writes the part of a page's template that shows the data of this name.
 ///

@@ -4,6 +4,8 @@
 
 #include <array>
 
+#include <nlohmann/json.hpp>
+
 namespace
 {
 

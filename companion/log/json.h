@@ -2,7 +2,7 @@
 
 #include "log/run.h"
 
-#include <nlohmann/json.hpp>
+#include <nlohmann/json_fwd.hpp>
 
 /// A problem of a run, explained before, for programs.
 nlohmann::ordered_json problemToJson(const Run& run, const Problem& problem);

@@ -24,6 +24,7 @@
 #include <ostream>
 #include <vector>
 
+#include <nlohmann/json.hpp>
 #include <poll.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -182,7 +183,7 @@ public:
         if (mOptions.json) {
             mOut << "{\"command\": \"log\", \"version\": " << jsonVersion << ", \"runs\": [";
         }
-        std::string error = openPage();
+        std::string error = mOptions.htmlFile.empty() ? "" : openPage();
         const std::size_t count = std::max<std::size_t>(mOptions.files.size(), 1);
         for (std::size_t index = 0; index < count && error.empty(); ++index) {
             error = readSource(index);
@@ -216,17 +217,17 @@ private:
         return wrong.empty() ? "" : escaped(mOptions.htmlFile) + ": " + wrong;
     }
 
+    /// What is wrong, in words; empty for nothing.
     std::string openPage()
     {
-        if (mOptions.htmlFile.empty()) {
-            return "";
+        std::string wrong = objectionTo(mOptions.htmlFile, mOptions.files);
+        if (wrong.empty() && !openUnnamed(mPage)) {
+            wrong = std::strerror(errno);
         }
-        const std::string objection = objectionTo(mOptions.htmlFile, mOptions.files);
-        if (!objection.empty() || !openUnnamed(mPage)) {
-            return pageError(objection.empty() ? std::strerror(errno) : objection);
+        if (wrong.empty()) {
+            beginPage(mPage);
         }
-        beginPage(mPage);
-        return "";
+        return pageError(wrong);
     }
 
     std::string readSource(std::size_t index)

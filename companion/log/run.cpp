@@ -1,7 +1,6 @@
 #include "log/run.h"
 
 #include "LedManager.h"
-#include "findings.h"
 #include "procedure.h"
 
 #include <algorithm>
@@ -78,10 +77,7 @@ void splitVersions(std::string_view text, std::string_view separator, Versions& 
 /// True for a panel command that lights an outcome: not off, not the blue of the flashing.
 bool lightsOutcome(std::string_view command)
 {
-    const auto ends = [&](LedManager::Color color) {
-        const std::string end = " 0x" + std::to_string(color) + " c";
-        return command.size() >= end.size() && command.substr(command.size() - end.size()) == end;
-    };
+    const auto ends = [&](LedManager::Color color) { return contains(command, " 0x" + std::to_string(color) + " c"); };
     return ends(LedManager::COLOR_PASS) || ends(LedManager::COLOR_FAIL);
 }
 
@@ -193,12 +189,13 @@ Outcome outcomeOf(const Run& run)
 
 Outcome failureOf(const Step& step)
 {
-    if (step.result != StepResult::FAILED && !(isOneCommand(step.kind) && step.status && step.status->number != 0)) {
-        return Outcome::NONE;
+    const bool refused = isOneCommand(step.kind) && step.status && step.status->number != 0;
+    for (const auto& [kind, outcome] : stepFailures) {
+        if (kind == step.kind && (refused || step.result == StepResult::FAILED)) {
+            return outcome;
+        }
     }
-    const auto* const found = std::find_if(std::begin(stepFailures), std::end(stepFailures),
-                                           [&](const auto& failure) { return failure.first == step.kind; });
-    return found == std::end(stepFailures) ? Outcome::NONE : found->second;
+    return Outcome::NONE;
 }
 
 std::vector<std::size_t> failedCommands(const Step& step)
@@ -367,13 +364,10 @@ void RunBuilder::takeServiceLine(ServiceEvent event, std::string_view text)
 
 void RunBuilder::torn(std::uint64_t line)
 {
-    if (!mRun) {
-        ++mTornBefore;
-        return;
-    }
-    if (mRun->tornRecords++ == 0) {
+    if (mRun && mRun->tornRecords == 0) {
         mRun->firstTornLine = line;
     }
+    ++(mRun ? mRun->tornRecords : mTornBefore);
 }
 
 void RunBuilder::beginRun(const ParsedRecord& record)
@@ -390,12 +384,11 @@ void RunBuilder::beginRun(const ParsedRecord& record)
 
 void RunBuilder::endRun(bool followedByAnother)
 {
-    if (!mRun) {
-        return;
+    if (mRun) {
+        mRun->followedByAnother = followedByAnother;
+        mRunComplete(*mRun);
+        mRun.reset();
     }
-    mRun->followedByAnother = followedByAnother;
-    mRunComplete(*mRun);
-    mRun.reset();
 }
 
 /// Counts the time since the record before, unless the clock jumped.

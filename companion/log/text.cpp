@@ -1,6 +1,5 @@
 #include "log/text.h"
 
-#include "findings.h"
 #include "procedure.h"
 
 #include <algorithm>
@@ -341,7 +340,7 @@ std::vector<std::string> gapTexts(const Run& run)
     std::vector<std::string> texts;
     const Values values = run.gaps.empty() ? Values() : valuesOf(run, nullptr, {});
     for (const std::string& gap : run.gaps) {
-        texts.push_back(filled(catalogue("gaps").at(gap), values));
+        texts.push_back(sharedText(gap, values, "gaps"));
     }
     return texts;
 }

@@ -176,17 +176,6 @@ WordRange wordsOf(std::string_view operation)
     return found == index.end() ? WordRange(nullptr, nullptr) : found->second;
 }
 
-std::optional<long> takeNumber(std::string_view& text)
-{
-    long value = 0;
-    const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), value);
-    if (error != std::errc()) {
-        return std::nullopt;
-    }
-    text.remove_prefix(static_cast<std::size_t>(end - text.data()));
-    return value;
-}
-
 /// True, with what it holds in `meaning`, when `message` has the form of `pattern`.
 bool fits(std::string_view pattern, std::string_view message, Meaning& meaning)
 {
@@ -202,8 +191,14 @@ bool fits(std::string_view pattern, std::string_view message, Meaning& meaning)
     }
     meaning.rest = message.substr(pattern.size());
     meaning.number.reset();
-    if (number && !(meaning.number = takeNumber(meaning.rest))) {
-        return false;
+    if (number) {
+        long value = 0;
+        const auto [end, error] = std::from_chars(meaning.rest.begin(), meaning.rest.end(), value);
+        if (error != std::errc()) {
+            return false;
+        }
+        meaning.number = value;
+        meaning.rest.remove_prefix(static_cast<std::size_t>(end - meaning.rest.begin()));
     }
     return anyText || meaning.rest.empty();
 }

@@ -42,7 +42,8 @@ const Ranges combining = {{0x300, 0x36F}};
 
 bool isIn(const Ranges& ranges, char32_t character)
 {
-    return std::any_of(ranges.begin(), ranges.end(),
+    return character >= ranges.front().first && // which spares ASCII the search
+           std::any_of(ranges.begin(), ranges.end(),
                        [&](const auto& range) { return character >= range.first && character <= range.second; });
 }
 

@@ -37,8 +37,9 @@ std::string_view withoutBlanks(std::string_view text)
 /// `text`.
 bool takeColumn(std::string_view& text, std::string_view& column)
 {
-    const std::size_t end = text.find_first_of(" \t");
-    if (end == std::string_view::npos || end == 0) {
+    const auto isBlank = [](char character) { return character == ' ' || character == '\t'; };
+    const auto end = static_cast<std::size_t>(std::find_if(text.begin(), text.end(), isBlank) - text.begin());
+    if (end == text.size() || end == 0) { // of every record: faster than find_first_of()
         return false;
     }
     column = text.substr(0, end);
@@ -296,9 +297,13 @@ bool LogParser::parseHead(std::string_view text)
 /// Reads "DD-MM-YYYY HH-MM-SS" into mHead.
 bool LogParser::parseTime(std::string_view text)
 {
-    const bool formed = std::equal(text.begin(), text.end(), timeForm.begin(), timeForm.end(),
-                                   [](char it, char wanted) { return wanted == '0' ? isDigit(it) : it == wanted; });
-    if (!formed) {
+    if (text.size() != timeForm.size()) {
+        return false;
+    }
+    const bool sameDay = text.substr(0, 10) == mDate;
+    const std::size_t begin = sameDay ? 10 : 0; // a day that is known has its form
+    const auto hasForm = [](char it, char wanted) { return wanted == '0' ? isDigit(it) : it == wanted; };
+    if (!std::equal(text.begin() + begin, text.end(), timeForm.begin() + begin, hasForm)) {
         return false;
     }
     const int hour = number(text, 11, 13);
@@ -307,7 +312,7 @@ bool LogParser::parseTime(std::string_view text)
     if (hour > 23 || minute > 59 || second > 60) {
         return false;
     }
-    if (text.substr(0, 10) != mDate) {
+    if (!sameDay) {
         std::tm date = {};
         date.tm_mday = number(text, 0, 2);
         date.tm_mon = number(text, 3, 5) - 1;

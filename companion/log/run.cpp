@@ -77,7 +77,10 @@ void splitVersions(std::string_view text, std::string_view separator, Versions& 
 /// True for a panel command that lights an outcome: not off, not the blue of the flashing.
 bool lightsOutcome(std::string_view command)
 {
-    const auto ends = [&](LedManager::Color color) { return contains(command, " 0x" + std::to_string(color) + " c"); };
+    const auto ends = [&](LedManager::Color color) {
+        const std::string end = " 0x" + std::to_string(color) + " c";
+        return command.size() >= end.size() && command.substr(command.size() - end.size()) == end;
+    };
     return ends(LedManager::COLOR_PASS) || ends(LedManager::COLOR_FAIL);
 }
 

@@ -8,9 +8,3 @@ function(add_python_test name file)
   set_tests_properties(${name} PROPERTIES TIMEOUT 180 SKIP_RETURN_CODE 77 # tests/conftest.py
     ENVIRONMENT "PYTHONPATH=${PROJECT_SOURCE_DIR}")
 endfunction()
-
-function(add_module_test name module)
-  add_test(NAME ${name} COMMAND /usr/bin/python3 -B -m ${module} ${ARGN} WORKING_DIRECTORY ${PROJECT_SOURCE_DIR})
-  set_tests_properties(${name} PROPERTIES TIMEOUT 180 SKIP_RETURN_CODE 77
-    ENVIRONMENT "PYTHONPATH=${PROJECT_SOURCE_DIR}")
-endfunction()

@@ -6,21 +6,29 @@ import os
 
 import pytest
 
+SKIPPED = 77  # tests/conftest.py
+
 
 def start(test: pytest.Item) -> int:
     process = os.fork()
     if process == 0:
         test.ihook.pytest_runtest_protocol(item=test, nextitem=None)
-        os._exit(1 if test.session.testsfailed else 0)
+        has_passed = "passed" in test.config.pluginmanager.get_plugin("terminalreporter").stats
+        os._exit(1 if test.session.testsfailed else 0 if has_passed else SKIPPED)
     return process
 
 
 def pytest_runtestloop(session: pytest.Session) -> bool:
     session.config._tmp_path_factory.getbasetemp()  # type: ignore[attr-defined] # one for all
     running = {start(test): test for test in session.items}
+    has_passed = False
     while running:
         process, status = os.wait()
         test = running.pop(process)
-        if status != 0 and os.waitpid(start(test), 0)[1] != 0:
+        code = os.waitstatus_to_exitcode(status)
+        if code not in (0, SKIPPED) and os.waitpid(start(test), 0)[1] != 0:
             pytest.exit(f"{test.nodeid} fails", pytest.ExitCode.TESTS_FAILED)
+        has_passed |= code == 0
+    if session.items and not has_passed:
+        pytest.exit("every test was skipped", SKIPPED)
     return True

@@ -2,14 +2,16 @@
 
 import shlex
 import shutil
-from collections.abc import Iterator
+from collections.abc import Callable, Iterator
 from pathlib import Path
+from typing import Any
 
 import pytest
 
 SKIPPED = 77  # cmake/python_test.cmake
 ROOT = Path(__file__).parents[1]
 
+pytest_plugins = ["tests.service.service"]
 pytest.register_assert_rewrite("tests.commands", "tests.service.stand_in")
 
 
@@ -17,6 +19,10 @@ def pytest_addoption(parser: pytest.Parser) -> None:
     options = parser.getgroup("updater")
     options.addoption("--build", type=Path, default=ROOT / "build/default", help="the build folder under test")
     options.addoption("--emulator", type=shlex.split, default=[], help="what runs the tool of another machine")
+    options.addoption("--package", default="harl-updater", help="the package under test, in build/package")
+    options.addoption("--system", type=Path, default="/", help="the root file system on which it is tested")
+    options.addoption("--units", type=int, default=8, help="how many units the fleet has")
+    options.addoption("--write", action="store_true", help="keeps what is printed where it is compared with a file")
     options.addoption("--unit", default="stand-in", help="the kind of unit in the terminals of the bench")
 
 
@@ -38,6 +44,20 @@ def build(pytestconfig: pytest.Config) -> Path:
 def tool(build: Path) -> Path:
     """The companion program."""
     return build / "companion/harl-updater-tool"
+
+
+LINES: list[str] = []
+
+
+@pytest.fixture(scope="session")
+def tell() -> Callable[[str], None]:
+    """Shows a line at the end of the run, also of one without a failure."""
+    return LINES.append
+
+
+def pytest_terminal_summary(terminalreporter: Any) -> None:
+    for line in LINES:
+        terminalreporter.write_line(line)
 
 
 @pytest.fixture

@@ -34,7 +34,7 @@ CONFIGURE = [
 BUILD_LIMIT = 300  # s
 MOST_PROCESSES = 1000  # of a test: with some changes the hand-over calls itself for ever
 SINCE_LIMIT = 80  # s, after which --since begins with no other change
-SKIPPED = 77  # cmake/python_test.cmake
+SKIPPED = 77  # tests/conftest.py
 
 
 @dataclass(frozen=True)

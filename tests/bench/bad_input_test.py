@@ -2,23 +2,20 @@
 
 import os
 import re
-import subprocess
 import sys
 from pathlib import Path
 
 import pytest
 
 from bench.expected import BLOCKS, COMMANDS
+from tests.commands import run_command
 
 ROOT = Path(__file__).parents[2]
 GOOD = (ROOT / "bench/scenarios/up-to-date.toml").read_text()
 EARLY_END = GOOD[: GOOD.rindex("'''")]
+SECTIONS = "package, mirrors, board, stick, head, tools, updater"
+KEYS = "installed, version_file, link, login, disk, uploads_lost, script"
 TOOLS = "'systemctl', 'umount', 'rm', 'ls', 'apt', 'apt-cache', 'ssh', 'scp', 'i2cset', 'aplay'"
-
-
-def before_board(lines: str) -> str:
-    """The good file with lines before the board's section, and in it."""
-    return GOOD.replace("[board]\n", lines)
 
 
 def line_of(text: str, key: str) -> int:
@@ -26,48 +23,23 @@ def line_of(text: str, key: str) -> int:
     return next(number for number, line in enumerate(text.splitlines(), 1) if line.startswith(f"{key} ="))
 
 
-# The whole message: the file's text, the line and the reason.
+# The file's text, the line and the whole reason.
 WRONG_FILES = {
     "no-toml": (GOOD.replace("[board]", "[board"), 6, "Expected ']' at the end of a table declaration"),
     "early-end": (EARLY_END, len(EARLY_END.splitlines()), "Expected \"'''\""),
-    "section": (
-        GOOD.replace("[board]", "[bord]"),
-        6,
-        "bord: not known; the sections are package, mirrors, board, stick, head, tools, updater and expect",
-    ),
-    "key": (
-        before_board('[board]\ncolour = "red"\n'),
-        7,
-        "board.colour: not known; the keys are installed, version_file, link, login, disk, uploads_lost, script",
-    ),
-    "value": (before_board('[board]\ndisk = "none"\n'), 7, "board.disk: must be one of 'free', 'full', not 'none'"),
-    "type": (before_board('[board]\nuploads_lost = "3"\n'), 7, "board.uploads_lost: must be of type int, not '3'"),
-    "type-of-entry": (
-        before_board("[stick]\ndirectories = [3]\n\n[board]\n"),
-        7,
-        "stick.directories: must be of type str, not 3",
-    ),
-    "outside-the-unit": (
-        before_board('[stick]\ndirectories = ["../../quorb2.2.0"]\n\n[board]\n'),
-        7,
-        "stick.directories: must be fit for the name of a file, not '../../quorb2.2.0'",
-    ),
-    "missing-tool": (
-        before_board('[tools]\nmissing = ["nope"]\n\n[board]\n'),
-        7,
-        f"tools.missing: must be one of {TOOLS}, not 'nope'",
-    ),
-    "killed-tool": (
-        before_board('[tools]\nkilled = ["nope"]\n\n[board]\n'),
-        7,
-        f"tools.killed: must be one of {TOOLS}, not 'nope'",
-    ),
-    "null-character": (
-        before_board('[board]\nversion_file = "a\\u0000b"\n'),
-        7,
-        "board.version_file: must be without null characters",
-    ),
+    "section": (GOOD.replace("[board]", "[bord]"), 6, f"bord: not known; the sections are {SECTIONS} and expect"),
     "missing-expectation": (GOOD.replace("marker = true\n", ""), 9, "expect.marker: is missing"),
+}
+# A seventh line, below that of its section, and the reason, which names both.
+WRONG_LINES = {
+    'colour = "red"': f"board.colour: not known; the keys are {KEYS}",
+    'disk = "none"': "board.disk: must be one of 'free', 'full', not 'none'",
+    'uploads_lost = "3"': "board.uploads_lost: must be of type int, not '3'",
+    'version_file = "a\\u0000b"': "board.version_file: must be without null characters",
+    "directories = [3]": "stick.directories: must be of type str, not 3",
+    'directories = ["../quorb"]': "stick.directories: must be fit for the name of a file, not '../quorb'",
+    'missing = ["nope"]': f"tools.missing: must be one of {TOOLS}, not 'nope'",
+    'killed = ["nope"]': f"tools.killed: must be one of {TOOLS}, not 'nope'",
 }
 # Under [expect]: what is replaced, by what, and the reason, which begins with the key.
 WRONG_EXPECTATIONS = {
@@ -77,18 +49,13 @@ WRONG_EXPECTATIONS = {
     "type": (r"commands = \[[^]]*\]", "commands = [3]", "commands: must be of type str, not 3"),
     "block": (r"\(opening 0\)", "(nothing 0)", f"log: no block 'nothing'; there are {', '.join(BLOCKS)}"),
     "values": (r"\(opening 0\)", "(opening)", "log: block 'opening': values after the name: must be 1, not 0"),
-    "log": (
-        r"\(opening 0\)",
-        "runProcess: {stop}",
-        f"log: no command 'stop'; there are {', '.join(COMMANDS)}",
-    ),
+    "log": (r"\(opening 0\)", "runProcess: {stop}", f"log: no command 'stop'; there are {', '.join(COMMANDS)}"),
 }
 
 
 def bench(*arguments: str | Path, **variables: str) -> tuple[int, str, str]:
     """Status, output and errors of bench/run."""
-    command: list[str | Path] = [sys.executable, "-B", "-m", "bench", *arguments]
-    done = subprocess.run(command, env=os.environ | variables, capture_output=True, text=True, check=False)
+    done = run_command(sys.executable, "-B", "-m", "bench", *arguments, environment=os.environ | variables)
     return done.returncode, done.stdout, done.stderr
 
 
@@ -116,6 +83,13 @@ def build(tmp_path: Path) -> Path:
 @pytest.mark.parametrize("text, line, reason", WRONG_FILES.values(), ids=WRONG_FILES)
 def test_file(tmp_path: Path, text: str, line: int, reason: str) -> None:
     check_file(tmp_path / "scenario.toml", text, line, reason)
+
+
+@pytest.mark.parametrize("line, reason", WRONG_LINES.items(), ids=WRONG_LINES)
+def test_line(tmp_path: Path, line: str, reason: str) -> None:
+    section = reason.split(".")[0]
+    lines = f"[board]\n{line}\n" if section == "board" else f"[{section}]\n{line}\n\n[board]\n"
+    check_file(tmp_path / "scenario.toml", GOOD.replace("[board]\n", lines), 7, reason)
 
 
 @pytest.mark.parametrize("old, new, reason", WRONG_EXPECTATIONS.values(), ids=WRONG_EXPECTATIONS)
@@ -160,12 +134,11 @@ def test_build_that_is_none(tmp_path: Path) -> None:
 
 
 def test_paths_count_from_where_the_user_is(tmp_path: Path) -> None:
-    command: list[str | Path] = [ROOT / "bench/run", "scenario.toml"]
-    done = subprocess.run(command, cwd=tmp_path, capture_output=True, text=True, check=False)
+    done = run_command(ROOT / "bench/run", "scenario.toml", folder=tmp_path)
     message = "bench: scenario.toml: No such file or directory\n"
     assert (done.returncode, done.stdout, done.stderr) == (2, "", message)
     (tmp_path / "scenario.toml").touch()
-    done = subprocess.run(command, cwd=tmp_path, capture_output=True, text=True, check=False)
+    done = run_command(ROOT / "bench/run", "scenario.toml", folder=tmp_path)
     assert (done.returncode, done.stderr) == (2, "bench: scenario.toml:1: summary: is missing\n")
 
 
@@ -181,8 +154,7 @@ def test_too_little_space(tmp_path: Path, build: Path) -> None:
     small = tmp_path / "small"
     small.mkdir()
     script = f"mount -t tmpfs -o size=3m small {small} || exit 77; TMPDIR={small} exec {command}"
-    unshare = ["unshare", "--map-root-user", "--mount", "sh", "-c", script]
-    done = subprocess.run(unshare, capture_output=True, text=True, check=False)
+    done = run_command("unshare", "--map-root-user", "--mount", "sh", "-c", script)
     if done.returncode == 77 or "unshare" in done.stderr:
         pytest.skip("this machine forbids namespaces")
     message = f"bench: 3 MB are free in {small}, a unit needs 20: make room there or name another TMPDIR\n"
@@ -218,7 +190,6 @@ WRONG_WORDS = {
 
 @pytest.mark.parametrize("command, words", [(name, words) for name in WRONG_WORDS for words in WRONG_WORDS[name]])
 def test_other_command(command: str, words: str) -> None:
-    arguments = words.split(" ")
-    done = subprocess.run([ROOT / command, *arguments], capture_output=True, text=True, timeout=30, check=False)
+    done = run_command(ROOT / command, *words.split(" "))
     assert (done.returncode, done.stdout) == (2, ""), done.stderr
     assert done.stderr.count("\n") == 1, done.stderr

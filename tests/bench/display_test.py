@@ -2,19 +2,19 @@
 
 import os
 import re
-import subprocess
 import sys
 from pathlib import Path
 
 import pytest
 
 from tests.bench.terminal import Terminal
+from tests.commands import run_command
 
 COLOR = re.compile(r"\x1b\[[0-9;]*3[0-7][0-9;]*m")
 
 
 def check_summary(text: str) -> None:
-    summary = text[text.index("\nCommands\n"):]
+    summary = text[text.index("\nCommands\n") :]
     for line in (
         "Waits: 780 s in 2.6 s, 30 s in 0.2 s, 10 s in 0.2 s",
         "Outcome: updated",
@@ -69,8 +69,7 @@ def test_terminal_that_cannot_move_its_cursor(command: list[str], name: str) -> 
 
 
 def test_pipe(command: list[str]) -> None:
-    variables = os.environ | {"TERM": "xterm"}
-    done = subprocess.run(command, env=variables, capture_output=True, text=True, check=False)
+    done = run_command(*command, environment=os.environ | {"TERM": "xterm"})
     assert (done.returncode, done.stderr) == (0, "")
     check_summary(done.stdout)
     assert "\x1b" not in done.stdout

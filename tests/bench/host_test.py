@@ -12,6 +12,7 @@ import pytest
 
 from bench.real.unit import forbidden
 from bench.runner import CLEANUP
+from tests.commands import run_command
 
 ROOT = Path(__file__).parents[2]
 NO_UNIT = forbidden()
@@ -19,20 +20,15 @@ INSTRUMENT = ["/root/USB_MOUNT", "/root/RESOURCES", "/unzipUpgrade.sh", "/opt/be
 LONGEST_CLEARING = 60  # s
 
 
-def output(*command: str) -> str:
-    """What `command` prints."""
-    return subprocess.run(command, capture_output=True, text=True, check=False).stdout
-
-
 def machine(folder: str) -> dict[str, str]:
     """What a run with the temporary folder `folder` must leave unchanged on this machine."""
     return {
         "mounts": Path("/proc/self/mountinfo").read_text(),
-        "links": output("ip", "-brief", "link"),
-        "addresses": output("ip", "-brief", "address"),
-        "routes": output("ip", "route", "show", "table", "all"),
-        "control groups": output("find", "/sys/fs/cgroup", "-name", f"{Path(folder).name}-*"),
-        "package": output("grep", "-c", "^Package: solvik4", "/var/lib/dpkg/status"),
+        "links": run_command("ip", "-brief", "link").stdout,
+        "addresses": run_command("ip", "-brief", "address").stdout,
+        "routes": run_command("ip", "route", "show", "table", "all").stdout,
+        "control groups": run_command("find", "/sys/fs/cgroup", "-name", f"{Path(folder).name}-*").stdout,
+        "package": run_command("grep", "-c", "^Package: solvik4", "/var/lib/dpkg/status").stdout,
         "instrument": str([Path(path).exists() for path in INSTRUMENT if os.access("/root", os.X_OK)]),
         "users": Path("/etc/passwd").read_text(),
     }

@@ -2,7 +2,6 @@
 
 import os
 import re
-import subprocess
 import sys
 from collections.abc import Callable
 from dataclasses import replace
@@ -19,6 +18,7 @@ from bench.run_all import run_all
 from bench.runner import UnitMaker
 from bench.scenario import load
 from bench.unit import Files
+from tests.commands import run_command
 
 ROOT = Path(__file__).parents[2]
 BLUE, PASS = panel_module.FILLS["blue"], panel_module.FILLS["pass"]
@@ -58,17 +58,17 @@ class Elements(HTMLParser):
 def written(build: Path, tmp_path: Path) -> Written:
     """The page of a run of a scenario on stand-ins."""
 
-    def run(scenario: str) -> str:
+    def page_of(scenario: str) -> str:
         file = tmp_path / "page.html"
         words = ["--build", str(build), "--unit", "stand-in", "--speed", "2000", "--record", str(file), scenario]
-        command = [sys.executable, "-B", "-m", "bench", *words]
-        environment = os.environ | {"TMPDIR": str(tmp_path)}
-        done = subprocess.run(command, env=environment, capture_output=True, text=True, check=False)
+        done = run_command(
+            sys.executable, "-B", "-m", "bench", *words, environment=os.environ | {"TMPDIR": str(tmp_path)}
+        )
         assert file.exists(), done.stdout + done.stderr
         assert f"\nPage: {file}\n" in done.stdout
         return file.read_text(encoding="utf-8")
 
-    return run
+    return page_of
 
 
 def lit(*sent: tuple[float, int]) -> dict[int, list[tuple[float, float, int]]]:

@@ -1,12 +1,13 @@
 """Holds what each command prints with --json against docs/harl-updater-tool.schema.json."""
 
 import json
-import subprocess
 from collections.abc import Callable
 from pathlib import Path
 
 import jsonschema  # of Debian's python3-jsonschema
 import pytest
+
+from tests.commands import run_command
 
 ROOT = Path(__file__).parents[2]
 GOLDEN = ROOT / "tests/companion/golden/log"
@@ -37,14 +38,10 @@ Printed = Callable[[str], str]
 def printed(tool: Path) -> Printed:
     """What the tool prints for the words after its name."""
 
-    def run(words: str) -> str:
-        command = [str(tool), *words.split()]
-        done = subprocess.run(
-            command, cwd=GOLDEN, stdin=subprocess.DEVNULL, capture_output=True, timeout=60, check=False
-        )
-        return done.stdout.decode()
+    def print_for(words: str) -> str:
+        return run_command(tool, *words.split(), folder=GOLDEN).stdout
 
-    return run
+    return print_for
 
 
 def test_schema_is_one() -> None:

@@ -16,7 +16,7 @@ from bench.runner import run_on, temporary_folder
 from bench.standin.unit import StandInUnit
 from bench.unit import PROGRAMS
 from tests.commands import needs, output_of
-from tests.service.service_test import built_package
+from tests.service.service import built_package
 
 ROOT = Path(__file__).parents[2]
 COMPILER = "g++-12"

@@ -17,7 +17,7 @@ from bench.real.systemd import obstacle
 from tests.power_cut.cuts import Group, PowerCuts
 from tests.power_cut.disk import missing, own_mounts
 from tests.power_cut.unit import SITUATIONS
-from tests.service.service_test import built_package
+from tests.service.service import built_package
 
 JOBS = 2 * (os.cpu_count() or 1)  # a run waits for about half of its time
 UPDATES = {False: "the package and the board", True: "the package, the board and the updater itself"}

@@ -1,57 +1,45 @@
-"""Usage: power_cut_test.py BUILD_FOLDER [TEST...]
+"""A sample of what tests/power_cut/run checks, and a fault that it must detect, on the built package."""
 
-A sample of what tests/power_cut/run checks, and a fault that it must detect, on the built package in build/package/.
-"""
+from collections.abc import Iterator
+from pathlib import Path
 
-import unittest
+import pytest
 
 from bench.real.systemd import obstacle
-from tests.command_line import skip, take_path
 from tests.power_cut.cuts import Group, PowerCuts
 from tests.power_cut.disk import missing, own_mounts
-from tests.service.service_test import built_package
+from tests.service.service import built_package
 
 EVERY = 300  # images
 JOBS = 2
 
 
-class Sample(unittest.TestCase):
+@pytest.fixture(scope="module")
+def power_cuts(build: Path) -> Iterator[PowerCuts]:
     """An update of the package, the board and the updater itself."""
-
-    power_cuts: PowerCuts
-    groups: list[Group]
-
-    @classmethod
-    def setUpClass(cls) -> None:
-        cuts = cls.power_cuts.recording.cuts()[::EVERY]
-        cls.groups = cls.power_cuts.groups(cuts, JOBS)
-
-    def test_every_group_heals(self) -> None:
-        for group in self.power_cuts.judged(self.groups, JOBS):
-            with self.subTest(state=group.before.packages, cut=group.cut):
-                self.assertEqual(group.faults, [])
-
-    def test_service_without_its_repair_is_noticed(self) -> None:
-        broken = [group for group in self.groups if "reinstreq" in group.before.packages]
-        self.assertTrue(broken)
-        [judged] = self.power_cuts.judged(broken[:1], JOBS, repairs=False)
-        self.assertTrue(judged.faults)
-
-
-def main() -> None:
-    """Runs the tests of the program, as its usage says."""
-    programs = take_path()
     package = built_package("harl-updater")
     if not package:
-        skip("there is no package for this machine: packaging/build")
+        pytest.skip("there is no package for this machine: packaging/build")
     if reason := obstacle():
-        skip(f"this machine allows no machine of its own: {reason}")
+        pytest.skip(f"this machine allows no machine of its own: {reason}")
     if tools := missing():
-        skip(f"a disk cannot be recorded without {tools}")
+        pytest.skip(f"a disk cannot be recorded without {tools}")
     with own_mounts() as folder:
-        Sample.power_cuts = PowerCuts(folder, package, programs, upgrades_itself=True)
-        unittest.main(verbosity=2)
+        yield PowerCuts(folder, package, build, upgrades_itself=True)
 
 
-if __name__ == "__main__":
-    main()
+@pytest.fixture(scope="module")
+def groups(power_cuts: PowerCuts) -> list[Group]:
+    return power_cuts.groups(power_cuts.recording.cuts()[::EVERY], JOBS)
+
+
+def test_every_group_heals(power_cuts: PowerCuts, groups: list[Group]) -> None:
+    judged = power_cuts.judged(groups, JOBS)
+    assert [(group.before.packages, group.cut, group.faults) for group in judged if group.faults] == []
+
+
+def test_service_without_its_repair_is_noticed(power_cuts: PowerCuts, groups: list[Group]) -> None:
+    broken = [group for group in groups if "reinstreq" in group.before.packages]
+    assert broken
+    [judged] = power_cuts.judged(broken[:1], JOBS, repairs=False)
+    assert judged.faults

@@ -12,8 +12,7 @@ from bench.makers.packages import Package, build, raise_version, write_index
 from bench.makers.sticks import version_file_archive, write_stick
 from bench.outcomes import meaning_of
 from tests.power_cut.view import package_states
-from tests.service.hang_test import BOARD_TOOLS
-from tests.service.service_test import STICK, install, make_files, panel, states, wait_for
+from tests.service.service import BOARD_TOOLS, STICK, install, make_files, panel, states, wait_for
 
 PACKAGE, UPDATER = "solvik4-rh", "harl-updater"
 OLDER, NEWER = "1.2.0", "1.3.0"

@@ -9,6 +9,7 @@ import pytest
 
 from bench.outcomes import CHECK_FAILED, ENDED_EARLY, UP_TO_DATE, UPDATED, Outcome
 from bench.panel import COLOR_CODES, FIRST_LED, LAST_LED, Panel
+from tests.commands import run_command
 from tests.service.stand_in import ROOT, StandIn
 
 NAMESPACES = ["unshare", "--map-root-user", "--mount", "--pid", "--fork", "--kill-child", "--mount-proc"]
@@ -52,7 +53,7 @@ echo "$now.00 0.00" >"$UNIT/uptime"
 while pkill -PIPE -x "$AT_WORK"; do :; done
 """,
 }
-PROBE = subprocess.run([*NAMESPACES, "true"], capture_output=True, text=True, check=False)
+PROBE = run_command(*NAMESPACES, "true")
 pytestmark = pytest.mark.skipif(
     PROBE.returncode != 0, reason=f"this machine allows no process namespace: {PROBE.stderr.strip()}"
 )
@@ -98,9 +99,8 @@ class Unit(StandIn):
         """Runs it once the processes of the shell line `beside` are `at_work`, then `after`; returns its output."""
         waits = "".join(f"until pgrep -x {name} >/dev/null; do /usr/bin/sleep 0.01; done\n" for name in at_work)
         line = f'cd "$UNIT"\n{beside}\n{waits}./give-back; status=$?\n{after}\nexit $status'
-        command = [*NAMESPACES, "sh", "-c", line]
         self.environment["AT_WORK"] = " ".join(at_work)
-        done = subprocess.run(command, env=self.environment, capture_output=True, text=True, check=False, timeout=60)
+        done = run_command(*NAMESPACES, "sh", "-c", line, environment=self.environment)
         assert (done.stderr, done.returncode) == ("", status)
         return done.stdout
 

@@ -15,6 +15,7 @@ import pytest
 
 from bench.makers.files import write, write_script
 from bench.makers.i2cset import NEWER, OLDER
+from tests.commands import run_command
 from tests.mounts import separate_mounts
 
 ROOT = Path(__file__).parents[2]
@@ -255,23 +256,14 @@ class TestPassedOn:
         own = str(unit.folder / "bin")
         unit.environment["PATH"] = path.format(own=own, rest=unit.direct["PATH"])
         unit.tool("apt", 'echo "$PATH"; command -v systemctl ls')
-        done = subprocess.run(
-            [f"{own}/apt", "update"], env=unit.environment, capture_output=True, text=True, check=True
-        )
+        done = run_command(f"{own}/apt", "update", environment=unit.environment)
         assert f"{own}" not in done.stdout
         assert done.stdout.splitlines()[0] == unit.direct["PATH"]
 
     @pytest.mark.parametrize("path", ["{own}", "{own}:{own}/", "{own}/.:{own}"])
     def test_it_never_takes_itself_for_the_real_one(self, unit: Unit, path: str) -> None:
         own = str(unit.folder / "bin")
-        done = subprocess.run(
-            [f"{own}/apt", "install"],
-            env=unit.environment | {"PATH": path.format(own=own)},
-            capture_output=True,
-            text=True,
-            check=False,
-            timeout=10,
-        )
+        done = run_command(f"{own}/apt", "install", environment=unit.environment | {"PATH": path.format(own=own)})
         assert (done.returncode, done.stdout) == (127, "")
         assert unit.notes() == []  # not even once
 

@@ -1,19 +1,20 @@
-"""Usage: hang_test.py BUILD_FOLDER PACKAGE SYSTEM [TEST...]
-
-Lets every command of an update hang in every way, with the service of the built PACKAGE in a machine of its own (see
-service_test.py), with shortened limits, and a few with the shipped ones. Each time the instrument must come back, the
-panel must show the outcome of that failure, and the next run must end normally.
+"""Lets every command of an update hang in every way, with the service of the built package, with shortened limits, and
+a few with the shipped ones. Each time the instrument must come back, the panel must show the outcome of that failure,
+and the next run must end normally.
 """
 
 import json
 import time
-from collections.abc import Iterable
-from dataclasses import dataclass
+from collections.abc import Callable, Iterator
+from dataclasses import dataclass, field
 
+import pytest
+
+from bench.machine.machine import Machine
 from bench.makers.files import write, write_script
 from bench.makers.packages import Package, build, write_index
 from bench.outcomes import CHECK_FAILED, INSTALLATION_FAILED, UP_TO_DATE, UPDATED, Outcome
-from tests.service.service_test import ROOT, TOOLS, ServiceTest, main, shorten, wait_for
+from tests.service.service import BOARD_TOOLS, ROOT, TOOLS, Service, prepared, shorten, wait_for
 
 FROZEN = "/run/frozen"
 # What a hanging call does. The last one continues its work.
@@ -56,39 +57,38 @@ COMMANDS = {
     "start_of_the_application": Command("systemctl", "'start harl'", UPDATED),
     "stop_of_the_updater": Command("systemctl", "'stop harl-updater'", UPDATED),
 }
-BOARD_TOOLS = {
-    "scp": "exit 0",
-    "ssh": TOOLS["ssh"] + 'case $* in *unzipUpgrade*) echo 2.2.0 >/srv/board ;; esac',
-}
 
 
-class HangTest(ServiceTest):
-    """A unit with a package and a board to update."""
+@dataclass
+class Tally:
+    """What the cases of a class come to."""
 
-    passed = not_well = 0  # cases in which the panel passes, and passes over a unit that is not well
+    times: list[float] = field(default_factory=list)  # s, from the start to the application
+    passed: int = 0  # cases in which the panel passes
+    not_well: int = 0  # and of these, those over a unit that is not well
 
-    @classmethod
-    def tearDownClass(cls) -> None:
-        if cls.passed:
-            print(
-                f"{cls.__name__}: the panel passes in {cls.passed} cases, in {cls.not_well} of them over a unit that "
-                "is not well: the log says so each time"
-            )
 
-    def setUp(self) -> None:
-        super().setUp()
+class Hanging(Service):
+    """A unit with a package and a board to update, and commands that hang."""
+
+    def __init__(self, unit: Machine, package: str, tally: Tally) -> None:
+        super().__init__(unit, package)
+        self.tally = tally
+
+    def prepare(self) -> None:
+        super().prepare()
         self.restore_tools()
         self.set_speed(SPEED)
         self.use_hand_over("hand-over-short")
         self.inside("sh", "-c", "echo 2.1.0 >/srv/board")
         self.offer()
 
-    def tearDown(self) -> None:
+    def clear(self) -> None:
         self.restore_tools()
         # A hanging process is still in the updater's control group, and stays there if it is uninterruptible.
         self.unit.status("sh", "-c", "kill -9 $(cat /run/frozen.pid); umount -l /run/frozen; rm /run/frozen.pid")
         self.unit.status("pkill", "--signal", "KILL", "--full", "sleep 600")
-        super().tearDown()
+        super().clear()
 
     def restore_tools(self) -> None:
         """No tool hangs any more."""
@@ -118,7 +118,7 @@ class HangTest(ServiceTest):
         self.inside("sh", "-c", line)
         wait_for("the frozen mount", lambda: self.read("/run/frozen.log") != "")
         if self.read("/run/frozen.log") != "mounted\n":
-            self.skipTest(self.read("/run/frozen.log"))
+            pytest.skip(self.read("/run/frozen.log"))
 
     def run_to_the_end(self, longest: float = LONGEST) -> float:
         """One run; how long it takes until the application is active for good (s)."""
@@ -136,13 +136,13 @@ class HangTest(ServiceTest):
         self.restore_tools()
         self.unit.status("systemctl", "reset-failed")
         done = self.package_state().endswith("1.3.0") and self.read("/srv/board") == "2.2.0\n"
-        self.assertNotEqual(self.unit.status("grep", "-q", " /root/USB_MOUNT ", "/proc/mounts"), 0)
+        assert self.unit.status("grep", "-q", " /root/USB_MOUNT ", "/proc/mounts") != 0
         self.inside("mount", "-t", "tmpfs", "stick", "/root/USB_MOUNT")
         self.fill_stick()
         self.run_to_the_end()
-        self.assertEqual(self.panel(), (UP_TO_DATE if done else UPDATED).panel)
-        self.assertEqual(self.ended_as(), ("success", "2", "15"))
-        self.assertEqual(self.package_state(), "install ok installed 1.3.0")
+        assert self.panel() == (UP_TO_DATE if done else UPDATED).panel
+        assert self.ended_as() == ("success", "2", "15")
+        assert self.package_state() == "install ok installed 1.3.0"
 
     def check_log(self) -> None:
         """The panel passes: the log says that the unit is not well if it is not, and only then."""
@@ -152,88 +152,23 @@ class HangTest(ServiceTest):
         log = self.inside("sh", "-c", "harl-updater-tool log --journal --last --json; echo $?")
         said, status = log.rstrip().rsplit("\n", 1)
         meaning = json.loads(said)["runs"][0]["meaning"]
-        self.assertEqual("not well" in meaning, not well, meaning)
-        self.assertTrue(well or status == "1", f"status {status}: {meaning}")
-        type(self).passed += 1
-        type(self).not_well += not well
+        assert ("not well" in meaning) == (not well), meaning
+        assert well or status == "1", f"status {status}: {meaning}"
+        self.tally.passed += 1
+        self.tally.not_well += not well
 
     def check(self, command: Command, how: str) -> None:
-        """One case of the matrix."""
+        """A command that hangs, and the run after it."""
         outcome = UPDATED if how == KINDS["leaves_its_output_open"] else command.outcome
         if how == KINDS["is_uninterruptible"]:
             self.freeze()
         self.hang(command.tool, command.arguments, how, command.once)
-        took = self.run_to_the_end()
-        print(f"{took:.0f} s ", end="", flush=True)
+        self.tally.times.append(self.run_to_the_end())
         lost = command.once and how != KINDS["leaves_its_output_open"]  # one byte of a pair
-        self.assertEqual(self.panel(faults=lost), outcome.panel)
-        self.assertEqual(self.unit.status("systemctl", "is-active", "--quiet", "harl"), 0)
+        assert self.panel(faults=lost) == outcome.panel
+        assert self.unit.status("systemctl", "is-active", "--quiet", "harl") == 0
         if outcome == UPDATED:
             self.check_log()
-        self.check_next_run()
-
-
-class Matrix(HangTest):
-    """Each command hanging in each way; the tests are made below."""
-
-
-class ShippedLimits(HangTest):
-    """One command hanging in each way, with the limits that are shipped; the tests are made below."""
-
-    def setUp(self) -> None:
-        super().setUp()
-        self.use_hand_over("hand-over")
-
-
-def add_cases(tests: type[HangTest], commands: Iterable[str]) -> None:
-    """One test for each command and each way to hang."""
-    for name in commands:
-        for kind, how in KINDS.items():
-
-            def case(self: HangTest, command: Command = COMMANDS[name], how: str = how) -> None:
-                self.check(command, how)
-
-            setattr(tests, f"test_{name}_{kind}", case)
-
-
-class Others(HangTest):
-    """Hangs outside the commands."""
-
-    def test_maintainer_script(self) -> None:
-        self.offer("sleep 600")
-        self.run_to_the_end()
-        self.assertEqual(self.panel(), INSTALLATION_FAILED.panel)
-        # The package stays half-configured, and its script hangs again before each later run.
-        self.mount_stick()
-        self.run_to_the_end()
-        self.assertIn("prepare: solvik4-rh cannot be finished", self.journal())
-        self.assertEqual(self.panel(), INSTALLATION_FAILED.panel)
-        # Another version ends this.
-        build(Package("solvik4-rh", "1.4.0"), self.repository)
-        write_index(self.repository)
-        self.mount_stick()
-        self.run_to_the_end()
-        self.assertEqual(self.package_state(), "install ok installed 1.4.0")
-
-    def test_everything_on_the_panel(self) -> None:
-        self.hang("i2cset", "*", KINDS["never_ends"])
-        self.run_to_the_end()
-        self.assertIn("hand-over: panel: 3 s are used up; further calls fail at once", self.journal())
-        self.check_next_run()
-
-    def test_all_of_systemctl(self) -> None:
-        # Then not even give-back can start the application: the service manager does.
-        self.inside("sh", "-c", "systemctl stop harl")
-        self.hang("systemctl", "*harl*", KINDS["never_ends"])
-        self.run_to_the_end()
-        self.assertEqual(self.panel(), UPDATED.panel)
-
-    def test_stick_that_hangs_itself(self) -> None:
-        self.unit.status("umount", "/root/USB_MOUNT")
-        self.freeze()
-        self.inside("mount", "--bind", FROZEN, "/root/USB_MOUNT")
-        self.run_to_the_end()
-        self.assertEqual(self.panel(), CHECK_FAILED.panel)
         self.check_next_run()
 
     def mount_stick(self) -> None:
@@ -241,14 +176,6 @@ class Others(HangTest):
         self.inside("mount", "-t", "tmpfs", "stick", "/root/USB_MOUNT")
         self.fill_stick()
         self.unit.status("systemctl", "reset-failed")
-
-
-class Rescuer(HangTest):
-    """give-back is killed, hangs or cannot be run."""
-
-    def setUp(self) -> None:
-        super().setUp()
-        shorten(self.unit, outcome_time=4)
 
     def crash(self) -> None:
         """Ends the updater early, in the wait of the board."""
@@ -265,74 +192,149 @@ class Rescuer(HangTest):
         """The application is active, and the stick released."""
         wait_for("harl", lambda: self.unit.status("systemctl", "is-active", "--quiet", "harl") == 0, longest)
         wait_for("end", lambda: self.states() <= {"inactive", "failed"}, longest)
-        self.assertEqual(self.unit.status("systemctl", "is-active", "--quiet", "harl"), 0)
+        assert self.unit.status("systemctl", "is-active", "--quiet", "harl") == 0
 
     def kill_at(self, tool: str, arguments: str, signal: str = "KILL") -> None:
         """Kills give-back while it calls the tool."""
         self.hang(tool, arguments, f"{KILL_GIVE_BACK.format(signal)}; sleep 1", once=True)
         self.crash()
         self.assert_given_back_at_last()
-        self.assertTrue((self.unit.root() / "run/hung").exists(), "give-back was not killed")
-        self.assertNotEqual(self.unit.status("grep", "-q", " /root/USB_MOUNT ", "/proc/mounts"), 0)
+        assert (self.unit.root() / "run/hung").exists(), "give-back was not killed"
+        assert self.unit.status("grep", "-q", " /root/USB_MOUNT ", "/proc/mounts") != 0
 
-    def test_killed_before_its_first_step(self) -> None:
-        self.kill_at("systemctl", "*ActiveState*harl-updater")
 
-    def test_killed_while_it_shows_the_outcome(self) -> None:
+@pytest.fixture(scope="class")
+def tally(request: pytest.FixtureRequest, tell: Callable[[str], None]) -> Iterator[Tally]:
+    tally = Tally()
+    yield tally
+    if tally.times:
+        tell(
+            f"{request.node.name}: the application is back {min(tally.times):.0f} to {max(tally.times):.0f} s after "
+            f"the start; the panel passes in {tally.passed} of {len(tally.times)} cases, in {tally.not_well} of them "
+            "over a unit that is not well: the log says so each time"
+        )
+
+
+@pytest.fixture
+def service(unit: Machine, package: str, tally: Tally) -> Iterator[Hanging]:
+    yield from prepared(Hanging(unit, package, tally))
+
+
+class TestMatrix:
+    """Each command hanging in each way."""
+
+    @pytest.mark.parametrize("kind", KINDS)
+    @pytest.mark.parametrize("command", COMMANDS)
+    def test_hangs(self, service: Hanging, command: str, kind: str) -> None:
+        service.check(COMMANDS[command], KINDS[kind])
+
+
+class TestShippedLimits:
+    """One command hanging in each way, with the limits that are shipped."""
+
+    @pytest.mark.parametrize("kind", KINDS)
+    def test_hangs(self, service: Hanging, kind: str) -> None:
+        service.use_hand_over("hand-over")
+        service.check(COMMANDS["colour_of_the_outcome"], KINDS[kind])
+
+
+class TestOthers:
+    """Hangs outside the commands."""
+
+    def test_maintainer_script(self, service: Hanging) -> None:
+        service.offer("sleep 600")
+        service.run_to_the_end()
+        assert service.panel() == INSTALLATION_FAILED.panel
+        # The package stays half-configured, and its script hangs again before each later run.
+        service.mount_stick()
+        service.run_to_the_end()
+        assert "prepare: solvik4-rh cannot be finished" in service.journal()
+        assert service.panel() == INSTALLATION_FAILED.panel
+        # Another version ends this.
+        build(Package("solvik4-rh", "1.4.0"), service.repository)
+        write_index(service.repository)
+        service.mount_stick()
+        service.run_to_the_end()
+        assert service.package_state() == "install ok installed 1.4.0"
+
+    def test_everything_on_the_panel(self, service: Hanging) -> None:
+        service.hang("i2cset", "*", KINDS["never_ends"])
+        service.run_to_the_end()
+        assert "hand-over: panel: 3 s are used up; further calls fail at once" in service.journal()
+        service.check_next_run()
+
+    def test_all_of_systemctl(self, service: Hanging) -> None:
+        # Then not even give-back can start the application: the service manager does.
+        service.inside("sh", "-c", "systemctl stop harl")
+        service.hang("systemctl", "*harl*", KINDS["never_ends"])
+        service.run_to_the_end()
+        assert service.panel() == UPDATED.panel
+
+    def test_stick_that_hangs_itself(self, service: Hanging) -> None:
+        service.unit.status("umount", "/root/USB_MOUNT")
+        service.freeze()
+        service.inside("mount", "--bind", FROZEN, "/root/USB_MOUNT")
+        service.run_to_the_end()
+        assert service.panel() == CHECK_FAILED.panel
+        service.check_next_run()
+
+
+class TestRescuer:
+    """give-back is killed, hangs or cannot be run."""
+
+    @pytest.fixture
+    def service(self, service: Hanging) -> Hanging:
+        shorten(service.unit, outcome_time=4)
+        return service
+
+    def test_killed_before_its_first_step(self, service: Hanging) -> None:
+        service.kill_at("systemctl", "*ActiveState*harl-updater")
+
+    def test_killed_while_it_shows_the_outcome(self, service: Hanging) -> None:
         kill = f"touch /run/hung; {KILL_GIVE_BACK.format('KILL')}; sleep 0.7"
-        self.hang("i2cset", "*' 0x14 c'", f"[ ! -d /run/harl-updater/give-back ] || [ -e /run/hung ] || {{ {kill}; }}")
-        self.crash()
-        self.assert_given_back_at_last()
-        self.assertTrue((self.unit.root() / "run/hung").exists(), "give-back was not killed")
+        service.hang(
+            "i2cset", "*' 0x14 c'", f"[ ! -d /run/harl-updater/give-back ] || [ -e /run/hung ] || {{ {kill}; }}"
+        )
+        service.crash()
+        service.assert_given_back_at_last()
+        assert (service.unit.root() / "run/hung").exists(), "give-back was not killed"
         # After the interrupted pair, the controller gets one byte that it does not understand.
-        self.assertEqual(self.panel(faults=True), INSTALLATION_FAILED.panel)
+        assert service.panel(faults=True) == INSTALLATION_FAILED.panel
 
-    def test_killed_while_it_releases_the_stick(self) -> None:
-        self.kill_at("umount", "/root/USB_MOUNT")
+    def test_killed_while_it_releases_the_stick(self, service: Hanging) -> None:
+        service.kill_at("umount", "/root/USB_MOUNT")
 
-    def test_stopped_while_it_releases_the_stick(self) -> None:
-        self.kill_at("umount", "/root/USB_MOUNT", "TERM")
+    def test_stopped_while_it_releases_the_stick(self, service: Hanging) -> None:
+        service.kill_at("umount", "/root/USB_MOUNT", "TERM")
 
-    def test_killed_while_it_starts_the_application(self) -> None:
-        self.kill_at("systemctl", "*no-block*harl")
+    def test_killed_while_it_starts_the_application(self, service: Hanging) -> None:
+        service.kill_at("systemctl", "*no-block*harl")
 
-    def test_killed_again_and_again(self) -> None:
-        self.crash()
+    def test_killed_again_and_again(self, service: Hanging) -> None:
+        service.crash()
         for _ in range(8):
-            wait_for("give-back", lambda: self.main_of_give_back() != 0 or "failed" in self.states(), 20)
-            if process := self.main_of_give_back():
-                self.unit.status("kill", "-s", "KILL", str(process))
-        self.assert_given_back_at_last()
+            wait_for("give-back", lambda: service.main_of_give_back() != 0 or "failed" in service.states(), 20)
+            if process := service.main_of_give_back():
+                service.unit.status("kill", "-s", "KILL", str(process))
+        service.assert_given_back_at_last()
 
-    def test_program_that_cannot_be_run(self) -> None:
-        self.inside("mv", "/usr/lib/harl-updater/give-back", "/srv/give-back")
-        self.addCleanup(self.inside, "mv", "/srv/give-back", "/usr/lib/harl-updater/give-back")
-        self.crash()
-        self.assert_given_back_at_last()
+    def test_program_that_cannot_be_run(self, service: Hanging) -> None:
+        service.inside("mv", "/usr/lib/harl-updater/give-back", "/srv/give-back")
+        service.later.callback(service.inside, "mv", "/srv/give-back", "/usr/lib/harl-updater/give-back")
+        service.crash()
+        service.assert_given_back_at_last()
 
-    def test_its_start_fails(self) -> None:
-        # Neither a crash nor a stop may depend on the command that starts give-back.
-        drop_in = self.unit.root() / "etc/systemd/system/harl-updater.service.d/start.conf"
-        for command in ("/bin/false", "/bin/sh -c 'kill -9 $$$$'", "/bin/sleep 600"):
-            with self.subTest(command=command):
-                write(drop_in, f"[Service]\nExecStopPost=\nExecStopPost={command}\nTimeoutStopSec=3\n")
-                self.addCleanup(drop_in.unlink, True)
-                self.crash()
-                self.assert_given_back_at_last()
-                self.setUp()
+    # Neither a crash nor a stop may depend on the command that starts give-back.
+    @pytest.mark.parametrize("command", ["/bin/false", "/bin/sh -c 'kill -9 $$$$'", "/bin/sleep 600"])
+    def test_its_start_fails(self, service: Hanging, command: str) -> None:
+        text = f"[Service]\nExecStopPost=\nExecStopPost={command}\nTimeoutStopSec=3\n"
+        service.put("etc/systemd/system/harl-updater.service.d/start.conf", text)
+        service.crash()
+        service.assert_given_back_at_last()
 
-    def test_every_tool_of_its_own_hangs(self) -> None:
-        for tool in ("i2cset", "umount", "systemctl", "journalctl"):
-            with self.subTest(tool=tool):
-                self.crash()
-                wait_for("end of the updater", lambda: self.show("ActiveState") not in ("active", "activating"))
-                self.hang(tool, "*", KINDS["ignores_the_request_to_end"])
-                self.assert_given_back_at_last()
-                self.tearDown()
-                self.setUp()
-
-
-if __name__ == "__main__":
-    add_cases(Matrix, COMMANDS)
-    add_cases(ShippedLimits, ["colour_of_the_outcome"])
-    main()
+    @pytest.mark.parametrize("tool", ["i2cset", "umount", "systemctl", "journalctl"])
+    def test_every_tool_of_its_own_hangs(self, service: Hanging, tool: str) -> None:
+        service.crash()
+        wait_for("end of the updater", lambda: service.show("ActiveState") not in ("active", "activating"))
+        service.hang(tool, "*", KINDS["ignores_the_request_to_end"])
+        service.assert_given_back_at_last()

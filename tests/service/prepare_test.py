@@ -1,10 +1,11 @@
 """prepare, which runs before the updater, on stand-in tools."""
 
 import re
-import subprocess
 from pathlib import Path
 
 import pytest
+
+from tests.commands import run_command
 
 from tests.service.stand_in import StandIn
 
@@ -56,15 +57,7 @@ class Unit(StandIn):
 
     def prepare(self, status: int = 0) -> str:
         """Runs it; returns its output."""
-        done = subprocess.run(
-            [self.folder / "prepare"],
-            env=self.environment,
-            stdin=subprocess.DEVNULL,
-            capture_output=True,
-            text=True,
-            check=False,
-            timeout=60,
-        )
+        done = run_command(self.folder / "prepare", environment=self.environment)
         assert (done.stderr, done.returncode) == ("", status)
         return done.stdout
 

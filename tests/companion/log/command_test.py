@@ -20,6 +20,7 @@ from typing import IO, Any
 import pytest
 
 from bench import scenario
+from bench.makers.files import write_script
 
 ROOT = Path(__file__).resolve().parents[3]
 GOLDEN = ROOT / "tests/companion/golden/log"
@@ -40,11 +41,8 @@ class LogTool:
 
     def program(self, name: str, script: str) -> str:
         """Makes an executable in a folder of its own; returns that folder."""
-        file = self.folder / "bin" / name
-        file.parent.mkdir(exist_ok=True)
-        file.write_text(f"#!/bin/sh\n{script}")
-        file.chmod(0o755)
-        return str(file.parent)
+        write_script(self.folder / "bin" / name, script)
+        return str(self.folder / "bin")
 
     def refused(self, *arguments: str, text: bytes = b"", **options: Any) -> str:
         """Its one line about bad input."""
@@ -163,7 +161,7 @@ def test_status_tells_whether_the_last_run_went_well(log_tool: LogTool) -> None:
 
 
 # The panel passes over units that are not well: the log says so of each.
-def test_log_names_what_the_panel_passes_over(log_tool: LogTool) -> None:
+def test_log_names_what_the_panel_passes_over(log_tool: LogTool, tell: Callable[[str], None]) -> None:
     record = b"verify: the unit is not well: package-version\n"  # by the service, of each such unit
     passed, named, left_open = 0, 0, []
     for name in REMOTE:
@@ -187,7 +185,7 @@ def test_log_names_what_the_panel_passes_over(log_tool: LogTool) -> None:
         done = log_tool.run("--json", text=log + record)
         assert done.returncode == 1
         assert "not well: package-version" in json.loads(done.stdout)["runs"][0]["meaning"]
-    print(
+    tell(
         f"the panel passes in {passed} scenarios, in {named + len(left_open)} of them over a unit that is not "
         f"well: the log names what is wrong in {named}; left open: {left_open}, by the verification's record"
     )
@@ -210,10 +208,8 @@ def test_only_the_feedback_is_left(log_tool: LogTool) -> None:
 
 
 def test_each_record_alone(log_tool: LogTool) -> None:
-    log = (GOLDEN / "journal-short-board-disk-full.log").read_bytes()
-    lines = log.splitlines(keepends=True)
-    for name in ("panel-absent", "services-killed", "main-head-all", "upload-not-waited-for"):
-        lines += (GOLDEN / f"{name}.log").read_bytes().splitlines(keepends=True)
+    names = "journal-short-board-disk-full panel-absent services-killed main-head-all upload-not-waited-for"
+    lines = [line for name in names.split() for line in golden_lines(name)]
     alone = {lines[index] + lines[index + 1] for index in range(len(lines) - 1) if b"Updater |" in lines[index]}
     kinds = {line[line.index(b"(") :] if b"(" in line else line: line for line in alone}
     for piece in kinds.values():
@@ -298,9 +294,8 @@ def test_page_in_the_place_of_the_log_is_refused(log_tool: LogTool) -> None:
     for page in (log, log_tool.folder / "same"):
         assert "the log itself; name another file" in log_tool.refused("--html", str(page), str(log))
     with log.open("rb") as stream:
-        done = subprocess.run(
-            [log_tool.tool, "log", "--html", str(log)], stdin=stream, capture_output=True, check=False
-        )
+        command = [log_tool.tool, "log", "--html", str(log)]
+        done = subprocess.run(command, stdin=stream, capture_output=True, check=False)
     assert done.returncode == 2
     for page in (log_tool.folder / "link", log_tool.folder):
         assert "not a plain file; name another" in log_tool.refused("--html", str(page), str(log))
@@ -580,19 +575,12 @@ def test_too_little_memory_is_told(log_tool: LogTool) -> None:
 
 
 @pytest.mark.parametrize(
-    "words",
-    [
-        "--help",
-        "log up-to-date.log",
-        "log --json up-to-date.log",
-        "log --follow up-to-date.log",
-        "stick FOLDER",
-        "stick --json FOLDER",
-    ],
+    "words", ["--help", "log LOG", "log --json LOG", "log --follow LOG", "stick FOLDER", "stick --json FOLDER"]
 )
 def test_full_disk_is_told(log_tool: LogTool, words: str) -> None:
-    command = [log_tool.tool, *words.replace("FOLDER", str(log_tool.folder)).split()]
+    words = words.replace("LOG", "up-to-date.log").replace("FOLDER", str(log_tool.folder))
     with open("/dev/full", "wb") as full:
+        command = [log_tool.tool, *words.split()]
         done = subprocess.run(command, cwd=GOLDEN, stdout=full, stderr=subprocess.PIPE, timeout=60, check=False)
     assert done.returncode == 2
     said = rb"^harl-updater-tool: the output cannot be written: No space left on device\. .*\n$"

@@ -14,7 +14,7 @@ import pytest
 from bench.makers.files import write_script
 from bench.makers.keys import make_key
 from bench.makers.sticks import VERSIONS, zip_archive
-from tests.commands import needs, output_of
+from tests.commands import needs, output_of, run_command
 
 ROOT = Path(__file__).parents[3]
 SCRIPT = "#!/bin/sh\nunzip -o root/OSUpgrade.zip\n"
@@ -82,13 +82,8 @@ class Stick:
         """What the service's verification alone prints, its errors and its status, with tools of these lines."""
         for name, lines in tools.items():
             write_script(self.folder / "bin" / name, lines)
-        done = subprocess.run(
-            [ROOT / "service/verify-stick", self.root, self.keyring],
-            env={"PATH": f"{self.folder}/bin:{os.environ['PATH']}"},
-            capture_output=True,
-            text=True,
-            check=False,
-        )
+        path = f"{self.folder}/bin:{os.environ['PATH']}"
+        done = run_command(ROOT / "service/verify-stick", self.root, self.keyring, environment={"PATH": path})
         return done.stdout, done.stderr, done.returncode
 
 

@@ -8,6 +8,8 @@ from typing import Any
 
 import pytest
 
+from tests.mounts import separate_mounts
+
 SKIPPED = 77  # cmake/python_test.cmake
 ROOT = Path(__file__).parents[1]
 
@@ -58,6 +60,15 @@ def tell() -> Callable[[str], None]:
 def pytest_terminal_summary(terminalreporter: Any) -> None:
     for line in LINES:
         terminalreporter.write_line(line)
+
+
+@pytest.fixture
+def own_mounts() -> None:
+    """What the test mounts is not seen by the rest of the machine. Skips the test where that is not allowed."""
+    try:
+        separate_mounts()
+    except OSError as error:
+        pytest.skip(str(error))
 
 
 @pytest.fixture

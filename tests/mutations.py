@@ -408,6 +408,7 @@ class Tree:
         nothing = subprocess.DEVNULL
         end = time.monotonic() + limit
         with tempfile.TemporaryDirectory(prefix="mutation-", ignore_cleanup_errors=True) as scratch:
+            os.chmod(scratch, 0o755)  # some tests act as another user
             test = subprocess.Popen(
                 [*self.namespace, "sh", "-c", f"{check.command}; exit $?"],
                 cwd=self.folder,

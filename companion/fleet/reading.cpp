@@ -253,11 +253,13 @@ Inputs inputsOf(const std::vector<std::string>& paths, nlohmann::ordered_json& u
 {
     Inputs inputs;
     const auto add = [&](const std::string& path) {
-        std::size_t end = path.size();
+        std::size_t at = path.size();
+        std::size_t end = at;
         if (kindOf(path) == Kind::JOURNAL) {
-            end = std::min({end, path.find('@', path.rfind('/') + 1), path.rfind('.')});
+            at = path.find('@', path.rfind('/') + 1);
+            end = std::min(at, path.rfind('.'));
         }
-        inputs[path.substr(0, end)].insert({path[end] != '@', path});
+        inputs[path.substr(0, end)].insert({at != end, path});
     };
     for (const std::string& path : paths) {
         std::error_code error;

@@ -164,11 +164,10 @@ int runCheck(const std::string& path, bool json, const UnitSite& site, std::ostr
 
 int runVerify(const VerifyOptions& options, const UnitSite& site, std::ostream& out)
 {
-    const auto nextRunHasBegun = [&] { return options.record && Unit(site).updaterRuns(); }; // its end is verified
-    if (nextRunHasBegun()) {
-        return Report::STATUS_UNCHECKED;
-    }
     const Unit unit(site);
+    if (options.record && unit.updaterRuns()) {
+        return Report::STATUS_UNCHECKED; // the next run has begun; its end is verified
+    }
     Report report("verify", "The unit", "well");
     unit.defineTexts(report);
     const std::string state = unit.property("harl", "ActiveState");
@@ -181,8 +180,8 @@ int runVerify(const VerifyOptions& options, const UnitSite& site, std::ostream& 
     checkVersions(unit, report);
     if (!options.record) {
         report.write(options.json, out);
-    } else if (nextRunHasBegun()) {
-        return Report::STATUS_UNCHECKED;
+    } else if (Unit(site).updaterRuns()) {
+        return Report::STATUS_UNCHECKED; // it has begun meanwhile
     } else {
         out << recordOf(report) << '\n';
     }

@@ -21,9 +21,9 @@ struct FleetRun
     std::string meaning;
     std::string failure;              ///< the name of what decided a bad outcome; empty for nothing
     std::vector<std::string> besides; ///< names of what else went wrong
-    std::string
-        package; ///< with its version after the run, or "not known"; until finish() empty where the log does not tell
-    std::string board; ///< likewise its version
+    // Until finish(), these two are empty where the log does not tell; then "not known", if no run before told.
+    std::string package; ///< with its version after the run
+    std::string board;   ///< its version
 };
 
 struct FleetUnit

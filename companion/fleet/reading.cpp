@@ -28,8 +28,8 @@ const std::size_t blockSize = std::size_t{256} * 1024; // bytes
 
 enum class Kind { TEXT, JOURNAL, ARCHIVE };
 
-/// What is read one after the other: a file, or those of a journal. Behind the name, one that is full has "@" and a
-/// number, and the one that still grows, which comes last, has nothing.
+/// What is read one after the other: a file, or those of a journal. A full one has "@" and a number after its name; the
+/// one that still grows, which comes last, has nothing there.
 using Files = std::set<std::pair<bool, std::string>>;
 using Inputs = std::map<std::string, Files>; ///< by name
 

@@ -212,7 +212,7 @@ CPP = Language(
     re.compile("//.*"),
     ("//", "#", "namespace", "using", "__attribute__"),
     re.compile(r"(?!using|return;|break;|#|//|static_assert|friend|public|private|[}\]]).*;(\s*//.*)?"),
-    re.compile(r"(static )?(const )?(std::)?(string|bool|int|int32_t|Color|Led) \w+( = [\w.-]+)?;"),
+    re.compile(r"(static )?(const )?(std::)?(string|bool|int|int32_t|int64_t|size_t|Color|Led) \w+( = [\w.-]+)?;"),
     r"[;{}:]",
     "",
 )

@@ -213,7 +213,7 @@ void addGaps(Run& run)
     add(run.beginningMissing, "beginning");
     add(run.ended == RunEnd::NOT_SEEN, "end");
     add(run.outcome == Outcome::PASSED, run.mainHead ? "offer" : "outcome");
-    add(run.tornRecords > 0, "torn-records");
+    add(run.torn.records > 0, "torn-records");
     add(run.stepsLeftOut > 0, "steps-left-out");
     add(run.clockJumps > 0, "clock");
     add(run.statusesLost, "statuses");

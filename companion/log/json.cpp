@@ -107,7 +107,7 @@ nlohmann::ordered_json runToJson(const Run& run, const std::string& source)
             {"besides", besides},
             {"unit_after_run", run.service.unit.empty() ? Json() : Json(run.service.unit)},
             {"service_manager_said", linesToJson(run.service.lines)},
-            {"torn_records", run.tornRecords},
+            {"torn_records", run.torn.records},
             {"other_lines", run.otherLines},
             {"cannot_tell", gapTexts(run)}};
 }

@@ -14,8 +14,7 @@ const std::size_t mostActions = 32;     // of a step; an upload has 20 attempts
 const std::size_t longestText = 400;    // bytes kept of a text
 const std::size_t mostLinesAtEnds = 10; // of other programs: the first and the last
 const std::int64_t longestGap = 86400;  // s between two records
-const std::string mainPackage = packageOf(true);
-const std::int64_t mostDelay = 60; // s by which a wait may end late
+const std::int64_t mostDelay = 60;      // s by which a wait may end late
 
 /// A version check's result, and what stands between the two versions.
 struct VersionEvent
@@ -77,11 +76,10 @@ void splitVersions(std::string_view text, std::string_view separator, Versions& 
 /// True for a panel command that lights an outcome: not off, not the blue of the flashing.
 bool lightsOutcome(std::string_view command)
 {
-    const auto ends = [&](LedManager::Color color) {
-        const std::string end = " 0x" + std::to_string(color) + " c";
-        return command.size() >= end.size() && command.substr(command.size() - end.size()) == end;
+    const auto lights = [&](LedManager::Color color) {
+        return contains(command, " 0x" + std::to_string(color) + " c");
     };
-    return ends(LedManager::COLOR_PASS) || ends(LedManager::COLOR_FAIL);
+    return lights(LedManager::COLOR_PASS) || lights(LedManager::COLOR_FAIL);
 }
 
 /// True for a step whose result is its one command's exit code.
@@ -105,18 +103,17 @@ StepResult resultWithoutRecord(Step& step, StepKind next)
                                                                                       : StepResult::UNTOLD;
     }
     if (step.kind == StepKind::GIVE_BACK) {
-        if (step.actions.size() > 1 && step.actions[1].status) {
+        if (step.actions.size() > 2) { // both have ended
             const bool mounted = resultOf(step.actions[0].status) == StepResult::FAILED;
             return mounted ? StepResult::FAILED : resultOf(step.actions[1].status);
         }
-        if (!step.actions.empty()) {
-            step.actions[0].status.reset(); // one of two numbers, and no telling which
-        }
-        return StepResult::UNTOLD;
+        step.actions[0].status.reset(); // one of two numbers, and no telling which
     }
     const bool waited = !step.actions.empty() && *step.actions.back().command == '\0';
-    const bool silent = step.kind == StepKind::START || step.kind == StepKind::SHOW_OUTCOME;
-    return waited || silent ? StepResult::DONE : isOneCommand(step.kind) ? resultOf(step.status) : StepResult::UNTOLD;
+    if (waited || step.kind == StepKind::START || step.kind == StepKind::SHOW_OUTCOME) {
+        return StepResult::DONE;
+    }
+    return isOneCommand(step.kind) ? resultOf(step.status) : StepResult::UNTOLD;
 }
 
 Outcome mainHeadOutcome(const Run& run)
@@ -155,24 +152,18 @@ Outcome remoteHeadOutcome(const Run& run)
         return same && run.board.state != Versions::State::UNKNOWN ? Outcome::NO_UPDATE : Outcome::PASSED;
     }
     // What was reported is not in the log; the checks may decide it.
-    const Step* script = run.find(StepKind::RUN_BOARD_SCRIPT);
-    const bool boardDone = run.board.state == Versions::State::SAME || script != nullptr;
-    if (same && run.board.state == Versions::State::NOT_READ) {
-        return Outcome::NO_UPDATE;
-    }
-    if (run.markerRemoved || script != nullptr) {
+    if (run.markerRemoved || run.find(StepKind::RUN_BOARD_SCRIPT) != nullptr) {
         return Outcome::UPDATED;
     }
-    if (same && boardDone) {
-        return Outcome::NO_UPDATE;
-    }
     const Step* install = run.find(StepKind::INSTALL_PACKAGE);
-    if (install == nullptr || install->result != StepResult::DONE) {
-        return Outcome::NONE;
+    const bool installed = install != nullptr && install->result == StepResult::DONE;
+    if (run.board.state == Versions::State::SAME) {
+        return same ? Outcome::NO_UPDATE : installed ? Outcome::UPDATED : Outcome::NONE;
     }
-    return boardDone                                      ? Outcome::UPDATED
-           : run.board.state == Versions::State::NOT_READ ? Outcome::CHECK_FAILED
-                                                          : Outcome::NONE;
+    if (run.board.state == Versions::State::NOT_READ) {
+        return same ? Outcome::NO_UPDATE : installed ? Outcome::CHECK_FAILED : Outcome::NONE;
+    }
+    return Outcome::NONE;
 }
 
 Outcome outcomeOf(const Run& run)
@@ -245,8 +236,7 @@ const Step* Run::stepOf(const Problem& problem) const
 
 bool Run::isDecided() const
 {
-    return resultReported || errorReported || ended == RunEnd::BY_ITSELF ||
-           (!steps.empty() && steps.back().kind >= StepKind::SHOW_OUTCOME);
+    return ended == RunEnd::BY_ITSELF || (!steps.empty() && steps.back().kind >= StepKind::SHOW_OUTCOME);
 }
 
 bool isFailure(Outcome outcome)
@@ -266,15 +256,15 @@ void RunBuilder::record(const ParsedRecord& record)
     const bool otherSource = std::exchange(mSourceEnded, false) && mThread != record.thread;
     mThread = record.thread;
     if (!mRun || otherSource || beginsRun(meaning, record.message.has_value())) {
-        beginRun(record);
+        beginRun(record.line, record.time);
         mRun->beginningMissing = meaning.event != Event::VERSION && meaning.event != Event::MAIN_CHECKS &&
                                  record.operation != "setCallbacks";
     }
     mRun->lastLine = record.line + 1;
     noteTime(record, meaning);
     mRun->mainHead = mRun->mainHead || record.operation == "initMainHead" || record.operation == "updateMainHead";
-    const bool callback = meaning.event == Event::RESULT || meaning.event == Event::ERROR;
-    if (meaning.event == Event::NONE || (callback && mRun->mainHead)) { // the main head's program has callbacks too
+    if (meaning.event == Event::NONE ||
+        (mRun->mainHead && meaning.step == StepKind::SHOW_OUTCOME)) { // the main head's program has callbacks too
         return;
     }
     takeRunEvent(record, meaning);
@@ -318,11 +308,7 @@ void RunBuilder::otherLine(std::uint64_t line, std::string_view program, std::st
         mBefore.events.set(static_cast<std::size_t>(*event));
         mBefore.lines.add(text);
         if (event == ServiceEvent::NOT_ALLOWED) {
-            ParsedRecord none;
-            none.line = line;
-            none.time = mRun ? mRun->end : 0;
-            beginRun(none);
-            mRun->lastLine = line;
+            beginRun(line, mRun ? mRun->end : 0);
             mRun->ended = RunEnd::EARLY;
         }
         return;
@@ -367,22 +353,21 @@ void RunBuilder::takeServiceLine(ServiceEvent event, std::string_view text)
 
 void RunBuilder::torn(std::uint64_t line)
 {
-    if (mRun && mRun->tornRecords == 0) {
-        mRun->firstTornLine = line;
+    Torn& torn = mRun ? mRun->torn : mTornBefore;
+    if (torn.records++ == 0) {
+        torn.firstLine = line;
     }
-    ++(mRun ? mRun->tornRecords : mTornBefore);
 }
 
-void RunBuilder::beginRun(const ParsedRecord& record)
+void RunBuilder::beginRun(std::uint64_t line, std::int64_t time)
 {
     endRun(true);
     mRun.emplace();
     mRun->number = ++mRuns;
-    mRun->firstLine = record.line;
-    mRun->begin = mRun->end = record.time;
+    mRun->firstLine = mRun->lastLine = line;
+    mRun->begin = mRun->end = time;
     mRun->service = std::exchange(mBefore, {});
-    mRun->tornRecords = std::exchange(mTornBefore, 0);
-    mRun->firstTornLine = mRun->tornRecords > 0 ? 1 : 0;
+    mRun->torn = std::exchange(mTornBefore, {});
 }
 
 void RunBuilder::endRun(bool followedByAnother)
@@ -399,12 +384,11 @@ void RunBuilder::noteTime(const ParsedRecord& record, const Meaning& meaning)
 {
     std::int64_t gap = record.time - mRun->end;
     mRun->end = record.time;
-    const bool waited = meaning.event == Event::SUCCEEDED && meaning.step == StepKind::WAIT_FOR_BOARD;
-    if (waited && !mRun->steps.empty() && !mRun->steps.back().actions.empty()) {
+    if (meaning.event == Event::SUCCEEDED && !mRun->steps.empty() && !mRun->steps.back().actions.empty()) {
         const Action& wait = mRun->steps.back().actions.back();
         const std::int64_t before = mRun->elapsed - wait.began;
         const std::int64_t late = before + gap - wait.wait;
-        if (wait.wait > 0 && (late < -1 || late > mostDelay)) {
+        if (wait.wait != 0 && (late < -1 || late > mostDelay)) {
             ++mRun->clockJumps;
             mRun->elapsed += std::max<std::int64_t>(wait.wait - before, 0);
             return;
@@ -448,8 +432,7 @@ void RunBuilder::takeRunEvent(const ParsedRecord& record, const Meaning& meaning
         break;
     case Event::BOARD_VERSIONS: // of the lines shown, the last one before the verdict
         splitVersions(meaning.rest, "  ", run.board);
-        run.board.unclear = !run.steps.empty() && run.steps.back().actions.size() > 1 && !meaning.rest.empty() &&
-                            !contains(meaning.rest, "  "); // the blanks between are gone
+        run.board.unclear = !meaning.rest.empty() && !contains(meaning.rest, "  "); // the blanks between are gone
         break;
     case Event::TEAMVIEWER_REQUESTED:
     case Event::TEAMVIEWER_NOT_REQUESTED:
@@ -458,13 +441,13 @@ void RunBuilder::takeRunEvent(const ParsedRecord& record, const Meaning& meaning
         break;
     case Event::PANEL_FAILED:
         ++run.ledFailures;
-        run.outcomeLedFailures += lightsOutcome(meaning.rest) ? 1 : 0;
+        run.outcomeLedFailed = run.outcomeLedFailed || lightsOutcome(meaning.rest);
         break;
     default:
         break;
     }
-    const bool package = meaning.step == StepKind::CHECK_PACKAGE || meaning.step == StepKind::INSTALL_PACKAGE;
-    run.mainHead = run.mainHead || (package && contains(record.message.value_or(""), mainPackage));
+    const bool command = meaning.event == Event::NOTED || meaning.event == Event::COMMAND;
+    run.mainHead = run.mainHead || (command && contains(record.message.value_or(""), packageOf(true)));
 }
 
 /// What an event says about its step, or about the last one.
@@ -474,8 +457,8 @@ void RunBuilder::takeStepEvent(Step& step, const ParsedRecord& record, const Mea
     case Event::NOTED:
     case Event::STOPS_UPDATER: {
         const bool waits = *meaning.command == '\0';
-        const std::int64_t wait = waits && step.kind != StepKind::GIVE_BACK ? factsOf(step.kind).wait : 0;
-        if (step.actions.empty() && (!waits || wait > 0)) {
+        const std::int64_t wait = waits ? factsOf(step.kind).wait : 0;
+        if (step.actions.empty() && (!waits || wait != 0)) {
             beginAction(step, meaning.command, wait);
         }
         break;
@@ -494,7 +477,8 @@ void RunBuilder::takeStepEvent(Step& step, const ParsedRecord& record, const Mea
         }
         break;
     case Event::ATTEMPT_FAILED:
-        if (++step.failedAttempts > uploadAttempts || step.actions.empty()) {
+        ++step.failedAttempts;
+        if (step.actions.empty()) {
             break;
         }
         step.actions.back().attemptFailed = true;
@@ -526,7 +510,7 @@ void RunBuilder::takeStepEvent(Step& step, const ParsedRecord& record, const Mea
         if (meaning.number && step.kind == StepKind::REFRESH_MIRRORS && !step.status) {
             step.status = CommandStatus{*meaning.number, false};
         }
-        if (step.kind == StepKind::INSTALL_PACKAGE && !step.took && meaning.number && !meaning.rest.empty()) {
+        if (step.kind == StepKind::INSTALL_PACKAGE && !step.took && !meaning.rest.empty()) {
             // The code and the command's output, with nothing between: only the record before tells where it ends.
             const std::string code = step.status ? std::to_string(step.status->number) : "";
             if (startsWith(*record.message, code)) {
@@ -559,10 +543,14 @@ void RunBuilder::takeStatus(Step& step, long number)
             return;
         }
         endAction(step, status);
-        if (command == 2 && !status.lost()) {
+        if (command == 1) {
+            beginAction(step, "systemctl start harl");
+            return;
+        }
+        if (!status.lost()) {
             mRun->applicationStarted = number == 0;
         }
-        beginAction(step, command == 1 ? "systemctl start harl" : "", command == 1 ? 0 : giveBackWait);
+        beginAction(step, "", giveBackWait);
         return;
     }
     if (step.took) {

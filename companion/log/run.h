@@ -119,6 +119,13 @@ struct ServiceFacts
     bool has(ServiceEvent event) const { return events.test(static_cast<std::size_t>(event)); }
 };
 
+/// Records that are not whole.
+struct Torn
+{
+    std::uint64_t records = 0;
+    std::uint64_t firstLine = 0;
+};
+
 /// What went wrong in a run.
 struct Problem
 {
@@ -155,11 +162,10 @@ struct Run
     std::optional<bool> applicationStarted;
     bool followedByAnother = false; ///< The log goes on with another run.
     std::uint64_t ledFailures = 0;
-    std::uint64_t outcomeLedFailures = 0;
+    bool outcomeLedFailed = false;
     bool soundFailed = false;
     bool statusesLost = false; ///< Some command's status was -1.
-    std::uint64_t tornRecords = 0;
-    std::uint64_t firstTornLine = 0;
+    Torn torn;
     std::uint64_t otherLines = 0;
     ServiceFacts service;
 
@@ -208,7 +214,7 @@ public:
 
 private:
     bool beginsRun(const Meaning& meaning, bool whole) const;
-    void beginRun(const ParsedRecord& record);
+    void beginRun(std::uint64_t line, std::int64_t time);
     void endRun(bool followedByAnother);
     void takeServiceLine(ServiceEvent event, std::string_view text);
     void noteTime(const ParsedRecord& record, const Meaning& meaning);
@@ -227,5 +233,5 @@ private:
     ServiceFacts mBefore; // of the service, before the next run
     std::string mThread;  // of the last record
     bool mSourceEnded = false;
-    std::uint64_t mTornBefore = 0; // pieces in front of the next run's first record
+    Torn mTornBefore; // in front of the first run
 };

@@ -325,9 +325,9 @@ Values valuesOf(const Run& run, const Step* step, std::string_view failure)
         {"service", run.service.has(ServiceEvent::FAILURE_SHOWN) ? sharedText("service-lit-fail") : ""},
         {"unit", run.service.unit.empty() ? "what was found is in brackets" : run.service.unit},
         {"panel-failures", run.ledFailures == 0 ? "Commands" : counted(run.ledFailures, "command")},
-        {"outcome-dark", run.outcomeLedFailures > 0 ? ": the outcome was not, or not wholly, lit." : "."},
-        {"torn-records", counted(run.tornRecords, "torn record")},
-        {"first-torn-line", std::to_string(run.firstTornLine)},
+        {"outcome-dark", run.outcomeLedFailed ? ": the outcome was not, or not wholly, lit." : "."},
+        {"torn-records", counted(run.torn.records, "torn record")},
+        {"first-torn-line", std::to_string(run.torn.firstLine)},
         {"steps-left-out", counted(run.stepsLeftOut, "step")},
         {"clock-jumps", counted(run.clockJumps, "time")},
         {"failed-attempts", counted(attempts, "upload attempt")},
@@ -373,7 +373,7 @@ OperatorView operatorView(const Run& run)
     view.seen = facts.leds.empty() ? "REMOTE and MAIN, or " + std::string(color == "pass" ? "PASS" : "FAIL") + ", in "
                                    : view.seen + " lit in ";
     view.seen += color + " colour";
-    if (run.outcomeLedFailures > 0 && !run.statusesLost) {
+    if (run.outcomeLedFailed && !run.statusesLost) {
         view.leds.clear();
         view.seen = "a dark or incomplete panel (meant: " + view.seen + ")";
     }

@@ -27,7 +27,7 @@ std::string saidOf(std::string_view log, bool tools)
     std::string said;
     RunBuilder builder([&](Run& run) {
         explain(run);
-        run.firstLine = run.lastLine = run.tornRecords = run.otherLines = 0;
+        run.firstLine = run.lastLine = run.torn.records = run.otherLines = 0;
         for (Step& step : run.steps) {
             step.line = 0;
         }

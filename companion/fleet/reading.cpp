@@ -24,8 +24,6 @@ namespace
 
 namespace fs = std::filesystem;
 
-const std::size_t blockSize = std::size_t{256} * 1024; // bytes
-
 enum class Kind { TEXT, JOURNAL, ARCHIVE };
 
 /// What is read one after the other: a file, or those of a journal. A full one has "@" and a number after its name; the
@@ -203,7 +201,7 @@ private:
             mWhole = mWhole && dress.undamaged();
             return parserFor(entry);
         });
-        std::vector<char> block(blockSize);
+        std::vector<char> block(LogSource::blockSize);
         ssize_t length = 0;
         while ((length = source.read(block)) > 0) {
             dress.feed({block.data(), static_cast<std::size_t>(length)});

@@ -34,9 +34,8 @@ namespace
 
 using Json = nlohmann::ordered_json;
 
-const std::size_t blockSize = std::size_t{256} * 1024; // bytes
-const int pollTime = 250;                              // ms between two looks at a file, and at the clock
-const int settleTime = 2;                              // s, at most, for the earlier runs in a pipe
+const int pollTime = 250; // ms between two looks at a file, and at the clock
+const int settleTime = 2; // s, at most, for the earlier runs in a pipe
 
 /// What an input that holds no text begins with, and what to do about it.
 const std::pair<std::string_view, const char*> magics[] = {
@@ -54,7 +53,7 @@ const std::pair<std::string_view, const char*> magics[] = {
 class Reader
 {
 public:
-    explicit Reader(LogSink& sink) : mParser(sink), mDress(mParser), mBlock(blockSize) {}
+    explicit Reader(LogSink& sink) : mParser(sink), mDress(mParser), mBlock(LogSource::blockSize) {}
 
     /// Opens the source number `index`. False when that fails.
     bool open(const LogOptions& options, std::size_t index, std::ostream& err)

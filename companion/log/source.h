@@ -2,6 +2,7 @@
 
 #include "descriptor.h"
 
+#include <cstddef>
 #include <string>
 #include <vector>
 
@@ -11,6 +12,8 @@
 class LogSource
 {
 public:
+    static constexpr std::size_t blockSize = std::size_t{256} * 1024; ///< bytes that are best read at once
+
     LogSource() = default;
     LogSource(const LogSource&) = delete;
     LogSource& operator=(const LogSource&) = delete;

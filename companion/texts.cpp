@@ -116,6 +116,16 @@ std::string withSeparators(std::uint64_t number)
 
 } // namespace
 
+std::vector<std::string> linesOf(const std::string& text)
+{
+    std::vector<std::string> lines;
+    std::istringstream stream(text);
+    for (std::string line; std::getline(stream, line);) {
+        lines.push_back(line);
+    }
+    return lines;
+}
+
 const nlohmann::ordered_json& catalogue(const char* section)
 {
     static const nlohmann::ordered_json all = [] {

@@ -20,6 +20,9 @@ inline bool contains(std::string_view text, std::string_view part)
     return text.find(part) != std::string_view::npos;
 }
 
+/// The lines of `text`, without their ends.
+std::vector<std::string> linesOf(const std::string& text);
+
 // What reports are made of
 
 /// companion/catalogue.json and commands.json, which are a part of the program: texts that others share, the failures

@@ -79,8 +79,9 @@ int codeOf(int status)
     return status < 0 ? 0 : status >> 8;
 }
 
-std::vector<std::string> linesOf(const std::string& text)
+std::vector<std::string> linesRead(const std::string& output)
 {
+    const std::string text = asRead(output);
     std::vector<std::string> lines;
     for (std::size_t begin = 0; begin < text.size();) {
         const std::size_t end = std::min(text.find('\n', begin), text.size());

@@ -29,8 +29,9 @@ std::string asRead(const std::string& output);
 /// The exit code that the runner must derive from a raw wait status.
 int codeOf(int status);
 
-/// The lines of a text; a last one without a line feed counts, an empty one after the last line feed does not.
-std::vector<std::string> linesOf(const std::string& text);
+/// The lines of asRead() `output`; a last one without a line feed counts, an empty one after the last line feed does
+/// not.
+std::vector<std::string> linesRead(const std::string& output);
 
 /// The text after the first `key` in the last line that has `key` and none of `unless`; "" without such a line.
 std::string lastBehind(const std::vector<std::string>& lines, const std::string& key, const std::string& unless = "");

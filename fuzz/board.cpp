@@ -19,7 +19,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     const bool boardRead = codeOf(answers[0].status) == 0;
     const bool stickRead = boardRead && codeOf(answers[1].status) == 0;
     if (boardRead) {
-        expectedInstalled = lastBehind(linesOf(asRead(answers[0].output)), "Brimvale\t");
+        expectedInstalled = lastBehind(linesRead(answers[0].output), "Brimvale\t");
         expectedInstalled = expectedInstalled.substr(0, expectedInstalled.find('\r'));
     }
     if (stickRead) {

@@ -19,7 +19,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     std::string expectedCandidate;
     std::string lastMessage = "NO_INTERNET_ERROR_CODE";
     if (codeOf(answers[0].status) != 100 || ignoreNoInternet) {
-        const std::vector<std::string> lines = linesOf(asRead(answers[0].output));
+        const std::vector<std::string> lines = linesRead(answers[0].output);
         expectedInstalled = lastBehind(lines, "Installed: ");
         expectedCandidate = lastBehind(lines, "Candidate: ", "Installed: ");
         lastMessage = "NWM_UM_CHECK_UPDATE_FAILED";

@@ -160,16 +160,6 @@ TemporaryFolder::~TemporaryFolder()
     std::filesystem::remove_all(mPath, error);
 }
 
-std::vector<std::string> linesOf(const std::string& text)
-{
-    std::vector<std::string> lines;
-    std::istringstream stream(text);
-    for (std::string line; std::getline(stream, line);) {
-        lines.push_back(line);
-    }
-    return lines;
-}
-
 std::string valueAfter(const std::string& text, const std::string& key)
 {
     std::string value;

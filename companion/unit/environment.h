@@ -105,9 +105,6 @@ private:
     std::string mPath;
 };
 
-/// The lines of `text`, without their ends.
-std::vector<std::string> linesOf(const std::string& text);
-
 /// What follows `key` in the last line of `text` that holds it, as the updater reads its versions; empty without one.
 std::string valueAfter(const std::string& text, const std::string& key);
 

@@ -5,6 +5,7 @@
 #include "log/dress.h"
 #include "log/json.h"
 #include "log/run.h"
+#include "texts.h"
 
 #include <algorithm>
 #include <functional>

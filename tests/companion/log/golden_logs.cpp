@@ -29,16 +29,6 @@ std::string content(const std::string& file)
     return text.str();
 }
 
-Lines linesOf(const std::string& text)
-{
-    Lines lines;
-    std::istringstream stream(text);
-    for (std::string line; std::getline(stream, line);) {
-        lines.push_back(line);
-    }
-    return lines;
-}
-
 std::string goldenLogName(const testing::TestParamInfo<std::string>& test)
 {
     std::string name = test.param;

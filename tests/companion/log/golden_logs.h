@@ -15,8 +15,5 @@ Lines namesOfFiles(const std::string& folder, const std::string& extension);
 
 std::string content(const std::string& file);
 
-/// The lines of `text`, without their ends.
-Lines linesOf(const std::string& text);
-
 /// A golden log's name as one of a test.
 std::string goldenLogName(const testing::TestParamInfo<std::string>& test);

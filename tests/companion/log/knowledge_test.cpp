@@ -5,6 +5,7 @@
 #include "golden_logs.h"
 #include "log/catalogue.h"
 #include "log/run.h"
+#include "texts.h"
 
 #include <iostream>
 #include <set>

@@ -79,8 +79,7 @@ const Failure* entryFor(const Run& run, const Step& step)
         return findFailure("statuses-lost");
     }
     if (step.kind == S::CHECK_BOARD) {
-        const bool listed = step.actions.size() > 1 && step.status && step.status->number != 0;
-        if (step.event == Event::STICK_NOT_READ || listed) {
+        if (step.event == Event::STICK_NOT_READ) {
             return findFailure("stick-not-read");
         }
         if (!step.status || run.board.unclear) {
@@ -110,8 +109,8 @@ const Failure* entryFor(const Run& run, const Step& step)
 /// True for a step whose end decides the run's outcome.
 bool decides(const Step& step, Outcome outcome)
 {
-    const bool checks = outcome == Outcome::CHECK_FAILED || outcome == Outcome::FAILED;
-    return failureOf(step) == outcome || (checks && step.kind == S::CHECK_BOARD && step.result == StepResult::FAILED);
+    return failureOf(step) == outcome ||
+           (outcome == Outcome::CHECK_FAILED && step.kind == S::CHECK_BOARD && step.result == StepResult::FAILED);
 }
 
 /// What the service's words point to.
@@ -126,7 +125,7 @@ const std::pair<ServiceEvent, const char*> serviceProblems[] = {
 void addFailure(Run& run)
 {
     if (run.service.has(ServiceEvent::NOT_ALLOWED)) {
-        run.failure = {findFailure("run-not-allowed"), 0};
+        run.failure = {findFailure("run-not-allowed"), run.steps.size()};
         return;
     }
     if (run.steps.empty()) {
@@ -256,7 +255,7 @@ void explain(Run& run)
 bool wentWell(const Run& run)
 {
     const bool bad = run.service.has(ServiceEvent::UNIT_NOT_WELL) || run.service.has(ServiceEvent::NOT_STARTED) ||
-                     run.service.has(ServiceEvent::FAILURE_SHOWN) || run.service.has(ServiceEvent::NOT_ALLOWED);
+                     run.service.has(ServiceEvent::FAILURE_SHOWN);
     return !bad && run.outcome != Outcome::NONE && !isFailure(run.outcome) && run.applicationStarted.value_or(false) &&
            (run.ended == RunEnd::BY_SERVICE_MANAGER || run.ended == RunEnd::BY_ITSELF);
 }

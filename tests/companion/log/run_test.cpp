@@ -56,6 +56,16 @@ std::string times(int count, const std::string& text)
     return all;
 }
 
+/// Lines of one letter each, from the `first` one of the alphabet on.
+std::string letters(int first, int count)
+{
+    std::string lines;
+    for (int index = first; index < first + count; ++index) {
+        lines.append(1, static_cast<char>('a' + index)).append(1, '\n');
+    }
+    return lines;
+}
+
 /// What --json tells of each of the log's runs.
 Json toldOf(const std::string& log)
 {
@@ -96,6 +106,12 @@ class LogOfRun : public testing::TestWithParam<Row>
 };
 
 // Pieces of a run, without their times.
+/// What the catalogue says of a gap.
+std::string missing(const char* gap)
+{
+    return sharedText(gap, {}, "gaps");
+}
+
 const std::string command = "0 runProcess Running command: apt update\n";
 const std::string packageSame = "0 checkUpdate NWM_UM_NO_UPDATES 1 == 1\n";
 const std::string packageDiffers = "0 checkUpdate NWM_UM_UPDATE_FOUND: 1 -> 2\n";
@@ -207,7 +223,10 @@ const Row steps[] = {
     {"UploadBeforeError", upload + error, {{"steps/0/result", "untold"}, {"steps/0/actions/0/status", ""}}},
     {"NineteenFailedAttempts",
      upload + times(19, uploadFails) + error,
-     {{"outcome", "failed"}, {"steps/0/result", "untold"}, {"steps/0/actions/19/status", ""}}},
+     {{"outcome", "failed"},
+      {"steps/0/result", "untold"},
+      {"steps/0/actions/18/took_s", 0},
+      {"steps/0/actions/19/status", ""}}},
     {"TwentyFailedAttempts",
      upload + times(20, uploadFails) + error,
      {{"outcome", "board-failed"},
@@ -260,7 +279,11 @@ const Row steps[] = {
          "0 runProcess Exit code:255\n" +
          boardUnread + error,
      {{"failure/name", "board-host-key"}}},
-    {"FailedAttemptAlone", uploadFails, {{"steps/0/failed_attempts", 1}, {"steps/0/actions/0", nullptr}}},
+    {"FailedAttemptAlone",
+     uploadFails,
+     {{"steps/0/failed_attempts", 1},
+      {"steps/0/actions/0", nullptr},
+      {"cannot_tell/2", "Why 1 upload attempt failed."}}},
     {"OneOfTwoStatuses",
      "0 startHARL\n1 startHARL 256\n2 stopUpdater\n",
      {{"steps/0/result", "untold"}, {"steps/0/actions/0/status", ""}, {"application_started", nullptr}}},
@@ -268,6 +291,7 @@ const Row steps[] = {
      "0 startHARL\n1 startHARL 8192\n2 startHARL 0\n2 startHARL 256\n12 stopUpdater\n",
      {{"steps/0/result", "failed"},
       {"steps/0/actions/0/status", "exit 32"},
+      {"steps/0/actions/1/text", "systemctl start harl"},
       {"steps/0/actions/1/status", "exit 0"},
       {"steps/0/actions/2/text", "wait 10 s"},
       {"steps/0/actions/2/took_s", 10},
@@ -293,7 +317,12 @@ const Row steps[] = {
 const Row ofTime[] = {
     {"OneDay", "0 stopHARL\n86400 stopHARL 0\n", {{"took_s", 86400}, {"clock_jumps", 0}}},
     {"MoreThanOneDay", "0 stopHARL\n86401 stopHARL 0\n", {{"took_s", 0}, {"clock_jumps", 1}}},
-    {"Backwards", "5 stopHARL\n4 stopHARL 0\n", {{"took_s", 0}, {"clock_jumps", 1}}},
+    {"Backwards",
+     "5 stopHARL\n4 stopHARL 0\n",
+     {{"took_s", 0},
+      {"clock_jumps", 1},
+      {"cannot_tell/2",
+       "How long this run took: the clock was set 1 time while it went on. Times do not include that."}}},
     {"WaitLate", wait + "840" + waited, {{"took_s", 840}, {"clock_jumps", 0}}},
     {"WaitTooLate", wait + "841" + waited, {{"took_s", 780}, {"clock_jumps", 1}}},
     {"WaitEarly", wait + "779" + waited, {{"took_s", 779}, {"clock_jumps", 0}}},
@@ -355,6 +384,7 @@ const Row runs[] = {
      "0 stopHARL\ngive-back: the stick is in use\n",
      {{"unit_after_run", nullptr}, {"ended", "not-seen"}}},
     {"ServicesWordAfterTheEnd", "0 stopUpdater\n" + exited, {{"ended", "by-service-manager"}}},
+    {"OneTorn", "\t\t\tOK\n0 stopHARL\n", {{"cannot_tell/2", "What 1 torn record said (the first at line 1)."}}},
     {"TornBefore",
      "a tool's\n\t\t\tOK\n\t\t\tOK\n0 stopHARL\n",
      {{"torn_records", 2}, {"cannot_tell/2", "What 2 torn records said (the first at line 2)."}}},
@@ -371,6 +401,91 @@ const Row panel[] = {
     {"Failed", boardUnread + error + panelFails + "0x8 c\n", {{"panel/MAIN", nullptr}}},
 };
 
+const Row problems[] = {
+    {"Unknown", error, {{"failure/name", "unknown"}, {"failure/step", "show-outcome"}}},
+    {"EndedEarly", result + exited, {{"outcome", "passed"}, {"failure/name", "ended-early"}}},
+    {"EndedEarlyAtALaterStep", version + "0 stopHARL\n" + exited, {{"failure/step", "stop-application"}}},
+    {"OutcomeMissing", "0 stopHARL\n0 stopUpdater\n", {{"failure/name", "outcome-missing"}}},
+    {"EndMissing", result, {{"failure/name", "end-missing"}, {"cannot_tell/2", missing("outcome")}}},
+    {"MainHeadsEndMissing",
+     mainHead + packageSame + mainMarker,
+     {{"failure/name", "end-missing"}, {"cannot_tell/1", missing("offer")}}},
+    {"MainHeadsOffer", mainHead + packageDiffers + mainMarker, {{"failure/name", "unfinished"}}},
+    {"MainHeadUnfinished", mainHead + packageSame, {{"failure/name", "unfinished"}}},
+    {"MirrorsOfNoInternet",
+     "0 updateMirrors NO_INTERNET_ERROR_CODE\n",
+     {{"failure/name", "mirrors-unreachable"}, {"failure/step", "refresh-mirrors"}}},
+    {"PackageWithoutACode", "0 checkUpdate NWM_UM_CHECK_UPDATE_FAILED\n", {{"failure/name", "package-not-read"}}},
+    {"ExactCodeBeforeAPhrase",
+     installBegins + "dpkg: you must manually run it\n0 runProcess Exit code:127\n",
+     {{"failure/name", "package-tool-missing"}}},
+    {"PhraseBeforeAGeneralCode",
+     installBegins + "dpkg: you must manually run it\n0 runProcess Exit code:100\n",
+     {{"failure/name", "package-interrupted"}, {"besides/0", nullptr}}},
+    {"StatusesLostInUpload",
+     "0 stopHARL -1\n" + upload + "0 uploadQuorbFiles Failed to upload QUORB\n",
+     {{"failure/name", "statuses-lost"}, {"besides/0", nullptr}}},
+    {"StatusesLost",
+     "0 stopHARL -1\n0 updateMirrors NOT OK 7\n",
+     {{"failure/name", "mirrors-failed"},
+      {"besides/0/name", "statuses-lost"},
+      {"besides/0/step", "stop-application"},
+      {"besides/1", nullptr}}},
+    {"FirstStep",
+     "0 stopHARL\nhand-over: systemctl: no end within 90 s\n0 stopHARL 256\n0 updateMirrors\n",
+     {{"besides/0/name", "time-used-up"},
+      {"besides/0/step", "stop-application"},
+      {"besides/1/name", "application-not-stopped"},
+      {"besides/1/step", "stop-application"}}},
+    {"GiveBack",
+     result + "0 startHARL\n0 startHARL 256\n0 startHARL 256\n0 stopUpdater\n",
+     {{"failure", nullptr},
+      {"besides/0/name", "stick-not-released"},
+      {"besides/1/name", "application-not-started"},
+      {"besides/2", nullptr}}},
+    {"OnePanelCommand",
+     version + panelFails + "0x1 c\n",
+     {{"besides/0/name", "panel-failed"}, {"besides/0/step", "start"}}},
+    {"SoundOfAStep",
+     version + result + "0 play Failed to play a sound\n",
+     {{"besides/0/name", "sound-failed"}, {"besides/0/step", "show-outcome"}}},
+    {"SoundAlone",
+     "0 stopHARL\n0 play Failed to play a sound\n",
+     {{"besides/0/name", "sound-failed"}, {"besides/0/step", nullptr}}},
+    {"StartMissing",
+     result + "0 stopUpdater\n",
+     {{"failure", nullptr}, {"besides/0/name", "start-missing"}, {"besides/0/step", nullptr}}},
+    {"StartNotTold",
+     result + "0 startHARL\n0 startHARL 0\n0 stopUpdater\n",
+     {{"besides/0/name", "start-missing"}, {"besides/0/step", "give-back"}}},
+    {"NoStep", "0 main BEFORE UPDATE\n", {{"failure", nullptr}, {"besides/0", nullptr}}},
+    {"Repaired", "prepare: the installation is finished\n" + version, {{"besides/0/name", "installation-repaired"}}},
+    {"RepairFailed", "prepare: a is still unfinished\n" + version, {{"besides/0/name", "repair-failed"}}},
+    {"ShownAgain", version + "give-back: the outcome was not shown\n", {{"besides/0/name", "outcome-shown-again"}}},
+    {"PanelRefused", version + "give-back: the panel does not take it\n", {{"besides/0/name", "outcome-not-shown"}}},
+    {"StickInUse", version + "give-back: the stick is in use\n", {{"besides/0/name", "stick-in-use"}}},
+    {"WentOn", version + "give-back: going on beside it\n", {{"besides/0/name", "tool-still-at-work"}}},
+    {"NotStarted", version + "give-back: harl cannot be started\n", {{"besides/0/name", "application-not-started"}}},
+    {"WordsOfTools", "0 updateMirrors\na tool's\n0 updateMirrors NOT OK 7\n", {{"cannot_tell/2", missing("feedback")}}},
+};
+
+const std::string passed = packageSame + boardSame + result;
+const std::string started = "0 startHARL\n0 startHARL 0\n0 startHARL 0\n";
+const std::string ended = "0 stopUpdater\n";
+const Row ends[] = {
+    {"Well", passed + started + ended, {{"went_well", true}}},
+    {"WellByItself", passed + started + ended + "0 stopUpdater 0\n", {{"went_well", true}}},
+    {"NotSeen", passed + started, {{"went_well", false}}},
+    {"Early", passed + started + exited, {{"went_well", false}}},
+    {"NotStarted", passed + "0 startHARL\n0 startHARL 0\n0 startHARL 256\n" + ended, {{"went_well", false}}},
+    {"StartNotTold", passed + ended, {{"went_well", false}}},
+    {"NoOutcome", started + ended, {{"went_well", false}}},
+    {"Failed", error + started + ended, {{"went_well", false}}},
+    {"FailureShown",
+     passed + started + ended + "give-back: the updater ended before it had an outcome\n",
+     {{"went_well", false}}},
+};
+
 const std::string twoSteps = "0 installUpdate\n" + upload;
 const Row limits[] = {
     {"Steps",
@@ -384,6 +499,12 @@ const Row limits[] = {
     {"Actions",
      "0 updateMirrors\n" + times(33, command),
      {{"steps/0/actions/31/text", "apt update"}, {"steps/0/actions/32", nullptr}}},
+    {"Lines",
+     "0 updateMirrors\n" + letters(0, 10) + "again\nagain\n" + letters(10, 10),
+     {{"steps/0/tools_said/count", 22},
+      {"steps/0/tools_said/shown/9", "j"},
+      {"steps/0/tools_said/shown/10", "... (2 lines left out)"},
+      {"steps/0/tools_said/shown/11", "k"}}},
     {"Text", "0 main TavrenUpdater version: " + times(400, "x") + '\n', {{"updater", times(400, "x")}}},
     {"LongerText", "0 main TavrenUpdater version: " + times(401, "x") + '\n', {{"updater", times(400, "x") + "..."}}},
 };
@@ -407,4 +528,52 @@ INSTANTIATE_TEST_SUITE_P(Step, LogOfRun, testing::ValuesIn(steps), nameOf);
 INSTANTIATE_TEST_SUITE_P(Time, LogOfRun, testing::ValuesIn(ofTime), nameOf);
 INSTANTIATE_TEST_SUITE_P(Run, LogOfRun, testing::ValuesIn(runs), nameOf);
 INSTANTIATE_TEST_SUITE_P(Panel, LogOfRun, testing::ValuesIn(panel), nameOf);
+INSTANTIATE_TEST_SUITE_P(Problem, LogOfRun, testing::ValuesIn(problems), nameOf);
+INSTANTIATE_TEST_SUITE_P(End, LogOfRun, testing::ValuesIn(ends), nameOf);
 INSTANTIATE_TEST_SUITE_P(Limit, LogOfRun, testing::ValuesIn(limits), nameOf);
+
+TEST(LogCatalogue, EntryIsPrintedWhole)
+{
+    std::ostringstream text;
+    EXPECT_TRUE(printCatalogue("board-host-key", false, text));
+    EXPECT_EQ(text.str(), "board-host-key\n"
+                          "  Reported: ERROR_CHECK_UPDATE, ERROR_INSTALL_QUORB\n"
+                          "  In step:  check-board, upload-board\n"
+                          "  Cause:    The board showed a different host key from the one this head knows: it was "
+                          "replaced or\n            set up anew.\n"
+                          "  Do now:   Make sure that it is the right board, then renew its key: ssh-keygen -R "
+                          "192.168.9.2, log\n            in once, run the update again.\n"
+                          "  Says so:  ssh: HOST IDENTIFICATION HAS CHANGED\n"
+                          "  Says so:  ssh: Host key verification failed\n");
+    std::ostringstream json;
+    EXPECT_TRUE(printCatalogue("board-read-only", true, json));
+    const Json told = Json::parse(json.str());
+    EXPECT_EQ(told.at("command"), "explain");
+    EXPECT_EQ(told.at("version"), 1);
+    const Json& entry = told.at("failures").at(0);
+    EXPECT_EQ(told.at("failures").size(), 1U);
+    EXPECT_EQ(entry.at("name"), "board-read-only");
+    EXPECT_EQ(entry.at("reported"), "ERROR_INSTALL_QUORB");
+    EXPECT_EQ(entry.at("steps"), Json({"upload-board"}));
+    EXPECT_EQ(entry.at("phrases"),
+              Json({{{"tool", "scp"}, {"words", "Read-only file system"}, {"steps", {"upload-board"}}}}));
+    EXPECT_TRUE(entry.contains("cause") && entry.contains("remedy"));
+}
+
+TEST(LogCatalogue, UnknownEntryPrintsNothing)
+{
+    for (const bool json : {false, true}) {
+        std::ostringstream out;
+        EXPECT_FALSE(printCatalogue("nonsense", json, out));
+        EXPECT_EQ(out.str(), "");
+    }
+}
+
+TEST(LogCatalogue, EmptyLineStandsBetweenEntries)
+{
+    std::ostringstream text;
+    EXPECT_TRUE(printCatalogue("", false, text));
+    EXPECT_EQ(text.str().rfind("mirrors-unreachable\n", 0), 0U);
+    EXPECT_NE(text.str().find("\n\nmirrors-clock-behind\n  Reported:"), std::string::npos);
+    EXPECT_NE(text.str().find("\n\npanel-failed\n  Cause:"), std::string::npos);
+}

@@ -93,7 +93,7 @@ std::string said(std::string_view log, std::size_t blockSize)
     std::string text;
     RunBuilder builder([&](Run& run) {
         explain(run);
-        run.firstLine = run.lastLine = run.firstTornLine = 0;
+        run.firstLine = run.lastLine = run.torn.firstLine = 0;
         for (Step& step : run.steps) {
             step.line = 0;
         }

@@ -125,7 +125,7 @@ std::string lastRun(std::string_view log)
         }
         run.lastLine -= before;
         run.firstLine = run.number = 1;
-        run.tornRecords = run.firstTornLine = 0; // of pieces in front of the first run
+        run.torn = {}; // of pieces in front of the first run
         explain(run);
         said = runToJson(run, "log").dump();
     });

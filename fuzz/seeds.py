@@ -1,7 +1,7 @@
 """Usage: seeds.py FOLDER
 
 Writes the fuzzers' first inputs: the output of the tools in each of the bench's scenarios, its sticks, some archives,
-and the golden logs.
+the golden logs, and what earlier runs kept in fuzz/corpus.
 """
 
 import io
@@ -13,6 +13,7 @@ from bench import scenario
 from bench.makers.board import version_text
 from bench.scenario import Setup
 
+CORPUS = Path(__file__).parent / "corpus"
 MARKER = "/root/USB_MOUNT/debs/installTV\n"
 
 
@@ -101,18 +102,19 @@ def log_seeds() -> dict[str, bytes]:
 def main() -> None:
     """The command."""
     readable = {"package": package_seed, "board": board_seed, "teamviewer": teamviewer_seed, "stick": stick_seed}
-    for target, seed in readable.items():
+    setups = {name: scenario.load(name).setup for name in scenario.names()}
+    inputs = {
+        target: {name: seed(setup).encode() for name, setup in setups.items()} for target, seed in readable.items()
+    }
+    inputs["stick"] |= {name: odd.encode() for name, odd in ODD_STICKS.items()}
+    inputs |= {"archive": archive_seeds(), "dress": log_seeds(), "log": log_seeds()}
+    for target, contents in inputs.items():
         folder = Path(sys.argv[1]) / target
         folder.mkdir(parents=True, exist_ok=True)
-        for name in scenario.names():
-            (folder / name).write_bytes(seed(scenario.load(name).setup).encode())
-    for target, seeds in {"archive": archive_seeds(), "dress": log_seeds(), "log": log_seeds()}.items():
-        folder = Path(sys.argv[1]) / target
-        folder.mkdir(parents=True, exist_ok=True)
-        for name, content in seeds.items():
+        for name, content in contents.items():
             (folder / name).write_bytes(content)
-    for name, odd in ODD_STICKS.items():
-        (Path(sys.argv[1]) / "stick" / name).write_bytes(odd.encode())
+        with zipfile.ZipFile(CORPUS / f"{target}.zip") as kept:
+            kept.extractall(folder)
 
 
 main()

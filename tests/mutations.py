@@ -99,6 +99,7 @@ PARTS = [
         [
             gtest("unit-tests"),
             gtest("process-tests"),
+            gtest("faults/fault-matrix", "*OneFault*/RemoteHead__stopharl_exit1"),  # the order of main()
             *(
                 pytest("tests/program/program_test.py", f"[{scenario}]", "harl-updater call_recorder")
                 for scenario in SCENARIOS
@@ -212,7 +213,7 @@ CPP = Language(
     re.compile("//.*"),
     ("//", "#", "namespace", "using", "__attribute__"),
     re.compile(r"(?!using|return;|break;|#|//|static_assert|friend|public|private|[}\]]).*;(\s*//.*)?"),
-    re.compile(r"(static )?(const )?(std::)?(string|bool|int|int32_t|int64_t|size_t|Color|Led) \w+( = [\w.-]+)?;"),
+    re.compile(r"(?!return |delete |throw )(static )?(const )?[\w:]+ \w+( = [\w.-]+)?;"),
     r"[;{}:]",
     "",
 )

@@ -176,6 +176,12 @@ TEST_F(Runner, LongLinesAndManyLinesArriveWhole)
     EXPECT_TRUE(output == expected);
 }
 
+TEST_F(Runner, ZeroByteTakesTheRestOfItsPieceOf1023BytesWithIt)
+{
+    EXPECT_EQ(run("head -c 1022 /dev/zero | tr '\\0' x; printf '\\0next\\n'"), 0);
+    EXPECT_EQ(output, std::string(1022, 'x') + "next\n");
+}
+
 TEST_F(Runner, CommandThatClosesItsOutputEarlyIsWaitedFor)
 {
     EXPECT_EQ(run("echo early; exec >&-; sleep 0.2; exit 7"), 7);

@@ -1,5 +1,7 @@
 #include "golden_logs.h"
 
+#include "log/catalogue.h"
+
 #include <algorithm>
 #include <filesystem>
 #include <fstream>
@@ -27,6 +29,19 @@ std::string content(const std::string& file)
     std::ostringstream text;
     text << std::ifstream(file, std::ios::binary).rdbuf();
     return text.str();
+}
+
+void readRuns(std::string_view log, const std::function<void(const Run&)>& take)
+{
+    RunBuilder builder([&](Run& run) {
+        explain(run);
+        take(run);
+    });
+    LogParser parser(builder);
+    parser.feed(log);
+    parser.finish();
+    builder.finish();
+    EXPECT_EQ(builder.current(), nullptr);
 }
 
 std::string goldenLogName(const testing::TestParamInfo<std::string>& test)

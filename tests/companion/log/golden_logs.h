@@ -1,6 +1,10 @@
 #pragma once
 
+#include "log/run.h"
+
+#include <functional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include <gtest/gtest.h>
@@ -14,6 +18,9 @@ Lines goldenLogs();
 Lines namesOfFiles(const std::string& folder, const std::string& extension);
 
 std::string content(const std::string& file);
+
+/// Reads a log and hands over each of its runs, explained.
+void readRuns(std::string_view log, const std::function<void(const Run&)>& take);
 
 /// A golden log's name as one of a test.
 std::string goldenLogName(const testing::TestParamInfo<std::string>& test);

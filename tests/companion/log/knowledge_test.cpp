@@ -42,14 +42,9 @@ using Verdicts = std::vector<Verdict>;
 Verdicts verdictsOf(std::string_view log)
 {
     Verdicts verdicts;
-    RunBuilder builder([&](Run& run) {
-        explain(run);
+    readRuns(log, [&](const Run& run) {
         verdicts.push_back({run.outcome, wentWell(run), run.failure ? run.failure->failure->name : ""});
     });
-    LogParser parser(builder);
-    parser.feed(log);
-    parser.finish();
-    builder.finish();
     return verdicts;
 }
 

@@ -70,15 +70,7 @@ std::string letters(int first, int count)
 Json toldOf(const std::string& log)
 {
     Json told = Json::array();
-    RunBuilder builder([&](Run& run) {
-        explain(run);
-        told.push_back(runToJson(run, "a.log"));
-    });
-    LogParser parser(builder);
-    parser.feed(log);
-    parser.finish();
-    builder.finish();
-    EXPECT_EQ(builder.current(), nullptr);
+    readRuns(log, [&](const Run& run) { told.push_back(runToJson(run, "a.log")); });
     return told;
 }
 
@@ -105,13 +97,13 @@ class LogOfRun : public testing::TestWithParam<Row>
 {
 };
 
-// Pieces of a run, without their times.
 /// What the catalogue says of a gap.
 std::string missing(const char* gap)
 {
     return sharedText(gap, {}, "gaps");
 }
 
+// Pieces of a run
 const std::string command = "0 runProcess Running command: apt update\n";
 const std::string packageSame = "0 checkUpdate NWM_UM_NO_UPDATES 1 == 1\n";
 const std::string packageDiffers = "0 checkUpdate NWM_UM_UPDATE_FOUND: 1 -> 2\n";

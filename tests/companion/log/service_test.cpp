@@ -28,18 +28,13 @@ struct Said
 std::vector<Said> saidOf(const std::string& log)
 {
     std::vector<Said> list;
-    RunBuilder builder([&](Run& run) {
-        explain(run);
+    readRuns(log, [&](const Run& run) {
         Said said = {operatorView(run).meaning, run.failure ? run.failure->failure->name : "", {}, wentWell(run)};
         for (const Problem& problem : run.besides) {
             said.besides.emplace_back(problem.failure->name);
         }
         list.push_back(said);
     });
-    LogParser parser(builder);
-    parser.feed(log);
-    parser.finish();
-    builder.finish();
     return list;
 }
 

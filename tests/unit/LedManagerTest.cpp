@@ -200,6 +200,28 @@ TEST_F(Flashing, StopReturnsBeforeTheLastCycleHasEndedAndTheWaitAfterIt)
     EXPECT_EQ(Lines(all.end() - 4, all.end()), joined({{"stopped"}, bothOff(), {"ended"}}));
 }
 
+TEST_F(Flashing, TwoThreadsCanWaitForItsEnd)
+{
+    std::atomic<bool> stopped{false};
+    platform::scriptSleep([&stopped](const timespec*, timespec*) {
+        platform::note("pause");
+        platform::waitFor([&stopped] { return stopped.load(); });
+        return 0;
+    });
+    LedManager::instance()->startFlashRemoteAndMainInBlue();
+    platform::waitFor([] { return !entries("pause").empty(); });
+    LedManager::instance()->stopFlashRemoteAndMainInBlue();
+    const auto wait = [] { LedManager::instance()->waitForFlashingEnd(); };
+    std::thread first(wait);
+    std::thread second(wait);
+    platform::delay(50); // both wait
+    stopped = true;
+    first.join();
+    second.join();
+    const Lines all = journal();
+    EXPECT_EQ(Lines(all.end() - 2, all.end()), bothOff());
+}
+
 TEST_F(Flashing, StopAndWaitWithoutAThreadReturnAtOnce)
 {
     LedManager::instance()->stopFlashRemoteAndMainInBlue();

@@ -2,8 +2,90 @@
 
 #include <gtest/gtest.h>
 
+#include <cstdlib>
+#include <fstream>
+#include <map>
+#include <regex>
+#include <sstream>
+#include <utility>
+
+namespace
+{
+
+/// Compares the different reports of each test, as text without its line breaks, with those that golden/reports keeps
+/// of it: a file for each suite, and in it a line "# TEST" for each test. With KEEP_REPORTS in the environment it keeps
+/// them.
+class KeptReports : public testing::EmptyTestEventListener
+{
+public:
+    void add(const Report& report)
+    {
+        static const std::regex lineBreak("\n +(?!Fix:|The updater:)");
+        static const std::regex folder("\"[^\"]*/harl-updater-test-\\w+");
+        std::ostringstream out;
+        report.write(false, out);
+        out << report.toJson()["facts"] << "\n";
+        const std::string text =
+            std::regex_replace(std::regex_replace(out.str(), lineBreak, " "), folder, "\"(folder)");
+        mSaid += mSaid.find(text) == std::string::npos ? text : "";
+    }
+
+private:
+    void OnTestEnd(const testing::TestInfo& test) override
+    {
+        const std::string said = std::exchange(mSaid, "");
+        if (std::getenv("KEEP_REPORTS") != nullptr) {
+            mKept[test.test_suite_name()] += said.empty() ? "" : title(test) + said;
+        } else if (!said.empty()) {
+            EXPECT_EQ(said, kept(test)) << "if it is meant: tests/companion/make-golden-checks";
+        }
+    }
+
+    void OnTestProgramEnd(const testing::UnitTest&) override
+    {
+        for (const auto& [suite, text] : mKept) {
+            if (!text.empty()) {
+                std::ofstream(file(suite)) << text;
+            }
+        }
+    }
+
+    static std::string title(const testing::TestInfo& test) { return std::string("# ") + test.name() + '\n'; }
+
+    static std::string file(const std::string& suite)
+    {
+        return KEPT_REPORTS "/" + suite.substr(suite.find('/') + 1) + ".txt";
+    }
+
+    static std::string kept(const testing::TestInfo& test)
+    {
+        std::ostringstream all;
+        all << '\n' << std::ifstream(file(test.test_suite_name())).rdbuf();
+        const std::string text = all.str() + "# ";
+        const std::size_t found = text.find('\n' + title(test));
+        const std::size_t begin = found + 1 + title(test).size();
+        return found == std::string::npos ? "" : text.substr(begin, text.find("\n# ", begin - 1) + 1 - begin);
+    }
+
+    std::string mSaid; // by the reports of the running test
+    std::map<std::string, std::string> mKept;
+};
+
+KeptReports& keptReports()
+{
+    static KeptReports* reports = [] {
+        auto* made = new KeptReports; // GoogleTest's own from here on
+        testing::UnitTest::GetInstance()->listeners().Append(made);
+        return made;
+    }();
+    return *reports;
+}
+
+} // namespace
+
 Lines findingsOf(const Report& report)
 {
+    keptReports().add(report);
     Lines lines;
     for (const Finding& finding : report.findings()) {
         lines.push_back(nlohmann::json(finding.severity).get<std::string>() + ' ' + finding.check);
@@ -13,6 +95,7 @@ Lines findingsOf(const Report& report)
 
 std::string whatOf(const Report& report, const std::string& check)
 {
+    keptReports().add(report);
     Lines found;
     for (const Finding& finding : report.findings()) {
         if (finding.check == check) {
@@ -25,6 +108,7 @@ std::string whatOf(const Report& report, const std::string& check)
 
 std::string factOf(const Report& report, const std::string& name)
 {
+    keptReports().add(report);
     const nlohmann::ordered_json facts = report.toJson()["facts"];
     return facts.contains(name) ? facts[name].dump() : "";
 }

@@ -7,6 +7,8 @@
 
 using Lines = std::vector<std::string>;
 
+// The running test also fails unless the whole report is what golden/reports keeps of it.
+
 /// Severity and check of every finding, such as "error file-missing", in order.
 Lines findingsOf(const Report& report);
 

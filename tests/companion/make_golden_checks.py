@@ -2,11 +2,13 @@
 
 Keeps what `harl-updater-tool stick` and `harl-updater-tool unit` say before the update of each named scenario of the
 bench, or of all, in golden/stick.txt and golden/unit.txt: a line "# SCENARIO" for each that it is said of, then the
-text. The sticks are those of the bench's real unit, the units are stand-ins. Read the differences before you commit
-them. golden_checks_test.py compares what is kept with what the programs of a build folder say.
+text. The sticks are those of the bench's real unit, the units are stand-ins. golden_checks_test.py compares what is
+kept with what the programs of a build folder say. Without a SCENARIO it also keeps the reports of these programs'
+tests, in golden/reports. Read the differences before you commit them.
 """
 
 import argparse
+import os
 import re
 import subprocess
 import sys
@@ -79,6 +81,10 @@ def main() -> int:
     if unknown := set(arguments.scenarios) - set(scenario.names()):
         parser.error(f"no scenario {min(unknown)!r}: bench/run --list shows all")
     build("harl-updater-tool", "unit-on-standin")
+    if not arguments.scenarios:
+        build("stick-tests", "unit-check-tests")
+        for program in ("stick-tests", "unit-check-tests"):
+            subprocess.run([BUILD / "tests/companion" / program], env=os.environ | {"KEEP_REPORTS": "1"}, check=True)
     for name in arguments.scenarios or scenario.names():
         setup = scenario.load(name).setup
         for kind in KINDS:

@@ -12,22 +12,18 @@
 namespace
 {
 
-/// Compares the different reports of each test, as text without its line breaks, with those that golden/reports keeps
-/// of it: a file for each suite, and in it a line "# TEST" for each test. With KEEP_REPORTS in the environment it keeps
-/// them.
+/// Compares the different reports of each test with those that golden/reports keeps of it: a file for each suite, and
+/// in it a line "# TEST" for each test. With KEEP_REPORTS in the environment it keeps them.
 class KeptReports : public testing::EmptyTestEventListener
 {
 public:
-    void add(const Report& report)
+    void add(const std::string& text)
     {
-        static const std::regex lineBreak("\n +(?!Fix:|The updater:)");
-        static const std::regex folder("\"[^\"]*/harl-updater-test-\\w+");
-        std::ostringstream out;
-        report.write(false, out);
-        out << report.toJson()["facts"] << "\n";
-        const std::string text =
-            std::regex_replace(std::regex_replace(out.str(), lineBreak, " "), folder, "\"(folder)");
-        mSaid += mSaid.find(text) == std::string::npos ? text : "";
+        static const std::regex folder("([\"=:'])[^\"=:']*/harl-updater-test-\\w+");
+        static const std::regex process("(Process|ps) \\d+");
+        const std::string shown =
+            std::regex_replace(std::regex_replace(text, folder, "$1(folder)"), process, "$1 (number)");
+        mSaid += mSaid.find(shown) == std::string::npos ? shown : "";
     }
 
 private:
@@ -81,11 +77,25 @@ KeptReports& keptReports()
     return *reports;
 }
 
+/// The report as text, each finding on a line for each of its parts.
+void compare(const Report& report)
+{
+    static const std::regex lineBreak("\n +(?!Fix:|The updater:)");
+    std::ostringstream text;
+    report.write(false, text);
+    compareWithKept(std::regex_replace(text.str(), lineBreak, " ") + report.toJson()["facts"].dump() + '\n');
+}
+
 } // namespace
+
+void compareWithKept(const std::string& text)
+{
+    keptReports().add(text);
+}
 
 Lines findingsOf(const Report& report)
 {
-    keptReports().add(report);
+    compare(report);
     Lines lines;
     for (const Finding& finding : report.findings()) {
         lines.push_back(nlohmann::json(finding.severity).get<std::string>() + ' ' + finding.check);
@@ -95,7 +105,7 @@ Lines findingsOf(const Report& report)
 
 std::string whatOf(const Report& report, const std::string& check)
 {
-    keptReports().add(report);
+    compare(report);
     Lines found;
     for (const Finding& finding : report.findings()) {
         if (finding.check == check) {
@@ -108,7 +118,7 @@ std::string whatOf(const Report& report, const std::string& check)
 
 std::string factOf(const Report& report, const std::string& name)
 {
-    keptReports().add(report);
+    compare(report);
     const nlohmann::ordered_json facts = report.toJson()["facts"];
     return facts.contains(name) ? facts[name].dump() : "";
 }

@@ -7,7 +7,9 @@
 
 using Lines = std::vector<std::string>;
 
-// The running test also fails unless the whole report is what golden/reports keeps of it.
+/// The running test fails unless `text` is what golden/reports keeps of it, temporary folders and process numbers
+/// apart. The operations below compare their whole report so, too.
+void compareWithKept(const std::string& text);
 
 /// Severity and check of every finding, such as "error file-missing", in order.
 Lines findingsOf(const Report& report);

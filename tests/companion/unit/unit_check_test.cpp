@@ -42,7 +42,11 @@ protected:
         CheckResult result = {
             runUnit({true, false, false}, site, out, errors), nlohmann::json::parse(out.str()), {}, ""};
         result.errors = errors.str();
+        nlohmann::json facts = result.report["facts"];
+        facts.erase("free_bytes"); // of this machine
+        compareWithKept(facts.dump() + '\n' + result.errors);
         for (const auto& finding : result.report["findings"]) {
+            compareWithKept(finding.dump() + '\n');
             result.findings.push_back(finding["severity"].get<std::string>() + ' ' +
                                       finding["check"].get<std::string>());
         }

@@ -19,10 +19,15 @@ class KeptReports : public testing::EmptyTestEventListener
 public:
     void add(const std::string& text)
     {
-        static const std::regex folder("([\"=:'])[^\"=:']*/harl-updater-test-\\w+");
-        static const std::regex process("(Process|ps) \\d+");
-        const std::string shown =
-            std::regex_replace(std::regex_replace(text, folder, "$1(folder)"), process, "$1 (number)");
+        static const std::pair<std::regex, const char*> changing[] = {
+            {std::regex("([\"=:' ])[^\"=:' ]*/harl-updater-test-\\w+"), "$1(folder)"},
+            {std::regex("/harl-updater-tool-\\w+"), "/(folder)"},
+            {std::regex("(Process|ps) \\d+"), "$1 (number)"},
+        };
+        std::string shown = text;
+        for (const auto& [pattern, replacement] : changing) {
+            shown = std::regex_replace(shown, pattern, replacement);
+        }
         mSaid += mSaid.find(shown) == std::string::npos ? shown : "";
     }
 

@@ -217,6 +217,9 @@ TEST_F(UnitCheck, CompleteUnitIsFit)
     EXPECT_EQ(facts["package_candidate"], "1.3.0");
     EXPECT_EQ(facts["needed_bytes"], 1'000'000 + 2048 * 1024);
     EXPECT_EQ(facts["mirrors"], 1);
+    for (const std::string& call : unit.calls()) {
+        compareWithKept(call + '\n');
+    }
 }
 
 TEST_F(UnitCheck, ChangesNothing)

@@ -553,9 +553,12 @@ TEST_F(Stick, NothingOnTheStickIsChanged)
 TEST_F(Stick, VersionFolderThatMayNotBeEnteredIsUnchecked)
 {
     for (const char* folder : {"debs/QUORB/armhf/quorb2.2.0", "debs/QUORB/armhf"}) {
-        chmod(stick.path(folder).c_str(), 0744);
-        const AsNobody nobody;
-        EXPECT_EQ(findings(), Lines{"unchecked stick-unreadable"}) << folder;
+        chmod(stick.path(folder).c_str(), 0444);
+        {
+            const AsNobody nobody;
+            EXPECT_EQ(findings(), Lines{"unchecked stick-unreadable"}) << folder;
+        }
+        chmod(stick.path(folder).c_str(), 0755);
     }
 }
 

@@ -2,6 +2,7 @@
 
 import shlex
 import shutil
+import signal
 from collections.abc import Callable, Iterator
 from pathlib import Path
 from typing import Any
@@ -15,6 +16,10 @@ ROOT = Path(__file__).parents[1]
 
 pytest_plugins = ["tests.service.service"]
 pytest.register_assert_rewrite("tests.commands", "tests.service.stand_in")
+
+
+# A shell starts what it runs in the background with this signal ignored, and so would be all that a test interrupts.
+signal.signal(signal.SIGINT, signal.default_int_handler)
 
 
 def pytest_addoption(parser: pytest.Parser) -> None:

@@ -2,12 +2,14 @@
 
 #include "findings.h"
 #include "log/run.h"
+#include "log/text.h"
 #include "procedure.h"
 #include "stick/signature.h"
 #include "stick/stick_check.h"
 #include "unit/unit_check.h"
 
 #include <filesystem>
+#include <optional>
 #include <ostream>
 #include <sstream>
 
@@ -16,30 +18,40 @@ namespace
 
 const auto filesLimit = 120s; // dpkg(1) reads every file of the package
 
-/// "1.2.0 -> 1.3.0, would be installed"
-std::string plan(const std::string& installed, const std::string& candidate)
+/// Whether two versions are not the same text; nothing when one of them is not known.
+std::optional<bool> differ(const std::string& one, const std::string& other)
 {
-    if (installed.empty() || candidate.empty()) {
-        return "not known: a version cannot be read";
-    }
-    return installed == candidate ? installed + ", up to date"
-                                  : installed + " -> " + candidate + ", would be installed";
+    return one.empty() || other.empty() ? std::nullopt : std::optional(one != other);
+}
+
+/// "1.2.0 -> 1.3.0, would be installed"
+std::string plan(const std::string& installed, const std::string& candidate, const char* since = "")
+{
+    const std::optional<bool> update = differ(installed, candidate);
+    return !update   ? "not known: a version cannot be read"
+           : *update ? installed + " -> " + candidate + ", would be installed" + since
+                     : installed + ", up to date" + since;
 }
 
 void addPlans(const Unit& unit, Report& report)
 {
-    const std::string board = plan(report.fact("board_version"), report.fact("version"));
-    const std::string candidate = report.fact("package_now");
-    report.addFact(
-        "package_plan", "Package",
-        plan(report.fact("package_installed"), candidate.empty() ? report.fact("package_candidate") : candidate) +
-            (candidate.empty() ? ", as of the last refresh" : ""));
-    report.addFact("board_plan", "Board", board);
-    const bool installs = contains(board, "would be installed");
-    const std::int64_t seconds = outcomeWait + giveBackWait + (installs ? boardWait : 0);
-    report.addFact("shortest_s", "Takes at least",
-                   std::to_string((seconds + 59) / 60) + " min, and what downloading and copying take", seconds);
-    if (unit.isMainHead() && installs) {
+    const std::string installed = report.fact("package_installed");
+    const std::string now = report.fact("package_now");
+    const std::string candidate = now.empty() ? report.fact("package_candidate") : now;
+    report.addFact("package_plan", "Package",
+                   plan(installed, candidate, now.empty() ? ", as of the last refresh" : ""));
+    const std::string onBoard = report.fact("board_version");
+    const std::string onStick = report.fact("version");
+    report.addFact("board_plan", "Board", plan(onBoard, onStick));
+
+    const std::optional<bool> package = differ(installed, candidate);
+    const std::optional<bool> board = differ(onBoard, onStick);
+    const std::int64_t reading = unit.isMainHead() ? 0 : outcomeWait; // of the panel
+    const std::int64_t seconds = reading + giveBackWait + (board.value_or(false) ? boardWait : 0);
+    report.addFact("shortest_s", "Takes at least", durationText(seconds) + ", and what downloading and copying take",
+                   seconds);
+    const bool teamViewer = report.toJson()["facts"].value("teamviewer_requested", false);
+    if (unit.isMainHead() && package && board && (*package || *board || teamViewer)) {
         report.add("update-offered");
     }
 }
@@ -48,14 +60,14 @@ void addPlans(const Unit& unit, Report& report)
 void checkFiles(const Unit& unit, Report& report)
 {
     const CommandResult files = unit.run({"dpkg", "--verify", unit.package()}, filesLimit);
-    if (!files.started || files.timedOut || (files.exitCode != 0 && files.output.empty())) {
+    if (files.exitCode < 0 || (!files.succeeded() && files.output.empty())) {
         report.add("package-files.unknown", {{"complaint", complaint(files)}});
         return;
     }
     std::vector<std::string> wrong;
     for (const std::string& line : linesOf(files.output)) { // "??5??????   /path", with c before a configuration file's
         const std::size_t path = line.find('/');
-        if (path != std::string::npos && path > 2 && line.substr(path - 2, 2) != "c ") {
+        if (path != std::string::npos && !contains(line.substr(0, path), " c ")) {
             wrong.push_back(line.substr(path));
         }
     }
@@ -73,7 +85,7 @@ void checkConfiguration(const Unit& unit, Report& report)
     for (const std::string& line : linesOf(list.output)) { // " /etc/file checksum"
         std::istringstream words(line);
         std::string path;
-        if (words >> path && path.front() == '/' && std::filesystem::exists(unit.path(path + ".dpkg-dist"))) {
+        if (words >> path && std::filesystem::exists(unit.path(path + ".dpkg-dist"))) {
             kept.push_back(path);
         }
     }
@@ -100,21 +112,24 @@ void checkVersions(const Unit& unit, Report& report)
     const CommandResult package = unit.run({"dpkg-query", "--show", "--showformat=${Version}", unit.package()}, quick);
     const std::string installed = escaped(package.output);
     if (package.succeeded()) {
-        report.addFact("package_installed", "Package installed", installed);
+        report.addFact("package_installed", "Package installed", shown(package.output), installed);
     }
     checkBoard(unit, report);
     if (run.steps.empty()) {
         report.add("last-run");
         return;
     }
-    const auto compare = [&](const char* check, const std::string& found, const Versions& versions) {
+    const auto compare = [&](const char* check, const std::string& found, const Versions& versions, StepKind step) {
+        if (run.mainHead && versions.differ() && run.find(step) == nullptr) {
+            return; // its user did not want it
+        }
         const std::string& wanted = versions.differ() ? versions.candidate : versions.installed;
-        if (!found.empty() && versions.found() && !wanted.empty() && found != wanted) {
+        if (versions.found() && differ(found, wanted).value_or(false)) {
             report.add(check, {{"found", shown(found)}, {"wanted", shown(wanted)}});
         }
     };
-    compare("package-version", installed, run.package);
-    compare("board-version-old", report.fact("board_version"), run.board);
+    compare("package-version", installed, run.package, StepKind::INSTALL_PACKAGE);
+    compare("board-version-old", report.fact("board_version"), run.board, StepKind::UPLOAD_BOARD);
 }
 
 /// The line for the journal.

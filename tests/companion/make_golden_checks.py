@@ -1,27 +1,31 @@
 """Usage: tests/companion/make-golden-checks [SCENARIO...]
 
-Keeps what `harl-updater-tool stick` and `harl-updater-tool unit` say before the update of each named scenario of the
-bench, or of all, in golden/stick.txt and golden/unit.txt: a line "# SCENARIO" for each that it is said of, then the
-text. The sticks are those of the bench's real unit, the units are stand-ins. golden_checks_test.py compares what is
-kept with what the programs of a build folder say. Without a SCENARIO it also keeps the reports of these programs'
-tests, in golden/reports. Read the differences before you commit them.
+Keeps what `harl-updater-tool stick`, `unit` and `check` say before the update of each named scenario of the bench, or
+of all, and what `verify` says after it, in golden/stick.txt and so on: a line "# SCENARIO" for each that it is said of,
+then the text. The sticks are those of the bench's real unit, the units are stand-ins; after the update they are as the
+scenario expects, with the run of golden/log in their journal. golden_checks_test.py compares what is kept with what the
+programs of a build folder say. Without a SCENARIO it also keeps the reports of these programs' tests, in
+golden/reports. Read the differences before you commit them.
 """
 
 import argparse
+import contextlib
 import os
 import re
 import subprocess
 import sys
 import tempfile
+from collections.abc import Iterator
 from pathlib import Path
 
 from bench import scenario
 from bench.build import BUILD, build
 from bench.real.files import write_stick
-from bench.scenario import Setup
+from bench.scenario import Scenario, Setup
 
 ROOT = Path(__file__).resolve().parents[2]
 GOLDEN = ROOT / "tests/companion/golden"
+ON_STAND_IN = "tests/companion/unit-on-standin"
 
 
 def run(command: list[str | Path], folder: str) -> str:
@@ -30,27 +34,56 @@ def run(command: list[str | Path], folder: str) -> str:
     return f"{done.stdout}Exit status: {done.returncode}\n"
 
 
-def check_stick(emulator: list[str], programs: Path, setup: Setup) -> str:
-    """What the tool, run by the emulator, says about the stick; about an empty mount point when none is inserted."""
+@contextlib.contextmanager
+def stick_of(setup: Setup) -> Iterator[str]:
+    """A folder with the stick as "stick"; an empty mount point when none is inserted."""
     with tempfile.TemporaryDirectory(prefix="golden-") as folder:
         mount_point = Path(folder) / "stick"
         if setup.stick.inserted:
             write_stick(mount_point, setup)
         else:
             mount_point.mkdir()
+        yield folder
+
+
+def check_stick(emulator: list[str], programs: Path, what: Scenario) -> str:
+    """What the tool, run by the emulator, says about the stick."""
+    with stick_of(what.setup) as folder:
         return run([*emulator, programs / "companion/harl-updater-tool", "stick", "stick"], folder)
 
 
-def check_unit(emulator: list[str], programs: Path, setup: Setup) -> str:
-    """What the tool says about the unit, without what differs from run to run."""
-    variables = scenario.variables(setup)
-    program = programs / "tests/companion/unit-on-standin"
-    said = run([*emulator, program, *(f"{name}={value}" for name, value in variables.items())], "/")
+def on_stand_in(command: list[str | Path], folder: str, settings: dict[str, str]) -> str:
+    """What a command of unit-on-standin prints, without what differs from run to run."""
+    said = run([*command, *(f"{name}={value}" for name, value in settings.items())], folder)
     said = re.sub(r"^(Free space: +).*", r"\1(of this machine)", said, flags=re.MULTILINE)
     return re.sub(r"\b(Process|ps) \d+", r"\1 PID", said)
 
 
-KINDS = {"stick": check_stick, "unit": check_unit}
+def check_unit(emulator: list[str], programs: Path, what: Scenario) -> str:
+    """What the tool says about the unit."""
+    return on_stand_in([*emulator, programs / ON_STAND_IN, "unit"], "/", scenario.variables(what.setup))
+
+
+def check_update(emulator: list[str], programs: Path, what: Scenario) -> str:
+    """What the tool says about the unit with the stick."""
+    with stick_of(what.setup) as folder:
+        command = [*emulator, programs / ON_STAND_IN, "check", "stick"]
+        return on_stand_in(command, folder, scenario.variables(what.setup))
+
+
+def verify_unit(emulator: list[str], programs: Path, what: Scenario) -> str:
+    """What the tool says about the unit after the update."""
+    after = {
+        "UNIT_JOURNAL": str(GOLDEN / f"log/{what.name}.log"),
+        "UNIT_HARL": what.expect.harl,
+        "UNIT_PACKAGE": "iF" if what.setup.package.install in ("fails", "asks") else "ii",
+        "PACKAGE_INSTALLED": what.expect.package,
+        "BOARD_INSTALLED": what.expect.board,
+    }
+    return on_stand_in([*emulator, programs / ON_STAND_IN, "verify"], "/", scenario.variables(what.setup) | after)
+
+
+KINDS = {"stick": check_stick, "unit": check_unit, "check": check_update, "verify": verify_unit}
 
 
 def golden(kind: str) -> dict[str, str]:
@@ -86,9 +119,9 @@ def main() -> int:
         for program in ("stick-tests", "unit-check-tests"):
             subprocess.run([BUILD / "tests/companion" / program], env=os.environ | {"KEEP_REPORTS": "1"}, check=True)
     for name in arguments.scenarios or scenario.names():
-        setup = scenario.load(name).setup
-        for kind in KINDS:
-            keep(kind, golden(kind) | {name: KINDS[kind]([], BUILD, setup)})
+        what = scenario.load(name)
+        for kind, check in KINDS.items():
+            keep(kind, golden(kind) | {name: check([], BUILD, what)})
     return 0
 
 

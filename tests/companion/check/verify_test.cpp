@@ -1,16 +1,38 @@
 #include "check/check.h"
 #include "findings.h"
+#include "stick/signature.h"
+
+#include "finding_lines.h"
 #include "unit/standin.h"
 
+#include <functional>
 #include <sstream>
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+using testing::Contains;
+using testing::ElementsAreArray;
 using testing::HasSubstr;
+using testing::Not;
+using testing::StartsWith;
 
 namespace
 {
+
+const std::string logs = GOLDEN_LOG_FOLDER "/";
+
+/// The findings in a report for programs: "error package-files: Files of the package are missing ...".
+Lines findingsIn(const std::string& report)
+{
+    const nlohmann::json parsed = nlohmann::json::parse(report);
+    Lines findings;
+    for (const nlohmann::json& finding : parsed["findings"]) {
+        findings.push_back(finding["severity"].get<std::string>() + ' ' + finding["check"].get<std::string>() + ": " +
+                           finding["what"].get<std::string>());
+    }
+    return findings;
+}
 
 /// A unit after an update that installed package 1.3.0 and board 2.2.0.
 class Verify : public testing::Test
@@ -18,86 +40,193 @@ class Verify : public testing::Test
 protected:
     Verify()
     {
-        unit.replaceTool("dpkg", "exit 0");
-        unit.replaceTool("journalctl", "exec /bin/cat '" GOLDEN_LOG_FOLDER "/package-and-board.log'");
+        unit.set("UNIT_JOURNAL", logs + "package-and-board.log");
+        unit.set("PACKAGE_INSTALLED", "1.3.0");
         unit.set("BOARD_INSTALLED", "2.2.0");
-        installed("1.3.0");
     }
 
-    void installed(const std::string& version) const
-    {
-        unit.replaceTool("dpkg-query",
-                         "case $2 in *Version*) printf " + version + R"(;; *Conffiles*) echo; echo ' /etc/a.conf 0';;
-            *Status-Abbrev*) printf 'ii \tsolvik4-rh\n';; *) [ "$3" = solvik4-rh ] && printf installed;; esac)");
-    }
-
-    std::string record() const
+    std::string record(int status) const
     {
         std::ostringstream out;
-        runVerify({false, true}, unit.site(), out);
+        EXPECT_EQ(runVerify({false, true}, unit.site(), out), status);
         return out.str();
     }
 
     StandInUnit unit;
 };
 
+struct Aftermath
+{
+    const char* name;
+    std::function<void(StandInUnit& unit)> make;
+    int status;
+    const char* record;
+    Lines findings;
+};
+
+void PrintTo(const Aftermath& aftermath, std::ostream* out)
+{
+    *out << aftermath.name;
+}
+
+/// The first lines of the update's log, as a journal that the power cut.
+void cutJournal(const StandInUnit& unit, int lines)
+{
+    unit.replaceTool("journalctl",
+                     "exec /usr/bin/head -n " + std::to_string(lines) + " '" + logs + "package-and-board.log'");
+}
+
+/// What one change of a unit that is well makes of the verification.
+class VerifyAfter : public Verify, public testing::WithParamInterface<Aftermath>
+{
+};
+
 } // namespace
 
-TEST_F(Verify, UnitAsTheRunLeftItIsWell)
+TEST_P(VerifyAfter, IsFound)
 {
-    EXPECT_EQ(record(), "verify: the unit is well\n");
+    GetParam().make(unit);
+    EXPECT_EQ(record(GetParam().status), std::string("verify: ") + GetParam().record + '\n');
     std::ostringstream out;
-    EXPECT_EQ(runVerify({}, unit.site(), out), Report::STATUS_FIT);
-    EXPECT_THAT(out.str(), HasSubstr("The unit is well.\n"));
+    EXPECT_EQ(runVerify({true, false}, unit.site(), out), GetParam().status);
+    EXPECT_THAT(findingsIn(out.str()), ElementsAreArray(GetParam().findings));
 }
 
-TEST_F(Verify, BoardThatKeptItsOldVersionIsFound)
-{
-    unit.set("BOARD_INSTALLED", "2.1.0");
-    EXPECT_EQ(record(), "verify: the unit is not well: board-version-old\n");
-}
+INSTANTIATE_TEST_SUITE_P(
+    Each, VerifyAfter,
+    testing::Values(
+        Aftermath{"NothingElseUnitIsWell", [](StandInUnit& /*unit*/) {}, 0, "the unit is well", {}},
+        Aftermath{"BoardKeptItsVersion",
+                  [](StandInUnit& unit) { unit.set("BOARD_INSTALLED", "2.1.0"); },
+                  1,
+                  "the unit is not well: board-version-old",
+                  {R"(error board-version-old: The board has the version "2.1.0", not "2.2.0", )"
+                   "which the last run should have left."}},
+        Aftermath{"PackageKeptItsVersion",
+                  [](StandInUnit& unit) { unit.set("PACKAGE_INSTALLED", "1.2.0"); },
+                  1,
+                  "the unit is not well: package-version",
+                  {R"(error package-version: The package has the version "1.2.0", not "1.3.0", )"
+                   "which the last run should have left."}},
+        Aftermath{
+            "FilesAreDamaged",
+            [](StandInUnit& unit) {
+                unit.replaceTool("dpkg", "echo '??5?????? c /etc/a.conf'; echo 'missing   c /etc/b.conf'; "
+                                         "echo 'a line without a path'; echo '??5??????   /usr/bin/harl'; "
+                                         "echo 'missing     /usr/lib/x'; exit 1");
+            },
+            1,
+            "the unit is not well: package-files",
+            {R"(error package-files: Files of the package are missing or damaged: "/usr/bin/harl", "/usr/lib/x".)"}},
+        Aftermath{"ConfigurationWasChanged",
+                  [](StandInUnit& unit) { unit.replaceTool("dpkg", "echo '??5?????? c /etc/a.conf'; exit 1"); },
+                  0,
+                  "the unit is well",
+                  {}},
+        Aftermath{"FilesCannotBeCompared",
+                  [](StandInUnit& unit) { unit.replaceTool("dpkg", "echo 'dpkg: no database' >&2; exit 2"); },
+                  2,
+                  "not everything could be checked: package-files",
+                  {"unchecked package-files: The package's files cannot be compared with the database: "
+                   "\"dpkg: no database\"."}},
+        Aftermath{"ComparisonIsKilled",
+                  [](StandInUnit& unit) { unit.replaceTool("dpkg", "echo '??5??????   /usr/lib/x'; kill -9 $$"); },
+                  2,
+                  "not everything could be checked: package-files",
+                  {"unchecked package-files: The package's files cannot be compared with the database: "
+                   "a signal ended the command."}},
+        Aftermath{"InstallationIsUnfinished",
+                  [](StandInUnit& unit) { unit.put("var/lib/dpkg/updates/0001", ""); },
+                  1,
+                  "the unit is not well: package-half-configured",
+                  {"error package-half-configured: The package manager has unfinished work: an interrupted run."}},
+        Aftermath{"ConfigurationWasKept",
+                  [](StandInUnit& unit) { unit.put("etc/panel.conf.dpkg-dist", ""); },
+                  0,
+                  "the unit is well",
+                  {"warning configuration-kept: Changed configuration files were kept; the package's own are beside "
+                   "them, with .dpkg-dist: \"/etc/panel.conf\"."}},
+        Aftermath{"ApplicationFailed",
+                  [](StandInUnit& unit) { unit.set("UNIT_HARL", "failed"); },
+                  1,
+                  "the unit is not well: application",
+                  {R"(error application: The application harl is "failed".)"}},
+        Aftermath{"JournalIsEmpty",
+                  [](StandInUnit& unit) { unit.set("UNIT_JOURNAL", ""); },
+                  2,
+                  "not everything could be checked: last-run",
+                  {"unchecked last-run: The journal holds no run: what was to be installed is not known."}},
+        Aftermath{"JournalEndsWithTheUpdateThatWasFound",
+                  [](StandInUnit& unit) {
+                      cutJournal(unit, 76);
+                      unit.set("BOARD_INSTALLED", "2.1.0");
+                  },
+                  1,
+                  "the unit is not well: board-version-old",
+                  {R"(error board-version-old: The board has the version "2.1.0", not "2.2.0", )"
+                   "which the last run should have left."}},
+        Aftermath{"JournalEndsBeforeTheComparison",
+                  [](StandInUnit& unit) { cutJournal(unit, 74); },
+                  0,
+                  "the unit is well",
+                  {}},
+        Aftermath{"BoardOfAMainHeadIsNotTheOneThatItsRunFound",
+                  [](StandInUnit& unit) {
+                      unit.set("UPDATER_PROGRAM", "main");
+                      unit.set("UNIT_JOURNAL", logs + "main-head-up-to-date.log");
+                      unit.set("BOARD_INSTALLED", "2.1.0");
+                  },
+                  1,
+                  "the unit is not well: board-version-old",
+                  {R"(error board-version-old: The board has the version "2.1.0", not "2.2.0", )"
+                   "which the last run should have left."}},
+        Aftermath{"EverythingIsWrong",
+                  [](StandInUnit& unit) {
+                      unit.set("UNIT_HARL", "failed");
+                      unit.set("UNIT_PACKAGE", "iF");
+                      unit.replaceTool("dpkg", "echo '??5??????   /usr/lib/x'");
+                      unit.put("etc/harl.conf.dpkg-dist", "");
+                      unit.set("PACKAGE_INSTALLED", "1.2.0");
+                      unit.set("BOARD_INSTALLED", "2.1.0");
+                  },
+                  1,
+                  "the unit is not well: application, package-half-configured, package-files, package-version, "
+                  "board-version-old",
+                  {R"(error application: The application harl is "failed".)",
+                   R"(error package-half-configured: The package manager has unfinished work: "solvik4-rh".)",
+                   R"(error package-files: Files of the package are missing or damaged: "/usr/lib/x".)",
+                   "warning configuration-kept: Changed configuration files were kept; the package's own are beside "
+                   "them, with .dpkg-dist: \"/etc/harl.conf\".",
+                   R"(error package-version: The package has the version "1.2.0", not "1.3.0", )"
+                   "which the last run should have left.",
+                   R"(error board-version-old: The board has the version "2.1.0", not "2.2.0", )"
+                   "which the last run should have left."}},
+        Aftermath{"NothingCanBeAsked",
+                  [](StandInUnit& unit) {
+                      for (const char* tool : {"systemctl", "dpkg", "dpkg-query", "journalctl"}) {
+                          unit.removeTool(tool);
+                      }
+                  },
+                  2,
+                  "not everything could be checked: application, packages-unknown, package-files, last-run",
+                  {"unchecked application: The service manager cannot be asked for the application.",
+                   "unchecked packages-unknown: The installed packages cannot be listed: "
+                   "the command could not be started.",
+                   "unchecked package-files: The package's files cannot be compared with the database: "
+                   "the command could not be started.",
+                   "unchecked last-run: The journal holds no run: what was to be installed is not known."}}),
+    [](const auto& test) { return test.param.name; });
 
-TEST_F(Verify, PackageThatKeptItsOldVersionIsFound)
+TEST_F(Verify, ReportForProgramsNamesCommandAndVersions)
 {
-    installed("1.2.0");
-    EXPECT_EQ(record(), "verify: the unit is not well: package-version\n");
-}
-
-TEST_F(Verify, DamagedFilesAreFoundButChangedConfigurationIsNot)
-{
-    unit.replaceTool("dpkg", "echo '??5?????? c /etc/a.conf'; exit 1");
-    EXPECT_EQ(record(), "verify: the unit is well\n");
-    unit.replaceTool("dpkg", "echo '??5??????   /usr/bin/harl'; echo 'missing     /usr/lib/x'; exit 1");
-    EXPECT_EQ(record(), "verify: the unit is not well: package-files\n");
-}
-
-TEST_F(Verify, UnfinishedInstallationIsFound)
-{
-    unit.put("var/lib/dpkg/updates/0001", "");
-    EXPECT_EQ(record(), "verify: the unit is not well: package-half-configured\n");
-}
-
-TEST_F(Verify, KeptConfigurationIsAWarning)
-{
-    unit.put("etc/a.conf.dpkg-dist", "");
     std::ostringstream out;
-    EXPECT_EQ(runVerify({true, false}, unit.site(), out), Report::STATUS_FIT);
-    EXPECT_EQ(nlohmann::json::parse(out.str())["findings"][0]["check"], "configuration-kept");
+    runVerify({true, false}, unit.site(), out);
+    const nlohmann::json report = nlohmann::json::parse(out.str());
+    EXPECT_EQ(report["command"], "verify");
+    EXPECT_EQ(report["facts"], (nlohmann::json{{"board_version", "2.2.0"}, {"package_installed", "1.3.0"}}));
 }
 
-TEST_F(Verify, ApplicationThatDoesNotRunIsFound)
-{
-    unit.replaceTool("systemctl", R"(printf 'Id=harl.service\nLoadState=loaded\nActiveState=failed\n\n')");
-    EXPECT_EQ(record(), "verify: the unit is not well: application\n");
-}
-
-TEST_F(Verify, WithoutAJournalWhatWasToBeInstalledIsOpen)
-{
-    unit.replaceTool("journalctl", "exit 0");
-    EXPECT_EQ(record(), "verify: not everything could be checked: last-run\n");
-}
-
-TEST(Check, TellsWhatWouldHappen)
+TEST(Check, TellsProgramsWhatWouldHappen)
 {
     const StandInUnit unit;
     const TestFolder stick;
@@ -105,10 +234,24 @@ TEST(Check, TellsWhatWouldHappen)
     std::ostringstream out;
     std::ostringstream errors;
     EXPECT_EQ(runCheck(stick.path(), true, unit.site(), out, errors), Report::STATUS_NOT_FIT); // no files to upload
-    const nlohmann::json facts = nlohmann::json::parse(out.str())["facts"];
-    EXPECT_EQ(facts["package_plan"], "1.2.0 -> 1.3.0, would be installed");
-    EXPECT_EQ(facts["board_plan"], "2.1.0 -> 2.2.0, would be installed");
-    EXPECT_EQ(facts["shortest_s"], 780 + 30 + 10);
+    const nlohmann::json report = nlohmann::json::parse(out.str());
+    EXPECT_EQ(report["command"], "check");
+    EXPECT_EQ(report["facts"]["package_plan"], "1.2.0 -> 1.3.0, would be installed");
+    EXPECT_EQ(report["facts"]["board_plan"], "2.1.0 -> 2.2.0, would be installed");
+    EXPECT_EQ(report["facts"]["shortest_s"], 780 + 30 + 10);
+}
+
+TEST(Check, TellsOfASignatureBetweenStickAndPlans)
+{
+    const StandInUnit unit;
+    const TestFolder stick;
+    stick.makeFolder("debs/QUORB/armhf/quorb2.2.0");
+    stick.put(manifestName, "");
+    std::ostringstream out;
+    runCheck(stick.path(), false, unit.site(), out, out);
+    EXPECT_THAT(out.str(), HasSubstr("\nTeamViewer:            not requested"
+                                     "\nSignature:             not checked: no keyring is installed or named"
+                                     "\nPackage:               1.2.0 -> 1.3.0, would be installed\n"));
 }
 
 TEST(Check, AsksTheMirrorsIntoPrivateLists)
@@ -138,13 +281,14 @@ TEST(Check, AsksTheMirrorsIntoPrivateLists)
 TEST_F(Verify, WritesNoRecordWhileTheNextRunGoesOn)
 {
     unit.set("UNIT_UPDATER", "activating");
-    EXPECT_EQ(record(), "");
+    EXPECT_EQ(record(Report::STATUS_UNCHECKED), "");
+    EXPECT_THAT(unit.calls(), Not(Contains(StartsWith("dpkg --verify"))));
 }
 
 TEST_F(Verify, WritesNoRecordWhenTheNextRunBeginsMeanwhile)
 {
     unit.replaceTool("dpkg", "echo UNIT_UPDATER=activating >>\"${0%/*}/../settings\"");
-    EXPECT_EQ(record(), "");
+    EXPECT_EQ(record(Report::STATUS_UNCHECKED), "");
 }
 
 TEST_F(Verify, ReportHoldsWhatSupportNeedsAndNoLogin)
@@ -178,7 +322,7 @@ TEST_F(Verify, ReportHoldsWhatSupportNeedsAndNoLogin)
           "http://(login)@kept.invalid/", "This update is NOT likely to do what it should", "# dpkg --audit"}) {
         EXPECT_THAT(texts, HasSubstr(text));
     }
-    EXPECT_THAT(texts, testing::Not(HasSubstr("secret@")));
+    EXPECT_THAT(texts, Not(HasSubstr("secret@")));
 
     EXPECT_EQ(runReport({file + "2", folder.path("none"), false}, unit.site(), out, errors), Report::STATUS_FIT);
     EXPECT_THAT(shell("tar -xzOf " + file + "2 harl-updater-report/unit.txt"), HasSubstr("fit for an update"));
@@ -200,6 +344,17 @@ TEST(Check, OnAnotherMachineTheUnitIsOpen)
     std::ostringstream errors;
     runCheck(stick.path(), true, unit.site(), out, errors);
     EXPECT_THAT(out.str(), HasSubstr("\"not-a-unit\""));
-    EXPECT_THAT(unit.calls(), testing::Not(testing::Contains(testing::StartsWith("ssh"))));
-    EXPECT_EQ(runCheck(stick.path("nowhere"), false, unit.site(), out, errors), Report::STATUS_UNCHECKED);
+    EXPECT_THAT(unit.calls(), Not(Contains(StartsWith("ssh"))));
+}
+
+TEST(Check, RefusesAFolderThatIsNotThere)
+{
+    const StandInUnit unit;
+    std::ostringstream out;
+    std::ostringstream errors;
+    EXPECT_EQ(runCheck("/nowhere", true, unit.site(), out, errors), Report::STATUS_UNCHECKED);
+    EXPECT_EQ(nlohmann::json::parse(out.str())["command"], "check");
+    EXPECT_EQ(errors.str(),
+              "harl-updater-tool: \"/nowhere\" cannot be read: No such file or directory. Name the folder "
+              "that the stick is mounted at, the one that holds \"debs\".\n");
 }

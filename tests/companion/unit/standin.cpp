@@ -19,8 +19,8 @@ namespace fs = std::filesystem;
 namespace
 {
 
-const char* const tools[] = {"systemctl", "umount", "rm",    "ls",        "apt",     "apt-cache", "ssh",
-                             "scp",       "i2cset", "aplay", "i2cdetect", "apt-get", "dpkg-query"};
+const char* const tools[] = {"systemctl", "umount", "rm",        "ls",      "apt",  "apt-cache",  "ssh",       "scp",
+                             "i2cset",    "aplay",  "i2cdetect", "apt-get", "dpkg", "dpkg-query", "journalctl"};
 
 std::string quoted(std::string text)
 {
@@ -79,6 +79,9 @@ StandInUnit::StandInUnit()
                  {"TOOLS_KILLED", ""},
                  {"UPDATER_PROGRAM", "remote"},
                  {"UNIT_ENVIRONMENT", ""},
+                 {"UNIT_HARL", "active"},
+                 {"UNIT_JOURNAL", ""},
+                 {"UNIT_PACKAGE", "ii"},
                  {"UNIT_SERVICE_ENVIRONMENT", ""},
                  {"UNIT_UPDATER", "inactive"},
                  {"UNIT_UPDATER_LOADED", "loaded"}})

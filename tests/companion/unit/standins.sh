@@ -1,5 +1,5 @@
 #!/bin/sh
-# The tools that `harl-updater-tool unit` asks, on a stand-in unit: its search path holds a link to this file for each of
+# The tools that the checks of a unit ask, on a stand-in unit: its search path holds a link to this file for each of
 # them, and nothing else. They answer as the real ones do. What the unit is like comes from the file "settings" in the
 # folder above: UNIT is the folder of the stand-in unit, the other names are the bench's for the keys of a scenario.
 # shellcheck disable=SC2154 # the settings
@@ -22,8 +22,9 @@ systemctl() {
     show-environment) printf '%s\n' "$UNIT_ENVIRONMENT" ;;
     show)
         state=loaded
-        [ "$HEAD_HARL" = known ] || state=not-found
-        printf 'Id=harl.service\nLoadState=%s\nActiveState=active\nEnvironment=\n\n' "$state"
+        active=$UNIT_HARL
+        [ "$HEAD_HARL" = known ] || state=not-found active=inactive
+        printf 'Id=harl.service\nLoadState=%s\nActiveState=%s\nEnvironment=\n\n' "$state" "$active"
         printf 'Id=harl-updater.service\nLoadState=%s\nActiveState=%s\nEnvironment=%s\n' \
             "$UNIT_UPDATER_LOADED" "$UNIT_UPDATER" "$UNIT_SERVICE_ENVIRONMENT"
         ;;
@@ -78,14 +79,28 @@ installed() { # PACKAGE
     known "$1" && [ "$PACKAGE_INSTALLED" != "(none)" ]
 }
 
+dpkg() {
+    [ "$1" = --verify ] || fail 2 "dpkg: error: need an action option"
+    installed "$2" || fail 1 "dpkg: package '$2' is not installed"
+}
+
+# shellcheck disable=SC2016 # fields of dpkg-query
 dpkg_query() {
-    if [ $# -eq 3 ]; then # one package's state
-        installed "$3" || fail 1 "dpkg-query: no packages found matching $3"
-        printf 'installed'
-        return
-    fi
-    printf 'ii \tapt\nii \tdpkg\n'
-    ! installed "$package" || printf 'ii \t%s\n' "$package"
+    [ $# -eq 2 ] || installed "$3" || fail 1 "dpkg-query: no packages found matching $3"
+    case "$1 $2" in
+    '--show --showformat=${db:Status-Status}') printf installed ;;
+    '--show --showformat=${Version}') printf %s "$PACKAGE_INSTALLED" ;;
+    '--show --showformat=${Conffiles}\n') printf '\n /etc/harl.conf 0123\n /etc/panel.conf 4567 obsolete\n' ;;
+    '--show --showformat=${db:Status-Abbrev}\t${binary:Package}\n')
+        printf 'ii \tapt\nii \tdpkg\n'
+        ! installed "$package" || printf '%s \t%s\n' "$UNIT_PACKAGE" "$package"
+        ;;
+    *) fail 2 "dpkg-query: error: unknown option" ;;
+    esac
+}
+
+journalctl() {
+    [ -z "$UNIT_JOURNAL" ] || /bin/cat "$UNIT_JOURNAL"
 }
 
 apt_cache() {

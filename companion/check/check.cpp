@@ -50,7 +50,7 @@ void addPlans(const Unit& unit, Report& report)
     const std::int64_t seconds = reading + giveBackWait + (board.value_or(false) ? boardWait : 0);
     report.addFact("shortest_s", "Takes at least", durationText(seconds) + ", and what downloading and copying take",
                    seconds);
-    const bool teamViewer = report.toJson()["facts"].value("teamviewer_requested", false);
+    const bool teamViewer = report.toJson()["facts"]["teamviewer_requested"] == true;
     if (unit.isMainHead() && package && board && (*package || *board || teamViewer)) {
         report.add("update-offered");
     }
@@ -67,7 +67,11 @@ void checkFiles(const Unit& unit, Report& report)
     std::vector<std::string> wrong;
     for (const std::string& line : linesOf(files.output)) { // "??5??????   /path", with c before a configuration file's
         const std::size_t path = line.find('/');
-        if (path != std::string::npos && !contains(line.substr(0, path), " c ")) {
+        std::istringstream words(line);
+        std::string state;
+        std::string mark;
+        words >> state >> mark;
+        if (path != std::string::npos && mark != "c") {
             wrong.push_back(line.substr(path));
         }
     }

@@ -1,4 +1,4 @@
-"""What the checks say before and after the update of each scenario of the bench is what make_golden_checks.py has kept."""
+"""What the checks say before and after the update of each scenario is what make_golden_checks.py has kept."""
 
 from pathlib import Path
 

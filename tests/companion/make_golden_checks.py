@@ -52,23 +52,23 @@ def check_stick(emulator: list[str], programs: Path, what: Scenario) -> str:
         return run([*emulator, programs / "companion/harl-updater-tool", "stick", "stick"], folder)
 
 
-def on_stand_in(command: list[str | Path], folder: str, settings: dict[str, str]) -> str:
+def on_stand_in(words: list[str | Path], settings: dict[str, str], folder: str = "/") -> str:
     """What a command of unit-on-standin prints, without what differs from run to run."""
-    said = run([*command, *(f"{name}={value}" for name, value in settings.items())], folder)
+    said = run(words + [f"{name}={value}" for name, value in settings.items()], folder)
     said = re.sub(r"^(Free space: +).*", r"\1(of this machine)", said, flags=re.MULTILINE)
     return re.sub(r"\b(Process|ps) \d+", r"\1 PID", said)
 
 
 def check_unit(emulator: list[str], programs: Path, what: Scenario) -> str:
     """What the tool says about the unit."""
-    return on_stand_in([*emulator, programs / ON_STAND_IN, "unit"], "/", scenario.variables(what.setup))
+    return on_stand_in([*emulator, programs / ON_STAND_IN, "unit"], scenario.variables(what.setup))
 
 
 def check_update(emulator: list[str], programs: Path, what: Scenario) -> str:
     """What the tool says about the unit with the stick."""
     with stick_of(what.setup) as folder:
-        command = [*emulator, programs / ON_STAND_IN, "check", "stick"]
-        return on_stand_in(command, folder, scenario.variables(what.setup))
+        settings = scenario.variables(what.setup)
+        return on_stand_in([*emulator, programs / ON_STAND_IN, "check", "stick"], settings, folder)
 
 
 def verify_unit(emulator: list[str], programs: Path, what: Scenario) -> str:
@@ -80,7 +80,7 @@ def verify_unit(emulator: list[str], programs: Path, what: Scenario) -> str:
         "PACKAGE_INSTALLED": what.expect.package,
         "BOARD_INSTALLED": what.expect.board,
     }
-    return on_stand_in([*emulator, programs / ON_STAND_IN, "verify"], "/", scenario.variables(what.setup) | after)
+    return on_stand_in([*emulator, programs / ON_STAND_IN, "verify"], scenario.variables(what.setup) | after)
 
 
 KINDS = {"stick": check_stick, "unit": check_unit, "check": check_update, "verify": verify_unit}

@@ -69,11 +69,11 @@ void PrintTo(const Aftermath& aftermath, std::ostream* out)
     *out << aftermath.name;
 }
 
-/// The first lines of the update's log, as a journal that the power cut.
+/// Leaves the first lines of the update's log, the last without its end, as of a journal that is too long to be kept.
 void cutJournal(const StandInUnit& unit, int lines)
 {
-    unit.replaceTool("journalctl",
-                     "exec /usr/bin/head -n " + std::to_string(lines) + " '" + logs + "package-and-board.log'");
+    unit.replaceTool("journalctl", "printf %s \"$(/usr/bin/head -n " + std::to_string(lines) + " '" + logs +
+                                       "package-and-board.log')\"");
 }
 
 /// What one change of a unit that is well makes of the verification.
@@ -170,6 +170,12 @@ INSTANTIATE_TEST_SUITE_P(
                   0,
                   "the unit is well",
                   {}},
+        Aftermath{"BoardDoesNotAnswer",
+                  [](StandInUnit& unit) { unit.set("BOARD_LINK", "down"); },
+                  1,
+                  "the unit is not well: board-unreachable",
+                  {R"(error board-unreachable: The board at 192.168.9.2 cannot be asked: )"
+                   R"("ssh: connect to host 192.168.9.2 port 22: Connection timed out".)"}},
         Aftermath{"BoardOfAMainHeadIsNotTheOneThatItsRunFound",
                   [](StandInUnit& unit) {
                       unit.set("UPDATER_PROGRAM", "main");

@@ -92,7 +92,7 @@ StandInUnit::StandInUnit()
     folder.makeFolder("root/tmp");
     folder.makeFolder("root/var/log/journal");
     for (const char* file : {"dev/i2c-0", "var/lib/apt/lists/lock", "var/lib/dpkg/lock-frontend", "var/lib/dpkg/lock",
-                             "var/cache/apt/archives/lock"}) {
+                             "var/cache/apt/archives/lock", "usr/sbin/harl-updater"}) {
         put(file, "");
     }
     put("proc/asound/pcm", "00-00: Dummy PCM : Dummy PCM : playback 8 : capture 8\n");

@@ -39,6 +39,7 @@ i2cset() {
 }
 
 i2cdetect() {
+    [ "$*" = "-y -a -r 0 0x07 0x07" ] || fail 1 "Error: Unsupported option"
     answer=07
     [ "$HEAD_PANEL" = present ] || answer=--
     echo "     0  1  2  3  4  5  6  7  8  9  a  b  c  d  e  f"

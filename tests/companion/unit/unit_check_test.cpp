@@ -135,6 +135,12 @@ INSTANTIATE_TEST_SUITE_P(
         Fault{"MissingSoundDeviceIsAWarning",
               [](StandInUnit& unit) { unit.put("proc/asound/pcm", "00-00: Microphone : Microphone : capture 1\n"); },
               Lines{"warning sound-device"}},
+        Fault{"PanelIsToldBeforeTheSound",
+              [](StandInUnit& unit) {
+                  unit.removeTool("i2cset");
+                  unit.removeTool("aplay");
+              },
+              Lines{"error tool-missing", "warning tool-missing"}},
         Fault{"BoardThatDoesNotAnswerIsUnreachable", [](StandInUnit& unit) { unit.set("BOARD_LINK", "down"); },
               Lines{"error board-unreachable"}},
         Fault{"RefusedKeyIsALoginError", [](StandInUnit& unit) { unit.set("BOARD_LOGIN", "key-refused"); },
@@ -145,6 +151,9 @@ INSTANTIATE_TEST_SUITE_P(
               [](StandInUnit& unit) {
                   unit.replaceTool("ssh", "echo 'cat: /root/App/AppExe/version.txt: Permission denied' >&2; exit 1");
               },
+              Lines{"error board-version"}},
+        Fault{"VersionOfACommandThatFailedIsAnError",
+              [](StandInUnit& unit) { unit.replaceTool("ssh", "printf 'Brimvale\\t2.1.0\\n'; exit 1"); },
               Lines{"error board-version"}},
         Fault{"LockFileThatCannotBeReadIsUnchecked",
               [](StandInUnit& unit) {
@@ -174,7 +183,6 @@ INSTANTIATE_TEST_SUITE_P(
               Lines{"warning journal-volatile"}},
         Fault{"ClockBehindTheUpdaterIsAnError",
               [](StandInUnit& unit) {
-                  unit.put("usr/sbin/harl-updater", "");
                   fs::last_write_time(unit.folder.path("root/usr/sbin/harl-updater"),
                                       fs::file_time_type::clock::now() + std::chrono::hours(24));
               },
@@ -414,17 +422,36 @@ TEST_F(UnitCheck, ToolThatRefusesThePanelsAddressIsAnError)
 {
     unit.replaceTool("i2cset", "echo 'Error: Chip address out of range (0x08-0x77)!' >&2; echo Usage: >&2; exit 1");
     EXPECT_EQ(findings(), Lines{"error panel-address-refused"});
-    EXPECT_THAT(what(), HasSubstr("address 0x07: \"Error: Chip address out of range (0x08-0x77)!\"."));
+    EXPECT_EQ(what(), '"' + unit.folder.path("bin/i2cset").string() +
+                          "\" refuses the panel's address 0x07: \"Error: Chip address out of range (0x08-0x77)!\".");
 }
 
-TEST_F(UnitCheck, MissingAndBrokenSoundFilesAreWarnings)
+TEST_F(UnitCheck, MissingSoundFileIsAWarning)
 {
     unit.remove("root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav");
-    unit.put("root/RESOURCES/SOUNDS/SND_RESULT_FAIL.wav", waveFile(1000).substr(0, 500));
     const CheckResult result = check();
-    EXPECT_EQ(result.findings, (Lines{"warning sound-file", "warning sound-file"}));
+    EXPECT_EQ(result.findings, Lines{"warning sound-file"});
     EXPECT_EQ(result.status, 0);
-    EXPECT_THAT(result.report["findings"][1]["what"].get<std::string>(), HasSubstr("it is cut off: 500 of 1044 bytes"));
+    EXPECT_EQ(what(), "The sound \"/root/RESOURCES/SOUNDS/SND_RESULT_PASS.wav\" cannot be played: it is not there.");
+}
+
+TEST_F(UnitCheck, FileThatIsNoWholeSoundIsAWarning)
+{
+    const std::string whole = waveFile(1000);
+    const std::pair<std::string, const char*> faults[] = {
+        {"", "it is empty"},
+        {"R", "it is no WAV file"},
+        {"RIFF....AVI " + whole.substr(12), "it is no WAV file"},
+        {"FORM" + whole.substr(4), "it is no WAV file"},
+        {whole.substr(0, 12), "it is cut off: 12 of 1044 bytes are there"},
+        {whole.substr(0, 1043), "it is cut off: 1043 of 1044 bytes are there"},
+        {waveFile(100'000).substr(0, 100'000), "it is cut off: 100000 of 100044 bytes are there"},
+    };
+    for (const auto& [content, fault] : faults) {
+        unit.put("root/RESOURCES/SOUNDS/SND_RESULT_FAIL.wav", content);
+        EXPECT_EQ(what(), std::string("The sound \"/root/RESOURCES/SOUNDS/SND_RESULT_FAIL.wav\" cannot be played: ") +
+                              fault + '.');
+    }
 }
 
 TEST_F(UnitCheck, SoundFileThatCannotBeReadIsUnchecked)

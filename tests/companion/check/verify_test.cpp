@@ -55,6 +55,13 @@ protected:
     StandInUnit unit;
 };
 
+const char oldBoard[] = R"(error board-version-old: The board has the version "2.1.0", not "2.2.0", )"
+                        "which the last run should have left.";
+const char oldPackage[] = R"(error package-version: The package has the version "1.2.0", not "1.3.0", )"
+                          "which the last run should have left.";
+const char keptConfiguration[] = "warning configuration-kept: Changed configuration files were kept; the package's own "
+                                 "are beside them, with .dpkg-dist: \"/etc/panel.conf\".";
+
 struct Aftermath
 {
     const char* name;
@@ -95,19 +102,17 @@ TEST_P(VerifyAfter, IsFound)
 INSTANTIATE_TEST_SUITE_P(
     Each, VerifyAfter,
     testing::Values(
-        Aftermath{"NothingElseUnitIsWell", [](StandInUnit& /*unit*/) {}, 0, "the unit is well", {}},
+        Aftermath{"NothingIsWrong", [](StandInUnit& /*unit*/) {}, 0, "the unit is well", {}},
         Aftermath{"BoardKeptItsVersion",
                   [](StandInUnit& unit) { unit.set("BOARD_INSTALLED", "2.1.0"); },
                   1,
                   "the unit is not well: board-version-old",
-                  {R"(error board-version-old: The board has the version "2.1.0", not "2.2.0", )"
-                   "which the last run should have left."}},
+                  {oldBoard}},
         Aftermath{"PackageKeptItsVersion",
                   [](StandInUnit& unit) { unit.set("PACKAGE_INSTALLED", "1.2.0"); },
                   1,
                   "the unit is not well: package-version",
-                  {R"(error package-version: The package has the version "1.2.0", not "1.3.0", )"
-                   "which the last run should have left."}},
+                  {oldPackage}},
         Aftermath{
             "FilesAreDamaged",
             [](StandInUnit& unit) {
@@ -144,8 +149,7 @@ INSTANTIATE_TEST_SUITE_P(
                   [](StandInUnit& unit) { unit.put("etc/panel.conf.dpkg-dist", ""); },
                   0,
                   "the unit is well",
-                  {"warning configuration-kept: Changed configuration files were kept; the package's own are beside "
-                   "them, with .dpkg-dist: \"/etc/panel.conf\"."}},
+                  {keptConfiguration}},
         Aftermath{"ApplicationFailed",
                   [](StandInUnit& unit) { unit.set("UNIT_HARL", "failed"); },
                   1,
@@ -163,8 +167,7 @@ INSTANTIATE_TEST_SUITE_P(
                   },
                   1,
                   "the unit is not well: board-version-old",
-                  {R"(error board-version-old: The board has the version "2.1.0", not "2.2.0", )"
-                   "which the last run should have left."}},
+                  {oldBoard}},
         Aftermath{"JournalEndsBeforeTheComparison",
                   [](StandInUnit& unit) { cutJournal(unit, 74); },
                   0,
@@ -184,14 +187,13 @@ INSTANTIATE_TEST_SUITE_P(
                   },
                   1,
                   "the unit is not well: board-version-old",
-                  {R"(error board-version-old: The board has the version "2.1.0", not "2.2.0", )"
-                   "which the last run should have left."}},
+                  {oldBoard}},
         Aftermath{"EverythingIsWrong",
                   [](StandInUnit& unit) {
                       unit.set("UNIT_HARL", "failed");
                       unit.set("UNIT_PACKAGE", "iF");
                       unit.replaceTool("dpkg", "echo '??5??????   /usr/lib/x'");
-                      unit.put("etc/harl.conf.dpkg-dist", "");
+                      unit.put("etc/panel.conf.dpkg-dist", "");
                       unit.set("PACKAGE_INSTALLED", "1.2.0");
                       unit.set("BOARD_INSTALLED", "2.1.0");
                   },
@@ -201,12 +203,7 @@ INSTANTIATE_TEST_SUITE_P(
                   {R"(error application: The application harl is "failed".)",
                    R"(error package-half-configured: The package manager has unfinished work: "solvik4-rh".)",
                    R"(error package-files: Files of the package are missing or damaged: "/usr/lib/x".)",
-                   "warning configuration-kept: Changed configuration files were kept; the package's own are beside "
-                   "them, with .dpkg-dist: \"/etc/harl.conf\".",
-                   R"(error package-version: The package has the version "1.2.0", not "1.3.0", )"
-                   "which the last run should have left.",
-                   R"(error board-version-old: The board has the version "2.1.0", not "2.2.0", )"
-                   "which the last run should have left."}},
+                   keptConfiguration, oldPackage, oldBoard}},
         Aftermath{"NothingCanBeAsked",
                   [](StandInUnit& unit) {
                       for (const char* tool : {"systemctl", "dpkg", "dpkg-query", "journalctl"}) {
@@ -258,6 +255,22 @@ TEST(Check, TellsOfASignatureBetweenStickAndPlans)
     EXPECT_THAT(out.str(), HasSubstr("\nTeamViewer:            not requested"
                                      "\nSignature:             not checked: no keyring is installed or named"
                                      "\nPackage:               1.2.0 -> 1.3.0, would be installed\n"));
+}
+
+TEST(Check, TellsOfAnOlderStickAfterThePlans)
+{
+    StandInUnit unit;
+    unit.set("UPDATER_PROGRAM", "main");
+    const TestFolder stick;
+    stick.makeFolder("debs/QUORB/armhf/quorb2.2.0");
+    stick.put(manifestName, "Version: 2.0.0\n");
+    std::ostringstream out;
+    runCheck(stick.path(), true, unit.site(), out, out);
+    Lines findings = findingsIn(out.str());
+    findings.erase(findings.begin(), findings.end() - 2);
+    EXPECT_EQ(findings,
+              (Lines{"note update-offered: A main head offers an update; its user decides.",
+                     R"(warning stick-older: The stick's version "2.0.0" is older than the board's, "2.1.0".)"}));
 }
 
 TEST(Check, AsksTheMirrorsIntoPrivateLists)

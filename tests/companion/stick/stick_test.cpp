@@ -562,6 +562,16 @@ TEST_F(Stick, VersionFolderThatMayNotBeEnteredIsUnchecked)
     }
 }
 
+TEST_F(Stick, BoardFolderThatMayNotBeListedIsUnchecked)
+{
+    chmod(stick.path("debs/QUORB/armhf").c_str(), 0111);
+    {
+        const AsNobody nobody;
+        EXPECT_EQ(findings(), Lines{"unchecked stick-unreadable"});
+    }
+    chmod(stick.path("debs/QUORB/armhf").c_str(), 0755);
+}
+
 TEST_F(Stick, LinkToTheUnitsMountPointIsFollowedOnTheStick)
 {
     rename("debs/QUORB/armhf/quorb2.2.0", "files");

@@ -204,6 +204,8 @@ TEST_F(Stick, FolderNameOfFiveBytesHasNoVersion)
 {
     rename(std::string(board) + "quorb2.2.0", std::string(board) + "quorb");
     EXPECT_EQ(findings(), Lines{"error version-missing"});
+    rename(board + std::string("quorb"), board + std::string("quo"));
+    EXPECT_EQ(findings(), Lines{"error version-missing"});
 }
 
 TEST_F(Stick, VersionWithALineBreakIsCut)
@@ -279,6 +281,8 @@ TEST_F(Stick, ScriptWithoutRunBitIsAnError)
 {
     chmod(stick.path(std::string(board) + "quorb2.2.0/unzipUpgrade.sh").c_str(), 0644);
     EXPECT_EQ(findings(), Lines{"error script-run-bit"});
+    stick.put(board + std::string("quorb2.2.0/unzipUpgrade.sh"), "#!sh\n", 0644);
+    EXPECT_EQ(findings(), (Lines{"error script-first-line", "error script-run-bit"}));
 }
 
 TEST_F(Stick, ScriptThatCannotBeReadIsUnchecked)
@@ -560,6 +564,19 @@ TEST_F(Stick, VersionFolderThatMayNotBeEnteredIsUnchecked)
         }
         chmod(stick.path(folder).c_str(), 0755);
     }
+}
+
+TEST_F(Stick, CommandPrintsTheWholeReport)
+{
+    stick.put("harl-updater.manifest", "Format: 1\n");
+    const fs::path before = fs::current_path();
+    fs::current_path(stick.path()); // its name would change where the lines break
+    std::ostringstream out;
+    std::ostringstream errors;
+    EXPECT_EQ(runStick(".", false, out, errors, ""), Report::STATUS_FIT);
+    EXPECT_EQ(runStick("nowhere", true, out, errors, ""), Report::STATUS_UNCHECKED);
+    fs::current_path(before);
+    compareWithKept(out.str() + errors.str());
 }
 
 TEST_F(Stick, BoardFolderThatMayNotBeListedIsUnchecked)

@@ -237,6 +237,24 @@ TEST_F(Stick, PrefixOfAnotherLengthIsAWarning)
     }
 }
 
+TEST(StickVersion, EveryCharacterHasItsPlace)
+{
+    const auto found = [](const std::string& name) {
+        Report report("stick", "A name");
+        checkVersionName(name, report);
+        return report.findings().size();
+    };
+    for (const char digit : std::string("0123456789")) {
+        EXPECT_EQ(found(std::string("quorb") + digit), 0U) << digit;
+        EXPECT_EQ(found(std::string("quor") + digit + "2.2.0"), 1U) << digit; // a prefix that may be too short
+    }
+    EXPECT_EQ(found("quor.2.2.0"), 1U);
+    EXPECT_EQ(found("quorb1abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789.+~_-"), 0U);
+    for (const char other : std::string(" !\"#$%&'()*,/:;<=>?@[\\]^`{|}\x01\x7f\xe4")) {
+        EXPECT_EQ(found(std::string("quorb2") + other), 1U) << other;
+    }
+}
+
 // The files for the board
 
 TEST_F(Stick, MissingFilesAreErrors)

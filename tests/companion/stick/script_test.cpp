@@ -81,6 +81,7 @@ TEST(StickScript, WindowsLineEndBehindTheFirstLineIsNamedByItsLine)
     const Report report = check("#!/bin/sh\ncd /\nexit 0\r\n");
     EXPECT_EQ(findingsOf(report), Lines{"error script-line-ends"});
     EXPECT_THAT(whatOf(report, "script-line-ends"), HasSubstr("line 3"));
+    EXPECT_THAT(whatOf(check("\nexit 0\r\n"), "script-line-ends"), HasSubstr("line 2"));
 }
 
 TEST(StickScript, LineEndsInDataBehindTheScriptDoNotMatter)
@@ -91,6 +92,8 @@ TEST(StickScript, LineEndsInDataBehindTheScriptDoNotMatter)
 TEST(StickScript, AnyRunBitIsEnough)
 {
     EXPECT_EQ(checkBit(0744, true, false), Lines());
+    EXPECT_EQ(checkBit(0654, true, false), Lines());
+    EXPECT_EQ(checkBit(0645, true, false), Lines());
     EXPECT_EQ(checkBit(0755, false, true), Lines());
 }
 

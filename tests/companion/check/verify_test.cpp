@@ -59,6 +59,8 @@ const char oldBoard[] = R"(error board-version-old: The board has the version "2
                         "which the last run should have left.";
 const char oldPackage[] = R"(error package-version: The package has the version "1.2.0", not "1.3.0", )"
                           "which the last run should have left.";
+const char everythingIsWrong[] = "the unit is not well: application, package-half-configured, package-files, "
+                                 "package-version, board-version-old";
 const char keptConfiguration[] = "warning configuration-kept: Changed configuration files were kept; the package's own "
                                  "are beside them, with .dpkg-dist: \"/etc/panel.conf\".";
 
@@ -198,8 +200,7 @@ INSTANTIATE_TEST_SUITE_P(
                       unit.set("BOARD_INSTALLED", "2.1.0");
                   },
                   1,
-                  "the unit is not well: application, package-half-configured, package-files, package-version, "
-                  "board-version-old",
+                  everythingIsWrong,
                   {R"(error application: The application harl is "failed".)",
                    R"(error package-half-configured: The package manager has unfinished work: "solvik4-rh".)",
                    R"(error package-files: Files of the package are missing or damaged: "/usr/lib/x".)",

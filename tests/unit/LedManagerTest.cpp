@@ -101,6 +101,19 @@ protected:
         LedManager::instance()->waitForFlashingEnd();
     }
 
+    /// Starts it and stops it within its first pause, which lasts until `resumed`.
+    static void stopWithinAPause(const std::atomic<bool>& resumed)
+    {
+        platform::scriptSleep([&resumed](const timespec*, timespec*) {
+            platform::note("pause");
+            platform::waitFor([&resumed] { return resumed.load(); });
+            return 0;
+        });
+        LedManager::instance()->startFlashRemoteAndMainInBlue();
+        platform::waitFor([] { return !entries("pause").empty(); });
+        LedManager::instance()->stopFlashRemoteAndMainInBlue();
+    }
+
     static Lines cycle(const char* lit, const char* unlit)
     {
         return joined({ran(allLeds(dark)), {ran(ledCommand(lit, blue)), ran(ledCommand(unlit, dark)), "sleep:1"}});
@@ -183,17 +196,10 @@ TEST_F(Flashing, SignalDoesNotShortenTheSecond)
 
 TEST_F(Flashing, StopReturnsBeforeTheLastCycleHasEndedAndTheWaitAfterIt)
 {
-    std::atomic<bool> stopped{false};
-    platform::scriptSleep([&stopped](const timespec*, timespec*) {
-        platform::note("pause");
-        platform::waitFor([&stopped] { return stopped.load(); });
-        return 0;
-    });
-    LedManager::instance()->startFlashRemoteAndMainInBlue();
-    platform::waitFor([] { return !entries("pause").empty(); });
-    LedManager::instance()->stopFlashRemoteAndMainInBlue();
+    std::atomic<bool> resumed{false};
+    stopWithinAPause(resumed);
     platform::note("stopped");
-    stopped = true;
+    resumed = true;
     LedManager::instance()->waitForFlashingEnd();
     platform::note("ended");
     const Lines all = journal();
@@ -202,20 +208,13 @@ TEST_F(Flashing, StopReturnsBeforeTheLastCycleHasEndedAndTheWaitAfterIt)
 
 TEST_F(Flashing, TwoThreadsCanWaitForItsEnd)
 {
-    std::atomic<bool> stopped{false};
-    platform::scriptSleep([&stopped](const timespec*, timespec*) {
-        platform::note("pause");
-        platform::waitFor([&stopped] { return stopped.load(); });
-        return 0;
-    });
-    LedManager::instance()->startFlashRemoteAndMainInBlue();
-    platform::waitFor([] { return !entries("pause").empty(); });
-    LedManager::instance()->stopFlashRemoteAndMainInBlue();
+    std::atomic<bool> resumed{false};
+    stopWithinAPause(resumed);
     const auto wait = [] { LedManager::instance()->waitForFlashingEnd(); };
     std::thread first(wait);
     std::thread second(wait);
     platform::delay(50); // both wait
-    stopped = true;
+    resumed = true;
     first.join();
     second.join();
     const Lines all = journal();

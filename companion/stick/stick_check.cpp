@@ -288,6 +288,7 @@ private:
             misspelled = reportCase(folder, file, found, "name-case", "upload-fails") || misspelled;
             if (found) {
                 last = path;
+                continue;
             }
             const std::vector<std::string> likes = lookalikes(folder, file);
             similar.insert(similar.end(), likes.begin(), likes.end());

@@ -135,7 +135,7 @@ void checkBoard(const Unit& unit, Report& report)
     if (!answer.started) {
         return; // reported with the tools
     }
-    if (answer.exitCode == 255 || answer.exitCode < 0) { // ssh(1): an error of its own
+    if (answer.exitCode == 255 || answer.exitCode < 0) { // 255: an error of ssh(1) itself
         const bool unknown = contains(answer.errors, "Host key verification failed");
         const bool denied = contains(answer.errors, "Permission denied");
         const bool changed = contains(answer.errors, "HOST IDENTIFICATION HAS CHANGED");
@@ -178,8 +178,7 @@ void checkUnit(const Unit& unit, Report& report)
         report.add("journal-volatile");
     }
     struct stat updater = {}; // the package tools keep the time at which it was built
-    stat(unit.path("/usr/sbin/harl-updater").c_str(), &updater); // 0 without it
-    if (std::time(nullptr) < updater.st_mtime) {
+    if (stat(unit.path("/usr/sbin/harl-updater").c_str(), &updater) == 0 && std::time(nullptr) < updater.st_mtime) {
         report.add("clock-behind");
     }
     report.addFact("search_path", "Search path", escaped(unit.searchPath()));

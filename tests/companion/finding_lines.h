@@ -7,9 +7,7 @@
 
 using Lines = std::vector<std::string>;
 
-/// The running test fails unless `text` is what golden/reports keeps of it, temporary folders and process numbers
-/// apart. The operations below compare their whole report so, too.
-void compareWithKept(const std::string& text);
+// Each of these also compares the whole report with the kept one: kept_reports.h.
 
 /// Severity and check of every finding, such as "error file-missing", in order.
 Lines findingsOf(const Report& report);

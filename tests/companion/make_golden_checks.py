@@ -4,8 +4,8 @@ Keeps what `harl-updater-tool stick`, `unit` and `check` say before the update o
 of all, and what `verify` says after it, in golden/stick.txt and so on: a line "# SCENARIO" for each that it is said of,
 then the text. The sticks are those of the bench's real unit, the units are stand-ins; after the update they are as the
 scenario expects, with the run of golden/log in their journal. golden_checks_test.py compares what is kept with what the
-programs of a build folder say. Without a SCENARIO it also keeps the reports that stick-tests and
-unit-check-tests make, in golden/reports. Read the differences before you commit them.
+programs of a build folder say. Without a SCENARIO it also keeps the reports that stick-tests and unit-check-tests
+make, in golden/reports. Read the differences before you commit them.
 """
 
 import argparse

@@ -1,6 +1,7 @@
 #include "stick/stick_check.h"
 
 #include "finding_lines.h"
+#include "kept_reports.h"
 #include "stick/zip_file.h"
 #include "test_folder.h"
 

@@ -1,6 +1,7 @@
 #include "unit/unit_check.h"
 
 #include "finding_lines.h"
+#include "kept_reports.h"
 #include "unit/standin.h"
 
 #include <gmock/gmock.h>

@@ -1,0 +1,7 @@
+#pragma once
+
+#include <string>
+
+/// Compares `text`, temporary folders and process numbers apart, with what golden/reports keeps of the running test,
+/// which fails when they differ. Of texts that are the same one counts.
+void compareWithKept(const std::string& text);

@@ -215,8 +215,8 @@ CPP = Language(
     ("//", "#", "namespace", "using", "__attribute__"),
     re.compile(r"(?!using|return;|break;|#|//|static_assert|friend|public|private|[}\]]).*;(\s*//.*)?"),
     re.compile(
-        r"(?!return |delete |throw )(static )?(const )?[\w:<>]+[*&]? \w+(\[[^]]*\])?"
-        r"( = ([\w.* -]+|\{\}|\"[^\"]*\"|R\"\(.*?\)\"))?;"
+        r"(?!return |delete |throw )(static )?(const )?[\w:]+(<[\w:<>, ()*]*>)?[*&]? \w+(\[[^]]*\]|\{[\w, ]*\})?"
+        r"( = ([\w:.*'{}< -]+|\"[^\"]*\"|R\"\(.*?\)\"))?;"
     ),
     r"[;{}:]",
     "",

@@ -16,6 +16,11 @@ def make_key(home: Path, name: str, keyring: Path) -> None:
         subprocess.run([*command, "--export", name], stdout=out, check=True)
 
 
+def end_agent(home: Path) -> None:
+    """Ends the agent that gpg started for the folder, which removes its socket only now."""
+    subprocess.run(["gpgconf", "--homedir", str(home), "--kill", "all"], check=True)
+
+
 def sign_index(repository: Path, keyring: Path, fault: str) -> None:
     """Signs the index of the folder `repository` for apt and writes the keyring that verifies it.
 
@@ -39,6 +44,6 @@ def sign_index(repository: Path, keyring: Path, fault: str) -> None:
         (repository / "InRelease").write_bytes(signed)
         if fault == "wrong-key":
             make_key(home, "other", keyring)
-        subprocess.run(["gpgconf", "--homedir", str(home), "--kill", "all"], check=True)
+        end_agent(home)
     if fault == "half-synchronised":
         (repository / "Packages").write_bytes(packages + b"\n")

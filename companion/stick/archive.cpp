@@ -175,9 +175,8 @@ private:
             mReport.add("archive-entry-path", {{"entries", leaving.text()}});
         }
         if (!intact) {
-            mReport.add("archive-damaged", {{"entries", "its directory is damaged at offset " +
-                                                            std::to_string(unzGetOffset64(mArchive.get())) +
-                                                            ", behind " + counted(mEntries, "entry", "entries")}});
+            mReport.add("archive-damaged",
+                        {{"entries", "its directory is damaged after " + counted(mEntries, "entry", "entries")}});
         } else if (mEntries > mostEntries) {
             mReport.add("archive-bomb.entries", {{"most", counted(mostEntries, "entry", "entries")}});
         } else if (mDeclaredBytes > mostUnpacked || mPackedBytes > mSize) {

@@ -1,5 +1,6 @@
 """Makes sticks with `harl-updater-tool stick make`, signs and spoils them, and checks them with `stick`."""
 
+import json
 import os
 import pty
 import re
@@ -7,12 +8,13 @@ import shutil
 import signal
 import subprocess
 import time
+from collections.abc import Iterator
 from pathlib import Path
 
 import pytest
 
 from bench.makers.files import write_script
-from bench.makers.keys import make_key
+from bench.makers.keys import end_agent, make_key
 from bench.makers.sticks import VERSIONS, zip_archive
 from tests.commands import needs, output_of, run_command
 
@@ -43,7 +45,8 @@ class Stick:
 
     def run(self, *words: str | Path, status: int) -> str:
         """What the tool prints for the words after its name; it must end with the status."""
-        return output_of(self.tool, *words, status=status, GNUPGHOME=self.folder / "maker")
+        path = f"{self.folder}/bin:{os.environ['PATH']}"
+        return output_of(self.tool, *words, status=status, GNUPGHOME=self.folder / "maker", PATH=path)
 
     def make(self, *more: str, status: int = 0, version: str = "2.2.0") -> str:
         """Makes the stick; returns what is printed."""
@@ -52,6 +55,11 @@ class Stick:
     def check(self, *more: str | Path, status: int = 0) -> str:
         """What `stick` says, in one line."""
         return " ".join(self.run("stick", *more, self.root, status=status).split())
+
+    def facts(self, *more: str | Path) -> dict[str, str | None]:
+        """The facts that `stick` finds."""
+        facts: dict[str, str | None] = json.loads(self.run("stick", "--json", *more, self.root, status=0))["facts"]
+        return facts
 
     def files(self) -> dict[str, bytes]:
         """All files of the stick."""
@@ -75,8 +83,10 @@ class Stick:
     def wrong(self, says: str) -> None:
         """The stick is not fit, with this complaint."""
         said = self.check("--keyring", self.keyring, status=1)
+        separator = ";" if "debs/" in says else ":"
+        assert f"The stick is not as the maker signed it{separator} {says}" in said
         assert "[stick-signature]" in said
-        assert says in said
+        assert "Signature:" not in said
 
     def verify(self, **tools: str) -> tuple[str, str, int]:
         """What the service's verification alone prints, its errors and its status, with tools of these lines."""
@@ -90,6 +100,12 @@ class Stick:
 @pytest.fixture
 def stick(tmp_path: Path, tool: Path) -> Stick:
     return Stick(tmp_path, tool)
+
+
+def mount(folder: Path, limit: str, request: pytest.FixtureRequest) -> None:
+    """Mounts a file system of this limit for the test."""
+    subprocess.run(["mount", "-t", "tmpfs", "-o", limit, "stick", folder], check=True)
+    request.addfinalizer(lambda: subprocess.run(["umount", folder], check=True))
 
 
 def test_writes_exactly_what_the_updater_expects(stick: Stick) -> None:
@@ -185,8 +201,7 @@ def test_interruption_leaves_the_version_that_was_there(stick: Stick) -> None:
 
 @pytest.mark.usefixtures("own_mounts")
 def test_full_stick_keeps_the_version_that_was_there(stick: Stick, request: pytest.FixtureRequest) -> None:
-    subprocess.run(["mount", "-t", "tmpfs", "-o", "size=2m", "stick", stick.root], check=True)
-    request.addfinalizer(lambda: subprocess.run(["umount", stick.root], check=True))
+    mount(stick.root, "size=2m", request)
     stick.make(version="2.1.0")
     before = stick.files()
     stick.archive = stick.big_archive()
@@ -205,10 +220,11 @@ def test_terminal_shows_rate_and_time_left(stick: Stick) -> None:
 
 
 @pytest.fixture
-def signed(stick: Stick) -> Stick:
+def signed(stick: Stick) -> Iterator[Stick]:
     make_key(stick.folder / "maker", "maker", stick.keyring)
     stick.make("--sign", "maker", "--oldest", "2.0.0")
-    return stick
+    yield stick
+    end_agent(stick.folder / "maker")
 
 
 class TestSigned:
@@ -219,8 +235,11 @@ class TestSigned:
         assert re.search(r"^Format: 1\nVersion: 2.2.0\nOldest: 2.0.0\nDate: \d{4}-\d\d-\d\dT.*Z\nSHA256:\n", text)
         size = signed.archive.stat().st_size
         assert re.search(rf"\n [0-9a-f]{{64}} {size} {VERSIONS}/quorb2.2.0/OSUpgrade.zip\n", text)
-        assert "Signature: good, of 20" in signed.check("--keyring", signed.keyring)
-        assert "Signature: not checked" in signed.check()
+        date = re.findall(r"Date: (.*)", text)[0]
+        assert f"Signature: good, of {date} " in signed.check("--keyring", signed.keyring)
+        assert "Signature: not checked: no keyring is installed or named " in signed.check()
+        assert signed.facts("--keyring", signed.keyring)["signature"] == date
+        assert signed.facts()["signature"] is None
 
     def test_changed_file(self, signed: Stick) -> None:
         (signed.root / VERSIONS / "quorb2.2.0/unzipUpgrade.sh").write_text("#!/bin/sh\nreboot\n")
@@ -278,8 +297,45 @@ class TestSigned:
         assert MANIFEST not in signed.files()
         signed.wrong("not signed")
 
+    def test_manifest_lists_every_file_in_order(self, signed: Stick) -> None:
+        for number in range(20):
+            (signed.root / f"debs/{number * 7 % 20:02}").touch()
+        signed.make("--replace", "--sign", "maker")
+        listed = re.findall(r" (debs/.*)\n", (signed.root / MANIFEST).read_text())
+        assert listed == sorted(path for path in signed.files() if path.startswith("debs/"))
+
     def test_key_that_gpg_does_not_have(self, signed: Stick) -> None:
-        assert "gpg did not sign" in signed.make("--replace", "--sign", "nobody", status=2)
+        assert 'gpg did not sign with the key "nobody".' in signed.make("--replace", "--sign", "nobody", status=2)
+
+    def test_file_that_cannot_be_listed(self, signed: Stick) -> None:
+        (signed.root / "debs/a\nb").touch()
+        said = signed.make("--replace", "--sign", "maker", status=2)
+        assert f'"{signed.root}/debs/a\\nb" cannot be listed in a manifest.' in said
+
+    @pytest.mark.parametrize("lines", ["echo no medium >&2; exit 1", "printf %064d 0; exit 1", "echo 0"])
+    def test_file_whose_sum_is_not_known(self, signed: Stick, lines: str) -> None:
+        write_script(signed.folder / "bin/sha256sum", lines)
+        said = signed.make("--replace", "--sign", "maker", status=2)
+        assert '/OSUpgrade.zip" cannot be listed in a manifest.' in said
+        assert ("no medium" in said) == ("no medium" in lines)
+
+    def test_link_cannot_be_signed(self, signed: Stick) -> None:
+        (signed.root / "debs/link").symlink_to(signed.archive)
+        said = signed.make("--replace", "--sign", "maker", status=2)
+        assert f'"{signed.root}/debs/link" is no plain file: it cannot be signed.' in said
+
+    @pytest.mark.usefixtures("own_mounts")
+    def test_manifest_that_cannot_be_written(self, signed: Stick, request: pytest.FixtureRequest) -> None:
+        # room for the stick, debs, QUORB, armhf, the version and its two files
+        mount(signed.root, "nr_inodes=7", request)
+        said = signed.make("--sign", "maker", status=2)
+        assert f'"{signed.root}/{MANIFEST}" cannot be written. Make room on the stick.' in said
+
+    def test_tool_without_the_package_cannot_verify(self, signed: Stick) -> None:
+        signed.tool = Path(shutil.copy(signed.tool, signed.folder))
+        said = signed.check("--keyring", signed.keyring, status=2)
+        assert "The signature cannot be checked: " in said
+        assert '/lib/harl-updater/verify-stick" is not there. [stick-signature]' in said
 
     def test_nothing_for_the_board_is_nothing_to_verify(self, signed: Stick) -> None:
         shutil.rmtree(signed.root / "debs/QUORB")

@@ -131,11 +131,18 @@ PARTS = [
         ],
     ),
     Part(
-        ["companion/stick/stick_check.cpp", "companion/stick/archive.cpp", "companion/stick/signature.cpp"],
+        ["companion/stick/stick_check.cpp", "companion/stick/archive.cpp"],
         [
             gtest("companion/stick-tests", f"-{LARGE}"),
             at_once("tests/companion/stick/make_test.py", targets="harl-updater-tool"),
             gtest("companion/stick-tests", LARGE),
+        ],
+    ),
+    Part(
+        ["companion/stick/signature.cpp"],
+        [
+            gtest("companion/unit-check-tests", "Check.Tells*"),
+            at_once("tests/companion/stick/make_test.py", "Signed", "harl-updater-tool"),
         ],
     ),
     Part(
@@ -215,7 +222,7 @@ CPP = Language(
     ("//", "#", "namespace", "using", "__attribute__"),
     re.compile(r"(?!using|return;|break;|#|//|static_assert|friend|public|private|[}\]]).*;(\s*//.*)?"),
     re.compile(
-        r"(?!return |delete |throw )(static )?(const )?[\w:]+(<[\w:<>, ()*]*>)?[*&]? \w+(\[[^]]*\]|\{[\w, ]*\})?"
+        r"(?!return |delete |throw )(static )?(const )?(struct )?[\w:]+(<[\w:<>, ()*]*>)?[*&]? \w+(\[[^]]*\]|\{[\w, ]*\})?"
         r"( = ([\w:.*'{}< -]+|\"[^\"]*\"|R\"\(.*?\)\"))?;"
     ),
     r"[;{}:]",
@@ -288,14 +295,13 @@ def is_statement(lines: list[str], index: int, language: Language) -> bool:
 
 
 def mutations_of(file: str) -> Iterator[Mutation]:
-    dice = random.Random(file)
     language = language_of(file)
     lines = [line.strip() for line in (ROOT / file).read_text().splitlines()]
     for index, line in enumerate(lines):
         if not line or line.startswith(language.passed_over):
             continue
         place = f" [{lines[: index + 1].count(line)}]" if lines.count(line) > 1 else ""
-        for after in changed_lines(line, language, dice):
+        for after in changed_lines(line, language, random.Random(f"{file}: {line}{place}")):
             yield Mutation(file, index + 1, line, after.strip(), place)
         if not is_statement(lines, index, language):
             continue

@@ -32,7 +32,7 @@ void checkLocks(const Unit& unit, Report& report)
     };
     for (const auto& [path, name] : locks) {
         const Descriptor file(open(unit.path(path).c_str(), O_RDONLY | O_CLOEXEC));
-        const int error = file ? 0 : errno;
+        const int error = errno; // of open(), when it failed
         struct flock lock = {};
         lock.l_type = F_WRLCK;
         const bool held = file && fcntl(file.number(), F_GETLK, &lock) == 0 && lock.l_type != F_UNLCK;

@@ -19,8 +19,9 @@ namespace fs = std::filesystem;
 namespace
 {
 
-const char* const tools[] = {"systemctl", "umount", "rm",        "ls",      "apt",  "apt-cache",  "ssh",       "scp",
-                             "i2cset",    "aplay",  "i2cdetect", "apt-get", "dpkg", "dpkg-query", "journalctl"};
+const char* const tools[] = {"systemctl", "umount", "rm",         "ls",        "apt",       "apt-cache",
+                             "ssh",       "scp",    "i2cset",     "aplay",     "i2cdetect", "apt-config",
+                             "apt-get",   "dpkg",   "dpkg-query", "journalctl"};
 
 std::string quoted(std::string text)
 {

@@ -129,11 +129,17 @@ apt_get() {
     esac
 }
 
+apt_config() {
+    [ "$*" = dump ] || fail 100 "E: Invalid operation $1"
+    printf 'APT "";\nAPT::Architecture "armhf";\nDPkg::Options "";\n'
+}
+
 case " $TOOLS_KILLED " in
 *" $tool "*) kill -KILL $$ ;;
 esac
 case $tool in
 apt-cache) apt_cache "$@" ;;
+apt-config) apt_config "$@" ;;
 apt-get) apt_get "$@" ;;
 dpkg-query) dpkg_query "$@" ;;
 umount | rm | ls | apt | scp) ;; # asked for, not run

@@ -196,7 +196,11 @@ INSTANTIATE_TEST_SUITE_P(
               },
               Lines{"warning service-not-reloaded"}},
         Fault{"AptSettingsAgainstTheServicesAreAWarning",
-              [](StandInUnit& unit) { unit.replaceTool("apt-config", R"(echo 'DPkg::Options:: "--force-confnew";')"); },
+              [](StandInUnit& unit) {
+                  unit.replaceTool("apt-config", R"(printf '%s\n' 'DPkg::Options:: "--force-confnew";' 'APT "";' \
+                      'DPkg::Options:: "--force-confask";' 'DPkg::Options:: "--force-confold";' \
+                      'APT::Update::Error-Mode "any";' 'Binary::apt::APT::Update::Error-Mode "any";')");
+              },
               Lines{"warning apt-settings"}},
         Fault{"NineSilentAddressesOfOneMirrorAreOneError",
               [](StandInUnit& unit) {
@@ -235,11 +239,12 @@ TEST_F(UnitCheck, ChangesNothing)
 {
     check();
     for (const std::string& call : unit.calls()) {
-        EXPECT_THAT(call, testing::AnyOf("systemctl show-environment", testing::StartsWith("systemctl show "),
-                                         "i2cset -y 0 0x07 0x100 c", testing::StartsWith("i2cdetect "),
-                                         testing::StartsWith("ssh "), testing::StartsWith("dpkg-query --show "),
-                                         testing::StartsWith("apt-cache "), "apt-get update --print-uris",
-                                         testing::StartsWith("apt-get -c " + unit.folder.path("root/tmp").string())));
+        EXPECT_THAT(call,
+                    testing::AnyOf("systemctl show-environment", testing::StartsWith("systemctl show "),
+                                   "i2cset -y 0 0x07 0x100 c", testing::StartsWith("i2cdetect "),
+                                   testing::StartsWith("ssh "), testing::StartsWith("dpkg-query --show "),
+                                   testing::StartsWith("apt-cache "), "apt-config dump", "apt-get update --print-uris",
+                                   testing::StartsWith("apt-get -c " + unit.folder.path("root/tmp").string())));
     }
     EXPECT_TRUE(fs::is_empty(unit.folder.path("root/tmp")));
 }
@@ -415,6 +420,9 @@ TEST_F(UnitCheck, SearchPathOfTheServiceCounts)
     EXPECT_EQ(findings(), Lines());
     EXPECT_EQ(fact("search_path"), unit.folder.path("bin").string());
     EXPECT_EQ(fact("locale"), "LANG=C.UTF-8 LANGUAGE=de");
+    std::ostringstream out;
+    runUnit({}, unit.site(), out, out);
+    EXPECT_THAT(out.str(), HasSubstr("\nLocale:                LANG=C.UTF-8 LANGUAGE=de\n"));
 }
 
 // Panel and sound
@@ -535,7 +543,7 @@ TEST_F(UnitCheck, InterruptedRunOfThePackageManagerIsAnError)
 {
     unit.put("var/lib/dpkg/updates/tmp.i", "");
     EXPECT_EQ(findings(), Lines());
-    unit.put("var/lib/dpkg/updates/0001", "");
+    unit.put("var/lib/dpkg/updates/0123456789", "");
     EXPECT_EQ(what(), "The package manager has unfinished work: an interrupted run.");
     unit.replaceTool("dpkg-query", R"(printf 'iF \tsolvik4-rh\n')");
     EXPECT_EQ(what(), "The package manager has unfinished work: \"solvik4-rh\" and an interrupted run.");
@@ -548,6 +556,10 @@ TEST_F(UnitCheck, LocaleThatTranslatesThePackageToolIsAnError)
                                   "printf 'apt:\\n  Installiert:           2.6.1\\n  Installationskandidat: 2.6.1\\n'");
     EXPECT_EQ(findings(), Lines{"error policy-words"});
     EXPECT_THAT(what(), HasSubstr("locale \"LANG=de_DE.UTF-8\""));
+    for (const char* oneWord : {"Installed: 2.6.1\n  Installationskandidat", "Installiert: 2.6.1\n  Candidate"}) {
+        unit.replaceTool("apt-cache", "printf 'apt:\n  " + std::string(oneWord) + ": 2.6.1\n'");
+        EXPECT_EQ(findings(), Lines{"error policy-words"}) << oneWord;
+    }
 }
 
 TEST_F(UnitCheck, FreeSpaceThatCannotBeReadIsUnchecked)

@@ -634,6 +634,19 @@ TEST_F(UnitCheck, MirrorsAreRefreshedPrivatelyAndWithoutTheUnitsHooks)
     EXPECT_TRUE(fs::exists(root + "/hook"));
 }
 
+TEST_F(UnitCheck, RefreshHasSettingsOfItsOwnAndTheUnitsLists)
+{
+    unit.put("var/lib/apt/lists/old", "kept\n");
+    unit.replaceTool("apt-get",
+                     "case $* in *print-uris) echo \"'http://mirror.invalid/1' 1 0 \"; exit;; esac\n"
+                     "PATH=/bin; cd \"${2%/*}/lists\" && cat ../apt.conf old >../../refresh && ls >>../../refresh");
+    EXPECT_EQ(findings(), Lines());
+    std::ostringstream refresh;
+    refresh << std::ifstream(unit.folder.path("root/tmp/refresh")).rdbuf();
+    compareWithKept(refresh.str());
+    EXPECT_THAT(refresh.str(), HasSubstr("\nkept\nold\npartial\n"));
+}
+
 TEST_F(UnitCheck, RefreshThatFailsIsAnError)
 {
     unit.replaceTool("apt-get", "case $* in *print-uris) echo \"'http://mirror.invalid/1' 1 0 \"; exit;; esac; "

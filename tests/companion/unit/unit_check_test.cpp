@@ -176,10 +176,11 @@ INSTANTIATE_TEST_SUITE_P(
         Fault{"MirrorWithoutTheIndexIsNamed",
               [](StandInUnit& unit) {
                   unit.replaceTool("apt-get",
-                                   "echo \"'http://mirror.invalid/1' 1 0 \"; case $* in *print-uris) exit;; esac; "
-                                   "echo 'E: Failed to fetch http://mirror.invalid/1  404  Not Found' >&2; exit 100");
+                                   "echo \"'http://mirror.invalid/1' 1 0 \"; case $* in *print-uris) exit;; esac\n"
+                                   "for failure in '1  404  Gone' '2  File not found' '3  Not Found'; do"
+                                   " echo \"E: Failed to fetch http://mirror.invalid/$failure\" >&2; done; exit 100");
               },
-              Lines{"warning mirror-index", "error refresh-fails"}},
+              Lines{"warning mirror-index", "warning mirror-index", "warning mirror-index", "error refresh-fails"}},
         Fault{"VolatileJournalIsAWarning", [](StandInUnit& unit) { unit.remove("var/log/journal"); },
               Lines{"warning journal-volatile"}},
         Fault{"ClockBehindTheUpdaterIsAnError",

@@ -20,9 +20,10 @@ struct UnitSite
     std::string root;       ///< Goes in front of every absolute path that is read; empty for the machine itself.
     std::string searchPath; ///< The services' PATH where the service manager does not tell it.
     bool isRoot = true;     ///< The check has root's rights.
-    std::function<void(int seconds)> pause;  ///< Waits while a lamp colour is shown.
-    std::ostream* waits = nullptr;           ///< A terminal, which is told what is waited for.
-    std::chrono::milliseconds silence = 25s; ///< A refresh ends when nothing comes for longer.
+    std::function<void(int seconds)> pause;   ///< Waits while a lamp colour is shown.
+    std::ostream* waits = nullptr;            ///< A terminal, which is told what is waited for.
+    std::chrono::milliseconds silence = 25s;  ///< A refresh ends when nothing comes for longer,
+    std::chrono::milliseconds refresh = 2min; ///< and when it takes longer.
 };
 
 /// The unit that the program runs on.

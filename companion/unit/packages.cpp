@@ -19,7 +19,6 @@
 namespace
 {
 
-const auto refreshLimit = 120s;
 const std::uint64_t littleSpace = 100'000'000; // bytes
 
 void checkLocks(const Unit& unit, Report& report)
@@ -172,14 +171,13 @@ bool reportUnfetched(const std::string& errors, Report& report)
     return !told.empty();
 }
 
-/// Bytes of the lists in `folder` that were fetched or are being fetched.
+/// Bytes of the lists in `folder`, which grow while one is fetched.
 std::uint64_t bytesFetched(const std::string& folder)
 {
     std::uint64_t bytes = 0;
     std::error_code error;
     for (const auto& list : std::filesystem::recursive_directory_iterator(folder + "/lists", error)) {
-        const bool plain = !list.is_symlink(error) && list.is_regular_file(error);
-        bytes += plain ? list.file_size(error) : 0;
+        bytes += list.is_regular_file(error) ? list.file_size(error) : 0;
     }
     return bytes;
 }
@@ -197,7 +195,7 @@ void refreshPrivately(const Unit& unit, const std::vector<std::string>& hosts, R
     std::uint64_t bytes = 0;
     std::chrono::milliseconds since{0};
     bool silent = false;
-    const CommandResult refresh = unit.run({"apt-get", "-c", settings, "update"}, refreshLimit, [&](auto time) {
+    const CommandResult refresh = unit.run({"apt-get", "-c", settings, "update"}, unit.site().refresh, [&](auto time) {
         const std::uint64_t now = bytesFetched(folder.path());
         since = std::exchange(bytes, now) == now ? since : time;
         silent = time - since >= unit.site().silence;

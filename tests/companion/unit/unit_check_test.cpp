@@ -162,6 +162,17 @@ INSTANTIATE_TEST_SUITE_P(
                   unit.folder.makeLink("root/var/lib/dpkg/lock", "lock");
               },
               Lines{"unchecked package-lock"}},
+        Fault{"FindingsComeInTheOrderOfTheSteps",
+              [](StandInUnit& unit) {
+                  unit.remove("var/lib/dpkg/lock");
+                  unit.folder.makeLink("root/var/lib/dpkg/lock", "lock");
+                  unit.set("UNIT_PACKAGE", "iF");
+                  unit.set("PACKAGE_OFFERED", "(none)");
+                  unit.replaceTool("apt-config", R"(echo 'APT::Update::Error-Mode "any";')");
+                  unit.replaceTool("apt-get", "");
+              },
+              Lines{"unchecked package-lock", "error package-half-configured", "warning package-not-offered",
+                    "warning apt-settings", "error mirrors-none"}},
         Fault{"MissingLockFileIsFree", [](StandInUnit& unit) { unit.remove("var/lib/dpkg/lock"); }, Lines()},
         Fault{"PackageDatabaseThatCannotBeReadIsUnchecked", [](StandInUnit& unit) { unit.removeTool("dpkg-query"); },
               Lines{"unchecked packages-unknown"}},
@@ -567,12 +578,14 @@ TEST_F(UnitCheck, FreeSpaceThatCannotBeReadIsUnchecked)
 {
     UnitSite site = unit.site();
     site.root = unit.folder.path("nowhere");
+    unit.replaceTool("apt-config", R"(echo 'APT::Update::Error-Mode "any";')"); // told before
     EXPECT_THAT(check(site).findings, Contains("unchecked space-unknown"));
 }
 
 TEST(UnitDisk, SpaceForThePackageIsEnough)
 {
     EXPECT_EQ(checkDisk(diskWith(200'000'000), 150'000'000), Lines());
+    EXPECT_EQ(checkDisk(diskWith(200'000'000), 1), Lines());
 }
 
 TEST(UnitDisk, LessSpaceThanThePackageNeedsIsFull)
@@ -584,6 +597,8 @@ TEST(UnitDisk, NoRoomForAFileIsFull)
 {
     struct statvfs system = diskWith(200'000'000);
     system.f_favail = 0;
+    EXPECT_EQ(checkDisk(system, 0), Lines{"error disk-full"});
+    system.f_files = 1;
     EXPECT_EQ(checkDisk(system, 0), Lines{"error disk-full"});
     system.f_files = 0; // files are not counted
     EXPECT_EQ(checkDisk(system, 0), Lines());
@@ -667,13 +682,14 @@ TEST_F(UnitCheck, SilentMirrorIsAnErrorThatExplainsTheExitStatus)
 
 TEST_F(UnitCheck, MirrorThatGivesNothingIsNotWaitedForToTheEnd)
 {
-    const std::string silent = "case $* in *print-uris) echo \"'http://mirror.invalid/1' 1 0 \"; exit;; esac\n";
-    unit.replaceTool("apt-get", silent + "PATH=/bin exec sleep 60");
+    unit.replaceTool("apt-get", "case $* in *print-uris) echo \"'http://mirror.invalid/1' 1 0 \"; "
+                                "echo \"'file:/lists/2' 2 0 \"; exit;; esac\nPATH=/bin exec sleep 60");
     UnitSite site = unit.site();
     site.silence = 100ms;
     const CheckResult result = check(site);
     EXPECT_EQ(result.findings, Lines{"unchecked mirrors-unknown"});
-    EXPECT_THAT(result.report["findings"][0]["what"].get<std::string>(), HasSubstr("\"mirror.invalid\""));
+    EXPECT_THAT(result.report["findings"][0]["what"].get<std::string>(),
+                HasSubstr("\"file:/lists/2\", \"mirror.invalid\""));
 }
 
 TEST_F(UnitCheck, MirrorThatGoesOnIsWaitedFor)
@@ -686,6 +702,8 @@ TEST_F(UnitCheck, MirrorThatGoesOnIsWaitedFor)
     UnitSite site = unit.site();
     site.silence = 2s;
     EXPECT_EQ(check(site).findings, Lines());
+    site.refresh = 1s;
+    EXPECT_EQ(check(site).findings, Lines{"unchecked mirrors-unknown"});
 }
 
 TEST_F(UnitCheck, TerminalIsToldWhatIsWaitedFor)

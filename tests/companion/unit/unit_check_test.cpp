@@ -584,7 +584,7 @@ TEST_F(UnitCheck, FreeSpaceThatCannotBeReadIsUnchecked)
 
 TEST(UnitDisk, SpaceForThePackageIsEnough)
 {
-    EXPECT_EQ(checkDisk(diskWith(200'000'000), 150'000'000), Lines());
+    EXPECT_EQ(checkDisk(diskWith(200'000'000), 200'000'000), Lines());
     EXPECT_EQ(checkDisk(diskWith(200'000'000), 1), Lines());
 }
 
@@ -607,6 +607,7 @@ TEST(UnitDisk, NoRoomForAFileIsFull)
 TEST(UnitDisk, LittleSpaceIsAWarning)
 {
     EXPECT_EQ(checkDisk(diskWith(99'999'999), 0), Lines{"warning disk-almost-full"});
+    EXPECT_EQ(checkDisk(diskWith(100'000'000), 0), Lines());
 }
 
 TEST(UnitDisk, DiskThatIsReadOnlyIsAnError)

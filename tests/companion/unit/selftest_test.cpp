@@ -42,7 +42,12 @@ protected:
 
 TEST_F(UnitSelfTest, LampTestShowsEveryLedInEveryColourAndLeavesThePanelDark)
 {
-    EXPECT_EQ(run(panel), 0);
+    UnitSite site = unit.site();
+    site.pause = [&, pause = site.pause](int seconds) {
+        out << "(" << seconds << " s)\n";
+        pause(seconds);
+    };
+    EXPECT_EQ(runUnit(panel, site, out, errors), 0);
     const char* const leds[] = {"0x10", "0x11", "0x12", "0x13", "0x14", "0x15", "0x16",
                                 "0x17", "0x18", "0x19", "0x1a", "0x1b", "0x1c", "0x1d"};
     Lines expected;
@@ -56,9 +61,9 @@ TEST_F(UnitSelfTest, LampTestShowsEveryLedInEveryColourAndLeavesThePanelDark)
         }
     }
     EXPECT_EQ(calls(), expected);
-    EXPECT_EQ(out.str(), "All 14 LEDs must be blue now.\n"
-                         "All 14 LEDs must be in the pass colour now.\n"
-                         "All 14 LEDs must be in the fail colour now.\n"
+    EXPECT_EQ(out.str(), "All 14 LEDs must be blue now.\n(2 s)\n"
+                         "All 14 LEDs must be in the pass colour now.\n(2 s)\n"
+                         "All 14 LEDs must be in the fail colour now.\n(2 s)\n"
                          "All 14 LEDs must be dark now.\n");
     EXPECT_EQ(errors.str(), "");
 }
@@ -74,9 +79,11 @@ TEST_F(UnitSelfTest, PanelThatDoesNotAnswerFailsTheLampTest)
 
 TEST_F(UnitSelfTest, LampTestEndsWithTheFirstColourThatFailsAndLeavesThePanelDark)
 {
-    unit.replaceTool("i2cset", "printf 'i2cset %s\\n' \"$*\" >>\"${0%/*}/../calls\"; [ \"$4\" != 0x2 ]");
+    unit.replaceTool("i2cset", "cd \"${0%/*}/..\"; printf 'i2cset %s\\n' \"$*\" >>calls\n"
+                               "[ \"$4\" != 0x2 ] || [ -e failed ] || { >failed; exit 1; }");
     EXPECT_EQ(run(panel), 1);
     EXPECT_EQ(out.str(), "All 14 LEDs must be blue now.\n");
+    EXPECT_THAT(errors.str(), testing::StartsWith("harl-updater-tool: 1 command of the panel test failed: "));
     EXPECT_THAT(calls(), testing::Not(testing::Contains("i2cset -y 0 0x07 0x8 c")));
     EXPECT_EQ(calls().back(), "i2cset -y 0 0x07 0x0 c");
 }

@@ -136,7 +136,8 @@ TEST_F(UnitSelfTest, TestsAreRefusedWhileTheUpdatersServiceRuns)
     EXPECT_EQ(run({true, true, true}), 2);
     EXPECT_THAT(nlohmann::json::parse(out.str())["error"], HasSubstr("the updater is running"));
     EXPECT_EQ(calls(), Lines());
-    EXPECT_THAT(errors.str(), HasSubstr("the updater is running"));
+    EXPECT_THAT(errors.str(), HasSubstr("the updater is running and uses panel and sound itself. "
+                                        "Run the test when it has ended.\n"));
 }
 
 TEST_F(UnitSelfTest, TestsAreRefusedWhileAnUpdaterStartedByHandRuns)

@@ -709,7 +709,7 @@ TEST_F(UnitCheck, MirrorThatGoesOnIsWaitedFor)
 
 TEST_F(UnitCheck, TerminalIsToldWhatIsWaitedFor)
 {
-    unit.replaceTool("apt-cache", "PATH=/bin sleep 2.2");
+    unit.replaceTool("apt-cache", "[ \"$1\" != policy ] || PATH=/bin sleep 2.2");
     UnitSite site = unit.site();
     std::ostringstream terminal;
     site.waits = &terminal;

@@ -222,8 +222,8 @@ CPP = Language(
     ("//", "#", "namespace", "using", "__attribute__"),
     re.compile(r"(?!using|return;|break;|#|//|static_assert|friend|public|private|[}\]]).*;(\s*//.*)?"),
     re.compile(
-        r"(?!return |delete |throw )(static )?(const )?(struct )?[\w:]+(<[\w:<>, ()*]*>)?[*&]? \w+(\[[^]]*\]|\{[\w, ]*\})?"
-        r"( = ([\w:.*'{}< -]+|\"[^\"]*\"|R\"\(.*?\)\"))?;"
+        r"(?!return |delete |throw )(static )?(const )?(struct )?[\w:]+(<[\w:<>, ()*]*>)?[*&]? "
+        r"\w+(\[[^]]*\]|\{[\w, ]*\})?( = ([\w:.*'{}< -]+|\"[^\"]*\"|R\"\(.*?\)\"))?;"
     ),
     r"[;{}:]",
     "",
@@ -301,7 +301,8 @@ def mutations_of(file: str) -> Iterator[Mutation]:
         if not line or line.startswith(language.passed_over):
             continue
         place = f" [{lines[: index + 1].count(line)}]" if lines.count(line) > 1 else ""
-        for after in changed_lines(line, language, random.Random(f"{file}: {line}{place}")):
+        dice = random.Random(f"{file}: {line}{place}")
+        for after in changed_lines(line, language, dice):
             yield Mutation(file, index + 1, line, after.strip(), place)
         if not is_statement(lines, index, language):
             continue

@@ -8,6 +8,7 @@ import tempfile
 from dataclasses import dataclass
 from pathlib import Path
 
+from bench.build import ROOT
 from bench.unit import UnitError
 
 PACKAGES = ["openssh-server", "openssh-sftp-server", "libwrap0"]  # an installed openssh-server would start a server
@@ -37,21 +38,17 @@ def find(kept: Path) -> Server:
 
 def _fetch(target: Path) -> None:
     with tempfile.TemporaryDirectory(dir=target.parent) as name:
-        work = Path(name)
-        (work / "files/sbin").mkdir(parents=True)
-        (work / "files/lib").mkdir()
-        download = ["apt-get", "download", *PACKAGES]
-        fetched = subprocess.run(download, cwd=work, capture_output=True, text=True, check=False)
-        if fetched.returncode != 0:
-            reason = (fetched.stderr.strip().splitlines() or ["no reason given"])[-1]
-            raise UnitError(
-                f"the board's sshd ({' '.join(PACKAGES)}) cannot be fetched: {reason}. "
-                "Connect this machine to its package mirrors and run apt-get update."
-            )
-        for package in work.glob("*.deb"):
-            subprocess.run(["dpkg-deb", "--extract", package, work / "tree"], check=True)
-        shutil.copy(work / "tree/usr/sbin/sshd", work / "files/sbin")
-        shutil.copy(work / "tree/usr/lib/openssh/sftp-server", work / "files/sbin")
-        [library] = (work / "tree").rglob("libwrap.so.0")
-        shutil.copy(library, work / "files/lib")
-        os.rename(work / "files", target)
+        tree, files = Path(name, "tree"), Path(name, "files")
+        architecture = subprocess.run(["dpkg", "--print-architecture"], stdout=subprocess.PIPE, text=True, check=True)
+        unpack = [str(ROOT / "scripts/unpack-packages"), architecture.stdout.strip(), str(tree), *PACKAGES]
+        unpacked = subprocess.run(unpack, stdout=subprocess.DEVNULL, stderr=subprocess.PIPE, text=True, check=False)
+        if unpacked.returncode != 0:
+            reason = (unpacked.stderr.strip().splitlines() or ["no reason given"])[-1]
+            raise UnitError(f"the board's sshd cannot be fetched: {reason}")
+        (files / "sbin").mkdir(parents=True)
+        (files / "lib").mkdir()
+        shutil.copy(tree / "usr/sbin/sshd", files / "sbin")
+        shutil.copy(tree / "usr/lib/openssh/sftp-server", files / "sbin")
+        [library] = tree.rglob("libwrap.so.0")
+        shutil.copy(library, files / "lib")
+        os.rename(files, target)

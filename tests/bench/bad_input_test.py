@@ -174,6 +174,14 @@ def test_missing_package(tmp_path: Path) -> None:
     assert "Unit:" not in shown
 
 
+def test_packages_that_the_mirror_lacks(tmp_path: Path) -> None:
+    done = run_command(ROOT / "scripts/unpack-packages", "none", tmp_path / "libraries", "libwrap0")
+    assert done.returncode == 1
+    reason = "is the Debian mirror in reach, and 100 MiB of room in"
+    assert done.stderr.endswith(f"unpack-packages: could not fetch libwrap0 for none: {reason} {tmp_path}?\n")
+    assert not any(tmp_path.iterdir())
+
+
 NUMBERS = ["x", "0", "-1", "", "1 2", "9999999999"]
 # Commands that would find nothing to run, or never end, and what is no argument of theirs.
 WRONG_WORDS = {

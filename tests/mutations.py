@@ -343,11 +343,27 @@ def lines_since(commit: str, files: list[str]) -> set[tuple[str, int]]:
 # Building and running
 
 
+# Root could change the host: a changed line may take the host's folders for a test's own.
+READ_ONLY = """
+host=$(findmnt --real --raw --noheadings --output TARGET)
+for folder in . /tmp "$TMPDIR"; do mount --bind "$folder" "$folder"; done
+for folder in $host; do mount -o remount,bind,ro "$folder"; done
+cd "$PWD"
+exec "$@"
+"""
+
+
 def namespace() -> list[str]:
-    """The words before a command that end all of its processes with it; none where the machine does not allow that."""
+    """The words before a command that end all of its processes with it and, as root, leave it only its folder and the
+    temporary ones to write to; none where the machine does not allow another user that."""
     words = ["unshare", "--mount", "--pid", "--fork", "--kill-child", "--mount-proc"]
-    words += [] if os.geteuid() == 0 else ["--map-root-user"]
-    return words if subprocess.run([*words, "true"], capture_output=True).returncode == 0 else []
+    root = os.geteuid() == 0
+    words += ["sh", "-ec", READ_ONLY, "sh"] if root else ["--map-root-user"]
+    with tempfile.TemporaryDirectory(prefix="mutation-") as scratch:
+        tried = subprocess.run([*words, "true"], cwd=scratch, env=os.environ | {"TMPDIR": scratch}, capture_output=True)
+    if root and tried.returncode != 0:
+        sys.exit("tests/mutation: root may not protect this machine from what is changed: run it as another user")
+    return words if tried.returncode == 0 else []
 
 
 class Tree:

@@ -17,7 +17,7 @@ def make_key(home: Path, name: str, keyring: Path) -> None:
 
 
 def end_agent(home: Path) -> None:
-    """Ends the agent that gpg started for the folder, which removes its socket only now."""
+    """Ends gpg's agent for the folder: ending late, it would remove the socket of the next one there."""
     subprocess.run(["gpgconf", "--homedir", str(home), "--kill", "all"], check=True)
 
 

@@ -260,15 +260,16 @@ TEST(Check, TellsOfASignatureBetweenStickAndPlans)
 
 TEST(Check, TellsOfAnOlderStickAfterThePlans)
 {
-    const std::pair<const char*, const char*> manifests[] = {
-        {"Version: 2.0.0\n", R"(warning stick-older: The stick's version "2.0.0" is older than the board's, "2.1.0".)"},
+    const std::pair<const char*, Lines> manifests[] = {
+        {"Version: 2.0.0\n",
+         {R"(warning stick-older: The stick's version "2.0.0" is older than the board's, "2.1.0".)"}},
         {"Format: 1\nVersion: 2.2.0\nOldest: 2.1.1\n",
-         "error stick-older: "
-         R"(The board's version "2.1.0" is older than "2.1.1", the oldest that "2.2.0" may replace.)"},
-        {"Version: 2.1.0\nOldest: 2.1.0\n", nullptr},
-        {"Oldest: 2.2.0\n", nullptr},
+         {"error stick-older: "
+          R"(The board's version "2.1.0" is older than "2.1.1", the oldest that "2.2.0" may replace.)"}},
+        {"Version: 2.1.0\nOldest: 2.1.0\n", {}},
+        {"Oldest: 2.2.0\n", {}},
     };
-    for (const auto& [manifest, finding] : manifests) {
+    for (const auto& [manifest, told] : manifests) {
         StandInUnit unit;
         unit.set("UPDATER_PROGRAM", "main");
         const TestFolder stick;
@@ -277,7 +278,7 @@ TEST(Check, TellsOfAnOlderStickAfterThePlans)
         std::ostringstream out;
         runCheck(stick.path(), true, unit.site(), out, out);
         Lines expected = {"note update-offered: A main head offers an update; its user decides."};
-        expected.insert(expected.end(), finding ? 1 : 0, finding ? finding : "");
+        expected.insert(expected.end(), told.begin(), told.end());
         Lines findings = findingsIn(out.str());
         findings.erase(findings.begin(), findings.end() - static_cast<std::ptrdiff_t>(expected.size()));
         EXPECT_EQ(findings, expected) << manifest;

@@ -37,6 +37,7 @@ class Stick:
         self.script = folder / "script.sh"
         self.script.write_text(SCRIPT)
         self.keyring = folder / "keys.gpg"
+        self.path = f"{folder}/bin:{os.environ['PATH']}"  # stand-ins for tools first
 
     def command(self, *more: str, version: str = "2.2.0") -> list[str | Path]:
         """The command that makes the stick."""
@@ -45,8 +46,7 @@ class Stick:
 
     def run(self, *words: str | Path, status: int) -> str:
         """What the tool prints for the words after its name; it must end with the status."""
-        path = f"{self.folder}/bin:{os.environ['PATH']}"
-        return output_of(self.tool, *words, status=status, GNUPGHOME=self.folder / "maker", PATH=path)
+        return output_of(self.tool, *words, status=status, GNUPGHOME=self.folder / "maker", PATH=self.path)
 
     def make(self, *more: str, status: int = 0, version: str = "2.2.0") -> str:
         """Makes the stick; returns what is printed."""
@@ -92,8 +92,7 @@ class Stick:
         """What the service's verification alone prints, its errors and its status, with tools of these lines."""
         for name, lines in tools.items():
             write_script(self.folder / "bin" / name, lines)
-        path = f"{self.folder}/bin:{os.environ['PATH']}"
-        done = run_command(ROOT / "service/verify-stick", self.root, self.keyring, environment={"PATH": path})
+        done = run_command(ROOT / "service/verify-stick", self.root, self.keyring, environment={"PATH": self.path})
         return done.stdout, done.stderr, done.returncode
 
 

@@ -33,6 +33,9 @@ struct CheckResult
     std::string errors;
 };
 
+/// For a stand-in of apt-get: its sources name one mirror.
+const std::string oneMirror = "case $* in *print-uris) echo \"'http://mirror.invalid/1' 1 0 \"; exit;; esac\n";
+
 class UnitCheck : public testing::Test
 {
 protected:
@@ -295,10 +298,9 @@ TEST_F(UnitCheck, NothingIsLeftWhenASignalEndsIt)
 {
     const std::string processFile = unit.folder.path("process");
     for (const int number : {SIGHUP, SIGINT, SIGTERM}) {
-        unit.replaceTool("apt-get", "case $* in *print-uris) echo \"'http://mirror.invalid/1' 1 0 \"; exit;; esac\n"
-                                    "echo $$ >" +
-                                        processFile + "\nkill -" + std::to_string(number) +
-                                        " $PPID\nPATH=/bin exec sleep 60");
+        std::string script = oneMirror;
+        script.append("echo $$ >").append(processFile).append("\nkill -").append(std::to_string(number));
+        unit.replaceTool("apt-get", script.append(" $PPID\nPATH=/bin exec sleep 60"));
         EXPECT_EXIT((std::signal(number, SIG_DFL), check()), testing::KilledBySignal(number), "");
         EXPECT_TRUE(fs::is_empty(unit.folder.path("root/tmp"))) << number;
         pid_t process = 0;
@@ -655,8 +657,8 @@ TEST_F(UnitCheck, RefreshHasSettingsOfItsOwnAndTheUnitsLists)
 {
     unit.put("var/lib/apt/lists/old", "kept\n");
     unit.replaceTool("apt-get",
-                     "case $* in *print-uris) echo \"'http://mirror.invalid/1' 1 0 \"; exit;; esac\n"
-                     "PATH=/bin; cd \"${2%/*}/lists\" && cat ../apt.conf old >../../refresh && ls >>../../refresh");
+                     oneMirror +
+                         "PATH=/bin; cd \"${2%/*}/lists\" && cat ../apt.conf old >../../refresh && ls >>../../refresh");
     EXPECT_EQ(findings(), Lines());
     std::ostringstream refresh;
     refresh << std::ifstream(unit.folder.path("root/tmp/refresh")).rdbuf();
@@ -666,8 +668,7 @@ TEST_F(UnitCheck, RefreshHasSettingsOfItsOwnAndTheUnitsLists)
 
 TEST_F(UnitCheck, RefreshThatFailsIsAnError)
 {
-    unit.replaceTool("apt-get", "case $* in *print-uris) echo \"'http://mirror.invalid/1' 1 0 \"; exit;; esac; "
-                                "echo 'E: Release file is not valid yet' >&2; exit 100");
+    unit.replaceTool("apt-get", oneMirror + "echo 'E: Release file is not valid yet' >&2; exit 100");
     EXPECT_EQ(findings(), Lines{"error refresh-fails"});
 }
 
@@ -696,8 +697,7 @@ TEST_F(UnitCheck, MirrorThatGivesNothingIsNotWaitedForToTheEnd)
 TEST_F(UnitCheck, MirrorThatGoesOnIsWaitedFor)
 {
     const std::string settings = "while [ $# -gt 0 ]; do [ \"$1\" != -c ] || lists=${2%/*}/lists; shift; done\n";
-    unit.replaceTool("apt-get", "case $* in *print-uris) echo \"'http://mirror.invalid/1' 1 0 \"; exit;; esac\n" +
-                                    settings +
+    unit.replaceTool("apt-get", oneMirror + settings +
                                     "for n in 1 2 3 4 5 6 7 8 9 10; do echo $n >>$lists/partial/list; "
                                     "PATH=/bin sleep 0.3; done");
     UnitSite site = unit.site();

@@ -1,4 +1,4 @@
-"""A plugin of pytest (-p tests.at_once): runs the chosen tests each in a process of its own, all at once, as most of
+"""A plugin of pytest (-p tests.at_once): runs the chosen tests each in a process of its own, many at once, as most of
 them wait. Ends at the first that fails, and fails again alone.
 """
 
@@ -7,6 +7,7 @@ import os
 import pytest
 
 SKIPPED = 77  # tests/conftest.py
+MOST = 100  # at once
 
 
 def start(test: pytest.Item) -> int:
@@ -20,9 +21,13 @@ def start(test: pytest.Item) -> int:
 
 def pytest_runtestloop(session: pytest.Session) -> bool:
     session.config._tmp_path_factory.getbasetemp()  # type: ignore[attr-defined] # one for all
-    running = {start(test): test for test in session.items}
+    waiting = session.items.copy()
+    running: dict[int, pytest.Item] = {}
     has_passed = False
-    while running:
+    while waiting or running:
+        while waiting and len(running) < MOST:
+            test = waiting.pop(0)
+            running[start(test)] = test
         process, status = os.wait()
         test = running.pop(process)
         code = os.waitstatus_to_exitcode(status)

@@ -69,10 +69,12 @@ class Part:
     checks: list[Check]
 
 
-def gtest(program: str, only: str = "*", folder: str = ".") -> Check:
+def gtest(program: str, only: str = "*", folder: str = ".", shards: int = 1) -> Check:
+    """The tests of the program whose names match `only`, in as many processes at once as there are `shards`."""
     name = Path(program).name
-    command = f"env --chdir={folder} $PWD/{BUILD}/tests/{program} --gtest_fail_fast --gtest_filter={only}"
-    return Check(name, command, name)
+    command = f"$PWD/{BUILD}/tests/{program} --gtest_fail_fast --gtest_filter={only}"
+    shard = f"env --chdir={folder} GTEST_TOTAL_SHARDS={shards} GTEST_SHARD_INDEX=@ {command}"
+    return Check(name, f"seq 0 {shards - 1} | xargs -P {shards} -I @ {shard}", name)
 
 
 def pytest(file: str, only: str = "", targets: str = "", more: str = "") -> Check:
@@ -133,7 +135,7 @@ PARTS = [
     Part(
         ["companion/stick/stick_check.cpp", "companion/stick/archive.cpp"],
         [
-            gtest("companion/stick-tests", f"-{LARGE}"),
+            gtest("companion/stick-tests", f"-{LARGE}", shards=8),
             at_once("tests/companion/stick/make_test.py", targets="harl-updater-tool"),
             gtest("companion/stick-tests", LARGE),
         ],
@@ -151,9 +153,9 @@ PARTS = [
             "companion/unit/selftest.cpp",
         ],
         [
-            gtest("companion/unit-check-tests"),
-            gtest("companion/tool-tests"),
-            pytest(
+            gtest("companion/unit-check-tests", shards=8),  # most of them wait
+            gtest("companion/tool-tests", shards=8),
+            at_once(
                 "tests/companion/golden_checks_test.py",
                 targets="harl-updater-tool unit-on-standin call_recorder harl-updater",
             ),

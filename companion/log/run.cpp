@@ -468,6 +468,9 @@ void RunBuilder::takeStepEvent(Step& step, const ParsedRecord& record, const Mea
         beginAction(step, meaning.command);
         break;
     case Event::EXIT_CODE:
+        if (step.kind == StepKind::GIVE_BACK) { // its commands have wait statuses: another step's, not in the log
+            break;
+        }
         if (!step.took && !step.actions.empty() && !step.actions.back().took) {
             step.status = CommandStatus{*meaning.number, false};
             endAction(step, step.status);

@@ -18,8 +18,10 @@ const std::size_t blockSize = std::size_t{1024} * 1024; // bytes
 const std::uint64_t largestArchive = 4ULL << 30U;       // bytes; a file on a FAT stick is smaller
 const std::uint64_t mostUnpacked = 4ULL << 30U;         // bytes of all entries together
 const std::uint64_t mostEntries = 100'000;
-const std::size_t mostName = 1024;    // bytes of an entry's name that are looked at
-const std::uint64_t localHeader = 30; // bytes of an entry's header in front of its name, APPNOTE 4.3.7
+const std::size_t mostName = 1024;        // bytes of an entry's name that are looked at
+const std::uint64_t localHeader = 30;     // bytes of an entry's header in front of its name, APPNOTE 4.3.7
+const std::uint64_t directoryHeader = 46; // bytes of its record in the directory in front of its name, 4.3.12
+const std::uint64_t endRecord = 22;       // bytes behind the directory at least, 4.3.16
 
 /// Faults of one kind: the first is shown, the others are counted.
 struct Faults
@@ -47,15 +49,21 @@ struct Entry
     unz_file_info64 info = {};
 };
 
-/// Calls `visit` with every entry until it returns false. False when the directory is damaged.
+/// Calls `visit` with every entry of the archive of `size` bytes until it returns false. False when the directory is
+/// damaged.
 template <typename Visit>
-bool forEachEntry(unzFile archive, Visit visit)
+bool forEachEntry(unzFile archive, std::uint64_t size, Visit visit)
 {
     int status = unzGoToFirstFile(archive);
     for (; status == UNZ_OK; status = unzGoToNextFile(archive)) {
         Entry entry;
         std::array<char, mostName> name{};
         if (unzGetCurrentFileInfo64(archive, &entry.info, name.data(), name.size(), nullptr, 0, nullptr, 0) != UNZ_OK) {
+            return false;
+        }
+        const std::uint64_t behindHeader =
+            entry.info.size_filename + entry.info.size_file_extra + entry.info.size_file_comment;
+        if (unzGetOffset64(archive) + directoryHeader + behindHeader + endRecord > size) {
             return false;
         }
         entry.name.assign(name.data(), std::min<std::size_t>(entry.info.size_filename, name.size()));
@@ -104,7 +112,7 @@ public:
             return;
         }
         if (readWhole() && open() && checkDirectory()) {
-            forEachEntry(mArchive.get(), [&](const Entry& entry) {
+            forEachEntry(mArchive.get(), mSize, [&](const Entry& entry) {
                 testEntry(entry);
                 return true;
             });
@@ -155,7 +163,7 @@ private:
     {
         Faults leaving;
         std::set<std::string> links;
-        const bool intact = forEachEntry(mArchive.get(), [&](const Entry& entry) {
+        const bool intact = forEachEntry(mArchive.get(), mSize, [&](const Entry& entry) {
             mPackedBytes += std::min<std::uint64_t>(entry.info.compressed_size, UINT64_MAX - mPackedBytes);
             mDeclaredBytes += std::min<std::uint64_t>(entry.info.uncompressed_size, UINT64_MAX - mDeclaredBytes);
             if (leavesFolder(entry.name)) {

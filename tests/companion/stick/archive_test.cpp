@@ -155,6 +155,18 @@ TEST(StickArchive, DamagedDirectoryIsFound)
     }
 }
 
+TEST(StickArchive, DirectoryThatRunsBeyondItsEndIsDamaged)
+{
+    const std::string archive = zipArchive({{"a", "abc"}});
+    for (const std::size_t length : {30, 32}) { // of the further fields, and of the comment, after APPNOTE.TXT 4.3.12
+        std::string damaged = archive;
+        damaged[damaged.find("PK\x01\x02") + length] = 1;
+        const Report report = check(damaged);
+        EXPECT_EQ(findingsOf(report), Lines{"error archive-damaged"});
+        EXPECT_THAT(whatOf(report, "archive-damaged"), HasSubstr("its directory is damaged after 0 entries"));
+    }
+}
+
 TEST(StickArchive, EncryptedOrUnknownEntriesAreNotTested)
 {
     EXPECT_EQ(findingsOf(check(zipArchive({{"a", "abc", 8, 1}}))), Lines{"unchecked archive-untested"});
